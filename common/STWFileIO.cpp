@@ -1,0 +1,132 @@
+#include "common/STWFileIO.h"
+
+#include <cerrno>
+#include <cstdlib>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+namespace {
+
+int writeAll(int fd, std::string_view contents) {
+    const char* p = contents.data();
+    size_t left = contents.size();
+    while (left > 0) {
+        ssize_t n = write(fd, p, left);
+        if (n < 0) {
+            if (errno == EINTR)
+                continue;
+            return errno;
+        }
+        p += n;
+        left -= static_cast<size_t>(n);
+    }
+    return 0;
+}
+
+int closeChecked(int fd) {
+    return close(fd) == 0 || errno == EINTR ? 0 : errno;
+}
+
+} // namespace
+
+int STWReadFileContents(const std::filesystem::path& path, std::string* contents, unsigned options,
+                        size_t maxSize) {
+    int flags = O_RDONLY | O_CLOEXEC | ((options & STWReadNoFollow) ? O_NOFOLLOW : 0);
+    int fd = open(path.c_str(), flags);
+    if (fd < 0)
+        return errno;
+    struct stat st;
+    if (fstat(fd, &st) != 0) {
+        int e = errno;
+        close(fd);
+        return e;
+    }
+    if (!S_ISREG(st.st_mode)) {
+        close(fd);
+        return S_ISDIR(st.st_mode) ? EISDIR : EINVAL;
+    }
+    if (static_cast<uint64_t>(st.st_size) > maxSize) {
+        close(fd);
+        return EFBIG;
+    }
+    std::string data;
+    data.resize(static_cast<size_t>(st.st_size));
+    size_t used = 0;
+    while (true) {
+        if (used == data.size()) {
+            // The file may have grown since fstat; keep reading up to the limit.
+            if (data.size() >= maxSize) {
+                char probe;
+                ssize_t n = read(fd, &probe, 1);
+                close(fd);
+                if (n > 0)
+                    return EFBIG;
+                break;
+            }
+            data.resize(std::min(maxSize, data.size() + 4096));
+        }
+        ssize_t n = read(fd, data.data() + used, data.size() - used);
+        if (n < 0) {
+            if (errno == EINTR)
+                continue;
+            int e = errno;
+            close(fd);
+            return e;
+        }
+        if (n == 0) {
+            close(fd);
+            break;
+        }
+        used += static_cast<size_t>(n);
+    }
+    data.resize(used);
+    *contents = std::move(data);
+    return 0;
+}
+
+int STWWriteFile(const std::filesystem::path& path, std::string_view contents, mode_t mode, bool sync) {
+    int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, mode);
+    if (fd < 0)
+        return errno;
+    int e = writeAll(fd, contents);
+    if (!e && sync && fsync(fd) != 0)
+        e = errno;
+    int c = closeChecked(fd);
+    return e ? e : c;
+}
+
+int STWWriteFileAtomically(const std::filesystem::path& path, std::string_view contents, mode_t mode,
+                           bool syncDirectory) {
+    std::filesystem::path directory = path.parent_path();
+    if (directory.empty())
+        directory = ".";
+    std::string temp = (directory / ("." + path.filename().string() + ".XXXXXX")).string();
+    int fd = mkostemp(temp.data(), O_CLOEXEC);
+    if (fd < 0)
+        return errno;
+    int e = fchmod(fd, mode) == 0 ? 0 : errno;
+    if (!e)
+        e = writeAll(fd, contents);
+    if (!e && fsync(fd) != 0)
+        e = errno;
+    int c = closeChecked(fd);
+    if (!e)
+        e = c;
+    if (!e && rename(temp.c_str(), path.c_str()) != 0)
+        e = errno;
+    if (e) {
+        unlink(temp.c_str());
+        return e;
+    }
+    return syncDirectory ? STWSyncDirectory(directory) : 0;
+}
+
+int STWSyncDirectory(const std::filesystem::path& directory) {
+    int fd = open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    if (fd < 0)
+        return errno;
+    int e = fsync(fd) == 0 ? 0 : errno;
+    close(fd);
+    return e;
+}

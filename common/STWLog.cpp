@@ -1,0 +1,233 @@
+#include "common/STWLog.h"
+
+#include <atomic>
+#include <cstdio>
+#include <cstdlib>
+#include <mutex>
+#include <strings.h>
+#include <sys/stat.h>
+#include <syslog.h>
+
+#include <spdlog/sinks/rotating_file_sink.h>
+#include <spdlog/spdlog.h>
+#define SD_JOURNAL_SUPPRESS_LOCATION
+#include <systemd/sd-journal.h>
+
+namespace {
+
+struct FileLog {
+    std::mutex mutex;
+    std::filesystem::path path;
+    std::string name;
+    std::shared_ptr<spdlog::logger> logger; // set once writing is enabled
+};
+
+FileLog& fileLog() {
+    static FileLog* log = new FileLog; // outlives static destructors of other objects
+    return *log;
+}
+
+std::atomic<int> fileLevel{0}; // 0: no file, else the most verbose level the file takes
+std::atomic<bool> fileOpen{false};
+
+STWLogLevel levelFromEnvironment() {
+    const char* env = getenv("STOWLY_LOG_LEVEL");
+    if (!env)
+        return STWLogLevel::Info;
+    static const std::pair<const char*, STWLogLevel> names[] = {
+        {"fault", STWLogLevel::Fault},   {"error", STWLogLevel::Error}, {"default", STWLogLevel::Default},
+        {"notice", STWLogLevel::Notice}, {"info", STWLogLevel::Info},   {"debug", STWLogLevel::Debug},
+    };
+    for (const auto& [name, level] : names)
+        if (strcasecmp(env, name) == 0)
+            return level;
+    return STWLogLevel::Info;
+}
+
+std::atomic<int> systemLevel{static_cast<int>(levelFromEnvironment())};
+
+// journald when our standard error is the journal stream the service manager gave us.
+bool useJournal() {
+    static const bool journal = [] {
+        const char* stream = getenv("JOURNAL_STREAM");
+        struct stat st;
+        if (!stream || fstat(STDERR_FILENO, &st) != 0)
+            return false;
+        unsigned long long dev = 0, ino = 0;
+        return sscanf(stream, "%llu:%llu", &dev, &ino) == 2 && dev == st.st_dev && ino == st.st_ino;
+    }();
+    return journal;
+}
+
+int syslogPriority(STWLogLevel level) {
+    switch (level) {
+    case STWLogLevel::Fault:
+        return LOG_CRIT;
+    case STWLogLevel::Error:
+        return LOG_ERR;
+    case STWLogLevel::Default:
+    case STWLogLevel::Notice:
+        return LOG_NOTICE;
+    case STWLogLevel::Info:
+        return LOG_INFO;
+    case STWLogLevel::Debug:
+        break;
+    }
+    return LOG_DEBUG;
+}
+
+void writeSystemLog(STWLogLevel level, STWLogCategory category, std::string_view function,
+                    std::string_view message) {
+    if (useJournal()) {
+        sd_journal_send("MESSAGE=%s: %.*s", std::string(function).c_str(), static_cast<int>(message.size()),
+                        message.data(), "PRIORITY=%d", syslogPriority(level), "SYSLOG_IDENTIFIER=stowlyd",
+                        "STOWLY_SUBSYSTEM=%s", STWLog::subsystem.data(), "STOWLY_CATEGORY=%s",
+                        STWLog::categoryName(category), "CODE_FUNC=%s", std::string(function).c_str(),
+                        nullptr);
+        return;
+    }
+    std::string line = "stowlyd <" + std::string(STWLog::levelName(level)) + "> [" +
+                       STWLog::categoryName(category) + "] " + std::string(function) + ": " +
+                       std::string(message) + "\n";
+    fwrite(line.data(), 1, line.size(), stderr);
+}
+
+} // namespace
+
+const char* STWLog::levelName(STWLogLevel level) {
+    switch (level) {
+    case STWLogLevel::Fault:
+        return "Fault";
+    case STWLogLevel::Error:
+        return "Error";
+    case STWLogLevel::Default:
+        return "Default";
+    case STWLogLevel::Notice:
+        return "Notice";
+    case STWLogLevel::Info:
+        return "Info";
+    case STWLogLevel::Debug:
+        break;
+    }
+    return "Debug";
+}
+
+const char* STWLog::categoryName(STWLogCategory category) {
+    switch (category) {
+    case STWLogCategory::Unspecified:
+        return "unspecified";
+    case STWLogCategory::Cache:
+        return "cache";
+    case STWLogCategory::Sandbox:
+        return "sandbox";
+    case STWLogCategory::Tolvan:
+        return "tolvan";
+    case STWLogCategory::Locking:
+        return "locking";
+    case STWLogCategory::Database:
+        return "database";
+    case STWLogCategory::Upcall:
+        return "upcall";
+    case STWLogCategory::Lifecycle:
+        return "lifecycle";
+    case STWLogCategory::FS:
+        return "fs";
+    case STWLogCategory::Startup:
+        return "startup";
+    case STWLogCategory::Test:
+        return "test";
+    case STWLogCategory::Metadata:
+        return "metadata";
+    case STWLogCategory::CodeSignMapping:
+        break;
+    }
+    return "codesignmapping";
+}
+
+bool STWLog::openLogFile(const std::filesystem::path& path, std::string_view name, STWLogLevel level) {
+    FileLog& log = fileLog();
+    std::lock_guard guard(log.mutex);
+    // Probe that the file can be created before promising anything.
+    FILE* probe = fopen(path.c_str(), "a");
+    if (!probe) {
+        writeSystemLog(STWLogLevel::Error, STWLogCategory::Unspecified, "openLogFile",
+                       STWFormat("Failed to set up rotating logs at path %s", path.c_str()));
+        return false;
+    }
+    fclose(probe);
+    log.path = path;
+    log.name = name;
+    log.logger.reset();
+    fileLevel = static_cast<int>(level);
+    fileOpen = true;
+    return true;
+}
+
+void STWLog::enableFileWriting(int diskLevel, size_t sizeParameter) {
+    FileLog& log = fileLog();
+    std::lock_guard guard(log.mutex);
+    if (!fileOpen)
+        return;
+    try {
+        auto sink = std::make_shared<spdlog::sinks::rotating_file_sink_mt>(
+            log.path.string(), sizeParameter, static_cast<size_t>(diskLevel > 0 ? diskLevel : 1));
+        auto logger = std::make_shared<spdlog::logger>(log.name, sink);
+        logger->set_pattern("%Y-%m-%d %H:%M:%S.%f [%t] %v");
+        logger->set_level(spdlog::level::trace);
+        logger->flush_on(spdlog::level::err);
+        std::atomic_store(&log.logger, logger);
+    } catch (const spdlog::spdlog_ex& e) {
+        writeSystemLog(STWLogLevel::Error, STWLogCategory::Unspecified, "enableFileWriting",
+                       STWFormat("Failed to set up rotating logs at path %s", log.path.c_str()));
+    }
+}
+
+void STWLog::closeLogFile() {
+    FileLog& log = fileLog();
+    std::lock_guard guard(log.mutex);
+    if (auto logger = std::atomic_load(&log.logger))
+        logger->flush();
+    std::atomic_store(&log.logger, std::shared_ptr<spdlog::logger>());
+    fileLevel = 0;
+    fileOpen = false;
+}
+
+bool STWLog::fileIsOpen() {
+    return fileOpen;
+}
+
+void STWLog::setSystemLogLevel(STWLogLevel level) {
+    systemLevel = static_cast<int>(level);
+}
+
+bool STWLog::isEnabled(STWLogLevel level) {
+    int l = static_cast<int>(level);
+    return l <= systemLevel.load(std::memory_order_relaxed) || l <= fileLevel.load(std::memory_order_relaxed);
+}
+
+void STWLog::write(STWLogLevel level, STWLogCategory category, std::string_view function,
+                   std::string_view message) {
+    int l = static_cast<int>(level);
+    if (l <= systemLevel.load(std::memory_order_relaxed))
+        writeSystemLog(level, category, function, message);
+    if (l <= fileLevel.load(std::memory_order_relaxed)) {
+        if (auto logger = std::atomic_load(&fileLog().logger)) {
+            logger->log(level <= STWLogLevel::Error ? spdlog::level::err : spdlog::level::info,
+                        "<{}> [{}] {}: {}", levelName(level), categoryName(category), function, message);
+        }
+    }
+}
+
+void STWLog::flush() {
+    if (auto logger = std::atomic_load(&fileLog().logger))
+        logger->flush();
+    fflush(stderr);
+}
+
+void STWLog::fatal(std::string_view function, std::string_view message) {
+    write(STWLogLevel::Fault, STWLogCategory::Unspecified, function, message);
+    flush();
+    if (useJournal() || systemLevel < static_cast<int>(STWLogLevel::Fault))
+        fprintf(stderr, "stowlyd: fatal: %.*s\n", static_cast<int>(message.size()), message.data());
+    abort();
+}

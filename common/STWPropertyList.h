@@ -1,0 +1,23 @@
+// Property-list encoding of STWValue through libplist.
+//
+// Reading accepts XML and binary property lists; the daemon writes binary ones. A UUID
+// has no property-list type and is written as its upper-case string. libplist keeps all
+// integers as unsigned 64-bit numbers, so an integer read back above INT64_MAX is taken
+// as the negative number with the same bits: negative values round-trip, unsigned ones
+// of 2^63 and above do not.
+#pragma once
+
+#include "common/STWValue.h"
+
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace STWPropertyList {
+
+// Parses XML or binary property-list bytes; nullopt when they are not a property list.
+std::optional<STWValue> parse(std::string_view bytes);
+std::string serializeBinary(const STWValue& value);
+std::string serializeXML(const STWValue& value);
+
+} // namespace STWPropertyList

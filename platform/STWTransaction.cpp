@@ -1,0 +1,58 @@
+#include "platform/STWTransaction.h"
+
+#include "common/STWLog.h"
+
+#include <condition_variable>
+#include <mutex>
+
+namespace {
+
+struct State {
+    std::mutex mutex;
+    std::condition_variable changed;
+    uint64_t count = 0;
+    std::chrono::steady_clock::time_point lastChange = std::chrono::steady_clock::now();
+};
+
+State& state() {
+    static State* s = new State; // used by detached worker threads up to process exit
+    return *s;
+}
+
+} // namespace
+
+void STWTransaction::begin() {
+    State& s = state();
+    std::lock_guard guard(s.mutex);
+    ++s.count;
+    s.lastChange = std::chrono::steady_clock::now();
+}
+
+void STWTransaction::end() {
+    State& s = state();
+    std::lock_guard guard(s.mutex);
+    if (s.count == 0)
+        STW_FATAL("transaction ended that was never begun");
+    --s.count;
+    s.lastChange = std::chrono::steady_clock::now();
+    if (s.count == 0)
+        s.changed.notify_all();
+}
+
+uint64_t STWTransaction::count() {
+    State& s = state();
+    std::lock_guard guard(s.mutex);
+    return s.count;
+}
+
+std::chrono::steady_clock::time_point STWTransaction::lastChange() {
+    State& s = state();
+    std::lock_guard guard(s.mutex);
+    return s.lastChange;
+}
+
+bool STWTransaction::waitForIdle(std::chrono::steady_clock::duration timeout) {
+    State& s = state();
+    std::unique_lock lock(s.mutex);
+    return s.changed.wait_for(lock, timeout, [&] { return s.count == 0; });
+}

@@ -1,0 +1,71 @@
+#include "common/STWValue.h"
+
+#include <gtest/gtest.h>
+
+#include <unordered_set>
+
+namespace {
+
+STWValue sample() {
+    STWValue::Dictionary inner{{"k", STWValue(int64_t(-7))}, {"d", STWValue(STWData{0, 1, 255})}};
+    return STWValue(STWValue::Dictionary{
+        {"str", STWValue("x")},
+        {"n", STWValue(5)},
+        {"arr", STWValue(STWValue::Array{STWValue(true), STWValue(1.5), STWValue(inner)})},
+    });
+}
+
+TEST(STWValue, TypedReadsOfTheWrongTypeReadAsAbsent) {
+    STWValue five(5), minus(-1), big(uint64_t(1) << 63), text("5"), flag(true), real(5.0);
+    EXPECT_EQ(five.uint64Value(), 5u);
+    EXPECT_EQ(five.int64Value(), 5);
+    EXPECT_FALSE(minus.uint64Value());
+    EXPECT_EQ(minus.int64Value(), -1);
+    EXPECT_EQ(big.uint64Value(), uint64_t(1) << 63);
+    EXPECT_FALSE(big.int64Value());
+    EXPECT_FALSE(text.uint64Value());
+    EXPECT_FALSE(flag.uint64Value());
+    EXPECT_FALSE(real.uint64Value());
+    EXPECT_FALSE(five.boolValue());
+    EXPECT_EQ(five.realValue(), 5.0);
+    EXPECT_EQ(five.string(), nullptr);
+    EXPECT_EQ(text.dictionary(), nullptr);
+    EXPECT_EQ(sample().find("str")->string() ? *sample().find("str")->string() : "", "x");
+    EXPECT_EQ(text.find("str"), nullptr);
+}
+
+TEST(STWValue, EqualityAndHashAreDeepAndCopiesAreIndependent) {
+    STWValue a = sample(), b = sample();
+    EXPECT_EQ(a, b);
+    EXPECT_EQ(a.hash(), b.hash());
+    STWValue c = a;
+    (*c.mutableDictionary())["arr"].mutableArray()->push_back(STWValue("more"));
+    EXPECT_NE(a, c);
+    EXPECT_EQ(a, b); // the copy did not share storage with a
+    // Signed and unsigned spellings of one integer are one value.
+    EXPECT_EQ(STWValue(int64_t(3)), STWValue(uint64_t(3)));
+    EXPECT_EQ(STWValue(int64_t(3)).hash(), STWValue(uint64_t(3)).hash());
+    EXPECT_NE(STWValue(3), STWValue(3.0));
+    std::unordered_set<STWValue> set{a, b, c, STWValue(), STWValue("x")};
+    EXPECT_EQ(set.size(), 4u);
+}
+
+TEST(STWValue, DescriptionIsReadable) {
+    EXPECT_EQ(sample().description(),
+              "{ \"arr\" = (true, 1.5, { \"d\" = <0001ff>; \"k\" = -7; }); \"n\" = 5; \"str\" = \"x\"; }");
+    EXPECT_EQ(STWValue().description(), "(null)");
+    EXPECT_EQ(STWValue(STWValue::Dictionary{}).description(), "{}");
+}
+
+TEST(STWUUID, ParsesEitherCaseAndPrintsUpperCase) {
+    auto u = STWUUID::fromString("0a1b2c3d-4e5f-4a6b-8c7d-9e0f1a2b3c4d");
+    ASSERT_TRUE(u);
+    EXPECT_EQ(u->string(), "0A1B2C3D-4E5F-4A6B-8C7D-9E0F1A2B3C4D");
+    EXPECT_EQ(STWUUID::fromString(u->string()), u);
+    for (const char* bad : {"", "0A1B2C3D4E5F4A6B8C7D9E0F1A2B3C4D", "0A1B2C3D-4E5F-4A6B-8C7D-9E0F1A2B3C4",
+                            "0A1B2C3D-4E5F-4A6B-8C7D-9E0F1A2B3C4G", "0A1B2C3D-4E5F-4A6B-8C7D_9E0F1A2B3C4D"})
+        EXPECT_FALSE(STWUUID::fromString(bad)) << bad;
+    EXPECT_NE(STWUUID::random(), STWUUID::random());
+}
+
+} // namespace

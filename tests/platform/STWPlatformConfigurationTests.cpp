@@ -1,0 +1,110 @@
+#include "platform/STWPlatformConfiguration.h"
+
+#include "common/STWDictionaryUtilities.h"
+
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <fstream>
+
+namespace {
+
+class STWPlatformConfigurationTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        char templ[] = "/tmp/stowly-root-XXXXXX";
+        ASSERT_NE(mkdtemp(templ), nullptr);
+        root = templ;
+        std::filesystem::create_directories(root / "etc/stowly");
+    }
+    void TearDown() override { std::filesystem::remove_all(root); }
+    void writeSettings(const STWValue::Dictionary& settings) {
+        ASSERT_TRUE(STW_writeToURL(settings, root / "etc/stowly/stowlyd.plist", STWWriteAtomic, nullptr));
+    }
+    std::filesystem::path root;
+};
+
+TEST_F(STWPlatformConfigurationTest, MissingFileMeansDefaultsUnderTheRoot) {
+    STWErrorRef error;
+    auto configuration = STWPlatformConfiguration::loadFromRoot(root, &error);
+    ASSERT_TRUE(configuration) << error->description();
+    EXPECT_EQ(configuration->resolve("/private/var/containers"), root / "private/var/containers");
+    EXPECT_EQ(configuration->runtimeDirectory(), root / "run/stowly");
+    EXPECT_FALSE(configuration->isInternalImage());
+    EXPECT_EQ(configuration->installationUID(), 33u);
+    EXPECT_EQ(configuration->systemContainerUID(), 0u);
+    EXPECT_EQ(configuration->mobileUserName(), "mobile");
+    EXPECT_FALSE(configuration->isFeatureEnabled("fast_container_sizing"));
+    EXPECT_EQ(STWPlatformConfiguration("/").resolve("/private/var"), "/private/var");
+}
+
+TEST_F(STWPlatformConfigurationTest, ReadsEveryKeyAndTheOSRelease) {
+    writeSettings({{"InternalImage", STWValue(true)},
+                   {"MultiUser", STWValue(true)},
+                   {"PersonasUnsupported", STWValue(true)},
+                   {"DeveloperMode", STWValue(true)},
+                   {"InstallationUID", STWValue(1000)},
+                   {"SystemContainerUID", STWValue(7)},
+                   {"MobileUserName", STWValue("phone")},
+                   {"Features", STWValue(STWValue::Dictionary{{"fast_container_sizing", STWValue(true)}})}});
+    std::ofstream(root / "etc/os-release")
+        << "NAME=\"Stowly OS\"\nBUILD_ID=21A100\nVERSION_ID=\"17.1\"\n# comment\nRELEASE_TYPE='Internal'\n";
+    STWErrorRef error;
+    auto configuration = STWPlatformConfiguration::loadFromRoot(root, &error);
+    ASSERT_TRUE(configuration);
+    EXPECT_TRUE(configuration->isInternalImage());
+    EXPECT_TRUE(configuration->isMultiUser());
+    EXPECT_TRUE(configuration->personasUnsupported());
+    EXPECT_TRUE(configuration->isDeveloperMode());
+    EXPECT_EQ(configuration->installationUID(), 1000u);
+    EXPECT_EQ(configuration->systemContainerUID(), 7u);
+    EXPECT_EQ(configuration->mobileUserName(), "phone");
+    EXPECT_TRUE(configuration->isFeatureEnabled("fast_container_sizing"));
+    const auto& version = configuration->systemVersion();
+    EXPECT_EQ(*STWDictionaryString(version, "BuildVersion"), "21A100");
+    EXPECT_EQ(*STWDictionaryString(version, "ProductVersion"), "17.1");
+    EXPECT_EQ(*STWDictionaryString(version, "ReleaseType"), "Internal");
+}
+
+TEST_F(STWPlatformConfigurationTest, MalformedFilesAndWrongTypesAreRefusedWithThePath) {
+    std::ofstream(root / "etc/stowly/stowlyd.plist") << "<plist><dict><key>InternalImage</key>";
+    STWErrorRef error;
+    EXPECT_FALSE(STWPlatformConfiguration::loadFromRoot(root, &error));
+    ASSERT_TRUE(error);
+    EXPECT_NE(error->message().find((root / "etc/stowly/stowlyd.plist").string()), std::string::npos)
+        << error->message();
+
+    for (const auto& [key, value, text] : std::vector<std::tuple<const char*, STWValue, const char*>>{
+             {"InternalImage", STWValue("yes"), "InternalImage must be a boolean"},
+             {"InstallationUID", STWValue(-1), "InstallationUID must be a user id"},
+             {"Features", STWValue(1), "Features must be a dictionary"}}) {
+        writeSettings({{key, value}});
+        error.reset();
+        EXPECT_FALSE(STWPlatformConfiguration::loadFromRoot(root, &error)) << key;
+        ASSERT_TRUE(error);
+        EXPECT_NE(error->message().find(text), std::string::npos) << error->message();
+    }
+
+    error.reset();
+    EXPECT_FALSE(STWPlatformConfiguration::loadFromRoot(root / "nonexistent", &error));
+    ASSERT_TRUE(error);
+}
+
+TEST(STWPlatformConfiguration, DeveloperModeIsNeverOnForTheRealRoot) {
+    // The real root's configuration is whatever the machine has; it may not enable developer mode.
+    STWErrorRef error;
+    auto configuration = STWPlatformConfiguration::loadFromRoot("/", &error);
+    if (!configuration)
+        GTEST_SKIP() << "the machine's own configuration does not load: " << error->message();
+    EXPECT_FALSE(configuration->isDeveloperMode());
+}
+
+TEST(STWParseOSRelease, QuotesAndEscapes) {
+    auto fields = STWParseOSRelease("A=plain\nB=\"with \\\"quote\\\"\"\n=novalue\nbroken\nC=''\n");
+    EXPECT_EQ(*STWDictionaryString(fields, "A"), "plain");
+    EXPECT_EQ(*STWDictionaryString(fields, "B"), "with \"quote\"");
+    EXPECT_EQ(*STWDictionaryString(fields, "C"), "");
+    EXPECT_EQ(fields.size(), 3u);
+}
+
+} // namespace

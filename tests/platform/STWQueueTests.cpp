@@ -1,0 +1,143 @@
+#include "platform/STWQueue.h"
+#include "platform/STWTransaction.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <future>
+#include <stdexcept>
+#include <vector>
+
+using namespace std::chrono_literals;
+
+namespace {
+
+TEST(STWQueue, RunsItemsOneAtATimeInSubmissionOrder) {
+    auto queue = STWQueue::create("test.order");
+    std::vector<int> seen;
+    std::atomic<int> running{0};
+    bool overlapped = false;
+    for (int i = 0; i < 500; ++i) {
+        queue->async([&, i] {
+            if (running.fetch_add(1) != 0)
+                overlapped = true;
+            seen.push_back(i);
+            running.fetch_sub(1);
+        });
+    }
+    queue->sync([] {});
+    ASSERT_EQ(seen.size(), 500u);
+    for (int i = 0; i < 500; ++i)
+        ASSERT_EQ(seen[i], i);
+    EXPECT_FALSE(overlapped);
+}
+
+TEST(STWQueue, SyncFromManyThreadsIsSerialisedWithAsyncWork) {
+    auto queue = STWQueue::create("test.mixed");
+    int counter = 0; // only touched on the queue
+    std::vector<std::thread> threads;
+    for (int t = 0; t < 8; ++t)
+        threads.emplace_back([&] {
+            for (int i = 0; i < 200; ++i) {
+                if (i % 2)
+                    queue->async([&] { ++counter; });
+                else
+                    queue->sync([&] { ++counter; });
+            }
+        });
+    for (auto& t : threads)
+        t.join();
+    EXPECT_EQ(queue->syncResult([&] { return counter; }), 1600);
+}
+
+TEST(STWQueue, SuspendedQueueRunsNothingUntilResumed) {
+    auto queue = STWQueue::create("test.suspend");
+    queue->suspend();
+    queue->suspend();
+    std::atomic<int> ran{0};
+    queue->async([&] { ++ran; });
+    auto waiter = std::async(std::launch::async, [&] { queue->sync([&] { ++ran; }); });
+    EXPECT_EQ(waiter.wait_for(100ms), std::future_status::timeout);
+    queue->resume();
+    EXPECT_EQ(waiter.wait_for(100ms), std::future_status::timeout); // still suspended once
+    EXPECT_EQ(ran.load(), 0);
+    queue->resume();
+    waiter.get();
+    EXPECT_EQ(ran.load(), 2);
+    EXPECT_FALSE(queue->isSuspended());
+}
+
+TEST(STWQueue, SuspendTakesEffectAfterTheRunningItem) {
+    auto queue = STWQueue::create("test.suspend-running");
+    std::promise<void> started, release;
+    auto releaseFuture = release.get_future().share();
+    std::atomic<int> ran{0};
+    queue->async([&] {
+        started.set_value();
+        releaseFuture.wait();
+        ++ran;
+    });
+    queue->async([&] { ++ran; });
+    started.get_future().wait();
+    queue->suspend();
+    release.set_value();
+    std::this_thread::sleep_for(50ms);
+    EXPECT_EQ(ran.load(), 1);
+    queue->resume();
+    queue->sync([] {});
+    EXPECT_EQ(ran.load(), 2);
+}
+
+TEST(STWQueue, KnowsWhichQueueIsCurrentAndPassesExceptionsToSyncCallers) {
+    auto a = STWQueue::create("test.a");
+    auto b = STWQueue::create("test.b");
+    EXPECT_FALSE(a->isCurrent());
+    a->sync([&] {
+        EXPECT_TRUE(a->isCurrent());
+        b->sync([&] {
+            EXPECT_TRUE(a->isCurrent());
+            EXPECT_TRUE(b->isCurrent());
+        });
+    });
+    std::promise<bool> onQueue;
+    a->async([&] { onQueue.set_value(a->isCurrent() && !b->isCurrent()); });
+    EXPECT_TRUE(onQueue.get_future().get());
+    EXPECT_THROW(a->sync([] { throw std::runtime_error("boom"); }), std::runtime_error);
+    EXPECT_EQ(a->syncResult([] { return 7; }), 7); // the queue survived the exception
+}
+
+TEST(STWQueue, TransactionsAreHeldFromSubmissionUntilTheWorkRan) {
+    ASSERT_TRUE(STWTransaction::waitForIdle(5s));
+    auto queue = STWQueue::create("test.transactions", {STWQueue::Priority::Background, true});
+    queue->suspend();
+    queue->async([] {});
+    queue->async([] {});
+    EXPECT_EQ(STWTransaction::count(), 2u);
+    EXPECT_FALSE(STWTransaction::waitForIdle(20ms));
+    queue->resume();
+    EXPECT_TRUE(STWTransaction::waitForIdle(5s));
+    {
+        STWTransaction::Scope scope;
+        EXPECT_EQ(STWTransaction::count(), 1u);
+    }
+    EXPECT_EQ(STWTransaction::count(), 0u);
+}
+
+TEST(STWQueueDeathTest, SyncFromTheQueuesOwnThreadIsDetected) {
+    EXPECT_DEATH(
+        {
+            auto queue = STWQueue::create("test.self");
+            queue->sync([&] { queue->sync([] {}); });
+        },
+        "synchronous submission to queue test.self from its own thread");
+    EXPECT_DEATH(
+        {
+            auto queue = STWQueue::create("test.assert");
+            queue->assertCurrent("caller");
+        },
+        "not running on queue test.assert");
+    EXPECT_DEATH(STWQueue::create("test.resume")->resume(), "resumed more often than suspended");
+}
+
+} // namespace
