@@ -1,0 +1,472 @@
+#include "src/packbuff/packbuff.h"
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <memory>
+#include <string>
+#include <string_view>
+#include <sys/mman.h>
+#include <unistd.h>
+#include <vector>
+
+extern "C" int packbuff_round_trip_from_c(void);
+
+namespace {
+
+using Bytes = std::vector<uint8_t>;
+
+// Raw wire bytes, for expected layouts and for buffers no writer would produce.
+struct Wire {
+    Bytes bytes;
+
+    Wire& header(uint16_t itemType, uint16_t valueType, uint32_t value) {
+        size_t at = bytes.size();
+        bytes.resize(at + 8);
+        memcpy(&bytes[at], &itemType, 2);
+        memcpy(&bytes[at + 2], &valueType, 2);
+        memcpy(&bytes[at + 4], &value, 4);
+        return *this;
+    }
+    Wire& raw(std::string_view data) {
+        bytes.insert(bytes.end(), data.begin(), data.end());
+        return *this;
+    }
+    Wire& zeros(size_t count) {
+        bytes.insert(bytes.end(), count, 0);
+        return *this;
+    }
+    Wire& end() { return zeros(8); }
+};
+
+Bytes contents(const sb_packbuff* pb) {
+    auto* start = static_cast<const uint8_t*>(sb_packbuff_get_bytes(pb));
+    return Bytes(start, start + sb_packbuff_get_size(pb));
+}
+
+// A reader over `data` as a peer would hand it over: exactly that long, nothing after (an
+// empty buffer still has an address).
+struct Reader {
+    explicit Reader(const Bytes& data) : size(data.size()), memory(new uint8_t[data.size()]) {
+        std::copy(data.begin(), data.end(), memory.get());
+        pb = sb_packbuff_init_with_buffer(memory.get(), size, true, SB_PACKBUFF_DEALLOC_NONE);
+    }
+    ~Reader() { sb_packbuff_free(pb); }
+    size_t cursor() const { return static_cast<size_t>(pb->item - pb->item_buffer); }
+
+    size_t size;
+    std::unique_ptr<uint8_t[]> memory;
+    sb_packbuff* pb;
+};
+
+TEST(Packbuff, NewBufferHoldsOnlyTheEndMarker) {
+    for (size_t requested : {size_t{0}, size_t{7}, size_t{8}, size_t{4096}}) {
+        sb_packbuff* pb = sb_packbuff_new(requested);
+        ASSERT_NE(pb, nullptr);
+        size_t block = requested < 8 ? 256 : requested;
+        EXPECT_EQ(pb->dealloc_type, uint32_t{SB_PACKBUFF_DEALLOC_FREE});
+        EXPECT_EQ(pb->block_size, block);
+        EXPECT_EQ(pb->bytes_allocated, block);
+        EXPECT_EQ(pb->bytes_remaining, block - 8);
+        EXPECT_EQ(sb_packbuff_get_size(pb), 8u);
+        EXPECT_EQ(contents(pb), Bytes(8, 0));
+        EXPECT_EQ(pb->item, pb->item_buffer);
+        EXPECT_FALSE(sb_packbuff_get_item_value_type(pb, nullptr));
+        sb_packbuff_free(pb);
+    }
+}
+
+TEST(Packbuff, StringItemLayout) {
+    sb_packbuff* pb = sb_packbuff_new_with_tag(256);
+    ASSERT_EQ(sb_packbuff_pack_string(pb, 2, "tmp", 3), 0);
+    Bytes expected = Wire().header(2, 2, 4).raw(std::string_view("tmp\0", 4)).zeros(4).end().bytes;
+    EXPECT_EQ(sb_packbuff_get_size(pb), 24u);
+    EXPECT_EQ(contents(pb), expected);
+    EXPECT_EQ(pb->item, pb->item_buffer + 16);
+    EXPECT_EQ(pb->bytes_remaining, 256u - 24);
+    sb_packbuff_free(pb);
+}
+
+// Written into memory full of 0xAA so that padding which is not zeroed shows.
+TEST(Packbuff, ItemsArePaddedToEightBytesWithZeros) {
+    for (size_t length = 0; length <= 17; ++length) {
+        SCOPED_TRACE(length);
+        Bytes memory(64, 0xAA);
+        sb_packbuff* pb =
+            sb_packbuff_init_with_buffer(memory.data(), memory.size(), false, SB_PACKBUFF_DEALLOC_NONE);
+        ASSERT_NE(pb, nullptr);
+        std::string data(length, 'x');
+        ASSERT_EQ(sb_packbuff_pack_bytes(pb, 9, data.data(), length), 0);
+        size_t padded = (length + 7) / 8 * 8;
+        Wire expected = Wire().header(3, 9, uint32_t(length)).raw(data).zeros(padded - length).end();
+        EXPECT_EQ(contents(pb), expected.bytes);
+        EXPECT_EQ(sb_packbuff_get_size(pb), 8 + padded + 8);
+        sb_packbuff_free(pb);
+    }
+
+    Bytes memory(24, 0xAA);
+    sb_packbuff* pb =
+        sb_packbuff_init_with_buffer(memory.data(), memory.size(), false, SB_PACKBUFF_DEALLOC_NONE);
+    ASSERT_EQ(sb_packbuff_pack_uint32(pb, 0, 0xDEADBEEF), 0);
+    EXPECT_EQ(contents(pb), Wire().header(1, 0, 0xDEADBEEF).end().bytes);
+    sb_packbuff_free(pb);
+}
+
+TEST(Packbuff, KeyValuePairs) {
+    sb_packbuff* pb = sb_packbuff_new(0);
+    ASSERT_EQ(sb_packbuff_pack_key_with_string_value(pb, 3, "group.a", 4, "/g/a"), 0);
+    Bytes expected = Wire()
+                         .header(2, 3, 8)
+                         .raw(std::string_view("group.a\0", 8))
+                         .header(2, 4, 5)
+                         .raw(std::string_view("/g/a\0", 5))
+                         .zeros(3)
+                         .end()
+                         .bytes;
+    EXPECT_EQ(contents(pb), expected);
+
+    Reader reader(contents(pb));
+    const char* key = nullptr;
+    const char* value = nullptr;
+    uint16_t valueType = 0;
+    size_t valueLength = 0;
+    ASSERT_EQ(sb_packbuff_unpack_key_with_string_value(reader.pb, &key, &valueType, &value, &valueLength), 0);
+    EXPECT_STREQ(key, "group.a");
+    EXPECT_EQ(valueType, 4); // the value's tag, not the key's
+    EXPECT_STREQ(value, "/g/a");
+    EXPECT_EQ(valueLength, 4u);
+    EXPECT_EQ(reader.cursor(), 32u);
+    sb_packbuff_free(pb);
+
+    // Room for the key item and its end marker, not for the value.
+    Bytes memory(8 + 8 + 8, 0xAA);
+    pb = sb_packbuff_init_with_buffer(memory.data(), memory.size(), false, SB_PACKBUFF_DEALLOC_NONE);
+    EXPECT_EQ(sb_packbuff_pack_key_with_string_value(pb, 3, "key", 4, "value"), ENOTSUP);
+    EXPECT_EQ(contents(pb), Wire().header(2, 3, 4).raw(std::string_view("key\0", 4)).zeros(4).end().bytes);
+    sb_packbuff_free(pb);
+
+    // A pair cut off after the key reads as a failure of the whole pair.
+    Reader cut(Wire().header(2, 3, 4).raw(std::string_view("key\0", 4)).zeros(4).end().bytes);
+    key = "untouched";
+    EXPECT_EQ(sb_packbuff_unpack_key_with_string_value(cut.pb, &key, nullptr, nullptr, nullptr), EINVAL);
+    EXPECT_STREQ(key, "untouched");
+    EXPECT_EQ(cut.cursor(), 0u);
+}
+
+// Every reallocation may move the memory; what was packed must come along unchanged.
+TEST(Packbuff, GrowsByBlocksAndKeepsEverything) {
+    sb_packbuff* pb = sb_packbuff_new(64);
+    Bytes flatMemory(64 * 1024);
+    sb_packbuff* flat =
+        sb_packbuff_init_with_buffer(flatMemory.data(), flatMemory.size(), false, SB_PACKBUFF_DEALLOC_NONE);
+    // An item larger than a block gets the block and its own size on top.
+    std::string big(200, 'b');
+    ASSERT_EQ(sb_packbuff_pack_bytes(pb, 7, big.data(), big.size()), 0);
+    ASSERT_EQ(sb_packbuff_pack_bytes(flat, 7, big.data(), big.size()), 0);
+    EXPECT_EQ(pb->bytes_allocated, 64u + 64 + 208);
+
+    for (uint32_t i = 0; i < 1000; ++i) {
+        std::string text = "item-" + std::to_string(i);
+        for (sb_packbuff* each : {pb, flat}) {
+            ASSERT_EQ(sb_packbuff_pack_string(each, uint16_t(i), text.c_str(), text.size()), 0);
+            ASSERT_EQ(sb_packbuff_pack_uint32(each, uint16_t(i), i * 3), 0);
+        }
+        // Small items only ever add whole blocks.
+        ASSERT_EQ((pb->bytes_allocated - 336) % 64, 0u);
+        ASSERT_EQ(pb->bytes_remaining, pb->bytes_allocated - pb->bytes_used);
+        ASSERT_EQ(pb->item, pb->item_buffer + pb->bytes_used - 8);
+    }
+    EXPECT_GT(pb->bytes_allocated, 64u * 100);
+    EXPECT_EQ(contents(pb), contents(flat));
+    sb_packbuff_free(pb);
+    sb_packbuff_free(flat);
+}
+
+TEST(Packbuff, WrappedMemoryNeverGrows) {
+    for (uint32_t dealloc : {SB_PACKBUFF_DEALLOC_NONE, SB_PACKBUFF_DEALLOC_FREE}) {
+        SCOPED_TRACE(dealloc);
+        auto* memory = static_cast<uint8_t*>(malloc(32));
+        sb_packbuff* pb = sb_packbuff_init_with_buffer(memory, 32, false, dealloc);
+        ASSERT_EQ(sb_packbuff_pack_uint32(pb, 1, 1), 0);
+        ASSERT_EQ(sb_packbuff_pack_uint32(pb, 2, 2), 0);
+        ASSERT_EQ(sb_packbuff_pack_uint32(pb, 3, 3), 0); // exactly full, end marker included
+        Bytes before = contents(pb);
+        EXPECT_EQ(sb_packbuff_pack_uint32(pb, 4, 4), ENOTSUP);
+        EXPECT_EQ(sb_packbuff_pack_string(pb, 4, "", 0), ENOTSUP);
+        EXPECT_EQ(contents(pb), before);
+        EXPECT_EQ(pb->bytes_allocated, 32u);
+        EXPECT_EQ(pb->item, memory + 24);
+        sb_packbuff_free(pb);
+        if (dealloc == SB_PACKBUFF_DEALLOC_NONE)
+            free(memory);
+    }
+
+    uint8_t small[7];
+    EXPECT_EQ(sb_packbuff_init_with_buffer(small, sizeof small, false, SB_PACKBUFF_DEALLOC_NONE), nullptr);
+    EXPECT_EQ(sb_packbuff_init_with_buffer(small, sizeof small, true, 3), nullptr);
+    EXPECT_EQ(sb_packbuff_init_with_buffer(nullptr, 64, true, SB_PACKBUFF_DEALLOC_NONE), nullptr);
+}
+
+TEST(Packbuff, RefusesLengthsTheFormatCannotCarry) {
+    sb_packbuff* pb = sb_packbuff_new(0);
+    ASSERT_EQ(sb_packbuff_pack_uint32(pb, 1, 1), 0);
+    Bytes before = contents(pb);
+    const char text[] = "abcd";
+    // None of these reads the data: the checks come first.
+    EXPECT_EQ(sb_packbuff_pack_string(pb, 1, text, 0xFFFFFFFFu), EINVAL);
+    EXPECT_EQ(sb_packbuff_pack_string(pb, 1, text, 2), EINVAL); // no NUL at text[2]
+    EXPECT_EQ(sb_packbuff_pack_string(pb, 1, nullptr, 0), EINVAL);
+    EXPECT_EQ(sb_packbuff_pack_key_with_string_value(pb, 1, nullptr, 2, "v"), EINVAL);
+    EXPECT_EQ(sb_packbuff_pack_bytes(pb, 1, text, size_t{0x100000000}), EINVAL);
+    EXPECT_EQ(sb_packbuff_pack_bytes(pb, 1, text, 0xFFFFFFFFu), ERANGE); // padding overflows
+    EXPECT_EQ(sb_packbuff_pack_bytes(pb, 1, text, 0xFFFFFFF9u), ERANGE);
+    EXPECT_EQ(sb_packbuff_pack_bytes(pb, 1, text, 0xFFFFFFF8u), ERANGE);
+    EXPECT_EQ(sb_packbuff_pack_bytes(pb, 1, text, 0xFFFFFFF1u), ERANGE);
+    EXPECT_EQ(contents(pb), before);
+    EXPECT_EQ(pb->item, pb->item_buffer + 8);
+    sb_packbuff_free(pb);
+}
+
+TEST(Packbuff, ReadsEveryKindAndSkips) {
+    sb_packbuff* pb = sb_packbuff_new(0);
+    ASSERT_EQ(sb_packbuff_pack_uint32(pb, 10, 42), 0);
+    ASSERT_EQ(sb_packbuff_pack_string(pb, 11, "", 0), 0);
+    ASSERT_EQ(sb_packbuff_pack_bytes(pb, 12, "\0\1\2", 3), 0);
+    ASSERT_EQ(sb_packbuff_pack_string(pb, 13, "skipped", 7), 0);
+    ASSERT_EQ(sb_packbuff_pack_uint32(pb, 14, 7), 0);
+    Reader reader(contents(pb));
+    sb_packbuff_free(pb);
+    sb_packbuff* in = reader.pb;
+    int error = -1;
+    size_t length = 99;
+
+    uint16_t tag = 0;
+    ASSERT_TRUE(sb_packbuff_get_item_value_type(in, &tag));
+    EXPECT_EQ(tag, 10);
+    // The wrong kind leaves the cursor for a second try.
+    EXPECT_EQ(sb_packbuff_unpack_string(in, &length, &error), nullptr);
+    EXPECT_EQ(error, EINVAL);
+    EXPECT_EQ(reader.cursor(), 0u);
+    EXPECT_EQ(sb_packbuff_unpack_uint32(in, &error), 42u);
+    EXPECT_EQ(error, 0);
+
+    const char* empty = sb_packbuff_unpack_string(in, &length, &error);
+    EXPECT_EQ(error, 0);
+    EXPECT_STREQ(empty, "");
+    EXPECT_EQ(length, 0u);
+    EXPECT_EQ(sb_packbuff_unpack_uint32(in, &error), 0u);
+    EXPECT_EQ(error, EINVAL);
+
+    auto* data = static_cast<const uint8_t*>(sb_packbuff_unpack_bytes(in, &length, &error));
+    EXPECT_EQ(error, 0);
+    ASSERT_EQ(length, 3u);
+    // Points into the buffer, not at a copy.
+    EXPECT_EQ(data, reader.memory.get() + 24 + 8);
+    EXPECT_EQ(memcmp(data, "\0\1\2", 3), 0);
+
+    EXPECT_EQ(sb_packbuff_skip_item(in), 0);
+    EXPECT_EQ(sb_packbuff_skip_item(in), 0);
+    EXPECT_FALSE(sb_packbuff_get_item_value_type(in, &tag));
+    EXPECT_EQ(sb_packbuff_skip_item(in), EINVAL); // the end marker is not an item
+    EXPECT_EQ(sb_packbuff_unpack_uint32(in, &error), 0u);
+    EXPECT_EQ(error, EINVAL);
+}
+
+TEST(Packbuff, RefusesBrokenStrings) {
+    struct Case {
+        const char* name;
+        Bytes bytes;
+    };
+    Case cases[] = {
+        {"no NUL", Wire().header(2, 0, 3).raw("abc").zeros(5).end().bytes},
+        {"NUL not last", Wire().header(2, 0, 3).raw(std::string_view("a\0c", 3)).zeros(5).end().bytes},
+        {"length 0", Wire().header(2, 0, 0).end().bytes},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        Reader reader(c.bytes);
+        int error = 0;
+        size_t length = 99;
+        EXPECT_EQ(sb_packbuff_unpack_string(reader.pb, &length, &error), nullptr);
+        EXPECT_EQ(error, EINVAL);
+        EXPECT_EQ(length, 0u);
+        EXPECT_EQ(reader.cursor(), 0u);
+        // Skipping does not judge the contents.
+        EXPECT_EQ(sb_packbuff_skip_item(reader.pb), 0);
+        EXPECT_FALSE(sb_packbuff_get_item_value_type(reader.pb, nullptr));
+    }
+}
+
+TEST(Packbuff, RefusesItemsThatRunPastTheBuffer) {
+    int error = 0;
+    size_t length = 0;
+
+    // Last item with no end marker behind it.
+    Reader noEnd(Wire().header(2, 5, 4).raw(std::string_view("tmp\0", 4)).zeros(4).bytes);
+    EXPECT_EQ(sb_packbuff_unpack_string(noEnd.pb, &length, &error), nullptr);
+    EXPECT_EQ(error, ERANGE);
+    EXPECT_EQ(sb_packbuff_skip_item(noEnd.pb), ERANGE);
+    EXPECT_EQ(noEnd.cursor(), 0u);
+    Reader noEndAfterValue(Wire().header(1, 5, 4).bytes);
+    EXPECT_EQ(sb_packbuff_unpack_uint32(noEndAfterValue.pb, &error), 0u);
+    EXPECT_EQ(error, ERANGE);
+
+    // Lengths that point past the end, including ones whose padding wraps in 32 bits.
+    for (uint32_t lie : {17u, 0x7FFFFFFFu, 0xFFFFFFF9u, 0xFFFFFFFFu}) {
+        SCOPED_TRACE(lie);
+        Reader reader(Wire().header(3, 5, lie).raw("12345678").end().bytes);
+        EXPECT_EQ(sb_packbuff_unpack_bytes(reader.pb, &length, &error), nullptr);
+        EXPECT_EQ(error, ERANGE);
+        EXPECT_EQ(sb_packbuff_skip_item(reader.pb), ERANGE);
+        EXPECT_EQ(reader.cursor(), 0u);
+    }
+
+    // Too short for a header: fewer than 4 bytes read as the end; 4 to 7 show a tag that
+    // cannot be read.
+    for (size_t size = 0; size < 8; ++size) {
+        SCOPED_TRACE(size);
+        Bytes header = Wire().header(1, 6, 1).bytes;
+        Reader reader(Bytes(header.begin(), header.begin() + static_cast<long>(size)));
+        uint16_t tag = 0;
+        EXPECT_EQ(sb_packbuff_get_item_value_type(reader.pb, &tag), size >= 4);
+        EXPECT_EQ(sb_packbuff_unpack_uint32(reader.pb, &error), 0u);
+        EXPECT_EQ(error, ERANGE);
+        EXPECT_EQ(sb_packbuff_skip_item(reader.pb), ERANGE);
+    }
+
+    // An unknown item type has a tag but cannot be read or skipped.
+    Reader unknown(Wire().header(9, 8, 0).end().bytes);
+    uint16_t tag = 0;
+    EXPECT_TRUE(sb_packbuff_get_item_value_type(unknown.pb, &tag));
+    EXPECT_EQ(tag, 8);
+    EXPECT_EQ(sb_packbuff_skip_item(unknown.pb), EINVAL);
+    EXPECT_EQ(unknown.cursor(), 0u);
+}
+
+std::string format(const char* fmt, auto... args) {
+    char line[512];
+    snprintf(line, sizeof line, fmt, args...);
+    return line;
+}
+
+std::string dumpOf(const sb_packbuff* pb, int* count) {
+    testing::internal::CaptureStdout();
+    *count = sb_packbuff_print(pb);
+    return testing::internal::GetCapturedStdout();
+}
+
+TEST(Packbuff, DumpShowsEveryItem) {
+    Bytes memory = Wire()
+                       .header(1, 0, 7)
+                       .header(2, 1, 4)
+                       .raw(std::string_view("tmp\0", 4))
+                       .zeros(4)
+                       .header(3, 2, 2)
+                       .raw("ab")
+                       .zeros(6)
+                       .header(6, 3, 0)
+                       .end()
+                       .zeros(8)
+                       .bytes;
+    sb_packbuff* pb =
+        sb_packbuff_init_with_buffer(memory.data(), memory.size(), true, SB_PACKBUFF_DEALLOC_NONE);
+    sb_packbuff_set_size(pb, memory.size() - 8);
+    sb_packbuff_skip_item(pb);
+    const void* m = memory.data();
+    const uint8_t* at = memory.data();
+    std::string expected =
+        format("packbuff: %p\n", static_cast<const void*>(pb)) +
+        "  block_size:      0\n"
+        "  dealloc_type:    None\n"
+        "  bytes_allocated: 64\n"
+        "  bytes_used:      56\n"
+        "  bytes_remaining: 8\n" +
+        format("  item_buffer %p, item: %p\n", m, static_cast<const void*>(at + 8)) + "\n" +
+        format("   0:%p -- value type 0 --inline value: 7\n", m) +
+        format("*  1:%p -- value type 1 --string (%p, 4 pad bytes, size: 4): \n     `tmp'\n",
+               static_cast<const void*>(at + 8), static_cast<const void*>(at + 16)) +
+        format("   2:%p -- value type 2 --bytes (%p, 6 pad bytes, size: 2)\n",
+               static_cast<const void*>(at + 24), static_cast<const void*>(at + 32)) +
+        format("   3:%p -- value type 3 --*Unknown item type* 6\n", static_cast<const void*>(at + 40)) +
+        format("   4: %p -- END\n", static_cast<const void*>(at + 48));
+    int count = 0;
+    std::string dump = dumpOf(pb, &count);
+    EXPECT_EQ(dump, expected);
+    EXPECT_EQ(count, static_cast<int>(dump.size()));
+
+    pb->dealloc_type = SB_PACKBUFF_DEALLOC_FREE;
+    EXPECT_NE(dumpOf(pb, &count).find("  dealloc_type:    free()\n"), std::string::npos);
+    pb->dealloc_type = SB_PACKBUFF_DEALLOC_VM_DEALLOCATE;
+    EXPECT_NE(dumpOf(pb, &count).find("  dealloc_type:    vm_deallocate()\n"), std::string::npos);
+    pb->dealloc_type = 7;
+    EXPECT_NE(dumpOf(pb, &count).find("  dealloc_type:    <Unknown>\n"), std::string::npos);
+    pb->dealloc_type = SB_PACKBUFF_DEALLOC_NONE;
+    sb_packbuff_free(pb);
+}
+
+TEST(Packbuff, DumpStopsAtTheEndOfTheUsedBytes) {
+    // A string whose length runs past the used bytes, and that has no NUL inside them.
+    Bytes memory = Wire().header(1, 0, 7).header(2, 1, 40).raw("abcdefgh").bytes;
+    sb_packbuff* pb =
+        sb_packbuff_init_with_buffer(memory.data(), memory.size(), true, SB_PACKBUFF_DEALLOC_NONE);
+    int count = 0;
+    std::string dump = dumpOf(pb, &count);
+    std::string tail = format("string (%p, 0 pad bytes, size: 40): \n     `abcdefgh'\n"
+                              ">> item pointer exceeds end of buffer. <<\n",
+                              static_cast<const void*>(memory.data() + 16));
+    ASSERT_GE(dump.size(), tail.size());
+    EXPECT_EQ(dump.substr(dump.size() - tail.size()), tail);
+    sb_packbuff_free(pb);
+
+    // The used bytes end right after an item: whatever lies behind them is not shown.
+    memory = Wire().header(1, 0, 7).header(1, 0, 9).end().bytes;
+    pb = sb_packbuff_init_with_buffer(memory.data(), memory.size(), true, SB_PACKBUFF_DEALLOC_NONE);
+    sb_packbuff_set_size(pb, 8);
+    dump = dumpOf(pb, &count);
+    tail = format("*  0:%p -- value type 0 --inline value: 7\n"
+                  ">> item pointer exceeds end of buffer. <<\n",
+                  static_cast<const void*>(memory.data()));
+    ASSERT_GE(dump.size(), tail.size());
+    EXPECT_EQ(dump.substr(dump.size() - tail.size()), tail);
+    sb_packbuff_free(pb);
+}
+
+TEST(Packbuff, FreeReleasesMappedMemory) {
+    size_t page = static_cast<size_t>(sysconf(_SC_PAGESIZE));
+    void* region = mmap(nullptr, page, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+    ASSERT_NE(region, MAP_FAILED);
+    sb_packbuff* pb = sb_packbuff_init_with_buffer(region, page, false, SB_PACKBUFF_DEALLOC_VM_DEALLOCATE);
+    ASSERT_EQ(sb_packbuff_pack_uint32(pb, 0, 1), 0);
+    sb_packbuff_free(pb);
+    unsigned char resident;
+    EXPECT_EQ(mincore(region, page, &resident), -1);
+    EXPECT_EQ(errno, ENOMEM); // nothing mapped there any more
+
+    // Memory that is not a mapped region cannot be released that way: the failure is
+    // logged and the memory stays.
+    Bytes memory(24 + 1);
+    uint8_t* unaligned = memory.data() + 1;
+    pb = sb_packbuff_init_with_buffer(unaligned, 24, false, SB_PACKBUFF_DEALLOC_VM_DEALLOCATE);
+    testing::internal::CaptureStderr();
+    sb_packbuff_free(pb);
+    std::string log = testing::internal::GetCapturedStderr();
+    EXPECT_NE(log.find(format("failed: vm_deallocate(%p, 24)", static_cast<void*>(unaligned))),
+              std::string::npos)
+        << log;
+}
+
+TEST(PackbuffDeathTest, BrokenCallsStopTheProcess) {
+    sb_packbuff* pb = sb_packbuff_new(0);
+    EXPECT_DEATH(sb_packbuff_pack_bytes(pb, 1, nullptr, 4), "additional_bytes != NULL");
+    EXPECT_DEATH(sb_packbuff_set_size(pb, pb->bytes_allocated + 1), "size <= pb->bytes_allocated");
+    sb_packbuff_free(pb);
+}
+
+TEST(Packbuff, UsableFromC) {
+    EXPECT_EQ(packbuff_round_trip_from_c(), 0) << "first failing line in the C file";
+}
+
+} // namespace
