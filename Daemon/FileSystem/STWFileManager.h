@@ -1,0 +1,179 @@
+// The one place where the daemon touches the file system for containers.
+//
+// Used by the container cache, create-or-lookup, deletion and death row, replace, boot-time
+// cleanup, per-container services, data protection and migration. It removes whole trees,
+// creates directories with mode, owner and data-protection class, copies and moves (with a
+// mode in which a missing source is no error), makes temporary directories, lists and walks
+// directories, tests existence, reads and sets protection classes, measures disk usage, and
+// decides whether a path a client sent really lies inside a container.
+//
+// Paths are absolute and carry no trailing separator; a "directory URL" is just the path.
+// Every failure is a POSIX-domain error whose code is the errno of the failing call, so
+// callers can hand it to clients unchanged. The manager has no state; every operation may
+// be called from any thread.
+//
+// Symbolic links: removal, copy, the tree walks and the protection-class operations never
+// follow a link found inside the tree they work on. A path that a client sent is checked
+// with realPathForURL(); to act on it without being fooled by a link swapped in after the
+// check, open it with openBeneath() relative to the container's directory descriptor.
+#pragma once
+
+#include "Daemon/FileSystem/STWFileDescriptor.h"
+#include "common/STWError.h"
+
+#include <cstdint>
+#include <filesystem>
+#include <fts.h>
+#include <functional>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <sys/types.h>
+#include <vector>
+
+// Values of createDirectoryAtURL()'s owner and class that leave the item as it is.
+inline constexpr uid_t STWFileManagerOwnerUnchanged = 0;
+inline constexpr int32_t STWFileManagerClassUnchanged = -1;
+
+enum STWFileManagerMoveOptions : unsigned {
+    STWFileManagerMoveDefault = 0,
+    // Make the move survive a power cut once it has been acknowledged: everything that is
+    // moved is fsynced before the rename, and the directories that the rename changed are
+    // fsynced after it (after a copy, for a move across file systems). Use it for every
+    // move that makes something visible that must not be lost or half there: a staged
+    // container renamed into its class directory, a replaced container moved into place, a
+    // metadata file or a journal renamed over its target. Moves into death row or into a
+    // staging area need no durability and should not pay for it.
+    STWFileManagerMoveDurable = 1u << 0,
+};
+
+enum STWOpenBeneathOptions : unsigned {
+    STWOpenBeneathDefault = 0,
+    // Refuse every symbolic link on the way, not only those that lead out of the directory.
+    STWOpenBeneathNoSymlinks = 1u << 0,
+};
+
+class STWFileManager {
+public:
+    // Called for each entry of _traverseDirectory(); answering false stops the walk with the
+    // error the visitor stored.
+    using TraversalVisitor = std::function<bool(FTSENT* entry, STWErrorRef* error)>;
+    // Given the current class of the item; answering false leaves it unchanged.
+    using ClassPredicate = std::function<bool(int32_t currentClass)>;
+
+    static STWFileManager* defaultManager();
+
+    // The home directory of `uid` from the users database (ROOT/etc/passwd under a private
+    // root prefix, else the system's), resolved under the root prefix; the mobile user's
+    // home when there is none.
+    static std::filesystem::path homeDirectoryURLForPOSIXUID(uid_t uid);
+
+    // Removes the item and, for a directory, everything below it; symbolic links are removed,
+    // never followed. A missing item is removed successfully. A user-immutable item is
+    // unflagged and removed. One item that cannot be removed does not stop the removal of
+    // the rest; the error is the first one met.
+    bool removeItemAtURL(const std::filesystem::path& url, STWErrorRef* error = nullptr) const;
+
+    // Creates the directory (and, with `withIntermediateDirectories`, its missing parents,
+    // which get `mode` plus owner write and search). An existing directory is fine: its mode
+    // stays, but it still gets `owner` (as user and group id) and `dataProtectionClass`
+    // unless they are STWFileManagerOwnerUnchanged / STWFileManagerClassUnchanged. A symbolic
+    // link in place of the directory is refused when an owner or class is to be set.
+    bool createDirectoryAtURL(const std::filesystem::path& url, bool withIntermediateDirectories, mode_t mode,
+                              uid_t owner, int32_t dataProtectionClass, STWErrorRef* error = nullptr) const;
+    bool createDirectoryAtURL(const std::filesystem::path& url, bool withIntermediateDirectories, mode_t mode,
+                              STWErrorRef* error = nullptr) const;
+
+    // Copies recursively: data (cloned where the file system can), mode, ownership, ACLs and
+    // extended attributes. Symbolic links are copied as links and never followed, at the
+    // source or the destination. A failed copy may leave part of the tree behind.
+    bool _copyItemAtURL(const std::filesystem::path& url, const std::filesystem::path& toURL, bool failIfSrcMissing,
+                        STWErrorRef* error) const;
+    bool copyItemAtURL(const std::filesystem::path& url, const std::filesystem::path& toURL,
+                       STWErrorRef* error = nullptr) const;
+    bool copyItemIfExistsAtURL(const std::filesystem::path& url, const std::filesystem::path& toURL,
+                               STWErrorRef* error = nullptr) const;
+
+    // Renames; across file systems copies and then removes the source (a source that cannot
+    // be removed is only logged).
+    bool _moveItemAtURL(const std::filesystem::path& url, const std::filesystem::path& toURL, bool failIfSrcMissing,
+                        STWFileManagerMoveOptions options, STWErrorRef* error) const;
+    bool moveItemAtURL(const std::filesystem::path& url, const std::filesystem::path& toURL,
+                       STWErrorRef* error = nullptr) const;
+    bool moveItemAtURL(const std::filesystem::path& url, const std::filesystem::path& toURL,
+                       STWFileManagerMoveOptions options, STWErrorRef* error = nullptr) const;
+    bool moveItemIfExistsAtURL(const std::filesystem::path& url, const std::filesystem::path& toURL,
+                               STWErrorRef* error = nullptr) const;
+    bool moveItemIfExistsAtURL(const std::filesystem::path& url, const std::filesystem::path& toURL,
+                               STWFileManagerMoveOptions options, STWErrorRef* error = nullptr) const;
+
+    // A new directory `withNamePrefix` + six random characters in `url`.
+    std::optional<std::filesystem::path> createTemporaryDirectoryInDirectoryURL(const std::filesystem::path& url,
+                                                                                const std::string& withNamePrefix,
+                                                                                STWErrorRef* error = nullptr) const;
+    std::optional<std::filesystem::path> createTemporaryDirectoryInDirectoryURL(const std::filesystem::path& url,
+                                                                                STWErrorRef* error = nullptr) const;
+
+    // An fts walk of the tree at `url` (physical, no chdir, one device, unsorted). An entry
+    // that cannot be read or examined ends the walk with its errno.
+    bool _traverseDirectory(const std::filesystem::path& url, STWErrorRef* error,
+                            const TraversalVisitor& withBlock) const;
+
+    // The entries of the directory in reading order, without those whose name begins with
+    // "." (so no hidden items either). No partial result: a missing directory fails with
+    // ENOENT.
+    std::optional<std::vector<std::filesystem::path>> urlsForItemsInDirectoryAtURL(const std::filesystem::path& url,
+                                                                                   STWErrorRef* error = nullptr) const;
+
+    // lstat-based: a dangling link exists. An item that cannot be examined (other than
+    // ENOENT) answers NO to both.
+    bool itemExistsAtURL(const std::filesystem::path& url) const;
+    bool itemDoesNotExistAtURL(const std::filesystem::path& url) const;
+
+    // The item's data-protection class (0 when it has none). A symbolic link is never
+    // followed: opening it fails. While the device is locked, class 1 items fail with EPERM.
+    bool dataProtectionClassOfItemAtURL(const std::filesystem::path& url, int32_t* dataProtectionClass,
+                                        STWErrorRef* error = nullptr) const;
+    bool setDataProtectionClassOfItemAtURL(const std::filesystem::path& url, int32_t toClass,
+                                           const ClassPredicate& ifPredicate, STWErrorRef* error = nullptr) const;
+
+    // Logs every item of the tree; the orphan cleanup records what it is about to remove.
+    void printDirectoryStructureAtURL(const std::filesystem::path& url) const;
+
+    // Bytes allocated to the tree, as du counts them (hard links once, one device). The fast
+    // variant prefers statistics the file system maintains when the "fast_container_sizing"
+    // feature is on; Linux keeps none, so both end up walking. 0 when it cannot be measured.
+    uint64_t fastDiskUsageForURL(const std::filesystem::path& url) const;
+    uint64_t diskUsageForURL(const std::filesystem::path& url) const;
+
+    // The real path of `url`, a path a client sent, if it lies inside `ifChildOfURL` (the base
+    // itself counts); nullopt otherwise. Refuses ".." components and absolute links, and
+    // relative links that climb out of the base. "/private/var/..." and "/var/..." below the
+    // root prefix name the same place on both sides.
+    std::optional<std::filesystem::path> realPathForURL(const std::filesystem::path& url,
+                                                        const std::filesystem::path& ifChildOfURL) const;
+    std::optional<std::filesystem::path> _realPathForURL(const std::filesystem::path& url,
+                                                         bool allowNonExistentPathComponents) const;
+    // The real path of the longest existing prefix (two components or more) of `path`,
+    // with the rest appended.
+    std::optional<std::filesystem::path> _realPathWhatExistsInPath(const std::string& path) const;
+    // Walks `path` lexically from `withStartingDepth` ("..": -1; "", ".": 0; others: +1) and
+    // fails as soon as the depth drops below the start; stores the final depth.
+    static bool _validateSymlink(std::string_view path, int32_t withStartingDepth, int32_t* andEndingDepth);
+
+    // Opens `relativePath` beneath the directory `dirfd` so that no "..", absolute path or
+    // symbolic link (nor a /proc magic link) can lead out of it, however the tree changes
+    // meanwhile: openat2 with RESOLVE_BENEATH, or where the kernel lacks it a walk of
+    // O_NOFOLLOW opens that refuses every link and every "..". `mode` is used with O_CREAT.
+    STWFileDescriptor openBeneath(int dirfd, const std::filesystem::path& relativePath, int flags, mode_t mode,
+                                  unsigned options, STWErrorRef* error = nullptr) const;
+    // The walk of O_NOFOLLOW opens on its own (for kernels without openat2, and for tests).
+    STWFileDescriptor _openBeneathByComponents(int dirfd, const std::filesystem::path& relativePath, int flags,
+                                               mode_t mode, STWErrorRef* error = nullptr) const;
+
+    // Tests observe every fsync made for durability, with the path synced.
+    static void setSyncObserverForTesting(std::function<void(const std::string& path)> observer);
+
+private:
+    STWFileManager() = default;
+};

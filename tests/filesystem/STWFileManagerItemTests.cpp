@@ -1,0 +1,285 @@
+#include "Daemon/FileSystem/STWKeybag.h"
+#include "common/STWFileIO.h"
+#include "platform/STWPlatformConfiguration.h"
+#include "tests/filesystem/STWFileSystemTestSupport.h"
+#include "tests/support/STWTestRoot.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <cstdio>
+#include <sys/stat.h>
+#include <unistd.h>
+
+namespace fs = std::filesystem;
+using namespace stwtest;
+
+namespace {
+
+class Items : public FileSystemTest {
+protected:
+    void TearDown() override {
+        STWKeybag::setLockStateOverrideForTesting(std::nullopt);
+        FileSystemTest::TearDown();
+    }
+};
+
+TEST_F(Items, ListingHidesDotNamesAndFailsForAMissingDirectory) {
+    fs::create_directory(scratch() / "dir");
+    fs::create_directory(scratch() / ".hidden-dir");
+    writeFile(scratch() / "file", "");
+    writeFile(scratch() / ".metadata", "");
+    fs::create_symlink("nowhere", scratch() / "dangling");
+
+    auto items = fm()->urlsForItemsInDirectoryAtURL(scratch());
+    ASSERT_TRUE(items);
+    std::vector<fs::path> sorted = *items;
+    std::sort(sorted.begin(), sorted.end());
+    EXPECT_EQ(sorted, (std::vector<fs::path>{scratch() / "dangling", scratch() / "dir", scratch() / "file"}));
+
+    STWErrorRef error;
+    EXPECT_FALSE(fm()->urlsForItemsInDirectoryAtURL(scratch() / "missing", &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->isPOSIX(ENOENT));
+    EXPECT_TRUE(error->message().starts_with("_IterateDirectory for ")) << error->message();
+}
+
+TEST_F(Items, ExistenceOfDanglingLinksAndOfItemsThatCannotBeExamined) {
+    fs::create_symlink("nowhere", scratch() / "dangling");
+    EXPECT_TRUE(fm()->itemExistsAtURL(scratch() / "dangling"));
+    EXPECT_FALSE(fm()->itemDoesNotExistAtURL(scratch() / "dangling"));
+    EXPECT_FALSE(fm()->itemExistsAtURL(scratch() / "missing"));
+    EXPECT_TRUE(fm()->itemDoesNotExistAtURL(scratch() / "missing"));
+
+    if (geteuid() != 0)
+        GTEST_SKIP() << "needs root to drop to another user";
+    fs::create_directory(scratch() / "closed");
+    writeFile(scratch() / "closed/item", "");
+    ASSERT_EQ(chmod((scratch() / "closed").c_str(), 0700), 0);
+    int result = runAs(kNobody, kNobody, [&] {
+        auto* manager = STWFileManager::defaultManager();
+        bool exists = manager->itemExistsAtURL(scratch() / "closed/item");
+        bool doesNotExist = manager->itemDoesNotExistAtURL(scratch() / "closed/item");
+        return !exists && !doesNotExist ? 0 : 1;
+    });
+    EXPECT_EQ(result, 0) << "an item that cannot be examined neither exists nor does not exist";
+}
+
+TEST_F(Items, ClassPredicateDecidesAndLinksAreNeverFollowed) {
+    fs::path file = scratch() / "file";
+    writeFile(file, "x");
+    int32_t value = -5;
+    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(file, &value));
+    EXPECT_EQ(value, 0) << "no class yet";
+
+    ASSERT_TRUE(fm()->setDataProtectionClassOfItemAtURL(file, 3, nullptr));
+    std::vector<int32_t> seen;
+    EXPECT_TRUE(fm()->setDataProtectionClassOfItemAtURL(file, 4, [&](int32_t current) {
+        seen.push_back(current);
+        return false;
+    }));
+    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(file, &value));
+    EXPECT_EQ(value, 3) << "a predicate answering NO changes nothing";
+    EXPECT_TRUE(fm()->setDataProtectionClassOfItemAtURL(file, 4, [&](int32_t current) {
+        seen.push_back(current);
+        return current != 4;
+    }));
+    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(file, &value));
+    EXPECT_EQ(value, 4);
+    EXPECT_EQ(seen, (std::vector<int32_t>{3, 3}));
+
+    fs::create_symlink(file, scratch() / "link");
+    STWErrorRef error;
+    EXPECT_FALSE(fm()->setDataProtectionClassOfItemAtURL(scratch() / "link", 1, nullptr, &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->isPOSIX(ELOOP));
+    EXPECT_TRUE(error->message().starts_with("Failed to open ")) << error->message();
+    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(file, &value));
+    EXPECT_EQ(value, 4);
+}
+
+TEST_F(Items, ClassOneIsOutOfReachWhileLocked) {
+    fs::path keybag = STWPlatformConfiguration::sharedInstance()->runtimeDirectory() / "keybag";
+    fs::create_directories(keybag.parent_path());
+    ASSERT_EQ(STWWriteFile(keybag, "locked\n", 0644, false), 0);
+    EXPECT_TRUE(STWKeybag::isDeviceLocked());
+    ASSERT_EQ(STWWriteFile(keybag, "unlocked", 0644, false), 0);
+    EXPECT_FALSE(STWKeybag::isDeviceLocked());
+    fs::remove(keybag);
+    EXPECT_FALSE(STWKeybag::isDeviceLocked()) << "no keybag file means unlocked";
+
+    fs::path complete = scratch() / "complete", other = scratch() / "other";
+    writeFile(complete, "c");
+    writeFile(other, "o");
+    ASSERT_TRUE(fm()->setDataProtectionClassOfItemAtURL(complete, 1, nullptr));
+    ASSERT_TRUE(fm()->setDataProtectionClassOfItemAtURL(other, 3, nullptr));
+
+    STWKeybag::setLockStateOverrideForTesting(true);
+    int32_t value = 0;
+    STWErrorRef error;
+    EXPECT_FALSE(fm()->dataProtectionClassOfItemAtURL(complete, &value, &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->isPOSIX(EPERM));
+    EXPECT_FALSE(fm()->setDataProtectionClassOfItemAtURL(complete, 3, nullptr));
+    EXPECT_FALSE(fm()->setDataProtectionClassOfItemAtURL(other, 1, nullptr));
+    EXPECT_TRUE(fm()->setDataProtectionClassOfItemAtURL(other, 4, nullptr));
+    EXPECT_FALSE(fm()->createDirectoryAtURL(scratch() / "new", false, 0755, 0, 1));
+
+    STWKeybag::setLockStateOverrideForTesting(false);
+    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(complete, &value));
+    EXPECT_EQ(value, 1);
+}
+
+TEST_F(Items, CreatingAnExistingDirectoryStillSetsOwnerAndClass) {
+    fs::path dir = scratch() / "a/b/c";
+    ASSERT_TRUE(fm()->createDirectoryAtURL(dir, true, 0750));
+    EXPECT_EQ(fs::status(dir).permissions() & fs::perms::all, fs::perms(0750));
+
+    STWErrorRef error;
+    EXPECT_FALSE(fm()->createDirectoryAtURL(scratch() / "x/y", false, 0755, &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->isPOSIX(ENOENT));
+    EXPECT_TRUE(error->message().starts_with("mkdir of ")) << error->message();
+
+    ASSERT_TRUE(fm()->createDirectoryAtURL(dir, true, 0700, 501, 4, &error)) << error->description();
+    struct stat st;
+    ASSERT_EQ(stat(dir.c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 07777, 0750u) << "an existing directory keeps its mode";
+    if (geteuid() == 0) {
+        EXPECT_EQ(st.st_uid, 501u);
+        EXPECT_EQ(st.st_gid, 501u) << "one id serves as user and group";
+    }
+    int32_t value = 0;
+    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(dir, &value));
+    EXPECT_EQ(value, 4);
+
+    // A file in the way is not a directory, with or without intermediate directories.
+    writeFile(scratch() / "file", "");
+    for (bool intermediates : {false, true}) {
+        error.reset();
+        EXPECT_FALSE(fm()->createDirectoryAtURL(scratch() / "file", intermediates, 0755, &error));
+        ASSERT_TRUE(error);
+        EXPECT_TRUE(error->isPOSIX(ENOTDIR));
+    }
+}
+
+TEST_F(Items, OwnerAndClassAreNeverGivenToALinkTarget) {
+    fs::path target = scratch() / "target";
+    fs::create_directory(target);
+    fs::create_directory_symlink(target, scratch() / "planted");
+    struct stat before;
+    ASSERT_EQ(stat(target.c_str(), &before), 0);
+    STWErrorRef error;
+    EXPECT_FALSE(fm()->createDirectoryAtURL(scratch() / "planted", true, 0755, 501, 3, &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->isPOSIX(ELOOP) || error->isPOSIX(ENOTDIR)) << error->description();
+    struct stat after;
+    ASSERT_EQ(stat(target.c_str(), &after), 0);
+    EXPECT_EQ(after.st_uid, before.st_uid);
+    int32_t value = -1;
+    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(target, &value));
+    EXPECT_EQ(value, 0);
+}
+
+TEST_F(Items, TemporaryDirectoriesAreUniqueAndPrefixed) {
+    auto first = fm()->createTemporaryDirectoryInDirectoryURL(scratch());
+    auto second = fm()->createTemporaryDirectoryInDirectoryURL(scratch(), "com.example.Assets.");
+    ASSERT_TRUE(first && second);
+    EXPECT_TRUE(fs::is_directory(*first));
+    EXPECT_TRUE(first->filename().native().starts_with("temp."));
+    EXPECT_EQ(first->filename().native().size(), 11u);
+    EXPECT_TRUE(second->filename().native().starts_with("com.example.Assets."));
+    EXPECT_EQ(first->parent_path(), scratch());
+
+    STWErrorRef error = STW_POSIX_ERROR_NOLOG(1, "stale");
+    EXPECT_FALSE(fm()->createTemporaryDirectoryInDirectoryURL(scratch() / "missing", &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->isPOSIX(ENOENT));
+    EXPECT_TRUE(error->message().starts_with("Failed to create temp dir at path ")) << error->message();
+}
+
+TEST_F(Items, TraversalStopsOnVisitorAndEntryErrors) {
+    fs::create_directories(scratch() / "tree/sub");
+    writeFile(scratch() / "tree/sub/f", "");
+    fs::create_directory_symlink(scratch(), scratch() / "tree/loop");
+    std::vector<std::string> seen;
+    ASSERT_TRUE(fm()->_traverseDirectory(scratch() / "tree", nullptr, [&](FTSENT* entry, STWErrorRef*) {
+        seen.push_back(std::to_string(entry->fts_info) + ":" + entry->fts_name);
+        return true;
+    }));
+    // Pre- and post-order visits of the directories, the file, and the link (not followed).
+    std::vector<std::string> expected = {std::to_string(FTS_D) + ":sub", std::to_string(FTS_D) + ":tree",
+                                         std::to_string(FTS_DP) + ":sub", std::to_string(FTS_DP) + ":tree",
+                                         std::to_string(FTS_F) + ":f", std::to_string(FTS_SL) + ":loop"};
+    std::sort(seen.begin(), seen.end());
+    std::sort(expected.begin(), expected.end());
+    EXPECT_EQ(seen, expected);
+
+    STWErrorRef error;
+    int visits = 0;
+    EXPECT_FALSE(fm()->_traverseDirectory(scratch() / "tree", &error, [&](FTSENT*, STWErrorRef* visitorError) {
+        ++visits;
+        *visitorError = STW_POSIX_ERROR_NOLOG(EBADF, "visitor gave up");
+        return false;
+    }));
+    EXPECT_EQ(visits, 1);
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->message(), "visitor gave up");
+
+    error.reset();
+    EXPECT_FALSE(fm()->_traverseDirectory(scratch() / "missing", &error, [](FTSENT*, STWErrorRef*) { return true; }));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->isPOSIX(ENOENT));
+    EXPECT_TRUE(error->message().starts_with("Error for path ")) << error->message();
+}
+
+// What `du -s --block-size=1` says, or nullopt where it cannot be run.
+std::optional<uint64_t> duBytes(const fs::path& path) {
+    std::string command = "du -s --block-size=1 '" + path.native() + "' 2>/dev/null";
+    FILE* pipe = popen(command.c_str(), "r");
+    if (!pipe)
+        return std::nullopt;
+    unsigned long long bytes = 0;
+    int fields = fscanf(pipe, "%llu", &bytes);
+    return pclose(pipe) == 0 && fields == 1 ? std::optional<uint64_t>(bytes) : std::nullopt;
+}
+
+TEST_F(Items, DiskUsageCountsAllocatedBytesLikeDu) {
+    fs::path tree = scratch() / "tree";
+    fs::create_directories(tree / "a/b");
+    writeFile(tree / "a/small", "x");
+    writeFile(tree / "a/b/large", std::string(1 << 20, 'l'));
+    ASSERT_EQ(link((tree / "a/b/large").c_str(), (tree / "hardlink").c_str()), 0);
+    fs::create_symlink("a/b/large", tree / "symlink");
+    // A sparse file: its size is not what it occupies.
+    {
+        FILE* f = fopen((tree / "sparse").c_str(), "w");
+        ASSERT_NE(f, nullptr);
+        fseek(f, 50 << 20, SEEK_SET);
+        fputc('s', f);
+        fclose(f);
+    }
+    auto expected = duBytes(tree);
+    if (!expected)
+        GTEST_SKIP() << "du is not available";
+    EXPECT_EQ(fm()->diskUsageForURL(tree), *expected);
+    EXPECT_LT(fm()->diskUsageForURL(tree), 10u << 20);
+
+    STWTestRoot::shared().writeSettings({{"Features", STWValue(STWValue::Dictionary{
+                                                          {"fast_container_sizing", STWValue(true)}})}});
+    EXPECT_EQ(fm()->fastDiskUsageForURL(tree), *expected);
+    STWTestRoot::shared().writeSettings({});
+    EXPECT_EQ(fm()->fastDiskUsageForURL(tree), *expected);
+
+    EXPECT_EQ(fm()->diskUsageForURL(scratch() / "missing"), 0u);
+    EXPECT_EQ(fm()->diskUsageForURL(""), 0u);
+}
+
+TEST_F(Items, HomeDirectoriesResolveUnderTheRoot) {
+    fs::path mobile = STWTestRoot::shared().resolve("/private/var/mobile");
+    EXPECT_EQ(STWFileManager::homeDirectoryURLForPOSIXUID(501), fs::canonical(mobile));
+    // A user without an entry, or whose home is missing, gets the mobile user's home.
+    EXPECT_EQ(STWFileManager::homeDirectoryURLForPOSIXUID(4242), mobile);
+    EXPECT_EQ(STWFileManager::homeDirectoryURLForPOSIXUID(502), mobile);
+}
+
+} // namespace

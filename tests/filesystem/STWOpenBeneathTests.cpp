@@ -1,0 +1,91 @@
+#include "tests/filesystem/STWFileSystemTestSupport.h"
+
+#include <cerrno>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+namespace fs = std::filesystem;
+using namespace stwtest;
+
+namespace {
+
+// Both the openat2 path and the component walk kernels without it fall back to.
+class OpenBeneath : public FileSystemTest, public ::testing::WithParamInterface<bool> {
+protected:
+    void SetUp() override {
+        FileSystemTest::SetUp();
+        container = scratch() / "container";
+        fs::create_directories(container / "Library/Caches");
+        fs::create_directories(scratch() / "outside");
+        writeFile(container / "Library/prefs", "p");
+        writeFile(scratch() / "outside/secret", "s");
+        dirfd = open(container.c_str(), O_RDONLY | O_DIRECTORY);
+        ASSERT_GE(dirfd, 0);
+    }
+    void TearDown() override {
+        close(dirfd);
+        FileSystemTest::TearDown();
+    }
+    bool walking() const { return GetParam(); }
+
+    // The errno of opening `relative`, 0 on success.
+    int openError(const fs::path& relative, int flags = O_RDONLY, unsigned options = STWOpenBeneathDefault) {
+        STWErrorRef error;
+        STWFileDescriptor fd = walking() ? fm()->_openBeneathByComponents(dirfd, relative, flags, 0644, &error)
+                                         : fm()->openBeneath(dirfd, relative, flags, 0644, options, &error);
+        if (fd)
+            return 0;
+        EXPECT_TRUE(error);
+        return error ? static_cast<int>(error->code()) : -1;
+    }
+
+    fs::path container;
+    int dirfd = -1;
+};
+
+TEST_P(OpenBeneath, OpensAndCreatesInside) {
+    EXPECT_EQ(openError("Library/prefs"), 0);
+    EXPECT_EQ(openError("./Library//Caches", O_RDONLY | O_DIRECTORY), 0);
+    EXPECT_EQ(openError(""), 0);
+    EXPECT_EQ(openError("Library/new", O_WRONLY | O_CREAT | O_EXCL), 0);
+    struct stat st;
+    ASSERT_EQ(stat((container / "Library/new").c_str(), &st), 0);
+    mode_t mask = umask(0);
+    umask(mask);
+    EXPECT_EQ(st.st_mode & 0777, 0644u & ~mask) << "the mode is passed on";
+    EXPECT_EQ(openError("Library/missing"), ENOENT);
+}
+
+TEST_P(OpenBeneath, NothingLeadsOutOfTheDirectory) {
+    fs::create_directory_symlink(scratch() / "outside", container / "Library/absolute");
+    fs::create_directory_symlink("../../outside", container / "Library/relative");
+    fs::create_symlink("/proc/self/root/etc/passwd", container / "magic");
+
+    EXPECT_EQ(openError("../outside/secret"), EXDEV);
+    EXPECT_EQ(openError((scratch() / "outside/secret").native()), EXDEV);
+    for (const char* path : {"Library/absolute/secret", "Library/relative/secret", "magic"}) {
+        int e = openError(path);
+        EXPECT_TRUE(e == EXDEV || e == ELOOP) << path << ": " << e;
+    }
+    // Creating through a link planted as the last component does not create outside.
+    fs::create_symlink(scratch() / "outside/created", container / "plant");
+    EXPECT_NE(openError("plant", O_WRONLY | O_CREAT), 0);
+    EXPECT_FALSE(fs::exists(scratch() / "outside/created"));
+}
+
+TEST_P(OpenBeneath, LinksInsideFollowOnlyWhenAllowed) {
+    fs::create_directory_symlink("Library", container / "alias");
+    if (walking()) {
+        EXPECT_EQ(openError("alias/prefs"), ELOOP) << "the component walk refuses every link";
+        return;
+    }
+    EXPECT_EQ(openError("alias/prefs"), 0);
+    EXPECT_EQ(openError("Library/Caches/../prefs"), 0) << "'..' that stays inside is fine";
+    EXPECT_EQ(openError("alias/prefs", O_RDONLY, STWOpenBeneathNoSymlinks), ELOOP);
+}
+
+INSTANTIATE_TEST_SUITE_P(, OpenBeneath, ::testing::Values(false, true),
+                         [](const auto& info) { return info.param ? "ComponentWalk" : "Openat2"; });
+
+} // namespace

@@ -1,0 +1,27 @@
+// A private root prefix for tests: a temporary directory with etc/passwd (a "mobile" user
+// 501 whose home is /private/var/mobile), etc/group (with "systemusers") and
+// etc/stowly/, installed as the shared platform configuration. The daemon's process-wide
+// objects keep the first root they see, so there is one root per test process; it is
+// removed when the process exits.
+#pragma once
+
+#include "common/STWValue.h"
+
+#include <filesystem>
+
+class STWTestRoot {
+public:
+    static STWTestRoot& shared();
+
+    const std::filesystem::path& path() const { return _path; }
+    std::filesystem::path resolve(const std::filesystem::path& absolute) const;
+    // Rewrites etc/stowly/stowlyd.plist and reloads the shared configuration.
+    void writeSettings(const STWValue::Dictionary& settings);
+    // Writes etc/stowly/personas.plist (an array of persona dictionaries).
+    void writePersonas(const STWValue::Array& personas);
+
+private:
+    STWTestRoot();
+    void _reload();
+    std::filesystem::path _path;
+};
