@@ -1,0 +1,194 @@
+#include "Daemon/Model/STWGlobalConfiguration.h"
+
+#include "Daemon/FileSystem/STWFileManager.h"
+#include "common/STWLog.h"
+#include "platform/STWPlatformConfiguration.h"
+#include "platform/STWUserDatabase.h"
+
+namespace {
+
+constexpr uint16_t kDirectoryMode = 0755;
+constexpr int32_t kNoProtectionClass = 4;
+constexpr int32_t kLeaveProtectionClass = -1;
+
+std::filesystem::path underRoot(const char* absolute) {
+    return STWPlatformConfiguration::sharedInstance()->resolve(absolute);
+}
+
+uid_t installationUID() { return STWPlatformConfiguration::sharedInstance()->installationUID(); }
+uid_t systemContainerUID() { return STWPlatformConfiguration::sharedInstance()->systemContainerUID(); }
+
+} // namespace
+
+void STWCreateLayoutDirectory(const std::filesystem::path& path, uint16_t mode, uid_t owner, int32_t protectionClass,
+                              const char* failureMessage) {
+    STWErrorRef error;
+    if (!STWFileManager::defaultManager()->createDirectoryAtURL(path, true, mode, owner, protectionClass, &error))
+        STW_LOG_ERROR(STWLogCategory::Unspecified, failureMessage, path, error);
+}
+
+std::shared_ptr<STWGlobalConfiguration> STWGlobalConfiguration::sharedInstance() {
+    static const std::shared_ptr<STWGlobalConfiguration> instance = std::make_shared<STWGlobalConfiguration>();
+    return instance;
+}
+
+STWGlobalConfiguration::STWGlobalConfiguration() {
+    _homeDirectory = underRoot("/private/var/root/");
+    std::string name = STWPlatformConfiguration::sharedInstance()->mobileUserName();
+    if (auto mobile = STWUserDatabase::userWithName(name)) {
+        _currentMobileUserId = mobile->uid;
+        _currentMobileGroupId = mobile->gid;
+        STW_LOG_NOTICE(STWLogCategory::Unspecified, "Current mobile user ID is %u, group ID is %u", _currentMobileUserId,
+                       _currentMobileGroupId);
+    } else {
+        STW_LOG_ERROR(STWLogCategory::Unspecified, "Failed to get mobile uid. This is bad");
+    }
+}
+
+std::filesystem::path STWGlobalConfiguration::_directory(std::optional<std::filesystem::path>& slot,
+                                                         const std::filesystem::path& computed, uint16_t mode,
+                                                         uid_t owner, int32_t protectionClass,
+                                                         const char* failureMessage) {
+    std::filesystem::path path;
+    {
+        std::lock_guard guard(_lock);
+        if (!slot)
+            slot = computed;
+        path = *slot;
+    }
+    STWCreateLayoutDirectory(path, mode, owner, protectionClass, failureMessage);
+    return path;
+}
+
+std::filesystem::path STWGlobalConfiguration::homeDirectory() {
+    std::lock_guard guard(_lock);
+    return *_homeDirectory;
+}
+
+std::filesystem::path STWGlobalConfiguration::sharedContainersDirectory() {
+    return _directory(_sharedContainersDirectory, underRoot("/private/var/containers"), kDirectoryMode, 0,
+                      kLeaveProtectionClass, "Failed to create shared container dir at \"%@\": %@");
+}
+
+std::filesystem::path STWGlobalConfiguration::bundleDirectory() {
+    return _directory(_bundleDirectory, sharedContainersDirectory() / "Bundle", kDirectoryMode, 0, kLeaveProtectionClass,
+                      "Failed to create bundle dir at \"%@\": %@");
+}
+
+std::filesystem::path STWGlobalConfiguration::transientBundleDirectory() {
+    return _directory(_transientBundleDirectory, sharedContainersDirectory() / "Temp", kDirectoryMode,
+                      installationUID(), kLeaveProtectionClass, "Failed to create transient bundle dir at \"%@\": %@");
+}
+
+std::filesystem::path STWGlobalConfiguration::cachesDirectory() {
+    return _directory(_cachesDirectory, homeDirectory() / "Library/Caches/com.vorlane.stowlyd", kDirectoryMode, 0,
+                      kNoProtectionClass, "Failed to create cache dir at \"%@\": %@");
+}
+
+std::filesystem::path STWGlobalConfiguration::stagingDirectory() {
+    return _directory(_stagingDirectory, cachesDirectory() / "Staging", kDirectoryMode, 0, kLeaveProtectionClass,
+                      "Failed to create staging dir at \"%@\": %@");
+}
+
+std::filesystem::path STWGlobalConfiguration::deathrowDirectory() {
+    return _directory(_deathrowDirectory, cachesDirectory() / "Dead", kDirectoryMode, 0, kLeaveProtectionClass,
+                      "Failed to create deathrow dir at \"%@\": %@");
+}
+
+std::filesystem::path STWGlobalConfiguration::transientDirectory() {
+    return _directory(_transientDirectory, cachesDirectory() / "Temp", kDirectoryMode, 0, kLeaveProtectionClass,
+                      "Failed to create transient dir at \"%@\": %@");
+}
+
+std::filesystem::path STWGlobalConfiguration::libraryDirectory() {
+    return _directory(_libraryDirectory, homeDirectory() / "Library/Stowly", kDirectoryMode, 0, kNoProtectionClass,
+                      "Failed to create library dir at \"%@\": %@");
+}
+
+std::filesystem::path STWGlobalConfiguration::replaceDirectory() {
+    return _directory(_replaceDirectory, libraryDirectory() / "Replace", kDirectoryMode, 0, kLeaveProtectionClass,
+                      "Failed to create replace dir at \"%@\": %@");
+}
+
+std::filesystem::path STWGlobalConfiguration::pendingUpdatesDirectory() {
+    return _directory(_pendingUpdatesDirectory, libraryDirectory() / "PendingUpdates", kDirectoryMode, 0,
+                      kLeaveProtectionClass, "Failed to create updates dir at \"%@\": %@");
+}
+
+std::filesystem::path STWGlobalConfiguration::logDirectory() {
+    std::filesystem::path path = homeDirectory() / "Library/Logs/Stowly";
+    STWCreateLayoutDirectory(path, kDirectoryMode, 0, kNoProtectionClass, "Failed to create log directory at \"%@\": %@");
+    return path;
+}
+
+std::optional<std::filesystem::path> STWGlobalConfiguration::legacyTransientBundleDirectory() {
+    std::filesystem::path path = underRoot("/private/var/setwrightd/Library/Caches/com.vorlane.stowlyd");
+    if (!STWFileManager::defaultManager()->itemExistsAtURL(path))
+        return std::nullopt;
+    return path;
+}
+
+std::shared_ptr<STWPerUserConfiguration>
+STWGlobalConfiguration::getPerUserConfigurationForUserIdentity(const STWUserIdentityRef& identity) {
+    std::lock_guard guard(_lock);
+    auto& slot = _perUserConfigurations[identity->identifier()];
+    if (!slot)
+        slot = std::make_shared<STWPerUserConfiguration>(identity);
+    return slot;
+}
+
+std::optional<std::filesystem::path> STWGlobalConfiguration::globalContainerBaseURLWithContentClass(
+    STWContainerClass contentClass, bool transient) {
+    std::string_view name = STWContainerClassDirectoryName(contentClass);
+    if (STWContainerClassIsBundle(contentClass))
+        return (transient ? transientBundleDirectory() : sharedContainersDirectory()) / name;
+    if (STWContainerClassIsSystem(contentClass))
+        return (transient ? transientDirectory() : sharedContainersDirectory()) / name;
+    return std::nullopt;
+}
+
+std::optional<std::filesystem::path> STWGlobalConfiguration::containerDirectoryURLForUserIdentity(
+    const STWUserIdentityRef& identity, STWContainerClass contentClass, bool transient) {
+    std::lock_guard guard(_lock); // global before per-user
+    if (auto base = globalContainerBaseURLWithContentClass(contentClass, transient)) {
+        uid_t owner = STWContainerClassIsBundle(contentClass) ? installationUID() : systemContainerUID();
+        STWCreateLayoutDirectory(*base, kDirectoryMode, owner, kLeaveProtectionClass,
+                                 "Failed to create container dir at \"%@\": %@");
+        return base;
+    }
+    return getPerUserConfigurationForUserIdentity(identity)->containerDirectoryURLForContentClass(contentClass,
+                                                                                                 transient);
+}
+
+std::filesystem::path STWGlobalConfiguration::stagingDirectoryURLForUserIdentity(const STWUserIdentityRef& identity,
+                                                                                 STWContainerClass contentClass) {
+    if (STWContainerClassIsPerUser(contentClass))
+        return getPerUserConfigurationForUserIdentity(identity)->stagingDirectory();
+    return stagingDirectory();
+}
+
+const std::vector<std::string>& STWGlobalConfiguration::appUserDataItemNames() {
+    static const std::vector<std::string> names{"Documents", "Library", "tmp", "StoreKit"};
+    return names;
+}
+
+const std::vector<std::string>& STWGlobalConfiguration::excludedFromAppUserData() {
+    static const std::vector<std::string> names{"SystemData"};
+    return names;
+}
+
+bool STWGlobalConfiguration::migrationFileExistsWithName(const std::string& name) {
+    return STWFileManager::defaultManager()->itemExistsAtURL(libraryDirectory() / name);
+}
+
+bool STWGlobalConfiguration::isInternalImage() {
+    std::lock_guard guard(_lock);
+    if (!_isInternalImage)
+        _isInternalImage = STWPlatformConfiguration::sharedInstance()->isInternalImage();
+    return *_isInternalImage;
+}
+
+void STWGlobalConfiguration::setIsInternalImage(bool internal) {
+    std::lock_guard guard(_lock);
+    _isInternalImage = internal;
+}

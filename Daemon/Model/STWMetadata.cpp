@@ -1,0 +1,220 @@
+#include "Daemon/Model/STWMetadata.h"
+
+#include "Daemon/FileSystem/STWFileManager.h"
+#include "Daemon/Model/STWGlobalConfiguration.h"
+#include "Daemon/Model/STWUserIdentitySharedCache.h"
+#include "common/STWDictionaryUtilities.h"
+#include "common/STWLog.h"
+
+namespace {
+
+constexpr const char* kClassKey = "STWMetadataContentClass";
+constexpr const char* kIdentifierKey = "STWMetadataIdentifier";
+constexpr const char* kUUIDKey = "STWMetadataUUID";
+constexpr const char* kVersionKey = "STWMetadataVersion";
+constexpr const char* kUserIdentityKey = "STWMetadataUserIdentity";
+constexpr const char* kInfoKey = "STWMetadataInfo";
+constexpr const char* kAssetsDirKey = "STWMetadataUserManagedAssetsDirName";
+constexpr const char* kPersonaKey = "STWMetadataPersona";
+
+STWFormatArg describe(const STWValue* v) { return v ? STWFormatArg(*v) : STWFormatArg(nullptr); }
+
+} // namespace
+
+STWMetadata::STWMetadata(const STWConcreteContainerIdentityRef& containerIdentity,
+                         std::optional<STWValue::Dictionary> info, std::filesystem::path url,
+                         std::optional<std::string> userManagedAssetsDirName)
+    : _containerClass(containerIdentity->containerClass()), _userIdentity(containerIdentity->userIdentity()),
+      _identifier(containerIdentity->identifier()), _uuid(containerIdentity->uuid()), _url(std::move(url)),
+      _userManagedAssetsDirName(std::move(userManagedAssetsDirName)), _info(std::move(info)) {}
+
+STWConcreteContainerIdentityRef STWMetadata::containerIdentity() const {
+    return STWConcreteContainerIdentity::containerIdentityWithUUID(_uuid, _userIdentity, _identifier, _containerClass,
+                                                                   nullptr);
+}
+
+std::string STWMetadata::description() const {
+    return STWFormat("<%@: %p; userIdentity = %@, uuid = %@, containerClass = %llu, identifier = %@, info = %@, url = "
+                     "%@, userManagedAssetsDirName = %@>",
+                     "STWMetadata", static_cast<const void*>(this), _userIdentity, _uuid, _containerClass, _identifier,
+                     _info ? STWFormatArg(STWDescribeDictionary(*_info)) : STWFormatArg(nullptr), _url,
+                     _userManagedAssetsDirName ? STWFormatArg(*_userManagedAssetsDirName) : STWFormatArg(nullptr));
+}
+
+STWValue::Dictionary STWMetadata::dictionaryRepresentation() const {
+    STWValue::Dictionary d;
+    if (_info)
+        d[kInfoKey] = STWValue(*_info);
+    d[kClassKey] = STWValue(_containerClass);
+    if (STWUserIdentity::isUserIdentityRequiredForContainerClass(_containerClass))
+        d[kUserIdentityKey] = STWValue(_userIdentity->plist());
+    d[kIdentifierKey] = STWValue(_identifier);
+    d[kUUIDKey] = STWValue(_uuid.string());
+    d[kVersionKey] = STWValue("2");
+    if (_userManagedAssetsDirName)
+        d[kAssetsDirKey] = STWValue(*_userManagedAssetsDirName);
+    return d;
+}
+
+bool STWMetadata::writeMetadataToDiskWithError(STWErrorRef* error) const {
+    return writeMetadataToFileURL(_url / fileName, error);
+}
+
+bool STWMetadata::writeMetadataToFileURL(const std::filesystem::path& fileURL, STWErrorRef* error) const {
+    STWValue::Dictionary dictionary = dictionaryRepresentation();
+    std::filesystem::path temp =
+        STWGlobalConfiguration::sharedInstance()->stagingDirectoryURLForUserIdentity(_userIdentity, _containerClass) /
+        STWFormat("temp_metadata-%@.plist", _uuid.string());
+    STW_LOG_DEBUG(STWLogCategory::Metadata, "[%s] Writing metadata to [%@]: %@ => %@", __func__, fileURL, *this,
+                  STWValue(dictionary));
+    STWErrorRef writeError;
+    // Durable: the file's bytes reach the disk before the rename makes them visible.
+    if (!STW_writeToURL(dictionary, temp, STWWriteDurable | STWWriteNoFileProtection, &writeError)) {
+        STWSetError(error, STW_ERROR(STWErrorWriteFileFailed, writeError,
+                                     "Failed to write metadata dictionary to URL %@ : %@:%ld", temp,
+                                     writeError->domain(), writeError->code()));
+        return false;
+    }
+    STWErrorRef moveError;
+    if (!STWFileManager::defaultManager()->moveItemAtURL(temp, fileURL, STWFileManagerMoveDurable, &moveError)) {
+        STWSetError(error, STW_ERROR(STWErrorWriteFileFailed, moveError,
+                                     "Failed to move metadata from staging: %@ to final: %@", temp, fileURL));
+        return false;
+    }
+    return true;
+}
+
+std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtUrl(const std::filesystem::path& containerURL,
+                                                                       const STWUserIdentityRef& forUserIdentity,
+                                                                       bool checkClassPath, STWErrorRef* error) {
+    return readAndValidateMetadataAtFileUrl(containerURL / fileName, forUserIdentity, checkClassPath, error);
+}
+
+std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtFileUrl(const std::filesystem::path& fileURL,
+                                                                           const STWUserIdentityRef& forUserIdentity,
+                                                                           bool checkClassPath, STWErrorRef* error) {
+    std::filesystem::path container = fileURL.parent_path();
+    // The container's owner may replace the file; never follow a link it put there.
+    auto read = STW_dictionaryWithContentsOfURL(fileURL, STWReadNoFollow, nullptr);
+    if (!read) {
+        STWSetError(error, STW_ERROR(STWErrorReadFileFailed, nullptr, "Failed to read metadata at URL %@", fileURL));
+        return nullptr;
+    }
+    STWValue::Dictionary& plist = *read;
+
+    const STWValue* identifierValue = STWDictionaryFind(plist, kIdentifierKey);
+    if (!identifierValue || !identifierValue->string()) {
+        STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata Identifier: %@ at %@",
+                                     describe(identifierValue), fileURL));
+        return nullptr;
+    }
+    const std::string& identifier = *identifierValue->string();
+
+    const STWValue* uuidValue = STWDictionaryFind(plist, kUUIDKey);
+    if (!uuidValue || !uuidValue->string()) {
+        STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata UUID String: %@ at %@",
+                                     describe(uuidValue), fileURL));
+        return nullptr;
+    }
+    std::optional<STWUUID> uuid = STWUUID::fromString(*uuidValue->string());
+    if (!uuid) {
+        STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata UUID: %@ at %@", *uuidValue,
+                                     fileURL));
+        return nullptr;
+    }
+
+    const STWValue* classValue = STWDictionaryFind(plist, kClassKey);
+    if (!classValue || !classValue->isNumber()) {
+        STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata Class: %@ at %@",
+                                     describe(classValue), fileURL));
+        return nullptr;
+    }
+    int64_t classNumber = classValue->int64Value().value_or(static_cast<int64_t>(classValue->realValue().value_or(0)));
+    if (classNumber < 1 || classNumber > 13) {
+        STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata Content Class: %ld at %@",
+                                     classNumber, fileURL));
+        return nullptr;
+    }
+    STWContainerClass containerClass = static_cast<STWContainerClass>(classNumber);
+
+    auto cache = STWUserIdentitySharedCache::sharedInstance();
+    STWUserIdentityRef userIdentity;
+    if (!STWUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
+        userIdentity = STWUserIdentityCache::defaultUserIdentity();
+    } else {
+        uid_t expectedOwner = forUserIdentity->posixUIDForContainerClass(containerClass);
+        if (STWContainerClassIsPerUser(containerClass)) {
+            const STWValue* persona = STWDictionaryFind(plist, kPersonaKey);
+            if (!persona) {
+                plist[kPersonaKey] = STWValue(expectedOwner);
+            } else if (persona->uint64Value() != static_cast<uint64_t>(expectedOwner)) {
+                STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Incorrect UserId: %@, expecting: %u for %@ at %@",
+                                             *persona, expectedOwner, identifier, fileURL));
+                return nullptr;
+            }
+        }
+        const STWValue* stored = STWDictionaryFind(plist, kUserIdentityKey);
+        if (!stored) {
+            std::optional<uint64_t> persona = STWDictionaryUInt64(plist, kPersonaKey);
+            uid_t uid = persona && *persona <= UINT32_MAX ? static_cast<uid_t>(*persona) : 0;
+            userIdentity = cache->userIdentityForPersonalPersonaWithUID(uid, uid);
+        } else {
+            uint64_t code = STWErrorSuccess;
+            userIdentity = STWUserIdentity::userIdentityWithPlist(*stored, *cache, &code);
+            if (!userIdentity) {
+                STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr,
+                                             "Invalid metadata User Identity: %@ for %@ at %@: %llu", *stored, identifier,
+                                             fileURL, code));
+                return nullptr;
+            }
+            if (!forUserIdentity || !(*userIdentity == *forUserIdentity)) {
+                STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr,
+                                             "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu", userIdentity,
+                                             forUserIdentity, identifier, fileURL, code));
+                return nullptr;
+            }
+        }
+    }
+
+    std::optional<STWValue::Dictionary> info;
+    if (const STWValue* infoValue = STWDictionaryFind(plist, kInfoKey)) {
+        if (!infoValue->dictionary()) {
+            STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata Info: %@ at %@", *infoValue,
+                                         fileURL));
+            return nullptr;
+        }
+        info = *infoValue->dictionary();
+    }
+    std::optional<std::string> assetsDirName;
+    if (const STWValue* assets = STWDictionaryFind(plist, kAssetsDirKey)) {
+        if (!assets->string()) {
+            STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr,
+                                         "Invalid metadata User Managed Dir Name String: %@ at %@", *assets, fileURL));
+            return nullptr;
+        }
+        assetsDirName = *assets->string();
+    }
+
+    if (checkClassPath) {
+        std::filesystem::path expected = container.parent_path().parent_path().parent_path() /
+                                         STWContainerClassDirectoryName(containerClass);
+        if (container.parent_path() != expected) {
+            STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata-URLs should match: %@ : %@",
+                                         fileURL, expected));
+            return nullptr;
+        }
+    }
+
+    uint64_t identityCode = STWErrorSuccess;
+    auto identity = STWConcreteContainerIdentity::containerIdentityWithUUID(*uuid, userIdentity, identifier,
+                                                                            containerClass, &identityCode);
+    if (!identity) {
+        STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Could not create user identity from %@: %llu",
+                                     fileURL, identityCode));
+        return nullptr;
+    }
+    auto metadata = std::make_shared<STWMetadata>(identity, std::move(info), container, std::move(assetsDirName));
+    STW_LOG_DEBUG(STWLogCategory::Metadata, "[%s] Read metadata from [%@]: %@ <= %@", __func__, fileURL, *metadata,
+                  STWValue(plist));
+    return metadata;
+}

@@ -1,0 +1,23 @@
+// The users and groups database: ROOT/etc/passwd and ROOT/etc/group when the root prefix
+// has them, else the system's own database. Home directories are resolved under the root.
+#pragma once
+
+#include <filesystem>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <sys/types.h>
+
+struct STWUserRecord {
+    std::string name;
+    uid_t uid = 0;
+    gid_t gid = 0;
+    std::filesystem::path homeDirectory; // already under the root prefix
+};
+
+class STWUserDatabase {
+public:
+    static std::optional<STWUserRecord> userWithName(std::string_view name);
+    static std::optional<STWUserRecord> userWithUID(uid_t uid);
+    static std::optional<gid_t> groupIDWithName(std::string_view name);
+};

@@ -1,0 +1,143 @@
+#include "Daemon/Model/STWGlobalConfiguration.h"
+#include "Daemon/Model/STWMetadata.h"
+#include "Daemon/Model/STWUserIdentitySharedCache.h"
+#include "common/STWDictionaryUtilities.h"
+#include "tests/support/STWTestRoot.h"
+
+#include <gtest/gtest.h>
+
+namespace {
+
+class STWMetadataTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        STWTestRoot::shared();
+        mobile = STWUserIdentitySharedCache::sharedInstance()->userIdentityForPersonalPersona();
+        classDirectory = *STWGlobalConfiguration::sharedInstance()->containerDirectoryURLForUserIdentity(mobile, 2, false);
+        uuid = STWUUID::random();
+        container = classDirectory / uuid.string();
+        std::filesystem::create_directories(container);
+    }
+    void TearDown() override { std::filesystem::remove_all(container); }
+
+    STWMetadata make(STWContainerClass c = 2) {
+        auto identity = STWConcreteContainerIdentity::containerIdentityWithUUID(uuid, mobile, "com.example.app", c, nullptr);
+        return STWMetadata(identity, STWValue::Dictionary{{"com.vorlane.Setwright.ContentProtectionClass", STWValue(3)}},
+                           container, std::nullopt);
+    }
+    STWValue::Dictionary stored() {
+        return *STW_dictionaryWithContentsOfURL(container / STWMetadata::fileName, STWReadDefault, nullptr);
+    }
+    // Rewrites the file with one key changed (or removed, for a null value) and reads it back.
+    std::string readError(const std::string& key, const STWValue& value, bool checkClassPath = true,
+                          const STWUserIdentityRef& expected = nullptr) {
+        STWValue::Dictionary d = stored();
+        if (value.isNull())
+            d.erase(key);
+        else
+            d[key] = value;
+        EXPECT_TRUE(STW_writeToURL(d, container / STWMetadata::fileName, STWWriteAtomic, nullptr));
+        STWErrorRef error;
+        EXPECT_FALSE(STWMetadata::readAndValidateMetadataAtUrl(container, expected ? expected : mobile, checkClassPath, &error));
+        if (!error)
+            return "(no error)";
+        EXPECT_EQ(error->code(), 29) << error->message();
+        return error->message();
+    }
+
+    STWUserIdentityRef mobile;
+    std::filesystem::path classDirectory, container;
+    STWUUID uuid;
+};
+
+TEST_F(STWMetadataTest, RoundTripsAndRewritesLeaveOneFileAndNoTemporary) {
+    STWMetadata metadata = make();
+    STWErrorRef error;
+    ASSERT_TRUE(metadata.writeMetadataToDiskWithError(&error));
+    ASSERT_TRUE(metadata.writeMetadataToDiskWithError(&error));
+    auto back = STWMetadata::readAndValidateMetadataAtUrl(container, mobile, true, &error);
+    ASSERT_TRUE(back) << error->description();
+    EXPECT_TRUE(back->containerIdentity()->isEqual(*metadata.containerIdentity()));
+    EXPECT_EQ(back->info(), metadata.info());
+    EXPECT_EQ(back->url(), container);
+    EXPECT_EQ(std::distance(std::filesystem::directory_iterator(container), std::filesystem::directory_iterator()), 1);
+    auto staging = STWGlobalConfiguration::sharedInstance()->stagingDirectoryURLForUserIdentity(mobile, 2);
+    EXPECT_TRUE(std::filesystem::is_empty(staging));
+    STWValue::Dictionary d = stored();
+    EXPECT_EQ(*STWDictionaryString(d, "STWMetadataVersion"), "2");
+    EXPECT_EQ(*STWDictionaryString(d, "STWMetadataUUID"), uuid.string());
+    EXPECT_TRUE(STWDictionaryDictionary(d, "STWMetadataUserIdentity"));
+}
+
+TEST_F(STWMetadataTest, EachKindOfInvalidFileIsRejectedWithItsMessage) {
+    ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
+    EXPECT_NE(readError("STWMetadataContentClass", STWValue(0)).find("Invalid metadata Content Class: 0 at"), std::string::npos);
+    EXPECT_NE(readError("STWMetadataContentClass", STWValue(14)).find("Invalid metadata Content Class: 14 at"), std::string::npos);
+    EXPECT_NE(readError("STWMetadataContentClass", STWValue("2")).find("Invalid metadata Class: \"2\" at"), std::string::npos);
+    ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
+    EXPECT_NE(readError("STWMetadataIdentifier", STWValue(5)).find("Invalid metadata Identifier: 5 at"), std::string::npos);
+    ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
+    EXPECT_NE(readError("STWMetadataUUID", STWValue("not-a-uuid")).find("Invalid metadata UUID: \"not-a-uuid\" at"), std::string::npos);
+    ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
+    EXPECT_NE(readError("STWMetadataPersona", STWValue(502)).find("Incorrect UserId: 502, expecting: 501 for com.example.app at"),
+              std::string::npos);
+    ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
+    auto other = STWUserIdentitySharedCache::sharedInstance()->userIdentityForPersonalPersonaWithUID(502, 502);
+    std::string wrongUser = readError("STWMetadataPersona", STWValue(), true, other);
+    EXPECT_NE(wrongUser.find("Incorrect User Identity:"), std::string::npos) << wrongUser;
+    ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
+    EXPECT_NE(readError("STWMetadataInfo", STWValue("text")).find("Invalid metadata Info:"), std::string::npos);
+    ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
+    // Class 4 stored in a Data/Application directory.
+    EXPECT_NE(readError("STWMetadataContentClass", STWValue(4)).find("Invalid metadata-URLs should match:"), std::string::npos);
+    STWErrorRef error;
+    EXPECT_TRUE(STWMetadata::readAndValidateMetadataAtUrl(container, mobile, false, &error)); // no class-path check
+
+    std::filesystem::remove(container / STWMetadata::fileName);
+    error.reset();
+    EXPECT_FALSE(STWMetadata::readAndValidateMetadataAtUrl(container, mobile, true, &error));
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->code(), 12);
+}
+
+TEST_F(STWMetadataTest, LegacyAndGlobalFilesFindTheirUserIdentity) {
+    ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
+    // Legacy file: only the POSIX user id is recorded; no comparison with the expected identity.
+    STWValue::Dictionary d = stored();
+    d.erase("STWMetadataUserIdentity");
+    d["STWMetadataPersona"] = STWValue(501);
+    ASSERT_TRUE(STW_writeToURL(d, container / STWMetadata::fileName, STWWriteAtomic, nullptr));
+    STWErrorRef error;
+    auto legacy = STWMetadata::readAndValidateMetadataAtUrl(container, mobile, true, &error);
+    ASSERT_TRUE(legacy);
+    EXPECT_EQ(legacy->userIdentity()->posixUID(), 501u);
+
+    // A system container needs no user identity: the default one is used whatever is expected.
+    auto systemDirectory = *STWGlobalConfiguration::sharedInstance()->containerDirectoryURLForUserIdentity(mobile, 12, false);
+    auto systemContainer = systemDirectory / uuid.string();
+    std::filesystem::create_directories(systemContainer);
+    auto identity = STWConcreteContainerIdentity::containerIdentityWithUUID(uuid, mobile, "com.vorlane.system", 12, nullptr);
+    ASSERT_TRUE(STWMetadata(identity, std::nullopt, systemContainer, std::nullopt).writeMetadataToDiskWithError(&error));
+    EXPECT_FALSE(STWDictionaryFind(*STW_dictionaryWithContentsOfURL(systemContainer / STWMetadata::fileName, 0, nullptr),
+                                   "STWMetadataUserIdentity"));
+    auto other = STWUserIdentitySharedCache::sharedInstance()->userIdentityForPersonalPersonaWithUID(502, 502);
+    auto system = STWMetadata::readAndValidateMetadataAtUrl(systemContainer, other, true, &error);
+    ASSERT_TRUE(system);
+    EXPECT_EQ(*system->userIdentity(), *STWUserIdentityCache::defaultUserIdentity());
+    std::filesystem::remove_all(systemContainer);
+}
+
+TEST_F(STWMetadataTest, AFailedWriteKeepsThePreviousFile) {
+    ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
+    // The final name is taken by a directory: the move fails, the old file's bytes stay.
+    std::filesystem::path target = container / "blocked";
+    std::filesystem::create_directories(target / "inside");
+    STWErrorRef error;
+    EXPECT_FALSE(make().writeMetadataToFileURL(target, &error));
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->code(), 34);
+    EXPECT_NE(error->message().find("Failed to move metadata from staging:"), std::string::npos);
+    EXPECT_TRUE(STWMetadata::readAndValidateMetadataAtUrl(container, mobile, true, nullptr));
+}
+
+} // namespace
