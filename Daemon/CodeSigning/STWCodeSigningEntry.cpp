@@ -1,0 +1,75 @@
+#include "Daemon/CodeSigning/STWCodeSigningEntry.h"
+
+#include "common/STWFormat.h"
+
+namespace {
+
+size_t combine(size_t seed, size_t value) {
+    return seed ^ (value + 0x9e3779b97f4a7c15ULL + (seed << 6) + (seed >> 2));
+}
+
+// An absent value hashes as 0, so "no child list" and "no dictionary" drop out of the XOR.
+size_t hashChildren(const std::optional<std::vector<std::string>>& children) {
+    if (!children)
+        return 0;
+    size_t seed = std::hash<size_t>()(children->size());
+    for (const std::string& child : *children)
+        seed = combine(seed, std::hash<std::string>()(child));
+    return seed;
+}
+
+size_t hashDictionary(const std::optional<STWValue::Dictionary>& dictionary) {
+    if (!dictionary)
+        return 0;
+    size_t seed = std::hash<size_t>()(dictionary->size());
+    for (const auto& [key, value] : *dictionary)
+        seed = combine(combine(seed, std::hash<std::string>()(key)), value.hash());
+    return seed;
+}
+
+char yesNo(bool flag) {
+    return flag ? 'Y' : 'N';
+}
+
+} // namespace
+
+STWCodeSigningEntry::STWCodeSigningEntry(std::optional<STWValue::Dictionary> codeSigningInfo,
+                                         uint64_t dataContainerClass)
+    : _codeSigningInfo(std::move(codeSigningInfo)), _dataContainerClass(dataContainerClass) {}
+
+bool STWCodeSigningEntry::operator==(const STWCodeSigningEntry& other) const {
+    return _codeSigningInfo == other._codeSigningInfo &&
+           _childBundleIdentifiers == other._childBundleIdentifiers && _invalid == other._invalid &&
+           _placeholder == other._placeholder && _advanceCopy == other._advanceCopy &&
+           _registeredByCaller == other._registeredByCaller &&
+           _dataContainerClass == other._dataContainerClass;
+}
+
+size_t STWCodeSigningEntry::hash() const {
+    size_t value = hashChildren(_childBundleIdentifiers) ^ hashDictionary(_codeSigningInfo);
+    if (_invalid)
+        value += 2;
+    if (_placeholder)
+        value += 4;
+    if (_registeredByCaller)
+        value += 8;
+    if (_dataContainerClass != 0)
+        value += 16;
+    if (_advanceCopy)
+        value += 32;
+    return value;
+}
+
+std::string STWCodeSigningEntry::description() const {
+    std::string children = "(null)";
+    if (_childBundleIdentifiers) {
+        STWValue::Array array(_childBundleIdentifiers->begin(), _childBundleIdentifiers->end());
+        children = STWValue(std::move(array)).description();
+    }
+    std::string info = _codeSigningInfo ? STWDescribeDictionary(*_codeSigningInfo) : "(null)";
+    return STWFormat(
+        "<%@ invalid: %c, placeholder: %c, advanceCopy: %c, regByCaller: %c, dataClass: %llu, childBundles: "
+        "%@, CSinfo: %@>",
+        "STWCodeSigningEntry", yesNo(_invalid), yesNo(_placeholder), yesNo(_advanceCopy),
+        yesNo(_registeredByCaller), _dataContainerClass, children, info);
+}
