@@ -36,6 +36,19 @@ std::filesystem::path STWPlatformConfiguration::resolve(const std::filesystem::p
     return _root / absolute.relative_path();
 }
 
+std::string STWPlatformConfiguration::firstBootSemaphoreName() const {
+    std::string name = "/stowlyd.fb_check";
+    if (!hasPrivateRoot())
+        return name;
+    // A short, stable hash of the root (FNV-1a) keeps the name within the kernel's limit.
+    uint32_t hash = 2166136261u;
+    for (unsigned char c : _root.native()) {
+        hash ^= c;
+        hash *= 16777619u;
+    }
+    return name + STWFormat(".%08x", hash);
+}
+
 bool STWPlatformConfiguration::isFeatureEnabled(std::string_view feature) const {
     const STWValue* value = STWDictionaryFind(_features, feature);
     return value && value->boolValue().value_or(false);

@@ -33,6 +33,9 @@ public:
     std::filesystem::path configurationDirectory() const { return resolve("/etc/stowly"); }
     std::filesystem::path runtimeDirectory() const { return resolve("/run/stowly"); }
     std::filesystem::path configurationFile() const { return configurationDirectory() / "stowlyd.plist"; }
+    // The named semaphore that marks "started since power-on" (a reboot clears it);
+    // daemons of different root prefixes never share it.
+    std::string firstBootSemaphoreName() const;
 
     bool isInternalImage() const { return _internalImage; }
     bool isMultiUser() const { return _multiUser; }

@@ -1,7 +1,7 @@
 #include "Daemon/FileSystem/STWFileManager.h"
 
 #include "Daemon/FileSystem/STWDirectoryWalker.h"
-#include "Daemon/FileSystem/STWKeybag.h"
+#include "platform/STWKeybag.h"
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWFileIO.h"
 #include "common/STWLog.h"

@@ -1,4 +1,4 @@
-#include "Daemon/FileSystem/STWKeybag.h"
+#include "platform/STWKeybag.h"
 #include "common/STWFileIO.h"
 #include "platform/STWPlatformConfiguration.h"
 #include "tests/filesystem/STWFileSystemTestSupport.h"

@@ -1,6 +1,7 @@
-#include "Daemon/FileSystem/STWKeybag.h"
+#include "platform/STWKeybag.h"
 
 #include "common/STWFileIO.h"
+#include "platform/STWFileWatcher.h"
 #include "platform/STWPlatformConfiguration.h"
 
 #include <atomic>
@@ -38,4 +39,13 @@ bool STWKeybag::isDeviceLocked() {
 
 void STWKeybag::setLockStateOverrideForTesting(std::optional<bool> locked) {
     lockOverride.store(locked ? (*locked ? 1 : 0) : -1, std::memory_order_relaxed);
+}
+
+bool STWKeybag::registerForLockStateNotifications(std::function<void()> callback) {
+    auto directory = STWPlatformConfiguration::sharedInstance()->runtimeDirectory();
+    int token = STWFileWatcher::sharedInstance().addWatch(directory, [callback](const std::string& name) {
+        if (name == "keybag")
+            callback();
+    });
+    return token >= 0;
 }

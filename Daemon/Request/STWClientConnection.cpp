@@ -1,0 +1,120 @@
+#include "Daemon/Request/STWClientConnection.h"
+
+#include "Daemon/Model/STWUserIdentitySharedCache.h"
+#include "common/STWLog.h"
+
+STWClientConnection::STWClientConnection()
+    : _backgroundQueue(_sharedBackgroundQueue()), _entitled(true), _allowOtherIdLookup(false), _unrestricted(true),
+      _clientIdentity(STWClientIdentity::anonymousPrivilegedClientIdentity()), _commandQueue(STWCommandQueue::init()),
+      _userIdentityCache(STWUserIdentitySharedCache::sharedInstance()) {}
+
+STWClientConnection::STWClientConnection(STWClientIdentityRef clientIdentity, bool entitled, bool allowOtherIdLookup,
+                                         bool unrestricted, std::optional<STWValue::Dictionary> lookup,
+                                         std::optional<STWValue::Array> entitledWipeIdentifiers,
+                                         std::shared_ptr<STWCommandQueue> commandQueue)
+    : _backgroundQueue(_sharedBackgroundQueue()), _entitled(entitled), _allowOtherIdLookup(allowOtherIdLookup),
+      _unrestricted(unrestricted), _clientIdentity(std::move(clientIdentity)), _commandQueue(std::move(commandQueue)),
+      _entitledWipeIdentifiers(std::move(entitledWipeIdentifiers)), _lookup(std::move(lookup)),
+      _userIdentityCache(STWUserIdentitySharedCache::sharedInstance()) {}
+
+const std::shared_ptr<STWClientConnection>& STWClientConnection::sharedClientConnection() {
+    static const std::shared_ptr<STWClientConnection> shared = std::make_shared<STWClientConnection>();
+    return shared;
+}
+
+std::shared_ptr<STWClientConnection>
+STWClientConnection::privilegedClientConnectionWithUserIdentity(STWUserIdentityRef userIdentity) {
+    return std::make_shared<STWClientConnection>(
+        STWClientIdentity::privilegedClientIdentityWithUserIdentity(std::move(userIdentity)), true, true, true,
+        std::nullopt, std::nullopt, STWCommandQueue::init());
+}
+
+const std::shared_ptr<STWQueue>& STWClientConnection::_sharedBackgroundQueue() {
+    static const std::shared_ptr<STWQueue> queue = STWQueue::create(
+        "com.vorlane.stowlyd.background", {.priority = STWQueue::Priority::Background, .holdsTransactions = true});
+    return queue;
+}
+
+bool STWClientConnection::completeWithError(uint64_t* error) {
+    return _commandQueue->executeAllUntilExhaustedOrError(error);
+}
+
+bool STWClientConnection::isEntitledForLookupWithClass(STWContainerClass containerClass, std::string_view identifier) {
+    auto identifiers = _lookupForContainerClass(containerClass);
+    return identifiers && identifiers->count(identifier) > 0;
+}
+
+std::optional<STWClientConnection::StringSet> STWClientConnection::_lookupForContainerClass(STWContainerClass containerClass) {
+    std::string_view word = STWContainerClassLookupWord(containerClass);
+    std::shared_ptr<std::map<std::string, StringSet, std::less<>>> sanitized;
+    {
+        std::lock_guard guard(_lock);
+        if (word.empty() || !_lookup)
+            return std::nullopt;
+        if (!_sanitizedLookup)
+            _sanitizedLookup = std::make_shared<std::map<std::string, StringSet, std::less<>>>();
+        sanitized = _sanitizedLookup;
+    }
+    std::lock_guard guard(_sanitizedLookupLock);
+    auto it = sanitized->find(word);
+    if (it == sanitized->end()) {
+        // A value that is not an array (a lone string, a number) allows nothing.
+        const STWValue* value = STWDictionaryFind(*_lookup, word);
+        StringSet identifiers = value && value->array() ? _setOfStringsFromArray(*value->array()) : StringSet();
+        it = sanitized->emplace(std::string(word), std::move(identifiers)).first;
+    }
+    return it->second;
+}
+
+STWClientConnection::StringSet STWClientConnection::_setOfStringsFromArray(const STWValue::Array& array) {
+    StringSet result;
+    for (const STWValue& element : array)
+        if (const std::string* s = element.string())
+            result.insert(*s);
+    return result;
+}
+
+std::optional<std::string> STWClientConnection::clientBundleIdentifier() const {
+    if (!_clientIdentity)
+        return std::nullopt;
+    return _clientIdentity->bundleIdentifier();
+}
+
+void STWClientConnection::setClientBundleIdentifier(std::optional<std::string> identifier) {
+    std::lock_guard guard(_lock);
+    _clientBundleIdentifier = std::move(identifier);
+}
+
+std::optional<STWValue::Array> STWClientConnection::entitledWipeIdentifiers() const {
+    std::lock_guard guard(_lock);
+    return _entitledWipeIdentifiers;
+}
+
+void STWClientConnection::setEntitledWipeIdentifiers(std::optional<STWValue::Array> identifiers) {
+    std::lock_guard guard(_lock);
+    _entitledWipeIdentifiers = std::move(identifiers);
+}
+
+// Boot-time setup and cleanup of the container store (restored system containers,
+// interrupted replace operations, pending protection changes, leftovers swept to death
+// row) are not part of this build yet. These entry points keep the start-up order in
+// place; they do no work and claim none.
+void STWClientConnection::rebootStowlySetup() {
+    STW_LOG_DEBUG(STWLogCategory::Startup, "First-boot setup has no steps in this build");
+}
+
+void STWClientConnection::stowlySetup() {
+    STW_LOG_DEBUG(STWLogCategory::Startup, "Every-start setup has no steps in this build");
+}
+
+void STWClientConnection::rebootStowlyCleanupWithCompletion(std::function<void()> completion) {
+    STW_LOG_DEBUG(STWLogCategory::Startup, "First-boot cleanup has no steps in this build");
+    // With nothing to clean, the cleanup is over as soon as it ran; the completion still
+    // marks the boot as seen and tells waiters.
+    _backgroundQueue->async(std::move(completion));
+}
+
+void STWClientConnection::stowlyCleanupWithCompletion(std::function<void()> completion) {
+    STW_LOG_DEBUG(STWLogCategory::Startup, "Every-start cleanup has no steps in this build");
+    _backgroundQueue->async(std::move(completion));
+}

@@ -1,0 +1,87 @@
+// The context of one request's container work: the caller, the entitlement decisions
+// the dispatcher made, the caller's lookup entitlement in a sanitised form, and the
+// request's command queue. The daemon's own work (start-up, setup, cleanup, upcalls)
+// runs on privileged connections.
+#pragma once
+
+#include "Daemon/Lifecycle/STWCommandQueue.h"
+#include "Daemon/Model/STWContainerClass.h"
+#include "Daemon/Model/STWUserIdentityCache.h"
+#include "Daemon/Request/STWClientIdentity.h"
+#include "common/STWValue.h"
+#include "platform/STWQueue.h"
+
+#include <atomic>
+#include <functional>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <set>
+#include <string>
+
+class STWClientConnection {
+public:
+    using StringSet = std::set<std::string, std::less<>>;
+
+    // The daemon's own connection: privileged, unrestricted, entitled.
+    STWClientConnection();
+    STWClientConnection(STWClientIdentityRef clientIdentity, bool entitled, bool allowOtherIdLookup, bool unrestricted,
+                        std::optional<STWValue::Dictionary> lookup,
+                        std::optional<STWValue::Array> entitledWipeIdentifiers,
+                        std::shared_ptr<STWCommandQueue> commandQueue);
+
+    static const std::shared_ptr<STWClientConnection>& sharedClientConnection();
+    static std::shared_ptr<STWClientConnection> privilegedClientConnectionWithUserIdentity(STWUserIdentityRef userIdentity);
+    // "com.vorlane.stowlyd.background": background work of every connection, one item at
+    // a time; each item holds an IPC transaction until it ran.
+    static const std::shared_ptr<STWQueue>& _sharedBackgroundQueue();
+
+    // Runs the commands this request queued (see STWCommandQueue).
+    bool completeWithError(uint64_t* error);
+    bool isEntitledForLookupWithClass(STWContainerClass containerClass, std::string_view identifier);
+    std::optional<StringSet> _lookupForContainerClass(STWContainerClass containerClass);
+    static StringSet _setOfStringsFromArray(const STWValue::Array& array);
+
+    // Start-up work of the daemon's own connection: first-boot and every-start setup,
+    // and the cleanups whose completions run later on the background queue.
+    void rebootStowlySetup();
+    void stowlySetup();
+    void rebootStowlyCleanupWithCompletion(std::function<void()> completion);
+    void stowlyCleanupWithCompletion(std::function<void()> completion);
+
+    const std::shared_ptr<STWQueue>& backgroundQueue() const { return _backgroundQueue; }
+    bool entitled() const { return _entitled; }
+    void setEntitled(bool v) { _entitled = v; }
+    bool allowOtherIdLookup() const { return _allowOtherIdLookup; }
+    void setAllowOtherIdLookup(bool v) { _allowOtherIdLookup = v; }
+    bool allowGroupIdLookup() const { return _allowGroupIdLookup; }
+    void setAllowGroupIdLookup(bool v) { _allowGroupIdLookup = v; }
+    bool unrestricted() const { return _unrestricted; }
+    void setUnrestricted(bool v) { _unrestricted = v; }
+    const STWClientIdentityRef& clientIdentity() const { return _clientIdentity; }
+    const std::shared_ptr<STWCommandQueue>& commandQueue() const { return _commandQueue; }
+    // Always the client identity's bundle identifier, whatever was set.
+    std::optional<std::string> clientBundleIdentifier() const;
+    void setClientBundleIdentifier(std::optional<std::string> identifier);
+    std::optional<STWValue::Array> entitledWipeIdentifiers() const;
+    void setEntitledWipeIdentifiers(std::optional<STWValue::Array> identifiers);
+    const std::optional<STWValue::Dictionary>& lookup() const { return _lookup; }
+    const std::shared_ptr<STWUserIdentityCache>& userIdentityCache() const { return _userIdentityCache; }
+
+private:
+    mutable std::mutex _lock; // guards the settable strings and the creation of _sanitizedLookup
+    std::shared_ptr<std::map<std::string, StringSet, std::less<>>> _sanitizedLookup;
+    std::mutex _sanitizedLookupLock;
+    std::shared_ptr<STWQueue> _backgroundQueue;
+    std::atomic<bool> _entitled;
+    std::atomic<bool> _allowOtherIdLookup;
+    std::atomic<bool> _allowGroupIdLookup{false};
+    std::atomic<bool> _unrestricted;
+    STWClientIdentityRef _clientIdentity;
+    std::shared_ptr<STWCommandQueue> _commandQueue;
+    std::optional<std::string> _clientBundleIdentifier;
+    std::optional<STWValue::Array> _entitledWipeIdentifiers;
+    std::optional<STWValue::Dictionary> _lookup;
+    std::shared_ptr<STWUserIdentityCache> _userIdentityCache;
+};

@@ -1,0 +1,244 @@
+#include "Daemon/Request/STWDaemon.h"
+
+#include "Daemon/Model/STWGlobalConfiguration.h"
+#include "Daemon/Request/STWClientConnection.h"
+#include "Daemon/Request/STWRequestDispatcher.h"
+#include "common/STWLog.h"
+#include "platform/STWIPCListener.h"
+#include "platform/STWKeybag.h"
+#include "platform/STWPlatformConfiguration.h"
+#include "platform/STWTransaction.h"
+
+#include <CLI/CLI.hpp>
+#include <atomic>
+#include <cerrno>
+#include <csignal>
+#include <cstring>
+#include <fcntl.h>
+#include <mutex>
+#include <semaphore.h>
+#include <sys/stat.h>
+#include <systemd/sd-daemon.h>
+#include <unistd.h>
+
+namespace {
+
+std::once_flag onceInitializationToken;
+std::once_flag upcallServerToken;
+std::atomic<bool> initialisationFinishedFlag{false};
+// Touched only by the lock-state callback, which runs on the main queue.
+int lockState = 3;
+bool firstBoot = false;
+
+const std::shared_ptr<STWQueue>& mainQueue() {
+    static const std::shared_ptr<STWQueue> queue = STWQueue::create("com.vorlane.stowlyd.main");
+    return queue;
+}
+
+// The kernel upcall server is not part of this build: start-up records that and goes on.
+bool STWKernServerStart() {
+    STW_LOG_DEBUG(STWLogCategory::Upcall, "The kernel upcall server is not part of this build");
+    return true;
+}
+
+void signpost(const char* interval, bool begin) {
+    STW_LOG_DEBUG(STWLogCategory::Tolvan, "%s %s", begin ? "begin" : "end", interval);
+}
+
+// A system notification: a marker file beside the socket, and a status line for the
+// service manager. Answers 0 or an errno value.
+uint32_t postNotification(const char* name) {
+    auto file = STWPlatformConfiguration::sharedInstance()->runtimeDirectory() / name;
+    int fd = open(file.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+    if (fd < 0)
+        return static_cast<uint32_t>(errno);
+    close(fd);
+    sd_notifyf(0, "STATUS=%s", name);
+    return 0;
+}
+
+void firstBootCompletion() {
+    STW_LOG_NOTICE(STWLogCategory::Startup, "stowlyd first boot cleanup complete");
+    std::string name = STWPlatformConfiguration::sharedInstance()->firstBootSemaphoreName();
+    sem_t* semaphore = sem_open(name.c_str(), O_CREAT, 0444, 0);
+    if (semaphore == SEM_FAILED)
+        STW_LOG_ERROR(STWLogCategory::Startup, "Failed to create semaphore %s: %s", name, strerror(errno));
+    else
+        sem_close(semaphore);
+    if (uint32_t status = postNotification("reboot-cleanup-complete"))
+        STW_LOG_ERROR(STWLogCategory::Startup, "Failed to post reboot-cleanup-complete: %u", status);
+    signpost("FirstBootCleanup", false);
+}
+
+void cleanupCompletion() {
+    if (uint32_t status = postNotification("cleanup-complete"))
+        STW_LOG_ERROR(STWLogCategory::Startup, "Failed to post cleanup-complete: %u", status);
+    signpost("BootCleanup", false);
+}
+
+} // namespace
+
+const std::shared_ptr<STWQueue>& STWDaemon::deathRowQueue() {
+    static const std::shared_ptr<STWQueue> queue = STWQueue::create(
+        "com.vorlane.stowlyd.deathrow", {.priority = STWQueue::Priority::Background, .holdsTransactions = true});
+    return queue;
+}
+
+const std::shared_ptr<STWQueue>& STWDaemon::lockStateQueue() {
+    static const std::shared_ptr<STWQueue> queue =
+        STWQueue::create("com.vorlane.stowlyd.lockstate", {.priority = STWQueue::Priority::Default, .holdsTransactions = true});
+    return queue;
+}
+
+bool STWDaemon::initialisationFinished() { return initialisationFinishedFlag.load(); }
+
+int STWDaemon::storedLockState() { return lockState; }
+
+void STWDaemon::keybag_notification_callback() {
+    int state = STWKeybag::lockState();
+    STW_LOG_DEBUG(STWLogCategory::Unspecified, "LockState=%d", state);
+    if (state == STWKeybagLocked) {
+        if (lockState != STWKeybagLocked)
+            lockStateQueue()->suspend();
+        lockState = STWKeybagLocked;
+    } else if (state == STWKeybagUnlocked) {
+        // The stored state starts "unknown", so the first unlocked report resumes nothing.
+        if (lockState == STWKeybagLocked)
+            lockStateQueue()->resume();
+        lockState = STWKeybagUnlocked;
+    }
+}
+
+void STWDaemon::_onceInitialization() {
+    signpost("StartingUp", true);
+    auto globalConfiguration = STWGlobalConfiguration::sharedInstance();
+    std::filesystem::path logFile = globalConfiguration->logDirectory() / "stowlyd.log";
+    STWLog::openLogFile(logFile, "com.vorlane.stowlyd", STWLogLevel::Notice);
+    bool internal = globalConfiguration->isInternalImage();
+    STWLog::enableFileWriting(internal ? 4 : 1, internal ? 262144 : 102400);
+    STW_LOG_FN("stowlyd_init", STWLogLevel::Debug, STWLogCategory::Startup, "stowlyd built at %s %s started", __DATE__,
+               __TIME__);
+
+    if (!deathRowQueue() || !lockStateQueue())
+        STW_FATAL("Can't create dispatch queues.");
+    const auto& connection = STWClientConnection::sharedClientConnection();
+
+    std::string semaphoreName = STWPlatformConfiguration::sharedInstance()->firstBootSemaphoreName();
+    sem_t* semaphore = sem_open(semaphoreName.c_str(), 0);
+    if (semaphore != SEM_FAILED) {
+        sem_close(semaphore);
+    } else {
+        firstBoot = true;
+        STW_LOG_NOTICE(STWLogCategory::Startup, "stowlyd performing first boot initialization");
+        signpost("FirstBootSetup", true);
+        connection->rebootStowlySetup();
+        signpost("FirstBootSetup", false);
+    }
+    signpost("BootSetup", true);
+    connection->stowlySetup();
+    signpost("BootSetup", false);
+
+    bool upcallServerStarted = false;
+    std::call_once(upcallServerToken, [&] { upcallServerStarted = STWKernServerStart(); });
+    if (!upcallServerStarted)
+        STW_FATAL("Failed to initialize kernel upcall interface.");
+
+    if (!STWKeybag::registerForLockStateNotifications([] { mainQueue()->async(keybag_notification_callback); }))
+        STW_LOG_ERROR(STWLogCategory::Startup, "Failed to register for %s: %d", "keybag lock status", errno);
+    mainQueue()->sync(keybag_notification_callback);
+
+    if (firstBoot) {
+        signpost("FirstBootCleanup", true);
+        connection->rebootStowlyCleanupWithCompletion(firstBootCompletion);
+    }
+    signpost("BootCleanup", true);
+    connection->stowlyCleanupWithCompletion(cleanupCompletion);
+
+    initialisationFinishedFlag = true;
+    signpost("StartingUp", false);
+    STWTransaction::end();
+}
+
+void STWDaemon::_runOnceInitialization() { std::call_once(onceInitializationToken, _onceInitialization); }
+
+int STWDaemon::main(int argc, char** argv) {
+    CLI::App app{"stowlyd: the container daemon"};
+    std::string root = "/";
+    double idleTimeout = -1;
+    app.add_option("--root", root, "Root prefix under which every path of the daemon lives");
+    app.add_option("--idle-timeout", idleTimeout,
+                   "Exit after this many idle seconds (0: never; default 60 under socket activation, else never)");
+    CLI11_PARSE(app, argc, argv);
+
+    // Signals are taken synchronously by the main thread; every thread started from here
+    // on inherits the mask.
+    sigset_t signals;
+    sigemptyset(&signals);
+    sigaddset(&signals, SIGTERM);
+    sigaddset(&signals, SIGINT);
+    pthread_sigmask(SIG_BLOCK, &signals, nullptr);
+    signal(SIGPIPE, SIG_IGN);
+
+    STWErrorRef error;
+    auto configuration = STWPlatformConfiguration::loadFromRoot(root, &error);
+    if (!configuration) {
+        fprintf(stderr, "stowlyd: %s\n", error->message().c_str());
+        return 1;
+    }
+    STWPlatformConfiguration::setSharedInstance(configuration);
+    std::error_code ec;
+    std::filesystem::create_directories(configuration->runtimeDirectory(), ec);
+    chmod(configuration->runtimeDirectory().c_str(), 0755);
+    if (configuration->isDeveloperMode())
+        STW_LOG_FAULT(STWLogCategory::Startup,
+                      "Developer mode is on: clients may declare any identity (root prefix %@)",
+                      configuration->rootPrefix());
+
+    STWTransaction::begin(); // ended by the once-initialisation
+    STWIPCListener listener(
+        {.socketPath = configuration->runtimeDirectory() / "stowlyd.sock",
+         .developerMode = configuration->isDeveloperMode(),
+         .allowSocketActivation = true},
+        [](const std::shared_ptr<STWPeerConnection>&) {
+            _runOnceInitialization();
+            if (!initialisationFinished())
+                STW_LOG_FAULT(STWLogCategory::Unspecified, "Early Tolvan processing detected.");
+        },
+        [](const std::shared_ptr<STWPeerConnection>& peer, uint64_t requestID, STWValue::Dictionary request) {
+            STWTransaction::Scope transaction;
+            STWRequestDispatcher::processTolvanEvent(peer, requestID, request);
+        });
+    bool listening = listener.start(&error);
+    if (!listening)
+        STW_LOG_FN("main", STWLogLevel::Error, STWLogCategory::Tolvan, "unable to start tolvan service!");
+
+    _runOnceInitialization();
+    sd_notify(0, "READY=1");
+    STW_LOG_NOTICE(STWLogCategory::Startup, "stowlyd is serving root %@", configuration->rootPrefix());
+
+    if (idleTimeout < 0)
+        idleTimeout = listener.isSocketActivated() ? 60 : 0;
+    auto idleLimit = std::chrono::duration_cast<std::chrono::steady_clock::duration>(
+        std::chrono::duration<double>(idleTimeout));
+    while (true) {
+        timespec tick{0, 250 * 1000 * 1000};
+        int signalNumber = sigtimedwait(&signals, nullptr, &tick);
+        if (signalNumber == SIGTERM || signalNumber == SIGINT) {
+            STW_LOG_NOTICE(STWLogCategory::Startup, "Stopping on signal %d", signalNumber);
+            break;
+        }
+        if (idleTimeout > 0 && listener.connectionCount() == 0 && STWTransaction::count() == 0) {
+            auto lastActivity = std::max(listener.lastConnectionChange(), STWTransaction::lastChange());
+            if (std::chrono::steady_clock::now() - lastActivity >= idleLimit) {
+                STW_LOG_NOTICE(STWLogCategory::Startup, "Exiting after %.0f idle seconds", idleTimeout);
+                break;
+            }
+        }
+    }
+    sd_notify(0, "STOPPING=1");
+    listener.stop();
+    // Work already posted (deletion passes, cleanups) gets a moment to finish.
+    STWTransaction::waitForIdle(std::chrono::seconds(10));
+    STWLog::flush();
+    return 0;
+}

@@ -1,0 +1,34 @@
+// The daemon process: its entry point, the one-time start-up work, the request socket
+// and the device lock-state watch. Start-up runs once, on the main thread, before any
+// request is served; requests that arrive meanwhile wait for it.
+#pragma once
+
+#include "platform/STWQueue.h"
+
+#include <chrono>
+#include <filesystem>
+#include <memory>
+#include <optional>
+#include <string>
+
+class STWDaemon {
+public:
+    // `stowlyd [--root DIR] [--idle-timeout SECONDS]`.
+    static int main(int argc, char** argv);
+
+    // "com.vorlane.stowlyd.deathrow": deletion passes over death row.
+    static const std::shared_ptr<STWQueue>& deathRowQueue();
+    // "com.vorlane.stowlyd.lockstate": suspended while the device is locked.
+    static const std::shared_ptr<STWQueue>& lockStateQueue();
+    static bool initialisationFinished();
+
+    // Follows the device's lock state: suspends the lock-state queue when the device
+    // locks and resumes it when it unlocks, strictly alternating.
+    static void keybag_notification_callback();
+    // The last lock state seen: 0 unlocked, 1 locked, 3 not yet known.
+    static int storedLockState();
+
+private:
+    static void _onceInitialization();
+    static void _runOnceInitialization();
+};

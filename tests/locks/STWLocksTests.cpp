@@ -1,0 +1,119 @@
+#include "Daemon/STWLocks.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <future>
+#include <thread>
+
+using namespace std::chrono_literals;
+
+namespace {
+
+// Runs `work` on another thread; `done()` tells whether it finished within a short wait.
+class Attempt {
+public:
+    explicit Attempt(std::function<void()> work) : _future(std::async(std::launch::async, std::move(work))) {}
+    bool done(std::chrono::milliseconds wait = 100ms) { return _future.wait_for(wait) == std::future_status::ready; }
+    void finish() { _future.get(); }
+
+private:
+    std::future<void> _future;
+};
+
+} // namespace
+
+TEST(STWLocks, ReadersShareAndOtherIdentifiersNeverWait) {
+    lock_identifier_for_reading("A");
+    Attempt secondReader([] {
+        lock_identifier_for_reading("A");
+        unlock_identifier("A");
+    });
+    EXPECT_TRUE(secondReader.done(2000ms));
+    Attempt otherWriter([] {
+        lock_identifier_for_writing("B");
+        unlock_identifier("B");
+    });
+    EXPECT_TRUE(otherWriter.done(2000ms));
+    Attempt sameWriter([] {
+        lock_identifier_for_writing("A");
+        unlock_identifier("A");
+    });
+    EXPECT_FALSE(sameWriter.done());
+    unlock_identifier("A");
+    EXPECT_TRUE(sameWriter.done(2000ms));
+    EXPECT_EQ(STWLocksCurrentState().lockRecordCount, 0u);
+}
+
+TEST(STWLocks, GlobalWriterWaitsForHoldersAndThenBlocksNewOnes) {
+    lock_identifier_for_reading("A");
+    std::atomic<bool> globalHeld{false};
+    Attempt global([&] {
+        lock_all_identifiers_for_writing();
+        globalHeld = true;
+        std::this_thread::sleep_for(200ms);
+        globalHeld = false;
+        unlock_all_identifiers();
+    });
+    EXPECT_FALSE(global.done());
+    EXPECT_FALSE(globalHeld);
+    unlock_identifier("A");
+    while (!globalHeld)
+        std::this_thread::yield();
+    // While the writer holds everything, a new reader of any identifier waits for it.
+    std::atomic<bool> readerSawGlobal{true};
+    Attempt reader([&] {
+        lock_identifier_for_reading("C");
+        readerSawGlobal = globalHeld.load();
+        unlock_identifier("C");
+    });
+    EXPECT_FALSE(reader.done(50ms));
+    global.finish();
+    reader.finish();
+    EXPECT_FALSE(readerSawGlobal);
+    EXPECT_EQ(STWLocksCurrentState().allReaderWriterState, 0u);
+}
+
+TEST(STWLocks, GlobalReadersAdmitIdentifierReadersButNotWriters) {
+    lock_all_identifiers_for_reading();
+    lock_all_identifiers_for_reading();
+    EXPECT_EQ(STWLocksCurrentState().allReaderWriterState, 2u);
+    Attempt reader([] {
+        lock_identifier_for_reading("A");
+        unlock_identifier("A");
+    });
+    EXPECT_TRUE(reader.done(2000ms));
+    Attempt writer([] {
+        lock_identifier_for_writing("A");
+        unlock_identifier("A");
+    });
+    unlock_all_identifiers();
+    EXPECT_FALSE(writer.done());
+    unlock_all_identifiers();
+    EXPECT_TRUE(writer.done(2000ms));
+}
+
+TEST(STWLocks, ArraysAreLockedOnceInOrderAndRecordsGoWithTheLastHolder) {
+    std::vector<std::string> ids{"C", "A", "B", "A"};
+    lock_identifier_for_writing(ids);
+    auto state = STWLocksCurrentState();
+    EXPECT_EQ(state.identifierWriterCount, 3u);
+    EXPECT_EQ(state.lockRecordCount, 3u);
+    // Two lockers of overlapping sets in opposite orders never deadlock.
+    Attempt other([] {
+        lock_identifier_for_writing(std::vector<std::string>{"B", "A"});
+        unlock_identifier(std::vector<std::string>{"A", "B"});
+    });
+    EXPECT_FALSE(other.done());
+    unlock_identifier(ids);
+    EXPECT_TRUE(other.done(2000ms));
+    state = STWLocksCurrentState();
+    EXPECT_EQ(state.identifierWriterCount, 0u);
+    EXPECT_EQ(state.lockRecordCount, 0u);
+}
+
+TEST(STWLocksDeathTest, UnlockingWhatIsNotLockedStopsTheProcess) {
+    EXPECT_DEATH(unlock_identifier("never-locked"), "invariant");
+    EXPECT_DEATH(unlock_all_identifiers(), "invariant");
+}
