@@ -1,0 +1,71 @@
+#include "client/stowlyctl/STWCTLCommands.h"
+
+#include "client/stowlyctl/STWCTLArguments.h"
+#include "common/STWFileIO.h"
+
+#include <cstring>
+#include <memory>
+#include <system_error>
+
+void STWCTLCommands::addAll(CLI::App& app) {
+    _addRaw(app);
+    _addDevice(app);
+    app.require_subcommand(1);
+}
+
+int STWCTLCommands::run() {
+    return _chosen ? _chosen(_session) : _session.usageError("no subcommand");
+}
+
+void STWCTLCommands::_onRun(CLI::App* command, Action action) {
+    command->callback([this, action = std::move(action)] { _chosen = action; });
+}
+
+// raw COMMAND [KEY=TYPE:VALUE ...]: any command number with typed keys, for commands that
+// have no subcommand of their own and for trying what the daemon does with odd input.
+void STWCTLCommands::_addRaw(CLI::App& app) {
+    struct Arguments {
+        std::string command;
+        std::vector<std::string> keys;
+    };
+    auto arguments = std::make_shared<Arguments>();
+    CLI::App* raw = app.add_subcommand("raw", "Send a command by number with typed keys");
+    raw->add_option("COMMAND", arguments->command, "Command number (0 to 18446744073709551615)")->required();
+    raw->add_option("KEYS", arguments->keys,
+                    "KEY=TYPE:VALUE, TYPE one of str, u64, i64, bool, real, uuid, data (hex), plist (file), "
+                    "strarr, u64arr (comma-separated)");
+    _onRun(raw, [arguments](STWCTLSession& session) {
+        std::optional<uint64_t> command = STWCTLParseUInt64(arguments->command);
+        if (!command)
+            return session.usageError("\"" + arguments->command + "\" is not a command number");
+        std::string reason;
+        auto message = STWCTLMessageWithArguments(*command, arguments->keys, &reason);
+        if (!message)
+            return session.usageError(reason);
+        return session.send(*message);
+    });
+}
+
+// device lock|unlock: the keybag state the daemon watches under its root.
+void STWCTLCommands::_addDevice(CLI::App& app) {
+    CLI::App* device = app.add_subcommand("device", "Change the simulated device state");
+    device->require_subcommand(1);
+    for (const char* state : {"locked", "unlocked"}) {
+        std::string verb = strcmp(state, "locked") == 0 ? "lock" : "unlock";
+        CLI::App* command = device->add_subcommand(verb, "Mark the keybag " + std::string(state));
+        _onRun(command, [state](STWCTLSession& session) {
+            std::filesystem::path directory = session.root() / "run/stowly";
+            std::error_code ec;
+            std::filesystem::create_directories(directory, ec);
+            // Written whole through a rename, so the daemon's watcher never reads half a word.
+            int e = ec ? ec.value() : STWWriteFileAtomically(directory / "keybag", state, 0644, false);
+            if (e) {
+                fprintf(stderr, "stowlyctl: cannot write %s: %s\n", (directory / "keybag").c_str(),
+                        strerror(e));
+                return int(STWCTLExitConnection);
+            }
+            session.print({{"Keybag", STWValue(state)}});
+            return int(STWCTLExitSuccess);
+        });
+    }
+}

@@ -1,0 +1,209 @@
+// stowlyctl run as a program against a scripted daemon: what it sends, what it prints and
+// how it exits.
+#include "common/STWDictionaryUtilities.h"
+#include "tests/client/STWFakeDaemon.h"
+
+#include <gtest/gtest.h>
+
+#include <fcntl.h>
+#include <fstream>
+#include <sstream>
+#include <sys/wait.h>
+#include <unistd.h>
+
+inline void PrintTo(const STWValue& value, std::ostream* os) {
+    *os << value.description();
+}
+
+namespace {
+
+using Dictionary = STWValue::Dictionary;
+
+struct Outcome {
+    int status = -1;
+    std::string out;
+    std::string err;
+};
+
+std::string slurp(const std::filesystem::path& path) {
+    std::ifstream in(path, std::ios::binary);
+    std::stringstream s;
+    s << in.rdbuf();
+    return s.str();
+}
+
+Outcome stowlyctl(const std::filesystem::path& scratch, std::vector<std::string> arguments) {
+    std::filesystem::path out = scratch / "stdout", err = scratch / "stderr";
+    arguments.insert(arguments.begin(), STOWLYCTL_PATH);
+    pid_t pid = fork();
+    if (pid == 0) {
+        int o = open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+        int e = open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+        dup2(o, 1);
+        dup2(e, 2);
+        std::vector<char*> argv;
+        for (std::string& a : arguments)
+            argv.push_back(a.data());
+        argv.push_back(nullptr);
+        execv(argv[0], argv.data());
+        _exit(127);
+    }
+    Outcome run;
+    int status = 0;
+    waitpid(pid, &status, 0);
+    run.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+    run.out = slurp(out);
+    run.err = slurp(err);
+    return run;
+}
+
+// Answers one request with `reply`, keeping what was asked.
+void answerOnce(STWFakeDaemon& daemon, Dictionary reply, std::vector<STWFrame>* received) {
+    daemon.serve([reply, received](int fd) {
+        STWFrameReader reader(fd);
+        STWFrame frame;
+        while (reader.read(frame, nullptr) == STWFrameReadResult::Frame) {
+            received->push_back(frame);
+            STWFakeDaemon::reply(fd, frame.id,
+                                 frame.kind == STWFrameKindHello ? Dictionary{{"ReplyError", STWValue(1)}}
+                                                                 : reply);
+        }
+    });
+}
+
+class stowlyctlTest : public ::testing::Test {
+protected:
+    Outcome run(std::vector<std::string> arguments) {
+        arguments.insert(arguments.begin(), {"--root", daemon.root().string()});
+        return stowlyctl(daemon.root(), std::move(arguments));
+    }
+    STWFakeDaemon daemon;
+    std::vector<STWFrame> received;
+};
+
+} // namespace
+
+TEST_F(stowlyctlTest, RawSendsTypedKeysAndPrintsTheReply) {
+    std::filesystem::path plist = daemon.root() / "value.plist";
+    STW_writeToURL({{"Nested", STWValue(true)}}, plist, STWWriteDefault, nullptr);
+    answerOnce(daemon, {{"ReplyError", STWValue(1)}, {"Path", STWValue("/c/A")}, {"Count", STWValue(3)}},
+               &received);
+    Outcome r = run({"raw", "18446744073709551615", "Name=str:a=b:c", "Size=u64:7", "Delta=i64:-5",
+                 "On=bool:true", "Ratio=real:0.5", "ID=uuid:00000000-0000-0000-0000-000000000001",
+                 "Blob=data:0aff", "Names=strarr:x,y", "Counts=u64arr:1,2", "Info=plist:" + plist.string()});
+    daemon.join();
+    EXPECT_EQ(r.status, 0) << r.err;
+    EXPECT_EQ(r.out, "ReplyError: 1 (Success)\nCount: 3\nPath: \"/c/A\"\n");
+    ASSERT_EQ(received.size(), 1u);
+    EXPECT_EQ(received[0].kind, STWFrameKindRequest);
+    STWUUID id{};
+    id.bytes[15] = 1;
+    EXPECT_EQ(received[0].body, (Dictionary{
+                                    {"Command", STWValue(UINT64_MAX)},
+                                    {"Name", STWValue("a=b:c")},
+                                    {"Size", STWValue(7)},
+                                    {"Delta", STWValue(-5)},
+                                    {"On", STWValue(true)},
+                                    {"Ratio", STWValue(0.5)},
+                                    {"ID", STWValue(id)},
+                                    {"Blob", STWValue(STWData{0x0a, 0xff})},
+                                    {"Names", STWValue(STWValue::Array{STWValue("x"), STWValue("y")})},
+                                    {"Counts", STWValue(STWValue::Array{STWValue(1), STWValue(2)})},
+                                    {"Info", STWValue(Dictionary{{"Nested", STWValue(true)}})},
+                                }));
+}
+
+TEST_F(stowlyctlTest, ReplyErrorOtherThanSuccessExitsOne) {
+    answerOnce(daemon, {{"ReplyError", STWValue(55)}, {"When", STWValue(STWDate{0, 0})}}, &received);
+    Outcome r = run({"--json", "raw", "4"});
+    daemon.join();
+    EXPECT_EQ(r.status, 1);
+    EXPECT_EQ(r.out, "{\"ReplyError\":55,\"When\":\"1970-01-01T00:00:00Z\"}\n");
+    EXPECT_EQ(r.err, "error: NotEntitled (55)\n");
+}
+
+TEST_F(stowlyctlTest, AsSendsHelloWithTheIdentityFirst) {
+    std::filesystem::path entitlements = daemon.root() / "entitlements.plist";
+    Dictionary granted{{"com.example.containers", STWValue(STWValue::Array{STWValue("a")})}};
+    STW_writeToURL(granted, entitlements, STWWriteDefault, nullptr);
+    answerOnce(daemon, {{"ReplyError", STWValue(1)}}, &received);
+    Outcome r = run({"--as", "com.example.tool", "--entitlements", entitlements.string(), "--sandboxed",
+                 "--persona", "PERSONA-1", "raw", "1"});
+    daemon.join();
+    EXPECT_EQ(r.status, 0) << r.err;
+    ASSERT_EQ(received.size(), 2u);
+    EXPECT_EQ(received[0].kind, STWFrameKindHello);
+    EXPECT_EQ(received[0].body, (Dictionary{{"CodeSigningIdentifier", STWValue("com.example.tool")},
+                                            {"Entitlements", STWValue(granted)},
+                                            {"Sandboxed", STWValue(true)},
+                                            {"PersonaUniqueString", STWValue("PERSONA-1")}}));
+    EXPECT_EQ(received[1].kind, STWFrameKindRequest);
+}
+
+TEST_F(stowlyctlTest, RefusedHelloExitsOne) {
+    daemon.serve([](int fd) {
+        STWFrameReader reader(fd);
+        if (auto hello = STWFakeDaemon::readFrame(reader))
+            STWFakeDaemon::reply(fd, hello->id, {{"ReplyError", STWValue(55)}});
+    });
+    Outcome r = run({"--as", "com.example.tool", "raw", "1"});
+    daemon.join();
+    EXPECT_EQ(r.status, 1);
+    EXPECT_EQ(r.err, "error: hello refused: NotEntitled (55)\n");
+}
+
+TEST_F(stowlyctlTest, ConnectionProblemsExitTwo) {
+    daemon.stopListening();
+    Outcome r = run({"raw", "1"});
+    EXPECT_EQ(r.status, 2);
+    EXPECT_NE(r.err.find("Connection refused"), std::string::npos) << r.err;
+
+    // --socket wins over --root.
+    r = stowlyctl(daemon.root(), {"--socket", (daemon.root() / "none.sock").string(), "raw", "1"});
+    EXPECT_EQ(r.status, 2);
+    EXPECT_NE(r.err.find("No such file"), std::string::npos) << r.err;
+}
+
+TEST_F(stowlyctlTest, TimeOutExitsTwo) {
+    daemon.serve([](int fd) {
+        STWFrameReader reader(fd);
+        STWFrame frame;
+        while (reader.read(frame, nullptr) == STWFrameReadResult::Frame) {
+        }
+    });
+    Outcome r = run({"--timeout", "0.2", "raw", "1"});
+    daemon.join();
+    EXPECT_EQ(r.status, 2);
+    EXPECT_NE(r.err.find("timed out"), std::string::npos) << r.err;
+}
+
+TEST_F(stowlyctlTest, BadArgumentsAreRefusedBeforeConnecting) {
+    // Nobody listens: an argument that got as far as connecting would exit 2 instead.
+    daemon.stopListening();
+    for (std::vector<std::string> arguments : std::vector<std::vector<std::string>>{
+             {"raw", "-1"},
+             {"raw", "18446744073709551616"},
+             {"raw", "1", "K=u64:-1"},
+             {"raw", "1", "K=u64:1", "K=str:x"},
+             {"raw", "1", "K"},
+             {"--as", "x", "--entitlements", "/nonexistent.plist", "raw", "1"},
+             {"--timeout", "0", "raw", "1"},
+             {"--sandboxed", "raw", "1"},
+             {"device"},
+             {},
+         }) {
+        Outcome r = run(arguments);
+        EXPECT_EQ(r.status, 64) << testing::PrintToString(arguments) << ": " << r.err;
+    }
+}
+
+TEST_F(stowlyctlTest, DeviceLockWritesTheKeybag) {
+    std::filesystem::path keybag = daemon.root() / "run/stowly/keybag";
+    Outcome r = run({"device", "lock"});
+    EXPECT_EQ(r.status, 0) << r.err;
+    EXPECT_EQ(slurp(keybag), "locked");
+    r = run({"--json", "device", "unlock"});
+    EXPECT_EQ(r.status, 0) << r.err;
+    EXPECT_EQ(r.out, "{\"Keybag\":\"unlocked\"}\n");
+    EXPECT_EQ(slurp(keybag), "unlocked");
+}
