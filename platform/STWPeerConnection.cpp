@@ -39,6 +39,10 @@ std::shared_ptr<STWPeerConnection> STWPeerConnection::adopt(int fd, STWErrorRef*
         STWSetError(error, STW_POSIX_ERROR(errno, "Cannot read the credentials of a peer"));
         return nullptr;
     }
+    // A client that stops reading its replies must not hold a daemon thread (or the
+    // completions that answer on its connection) for ever.
+    timeval sendTimeout{30, 0};
+    setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &sendTimeout, sizeof sendTimeout);
     peer->_pid = credentials.pid;
     peer->_uid = credentials.uid;
     peer->_gid = credentials.gid;

@@ -2,9 +2,12 @@
 
 #include "client/stowlyctl/STWCTLArguments.h"
 #include "common/STWFileIO.h"
+#include "platform/STWPlatformConfiguration.h"
 
+#include <cerrno>
 #include <cstring>
 #include <memory>
+#include <semaphore.h>
 #include <system_error>
 
 void STWCTLCommands::addAll(CLI::App& app) {
@@ -68,4 +71,22 @@ void STWCTLCommands::_addDevice(CLI::App& app) {
             return int(STWCTLExitSuccess);
         });
     }
+    // A reboot clears the marker of a first start since power-on, so the next daemon on
+    // this root runs its first-boot work again.
+    CLI::App* reboot = device->add_subcommand("reboot", "Forget that the daemon has started since power-on");
+    _onRun(reboot, [](STWCTLSession& session) {
+        STWErrorRef error;
+        auto configuration = STWPlatformConfiguration::loadFromRoot(session.root(), &error);
+        if (!configuration) {
+            fprintf(stderr, "stowlyctl: %s\n", error->message().c_str());
+            return int(STWCTLExitConnection);
+        }
+        std::string name = configuration->firstBootSemaphoreName();
+        if (sem_unlink(name.c_str()) != 0 && errno != ENOENT) {
+            fprintf(stderr, "stowlyctl: cannot remove %s: %s\n", name.c_str(), strerror(errno));
+            return int(STWCTLExitConnection);
+        }
+        session.print({{"FirstBootMarker", STWValue("cleared")}});
+        return int(STWCTLExitSuccess);
+    });
 }
