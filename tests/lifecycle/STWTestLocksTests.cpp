@@ -1,0 +1,222 @@
+#include "Daemon/Lifecycle/STWTestLocks.h"
+#include "Daemon/STWLocks.h"
+
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <functional>
+#include <future>
+
+using namespace std::chrono_literals;
+
+namespace {
+
+// Runs `work` on another thread; `done()` tells whether it finished within a short wait.
+class Attempt {
+public:
+    explicit Attempt(std::function<void()> work) : _future(std::async(std::launch::async, std::move(work))) {}
+    bool done(std::chrono::milliseconds wait = 150ms) {
+        return _future.wait_for(wait) == std::future_status::ready;
+    }
+
+private:
+    std::future<void> _future;
+};
+
+class STWTestLocksTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        locks = STWTestLocks::sharedInstance();
+        locks->setEnabled(true);
+    }
+    void TearDown() override {
+        locks->releaseAllLocks();
+        locks->setEnabled(false);
+        STWLocksSnapshot state = STWLocksCurrentState();
+        EXPECT_EQ(state.allReaderWriterState, 0u);
+        EXPECT_EQ(state.identifierReaderCount, 0u);
+        EXPECT_EQ(state.identifierWriterCount, 0u);
+    }
+    Attempt waiter(uint64_t lock) {
+        return Attempt([this, lock] { EXPECT_TRUE(locks->waitOnLock(lock)); });
+    }
+    static Attempt identifierWriter(const std::string& identifier) {
+        return Attempt([identifier] {
+            lock_identifier_for_writing(identifier);
+            unlock_identifier(identifier);
+        });
+    }
+
+    std::shared_ptr<STWTestLocks> locks;
+};
+
+TEST_F(STWTestLocksTest, ParkPointHoldsWaitersUntilItsLastReleaseAndCanBeTakenAgain) {
+    ASSERT_TRUE(locks->acquireLock(2));
+    ASSERT_TRUE(locks->acquireLock(2));
+    Attempt first = waiter(2);
+    Attempt second = waiter(2);
+    Attempt otherPoint = waiter(3);
+    EXPECT_TRUE(otherPoint.done(2000ms));
+    EXPECT_FALSE(first.done());
+
+    ASSERT_TRUE(locks->releaseLock(2));
+    EXPECT_EQ(locks->countForLock(2), 1);
+    EXPECT_FALSE(first.done());
+    EXPECT_FALSE(second.done(0ms));
+
+    ASSERT_TRUE(locks->releaseLock(2));
+    EXPECT_TRUE(first.done(2000ms));
+    EXPECT_TRUE(second.done(2000ms));
+
+    // A second round: the semaphore and the barrier must not carry anything over.
+    ASSERT_TRUE(locks->acquireLock(2));
+    Attempt again = waiter(2);
+    EXPECT_FALSE(again.done());
+    ASSERT_TRUE(locks->releaseLock(2));
+    EXPECT_TRUE(again.done(2000ms));
+}
+
+TEST_F(STWTestLocksTest, ReleaseAndReacquireBeforeTheBarrierRanStillParksLaterWaiters) {
+    // Churn: each round's barrier may not have started when the next is submitted.
+    for (int round = 0; round < 50; ++round) {
+        ASSERT_TRUE(locks->acquireLock(4));
+        ASSERT_TRUE(locks->releaseLock(4));
+    }
+    ASSERT_TRUE(locks->acquireLock(4));
+    Attempt parked = waiter(4);
+    EXPECT_FALSE(parked.done(300ms));
+    ASSERT_TRUE(locks->releaseLock(4));
+    EXPECT_TRUE(parked.done(2000ms));
+}
+
+TEST_F(STWTestLocksTest, WaitersParkOnlyWhileEnabledAndDisablingReleasesEverything) {
+    locks->setEnabled(false);
+    ASSERT_TRUE(locks->acquireLock(2));
+    Attempt unparked = waiter(2);
+    EXPECT_TRUE(unparked.done(2000ms));
+
+    locks->setEnabled(true);
+    EXPECT_TRUE(locks->enabled());
+    ASSERT_TRUE(locks->acquireLock(0));
+    Attempt parked = waiter(2);
+    EXPECT_FALSE(parked.done());
+    Attempt writer = identifierWriter("disable");
+    EXPECT_FALSE(writer.done(0ms));
+
+    locks->setEnabled(false);
+    EXPECT_FALSE(locks->enabled());
+    EXPECT_TRUE(parked.done(2000ms));
+    EXPECT_TRUE(writer.done(2000ms));
+    EXPECT_EQ(locks->countForLock(0), 0);
+    EXPECT_EQ(locks->countForLock(2), 0);
+}
+
+TEST_F(STWTestLocksTest, WriteLockHoldsOffDaemonWideReadersAndIdentifierLockersUntilReleased) {
+    // Taken on one thread, released on another: the hold belongs to the lock's count.
+    std::async(std::launch::async, [this] { ASSERT_TRUE(locks->acquireLock(1)); }).get();
+    EXPECT_EQ(STWLocksCurrentState().allReaderWriterState, 0xFFFFFFFFu);
+
+    Attempt writer = identifierWriter("container-A");
+    Attempt reader([] {
+        lock_identifier_for_reading("container-B");
+        unlock_identifier("container-B");
+    });
+    Attempt global([] {
+        lock_all_identifiers_for_reading();
+        unlock_all_identifiers();
+    });
+    EXPECT_FALSE(writer.done());
+    EXPECT_FALSE(reader.done(0ms));
+    EXPECT_FALSE(global.done(0ms));
+
+    ASSERT_TRUE(locks->releaseLock(1));
+    EXPECT_TRUE(writer.done(2000ms));
+    EXPECT_TRUE(reader.done(2000ms));
+    EXPECT_TRUE(global.done(2000ms));
+}
+
+TEST_F(STWTestLocksTest, ReadLockAdmitsReadersHoldsOffIdentifierWritersAndRefusesTheWriteLock) {
+    ASSERT_TRUE(locks->acquireLock(0));
+    ASSERT_TRUE(locks->acquireLock(0)); // only counts
+    EXPECT_EQ(STWLocksCurrentState().allReaderWriterState, 1u);
+    Attempt reader([] {
+        lock_identifier_for_reading("container-A");
+        unlock_identifier("container-A");
+    });
+    EXPECT_TRUE(reader.done(2000ms));
+    Attempt writer = identifierWriter("container-A");
+    EXPECT_FALSE(writer.done());
+    // Lock 1 would wait for lock 0 for ever on the state queue; it is refused instead.
+    Attempt write([this] { EXPECT_FALSE(locks->acquireLock(1)); });
+    EXPECT_TRUE(write.done(2000ms));
+    EXPECT_EQ(locks->countForLock(1), 0);
+
+    ASSERT_TRUE(locks->releaseLock(0));
+    EXPECT_FALSE(writer.done());
+    ASSERT_TRUE(locks->releaseLock(0));
+    EXPECT_TRUE(writer.done(2000ms));
+}
+
+TEST_F(STWTestLocksTest, AcquiringTheWriteLockWaitsForIdentifierHolders) {
+    lock_identifier_for_reading("held");
+    Attempt acquire([this] { EXPECT_TRUE(locks->acquireLock(1)); });
+    EXPECT_FALSE(acquire.done());
+    unlock_identifier("held");
+    EXPECT_TRUE(acquire.done(2000ms));
+    EXPECT_EQ(locks->countForLock(1), 1);
+    ASSERT_TRUE(locks->releaseLock(1));
+}
+
+TEST_F(STWTestLocksTest, UnbalancedReleasesAndUnknownLocksAreRefused) {
+    EXPECT_FALSE(locks->acquireLock(6));
+    EXPECT_FALSE(locks->releaseLock(6));
+    EXPECT_FALSE(locks->waitOnLock(6));
+    // Were these taken, unlocking a daemon-wide lock nobody holds would stop the process.
+    EXPECT_FALSE(locks->releaseLock(0));
+    EXPECT_FALSE(locks->releaseLock(1));
+    EXPECT_FALSE(locks->releaseLock(3));
+    EXPECT_EQ(locks->countForLock(3), 0);
+
+    ASSERT_TRUE(locks->acquireLock(3));
+    Attempt parked = waiter(3);
+    EXPECT_FALSE(parked.done());
+    ASSERT_TRUE(locks->releaseLock(3));
+    EXPECT_TRUE(parked.done(2000ms));
+    EXPECT_FALSE(locks->releaseLock(3));
+
+    ASSERT_TRUE(locks->acquireLock(1));
+    // Refused at once, not parked behind the write lock.
+    Attempt refused([this] {
+        EXPECT_FALSE(locks->waitOnLock(0));
+        EXPECT_FALSE(locks->waitOnLock(1));
+    });
+    EXPECT_TRUE(refused.done(2000ms));
+    ASSERT_TRUE(locks->releaseLock(1));
+    EXPECT_FALSE(locks->releaseLock(1));
+    EXPECT_EQ(STWLocksCurrentState().allReaderWriterState, 0u);
+}
+
+TEST_F(STWTestLocksTest, ReleaseAllLocksReleasesEveryHeldLockAtOnce) {
+    ASSERT_TRUE(locks->acquireLock(0));
+    ASSERT_TRUE(locks->acquireLock(0));
+    ASSERT_TRUE(locks->acquireLock(2));
+    for (int i = 0; i < 3; ++i)
+        ASSERT_TRUE(locks->acquireLock(5));
+    Attempt parkedAt2 = waiter(2);
+    Attempt parkedAt5 = waiter(5);
+    Attempt writer = identifierWriter("container-A");
+    EXPECT_FALSE(parkedAt2.done());
+    EXPECT_FALSE(parkedAt5.done(0ms));
+    EXPECT_FALSE(writer.done(0ms));
+
+    locks->releaseAllLocks();
+    EXPECT_TRUE(parkedAt2.done(2000ms));
+    EXPECT_TRUE(parkedAt5.done(2000ms));
+    EXPECT_TRUE(writer.done(2000ms));
+    for (uint64_t lock = 0; lock < STWTestLocks::lockCount; ++lock)
+        EXPECT_EQ(locks->countForLock(lock), 0) << lock;
+    EXPECT_FALSE(locks->releaseLock(0));
+    EXPECT_TRUE(locks->enabled());
+}
+
+} // namespace
