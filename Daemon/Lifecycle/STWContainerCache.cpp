@@ -201,6 +201,12 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
     for (const fs::path& entry : *entries) {
         if (!containerURL(entry, contentClass))
             continue;
+        // Containers are always real directories. Per-user class directories belong to
+        // their user, who could otherwise plant a link that passes the path checks of the
+        // metadata reader and gets some other directory mapped into the sandbox.
+        std::error_code ec;
+        if (fs::symlink_status(entry, ec).type() != fs::file_type::directory)
+            continue;
         // The reader logs why a directory is not a container.
         auto record = STWMetadata::readAndValidateMetadataAtUrl(entry, userIdentity, true, nullptr);
         if (!record)
@@ -531,11 +537,6 @@ bool STWContainerCache::_lock_shouldRegisterSandboxMappingWithUserIdentity(const
                                                                            STWContainerClass containerClass) {
     if (!_cacheLock.isHeldByCurrentThread())
         STW_FATAL("%s called without the container cache lock", __func__);
-    return _decideSandboxRegistration(userIdentity, identifier, containerClass);
-}
-
-bool STWContainerCache::_decideSandboxRegistration(const STWUserIdentityRef& userIdentity,
-                                                   const std::string& identifier, STWContainerClass containerClass) {
     if (!userIdentity)
         return false;
     bool shouldRegister;

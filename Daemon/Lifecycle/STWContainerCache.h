@@ -145,8 +145,6 @@ private:
     bool _setSandboxContainerMappingForUserIdentity(const STWUserIdentityRef& userIdentity,
                                                     const std::string& identifier, STWContainerClass containerClass,
                                                     const std::optional<std::filesystem::path>& url);
-    bool _decideSandboxRegistration(const STWUserIdentityRef& userIdentity, const std::string& identifier,
-                                    STWContainerClass containerClass);
     // The stale-record check shared by the single and the bulk look-up: nullptr and the
     // (logged) error when the record has no usable path or its metadata file is gone (then
     // the record is dropped).
