@@ -232,7 +232,7 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
 
 STWMetadataRef STWContainerCache::_validatedRecord(const STWMetadataRef& record, const std::string& cacheName,
                                                    bool transient, STWErrorRef* error) {
-    const fs::path& url = record->url();
+    fs::path url = record->url();
     if (url.empty()) {
         STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Cache: %@%@: Invalid URL path string: %@",
                                      cacheName, transientMarker(transient), url));
