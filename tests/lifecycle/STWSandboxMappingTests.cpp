@@ -87,35 +87,18 @@ TEST_F(STWSandboxMappingTest, MappingsArePushedOnAddAndWithdrawnOnRemove) {
     // Withdrawing what is not there is no failure.
     EXPECT_EQ(store->setUserStateItem({501, std::string("PERSONAL"), 1000, 1, "com.never.pushed"}, std::nullopt), 0);
 
-    // Bundle containers have no mapping, nor do transient containers.
+    // No mapping for: a bundle, a transient container, an enterprise identity's container of
+    // a bundle it shares with the personal persona, a personal container of an
+    // enterprise-only bundle.
     ASSERT_TRUE(add(STWMakeTestContainer(STWUserIdentityCache::defaultUserIdentity(), "com.example.app", 1)));
     ASSERT_TRUE(add(STWMakeTestContainer(mobile, "com.example.temp", 2, true), true));
-    EXPECT_TRUE(links().empty());
-}
-
-TEST_F(STWSandboxMappingTest, OnlyTheIdentitiesThatOwnABundleGetItsMapping) {
-    struct Case {
-        STWUserIdentityRef user;
-        const char* identifier;
-        STWContainerClass containerClass;
-        bool registers;
-    };
-    const Case cases[] = {
-        {mobile, "com.example.app", 2, true},    {enterprise, "com.example.app", 2, false},
-        {enterprise, "com.work.mail", 2, true},  {mobile, "com.work.mail", 2, false},
-        {enterprise, "com.work.mail", 4, true},  {mobile, "com.shared.app", 11, true},
-        // Shared with the personal persona: the common sandbox has it, not the enterprise one.
-        {enterprise, "com.shared.app", 2, false}, {enterprise, "group.com.work", 7, true},
-        {enterprise, "com.example.sys", 12, false}, {mobile, "com.example.sys", 13, true},
-    };
-    for (const Case& c : cases)
-        EXPECT_EQ(cache->shouldRegisterSandboxMappingWithUserIdentity(c.user, c.identifier, c.containerClass), c.registers)
-            << c.user->identifier() << " " << c.identifier << " " << c.containerClass;
-
     ASSERT_TRUE(add(STWMakeTestContainer(enterprise, "com.shared.app", 2)));
     ASSERT_TRUE(add(STWMakeTestContainer(mobile, "com.work.mail", 2)));
     EXPECT_TRUE(links().empty());
-    EXPECT_FALSE(cache->setSandboxContainerMappingForUserIdentity(mobile, "com.example.app", 14, fs::path("/x")));
+    // The owners do get theirs.
+    ASSERT_TRUE(add(STWMakeTestContainer(enterprise, "com.work.mail", 4)));
+    ASSERT_TRUE(add(STWMakeTestContainer(mobile, "com.shared.app", 11)));
+    EXPECT_EQ(links(), (std::set<fs::path>{base / "501/ENT-1/1/com.work.mail", base / "501/PERSONAL/1/com.shared.app"}));
 }
 
 TEST_F(STWSandboxMappingTest, HostileIdentifiersNeverLeaveTheStore) {
