@@ -25,7 +25,7 @@ STWMetadata::STWMetadata(const STWConcreteContainerIdentityRef& containerIdentit
                          std::optional<STWValue::Dictionary> info, std::filesystem::path url,
                          std::optional<std::string> userManagedAssetsDirName)
     : _containerClass(containerIdentity->containerClass()), _userIdentity(containerIdentity->userIdentity()),
-      _identifier(containerIdentity->identifier()), _uuid(containerIdentity->uuid()), _url(std::move(url)),
+      _identifier(containerIdentity->identifier()), _uuid(containerIdentity->uuid()), _url(url.native()),
       _userManagedAssetsDirName(std::move(userManagedAssetsDirName)), _info(std::move(info)) {}
 
 STWConcreteContainerIdentityRef STWMetadata::containerIdentity() const {
@@ -57,7 +57,7 @@ STWValue::Dictionary STWMetadata::dictionaryRepresentation() const {
 }
 
 bool STWMetadata::writeMetadataToDiskWithError(STWErrorRef* error) const {
-    return writeMetadataToFileURL(_url / fileName, error);
+    return writeMetadataToFileURL(url() / fileName, error);
 }
 
 bool STWMetadata::writeMetadataToFileURL(const std::filesystem::path& fileURL, STWErrorRef* error) const {

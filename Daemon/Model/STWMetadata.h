@@ -33,8 +33,8 @@ public:
     const std::string& identifier() const { return _identifier; }
     const STWUUID& uuid() const { return _uuid; }
     void setUuid(const STWUUID& uuid) { _uuid = uuid; }
-    const std::filesystem::path& url() const { return _url; }
-    void setUrl(std::filesystem::path url) { _url = std::move(url); }
+    std::filesystem::path url() const { return std::filesystem::path(_url); }
+    void setUrl(const std::filesystem::path& url) { _url = url.native(); }
     const std::optional<std::string>& userManagedAssetsDirName() const { return _userManagedAssetsDirName; }
     void setUserManagedAssetsDirName(std::optional<std::string> name) { _userManagedAssetsDirName = std::move(name); }
     const std::optional<STWValue::Dictionary>& info() const { return _info; }
@@ -62,7 +62,10 @@ private:
     STWUserIdentityRef _userIdentity;
     std::string _identifier;
     STWUUID _uuid;
-    std::filesystem::path _url;
+    // Kept as plain text: a std::filesystem::path also holds a parsed copy of every
+    // component, several hundred bytes per record, and the container cache keeps one
+    // record per container on the device.
+    std::string _url;
     std::optional<std::string> _userManagedAssetsDirName;
     std::optional<STWValue::Dictionary> _info;
 };

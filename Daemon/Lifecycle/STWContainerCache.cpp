@@ -1,0 +1,622 @@
+#include "Daemon/Lifecycle/STWContainerCache.h"
+
+#include "Daemon/FileSystem/STWFileManager.h"
+#include "Daemon/Model/STWGlobalConfiguration.h"
+#include "Daemon/Model/STWUserIdentitySharedCache.h"
+#include "common/STWLog.h"
+#include "platform/STWSandboxMappingStore.h"
+
+#include <cxxabi.h>
+#include <execinfo.h>
+#include <pthread.h>
+#include <typeinfo>
+#include <unordered_set>
+
+namespace fs = std::filesystem;
+
+namespace {
+
+const char* transientMarker(bool transient) { return transient ? "(transient)" : ""; }
+
+void signpost(const char* interval, bool begin, STWContainerClass containerClass) {
+    STW_LOG_DEBUG(STWLogCategory::Cache, "%s %s %llu", begin ? "begin" : "end", interval, containerClass);
+}
+
+std::string exceptionName(const std::type_info& type) {
+    int status = 0;
+    char* demangled = abi::__cxa_demangle(type.name(), nullptr, nullptr, &status);
+    std::string name = status == 0 && demangled ? demangled : type.name();
+    free(demangled);
+    return name;
+}
+
+// On an internal image an exception inside the cache is a bug to be fixed, not an error to
+// report: the daemon stops with the report as its crash message.
+[[noreturn]] void terminateWithUncaughtExceptionReport(const char* function, const std::string& name,
+                                                       const std::string& reason) {
+    std::string report = "** INTERNAL ERROR: Uncaught Exception **\nException: ";
+    char threadName[64] = {};
+    if (pthread_getname_np(pthread_self(), threadName, sizeof threadName) == 0 && threadName[0])
+        report += STWFormat("<%s> ", threadName);
+    if (!name.empty())
+        report += name + ": ";
+    report += reason;
+    report += "\nStack:\n";
+    void* frames[64];
+    int count = backtrace(frames, 64);
+    if (char** symbols = backtrace_symbols(frames, count)) {
+        for (int i = 0; i < count; ++i)
+            report += std::string(symbols[i]) + (i + 1 < count ? "\n" : "");
+        free(symbols);
+    }
+    STWLog::fatal(function, report);
+}
+
+// Turns the exception being handled into the code 40 error of the operation's edge.
+STWErrorRef errorForCurrentException(const char* function, uint64_t line) {
+    std::string name;
+    std::string reason;
+    try {
+        throw;
+    } catch (const std::exception& e) {
+        name = exceptionName(typeid(e));
+        reason = e.what();
+    } catch (...) {
+        name = "unknown exception";
+    }
+    if (STWGlobalConfiguration::sharedInstance()->isInternalImage())
+        terminateWithUncaughtExceptionReport(function, name, reason);
+    return STWErrorCreate(STWErrorDomain, STWErrorException, function, line, nullptr, true, "Got exception: %@ : %@",
+                          name, reason);
+}
+
+// Runs one public operation, so that no exception leaves it.
+template <class Result, class Body>
+Result guarded(const char* function, uint64_t line, STWErrorRef* error, Result failure, Body&& body) {
+    try {
+        return body();
+    } catch (...) {
+        STWSetError(error, errorForCurrentException(function, line));
+        return failure;
+    }
+}
+
+#define STW_CACHE_GUARDED(error, failure, ...) guarded(__func__, __LINE__, error, failure, __VA_ARGS__)
+
+} // namespace
+
+std::shared_ptr<STWContainerCache> STWContainerCache::sharedInstance() {
+    static std::shared_ptr<STWContainerCache> instance =
+        std::make_shared<STWContainerCache>(STWUserIdentitySharedCache::sharedInstance());
+    return instance;
+}
+
+STWContainerCache::STWContainerCache(std::shared_ptr<STWUserIdentityCache> userIdentityCache)
+    : _userIdentityCache(std::move(userIdentityCache)) {}
+
+std::string STWContainerCache::classCacheKey(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass) {
+    std::string_view directoryName = STWContainerClassDirectoryName(contentClass);
+    if (!STWUserIdentity::isUserIdentityRequiredForContainerClass(contentClass))
+        return std::string(directoryName);
+    std::string key = "[";
+    key += userIdentity ? userIdentity->identifier() : std::string("(null)");
+    key += "]-";
+    key += directoryName;
+    return key;
+}
+
+// MARK: - Call sites of subsystems not in this build
+
+void STWContainerCache::_assertNotOnCodeSigningMappingQueue() const {
+    // The registration decision calls into the code-signing mapping, which serialises on its
+    // own queue; a cache operation running on that queue would deadlock there. The mapping
+    // and its queue are not part of this build, so there is nothing to check against yet.
+    static std::once_flag logged;
+    std::call_once(logged, [] {
+        STW_LOG_DEBUG(STWLogCategory::Cache, "The code-signing mapping is not part of this build: no queue to check");
+    });
+}
+
+std::optional<std::string> STWContainerCache::_parentIdentifierForChildIdentifier(const std::string& identifier) const {
+    // Plug-in data containers register under their application's identifier once the
+    // code-signing mapping can name the parent. Without it the child's own identifier is
+    // used, which is what the mapping answers for a child it does not know.
+    STW_LOG_DEBUG(STWLogCategory::Cache,
+                  "The code-signing mapping is not part of this build: no parent identifier for %@", identifier);
+    return std::nullopt;
+}
+
+bool STWContainerCache::_isWellKnownContainerName(const std::string& name, STWContainerClass containerClass) const {
+    // Well-known system (group) containers are named by their identifier instead of a UUID.
+    // The list of them is not part of this build, so only UUID-named directories are taken
+    // as containers until it is.
+    STW_LOG_DEBUG(STWLogCategory::Cache,
+                  "The well-known container list is not part of this build: %@ is not taken as a container of class %llu",
+                  name, containerClass);
+    return false;
+}
+
+// MARK: - Class caches
+
+void STWContainerCache::_storeRecord(ClassCache& cache, STWMetadataRef record) {
+    // The key views the record's own identifier, so the old entry (key and record) must go
+    // before the new one comes; assigning over it would leave the key pointing into the
+    // record it replaced.
+    auto it = cache.find(record->identifier());
+    if (it != cache.end())
+        cache.erase(it);
+    std::string_view key = record->identifier();
+    cache.emplace(key, std::move(record));
+}
+
+bool STWContainerCache::containerURL(const fs::path& url, STWContainerClass isValidForContainerClass) const {
+    std::string name = url.filename().string();
+    if (STWUUID::fromString(name))
+        return true;
+    if (isValidForContainerClass == STWContainerClassDataSystem ||
+        isValidForContainerClass == STWContainerClassSharedSystemGroup)
+        return _isWellKnownContainerName(name, isValidForContainerClass);
+    return false;
+}
+
+STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(const STWUserIdentityRef& userIdentity,
+                                                                                STWContainerClass contentClass,
+                                                                                bool transient, STWErrorRef* error) {
+    return _lock_getCacheForUserIdentity(userIdentity, contentClass, transient, true, error);
+}
+
+STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(const STWUserIdentityRef& userIdentity,
+                                                                                STWContainerClass contentClass,
+                                                                                bool transient,
+                                                                                bool populateSandboxCache,
+                                                                                STWErrorRef* error) {
+    if (!_cacheLock.isHeldByCurrentThread())
+        STW_FATAL("%s called without the container cache lock", __func__);
+
+    std::string key = classCacheKey(userIdentity, contentClass);
+    auto& caches = transient ? _transientContainerCache : _liveContainerCache;
+    if (auto it = caches.find(key); it != caches.end())
+        return &it->second;
+
+    STW_LOG_NOTICE(STWLogCategory::Cache, "Rebuilding container class cache: %@%@", key, transientMarker(transient));
+    signpost("RebuildingCache", true, contentClass);
+
+    auto directory = STWGlobalConfiguration::sharedInstance()->containerDirectoryURLForUserIdentity(
+        userIdentity, contentClass, transient);
+    if (!directory) {
+        STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Invalid Content Class: %ld",
+                                     static_cast<long>(contentClass)));
+        signpost("RebuildingCache", false, contentClass);
+        return nullptr;
+    }
+    auto entries = STWFileManager::defaultManager()->urlsForItemsInDirectoryAtURL(*directory, error);
+    if (!entries) {
+        signpost("RebuildingCache", false, contentClass);
+        return nullptr;
+    }
+
+    ClassCache cache;
+    cache.reserve(entries->size());
+    bool pushMappings = populateSandboxCache && !transient;
+    for (const fs::path& entry : *entries) {
+        if (!containerURL(entry, contentClass))
+            continue;
+        // Containers are always real directories. Per-user class directories belong to
+        // their user, who could otherwise plant a link that passes the path checks of the
+        // metadata reader and gets some other directory mapped into the sandbox.
+        std::error_code ec;
+        if (fs::symlink_status(entry, ec).type() != fs::file_type::directory)
+            continue;
+        // The reader logs why a directory is not a container.
+        auto record = STWMetadata::readAndValidateMetadataAtUrl(entry, userIdentity, true, nullptr);
+        if (!record)
+            continue;
+        record->setTransient(transient);
+        // Two directories claiming one identifier: the later one in listing order stays.
+        _storeRecord(cache, record);
+        if (pushMappings &&
+            _lock_shouldRegisterSandboxMappingWithUserIdentity(record->userIdentity(), record->identifier(),
+                                                               contentClass) &&
+            !_setSandboxContainerMappingForUserIdentity(record->userIdentity(), record->identifier(), contentClass,
+                                                        record->url()))
+            STW_LOG_ERROR(STWLogCategory::Cache, "Failed to set container mapping during create/lookup operation of %@, %llu",
+                          record->identifier(), contentClass);
+    }
+
+    auto inserted = caches.emplace(std::move(key), std::move(cache)).first;
+    signpost("RebuildingCache", false, contentClass);
+    return &inserted->second;
+}
+
+// MARK: - Look-ups
+
+STWMetadataRef STWContainerCache::_validatedRecord(const STWMetadataRef& record, const std::string& cacheName,
+                                                   bool transient, STWErrorRef* error) {
+    fs::path url = record->url();
+    if (url.empty()) {
+        STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Cache: %@%@: Invalid URL path string: %@",
+                                     cacheName, transientMarker(transient), url));
+        return nullptr;
+    }
+    // The metadata file's path is only meaningful below an absolute container path.
+    if (!url.is_absolute()) {
+        STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Cache: %@%@: nil URL from %@", cacheName,
+                                     transientMarker(transient), url));
+        return nullptr;
+    }
+    fs::path metadataFile = url / STWMetadata::fileName;
+    if (!STWFileManager::defaultManager()->itemDoesNotExistAtURL(metadataFile))
+        return record;
+
+    // Deleted behind the daemon's back: drop the record so that the next look-up answers
+    // "not found" instead of handing out a path that is no container.
+    STWErrorRef removeError;
+    if (!_removeContainerForUserIdentity(record->userIdentity(), record->containerClass(), record->identifier(),
+                                         transient, record, &removeError))
+        STW_LOG_ERROR(STWLogCategory::Cache, "Failed to remove from cache user: %@, id: %@, class: %llu, transient: %d : %@",
+                      record->userIdentity(), record->identifier(), record->containerClass(),
+                      static_cast<int>(transient), removeError);
+    STWSetError(error, STW_ERROR(STWErrorMetadataMissing, nullptr,
+                                 "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", cacheName,
+                                 transientMarker(transient), metadataFile, record->identifier(),
+                                 record->containerClass()));
+    return nullptr;
+}
+
+STWMetadataRef STWContainerCache::containerForContainerIdentity(const STWContainerIdentityRef& identity, bool transient,
+                                                                bool updateSandbox, STWErrorRef* error) {
+    return STW_CACHE_GUARDED(error, STWMetadataRef(), [&] {
+        return _containerForContainerIdentity(identity, transient, updateSandbox, error);
+    });
+}
+
+STWMetadataRef STWContainerCache::_containerForContainerIdentity(const STWContainerIdentityRef& identity,
+                                                                 bool transient, bool updateSandbox,
+                                                                 STWErrorRef* error) {
+    if (!identity) {
+        STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Invalid input: identity: %@", nullptr));
+        return nullptr;
+    }
+    _assertNotOnCodeSigningMappingQueue();
+    const STWUserIdentityRef& userIdentity = identity->userIdentity();
+    STWContainerClass contentClass = identity->containerClass();
+    std::string cacheName = classCacheKey(userIdentity, contentClass);
+
+    STWMetadataRef record;
+    {
+        std::lock_guard guard(_cacheLock);
+        STWErrorRef underlying;
+        ClassCache* cache = _lock_getCacheForUserIdentity(userIdentity, contentClass, transient, updateSandbox,
+                                                          &underlying);
+        if (!cache) {
+            STWSetError(error, STW_ERROR(STWErrorCacheRebuildFailed, underlying, "Cache: [%@]-%@%@: Failed to rebuild",
+                                         userIdentity->identifier(), STWContainerClassDirectoryName(contentClass),
+                                         transientMarker(transient)));
+            return nullptr;
+        }
+        auto it = cache->find(identity->identifier());
+        if (it == cache->end()) {
+            STWSetError(error, STW_ERROR_NOLOG(STWErrorNotFound, nullptr, "Cache: %@%@: Container Not Found with ID: %@",
+                                               cacheName, transientMarker(transient), identity->identifier()));
+            return nullptr;
+        }
+        record = it->second;
+    }
+
+    record = _validatedRecord(record, cacheName, transient, error);
+    if (record)
+        STW_LOG_DEBUG(STWLogCategory::Cache, "Cache: %@%@: Found Identifier: %@", cacheName, transientMarker(transient),
+                      identity->identifier());
+    return record;
+}
+
+STWMetadataRef STWContainerCache::containerForContainerIdentity(const STWConcreteContainerIdentityRef& identity) {
+    if (!identity)
+        return nullptr;
+    // Errors of the two look-ups only say that this container is not there.
+    STWMetadataRef live = containerForContainerIdentity(identity, false, true, nullptr);
+    if (live && live->uuid() == identity->uuid())
+        return live;
+    STWMetadataRef transient = containerForContainerIdentity(identity, true, true, nullptr);
+    if (transient && transient->uuid() == identity->uuid())
+        return transient;
+    return nullptr;
+}
+
+std::optional<std::vector<STWMetadataRef>> STWContainerCache::allContainersForUserIdentity(
+    const STWUserIdentityRef& userIdentity, STWContainerClass contentClass, bool transient, STWErrorRef* error) {
+    return allContainersForUserIdentity(userIdentity, contentClass, transient, true, error);
+}
+
+std::optional<std::vector<STWMetadataRef>> STWContainerCache::allContainersForUserIdentity(
+    const STWUserIdentityRef& userIdentity, STWContainerClass contentClass, bool transient, bool populateSandboxCache,
+    STWErrorRef* error) {
+    return STW_CACHE_GUARDED(error, std::optional<std::vector<STWMetadataRef>>(), [&] {
+        return _allContainersForUserIdentity(userIdentity, contentClass, transient, populateSandboxCache, error);
+    });
+}
+
+std::optional<std::vector<STWMetadataRef>> STWContainerCache::_allContainersForUserIdentity(
+    const STWUserIdentityRef& userIdentity, STWContainerClass contentClass, bool transient, bool populateSandboxCache,
+    STWErrorRef* error) {
+    if (!STWContainerClassIsValid(contentClass)) {
+        STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Invalid Content Class: %ld",
+                                     static_cast<long>(contentClass)));
+        return std::nullopt;
+    }
+    if (!userIdentity) {
+        STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Invalid input: user identity: %@", nullptr));
+        return std::nullopt;
+    }
+    _assertNotOnCodeSigningMappingQueue();
+
+    std::vector<STWMetadataRef> records;
+    {
+        std::lock_guard guard(_cacheLock);
+        std::vector<ClassCache*> caches;
+        std::unordered_set<ClassCache*> seen;
+        STWErrorRef failure;
+        // Identities that share a key (the personal and the unspecific one, or every
+        // identity for a global class) share a class cache, which counts once.
+        auto collect = [&](const STWUserIdentityRef& identity) {
+            if (failure)
+                return;
+            STWErrorRef underlying;
+            ClassCache* cache = _lock_getCacheForUserIdentity(identity, contentClass, transient, populateSandboxCache,
+                                                              &underlying);
+            if (!cache) {
+                failure = STW_ERROR(STWErrorCacheRebuildFailed, underlying, "Cache: [%@]-%@%@: Failed to rebuild",
+                                    identity->identifier(), STWContainerClassDirectoryName(contentClass),
+                                    transientMarker(transient));
+                return;
+            }
+            if (seen.insert(cache).second)
+                caches.push_back(cache);
+        };
+        if (userIdentity->isNoSpecificPersona())
+            _userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(collect);
+        else
+            collect(userIdentity);
+        if (failure) {
+            STWSetError(error, failure);
+            return std::nullopt;
+        }
+        size_t total = 0;
+        for (ClassCache* cache : caches)
+            total += cache->size();
+        records.reserve(total);
+        for (ClassCache* cache : caches)
+            for (const auto& [identifier, record] : *cache)
+                records.push_back(record);
+    }
+
+    // Stale records are logged and dropped, never reported: the caller asked for what exists.
+    std::vector<STWMetadataRef> existing;
+    existing.reserve(records.size());
+    for (const STWMetadataRef& record : records) {
+        if (_validatedRecord(record, classCacheKey(record->userIdentity(), contentClass), transient, nullptr))
+            existing.push_back(record);
+    }
+    return existing;
+}
+
+// MARK: - Add and remove
+
+bool STWContainerCache::addContainerMetadata(const STWMetadataRef& metadata, const fs::path& url, bool transient,
+                                             bool updateSandbox, STWErrorRef* error) {
+    return STW_CACHE_GUARDED(error, false,
+                             [&] { return _addContainerMetadata(metadata, url, transient, updateSandbox, error); });
+}
+
+bool STWContainerCache::_addContainerMetadata(const STWMetadataRef& metadata, const fs::path& url, bool transient,
+                                              bool updateSandbox, STWErrorRef* error) {
+    STWContainerClass contentClass = metadata ? metadata->containerClass() : STWContainerClassUndefined;
+    if (!STWContainerClassIsValid(contentClass)) {
+        STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Invalid Metadata Content Class: %lld",
+                                     static_cast<long long>(contentClass)));
+        return false;
+    }
+    if (metadata->identifier().empty()) {
+        STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Invalid metadata Identifier: %@", nullptr));
+        return false;
+    }
+    if (url.empty() || !url.is_absolute()) {
+        STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Invalid input: URL: %@",
+                                     url.empty() ? nullptr : url.c_str()));
+        return false;
+    }
+    _assertNotOnCodeSigningMappingQueue();
+
+    const STWUserIdentityRef& userIdentity = metadata->userIdentity();
+    const std::string& identifier = metadata->identifier();
+    std::string cacheName = classCacheKey(userIdentity, contentClass);
+    bool shouldRegister = false;
+    {
+        std::lock_guard guard(_cacheLock);
+        STWErrorRef underlying;
+        ClassCache* cache = _lock_getCacheForUserIdentity(userIdentity, contentClass, transient, true, &underlying);
+        if (!cache) {
+            STWSetError(error, STW_ERROR(STWErrorCacheRebuildFailed, underlying, "Cache: [%@]-%@%@: Failed to rebuild",
+                                         userIdentity ? userIdentity->identifier() : std::string("(null)"),
+                                         STWContainerClassDirectoryName(contentClass), transientMarker(transient)));
+            return false;
+        }
+        STWMetadataRef record = metadata;
+        if (metadata->url() != url || metadata->transient() != transient) {
+            auto copy = std::make_shared<STWMetadata>(*metadata);
+            copy->setUrl(url);
+            copy->setTransient(transient);
+            record = std::move(copy);
+        }
+        _storeRecord(*cache, std::move(record));
+        if (updateSandbox)
+            shouldRegister = _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier, contentClass);
+    }
+
+    if (updateSandbox && !transient && shouldRegister &&
+        !_setSandboxContainerMappingForUserIdentity(userIdentity, identifier, contentClass, url))
+        STW_LOG_ERROR(STWLogCategory::Cache, "Failed to set container mapping of %@, %llu", identifier, contentClass);
+    STW_LOG_DEBUG(STWLogCategory::Cache, "Cache: %@%@: Added Identifier: %@", cacheName, transientMarker(transient),
+                  identifier);
+    return true;
+}
+
+bool STWContainerCache::removeContainerForUserIdentity(const STWUserIdentityRef& userIdentity,
+                                                       STWContainerClass contentClass, const std::string& identifier,
+                                                       bool transient, STWErrorRef* error) {
+    return STW_CACHE_GUARDED(error, false, [&] {
+        return _removeContainerForUserIdentity(userIdentity, contentClass, identifier, transient, nullptr, error);
+    });
+}
+
+bool STWContainerCache::_removeContainerForUserIdentity(const STWUserIdentityRef& userIdentity,
+                                                        STWContainerClass contentClass, const std::string& identifier,
+                                                        bool transient, const STWMetadataRef& onlyRecord,
+                                                        STWErrorRef* error) {
+    if (!STWContainerClassIsValid(contentClass)) {
+        STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Invalid Content Class: %ld",
+                                     static_cast<long>(contentClass)));
+        return false;
+    }
+    if (identifier.empty()) {
+        STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Invalid Identifier: %@", nullptr));
+        return false;
+    }
+    if (!userIdentity) {
+        STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Invalid input: user identity: %@", nullptr));
+        return false;
+    }
+    _assertNotOnCodeSigningMappingQueue();
+
+    std::string cacheName = classCacheKey(userIdentity, contentClass);
+    bool shouldRegister;
+    bool superseded = false;
+    {
+        std::lock_guard guard(_cacheLock);
+        STWErrorRef underlying;
+        ClassCache* cache = _lock_getCacheForUserIdentity(userIdentity, contentClass, transient, true, &underlying);
+        if (!cache) {
+            STWSetError(error, STW_ERROR(STWErrorCacheRebuildFailed, underlying, "Cache: [%@]-%@%@: Failed to rebuild",
+                                         userIdentity->identifier(), STWContainerClassDirectoryName(contentClass),
+                                         transientMarker(transient)));
+            return false;
+        }
+        auto it = cache->find(identifier);
+        if (it != cache->end()) {
+            // A stale record that was replaced meanwhile (a new container under the same
+            // identifier) stays, and so does its mapping.
+            if (onlyRecord && it->second != onlyRecord)
+                superseded = true;
+            else
+                cache->erase(it);
+        }
+        shouldRegister = _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier, contentClass);
+    }
+
+    if (shouldRegister && !transient && !superseded &&
+        !_setSandboxContainerMappingForUserIdentity(userIdentity, identifier, contentClass, std::nullopt))
+        STW_LOG_ERROR(STWLogCategory::Cache, "Failed to remove container mapping of %@, %llu", identifier, contentClass);
+    STW_LOG_DEBUG(STWLogCategory::Cache, "Cache: %@%@: Removed Identifier: %@", cacheName, transientMarker(transient),
+                  identifier);
+    return true;
+}
+
+// MARK: - Sandbox mappings
+
+bool STWContainerCache::shouldRegisterSandboxMappingWithUserIdentity(const STWUserIdentityRef& userIdentity,
+                                                                     const std::string& identifier,
+                                                                     STWContainerClass containerClass) {
+    return STW_CACHE_GUARDED(nullptr, false, [&] {
+        std::lock_guard guard(_cacheLock);
+        return _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier, containerClass);
+    });
+}
+
+bool STWContainerCache::_lock_shouldRegisterSandboxMappingWithUserIdentity(const STWUserIdentityRef& userIdentity,
+                                                                           const std::string& identifier,
+                                                                           STWContainerClass containerClass) {
+    if (!_cacheLock.isHeldByCurrentThread())
+        STW_FATAL("%s called without the container cache lock", __func__);
+    if (!userIdentity)
+        return false;
+    bool shouldRegister;
+    bool isMulti = false;
+    std::string bundleIdentifier = identifier;
+    if (STWContainerClassRegistersOnlyForEntitledUsers(containerClass)) {
+        if (STWContainerClassIsChildData(containerClass))
+            if (auto parent = _parentIdentifierForChildIdentifier(identifier))
+                bundleIdentifier = *parent;
+        STWUserIdentitySet owners = _userIdentityCache->userIdentitiesForBundleIdentifier(bundleIdentifier);
+        // A bundle shared by the personal persona and others lives in the common sandbox:
+        // every identity but an enterprise one maps it. Otherwise only its owners do.
+        isMulti = owners.size() >= 2 && owners.count(_userIdentityCache->userIdentityForPersonalPersona()) > 0;
+        shouldRegister = isMulti ? !userIdentity->isEnterprise() : owners.count(userIdentity) > 0;
+    } else if (containerClass == STWContainerClassSharedAppGroup) {
+        shouldRegister = true;
+    } else {
+        shouldRegister = !userIdentity->isEnterprise();
+    }
+    STW_LOG_INFO(STWLogCategory::Sandbox,
+                 "Deciding to register userIdentity: %@, identifier: %@ (%@), containerClass: %llu with sandbox: %d "
+                 "because isMulti: %d",
+                 userIdentity, identifier, bundleIdentifier, containerClass, static_cast<int>(shouldRegister),
+                 static_cast<int>(isMulti));
+    return shouldRegister;
+}
+
+bool STWContainerCache::setSandboxContainerMappingForUserIdentity(const STWUserIdentityRef& userIdentity,
+                                                                  const std::string& identifier,
+                                                                  STWContainerClass containerClass,
+                                                                  const std::optional<fs::path>& url) {
+    return STW_CACHE_GUARDED(nullptr, false, [&] {
+        return _setSandboxContainerMappingForUserIdentity(userIdentity, identifier, containerClass, url);
+    });
+}
+
+bool STWContainerCache::_setSandboxContainerMappingForUserIdentity(const STWUserIdentityRef& userIdentity,
+                                                                   const std::string& identifier,
+                                                                   STWContainerClass containerClass,
+                                                                   const std::optional<fs::path>& url) {
+    if (STWContainerClassIsBundle(containerClass))
+        return true;
+    std::optional<uint32_t> itemType = STWContainerClassSandboxItemType(containerClass);
+    if (!itemType) {
+        STW_LOG_ERROR(STWLogCategory::Sandbox, "Unsupported class for setting sandbox container mapping: %llu",
+                      containerClass);
+        return false;
+    }
+    if (!userIdentity) {
+        STW_LOG_ERROR(STWLogCategory::Sandbox, "Invalid input: user identity: %@", nullptr);
+        return false;
+    }
+
+    STWSandboxMappingItem item;
+    // System containers belong to no user; their mappings live in the state of user 0.
+    item.uid = STWContainerClassIsSystem(containerClass) ? 0 : userIdentity->posixUIDForContainerClass(containerClass);
+    item.personaUniqueString = userIdentity->personaUniqueString();
+    item.kernelPersonaID = userIdentity->kernelPersonaID();
+    item.itemType = *itemType;
+    item.identifier = identifier;
+    const char* path = url ? url->c_str() : nullptr;
+    auto store = STWSandboxMappingStore::sharedInstance();
+
+    if (int e = store->setUserStateItem(item, std::nullopt)) {
+        STW_LOG_ERROR(STWLogCategory::Sandbox,
+                      "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, class: %llu, path: %s : %d",
+                      item.uid, item.itemType, identifier, containerClass, path, e);
+        return false;
+    }
+    if (url) {
+        if (int e = store->setUserStateItem(item, *url)) {
+            STW_LOG_ERROR(STWLogCategory::Sandbox,
+                          "Failed to set mapping for user: %u, itemType: %llu, identifier %s, class: %llu, path: %s : %d",
+                          item.uid, item.itemType, identifier, containerClass, path, e);
+            return false;
+        }
+    }
+    // Debug, not notice: a rebuild pushes one mapping per container.
+    STW_LOG_DEBUG(STWLogCategory::Sandbox,
+                  "Pushed user: %u, itemType: %llu, identifier %s, class: %llu, persona id: %d, path: %s", item.uid,
+                  item.itemType, identifier, containerClass, item.kernelPersonaID, path);
+    return true;
+}

@@ -1,0 +1,165 @@
+// Which containers of a class exist for a user identity, and where, without walking the
+// file system on every request.
+//
+// One class cache per (user identity, class), kept apart for live and transient containers:
+// a hash map from container identifier to its metadata record. A class cache is built from
+// disk on first use by listing the class directory and reading every container's metadata
+// file with full validation; after that create-or-lookup, deletion and replace keep it up to
+// date through add and remove. A look-up checks that the record's metadata file is still
+// there and drops a record whose file vanished behind the daemon's back (reported once as
+// code 44, then as not found).
+//
+// The cache is also the one place that pushes container paths to the sandbox mapping store:
+// data, app-group and system containers are registered under their identifier when they are
+// added or found by a rebuild, and withdrawn when they are removed.
+//
+// One process-wide instance (sharedInstance()); its lock guards every class cache and is
+// held while a class cache is built. Callers serialise create and delete of one identity
+// with the identifier locks. Exceptions never leave a public operation: they become code 40.
+#pragma once
+
+#include "Daemon/Model/STWConcreteContainerIdentity.h"
+#include "Daemon/Model/STWContainerClass.h"
+#include "Daemon/Model/STWMetadata.h"
+#include "Daemon/Model/STWUserIdentity.h"
+#include "Daemon/Model/STWUserIdentityCache.h"
+#include "common/STWError.h"
+
+#include <atomic>
+#include <filesystem>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <thread>
+#include <unordered_map>
+#include <vector>
+
+class STWContainerCache {
+public:
+    static std::shared_ptr<STWContainerCache> sharedInstance();
+
+    // The code-signing mapping joins the constructor when that subsystem exists; until then
+    // the registration decision knows no parent identifiers (see _parentIdentifierForChildIdentifier).
+    explicit STWContainerCache(std::shared_ptr<STWUserIdentityCache> userIdentityCache);
+    STWContainerCache(const STWContainerCache&) = delete;
+    STWContainerCache& operator=(const STWContainerCache&) = delete;
+
+    const std::shared_ptr<STWUserIdentityCache>& userIdentityCache() const { return _userIdentityCache; }
+
+    // The record of the identity's container, or nullptr and an error: 43 the class cache
+    // could not be built, 21 no such container (not logged), 47 a record without a usable
+    // path, 44 the metadata file vanished (the record is dropped, so the next look-up
+    // answers 21). `updateSandbox` pushes the mappings of a class cache built by this call.
+    STWMetadataRef containerForContainerIdentity(const STWContainerIdentityRef& identity, bool transient,
+                                                 bool updateSandbox, STWErrorRef* error);
+    // The live record whose UUID is the identity's, else the transient one, else nullptr.
+    // The record's transient() tells which.
+    STWMetadataRef containerForContainerIdentity(const STWConcreteContainerIdentityRef& identity);
+
+    // Every record of the class for the identity; for the unspecific identity, those of every
+    // accessible user identity. Records whose metadata file vanished are dropped (and
+    // removed from the cache). Unordered.
+    std::optional<std::vector<STWMetadataRef>> allContainersForUserIdentity(const STWUserIdentityRef& userIdentity,
+                                                                            STWContainerClass contentClass,
+                                                                            bool transient, STWErrorRef* error);
+    std::optional<std::vector<STWMetadataRef>> allContainersForUserIdentity(const STWUserIdentityRef& userIdentity,
+                                                                            STWContainerClass contentClass,
+                                                                            bool transient, bool populateSandboxCache,
+                                                                            STWErrorRef* error);
+
+    // Inserts or replaces the record of metadata's identifier; the cache keeps a record
+    // whose url() is `url` and transient() is `transient`. With `updateSandbox`, a live
+    // container's mapping is pushed (a push failure is logged, never returned).
+    bool addContainerMetadata(const STWMetadataRef& metadata, const std::filesystem::path& url, bool transient,
+                              bool updateSandbox, STWErrorRef* error);
+    // Removes the identifier's record (an absent record is no error) and withdraws a live
+    // container's mapping.
+    bool removeContainerForUserIdentity(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass,
+                                        const std::string& identifier, bool transient, STWErrorRef* error);
+
+    // Pushes (url given) or withdraws (nullopt) the sandbox mapping of a container. Bundle
+    // classes have none and succeed; unsupported classes fail.
+    bool setSandboxContainerMappingForUserIdentity(const STWUserIdentityRef& userIdentity, const std::string& identifier,
+                                                   STWContainerClass containerClass,
+                                                   const std::optional<std::filesystem::path>& url);
+    // Whether a container of the class gets a sandbox mapping for this identity.
+    bool shouldRegisterSandboxMappingWithUserIdentity(const STWUserIdentityRef& userIdentity,
+                                                      const std::string& identifier, STWContainerClass containerClass);
+    bool _lock_shouldRegisterSandboxMappingWithUserIdentity(const STWUserIdentityRef& userIdentity,
+                                                            const std::string& identifier,
+                                                            STWContainerClass containerClass);
+
+    // Whether a directory entry may be a container of the class: its name is a UUID, or,
+    // for system and system group containers, a well-known identifier.
+    bool containerURL(const std::filesystem::path& url, STWContainerClass isValidForContainerClass) const;
+
+    // "Data/System" for classes without a user identity, "[501]-Data/Application" otherwise.
+    static std::string classCacheKey(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass);
+
+private:
+    using ClassCache = std::unordered_map<std::string_view, STWMetadataRef>;
+
+    // The non-recursive cache lock, with its owner recorded so that _lock_ methods can check
+    // that their caller holds it.
+    class CacheLock {
+    public:
+        void lock() {
+            _mutex.lock();
+            _owner.store(std::this_thread::get_id(), std::memory_order_relaxed);
+        }
+        void unlock() {
+            _owner.store(std::thread::id(), std::memory_order_relaxed);
+            _mutex.unlock();
+        }
+        bool isHeldByCurrentThread() const {
+            return _owner.load(std::memory_order_relaxed) == std::this_thread::get_id();
+        }
+
+    private:
+        std::mutex _mutex;
+        std::atomic<std::thread::id> _owner{};
+    };
+
+    // The class cache, built from disk when missing; nullptr and the listing error when the
+    // class directory cannot be listed (nothing is cached then).
+    ClassCache* _lock_getCacheForUserIdentity(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass,
+                                              bool transient, bool populateSandboxCache, STWErrorRef* error);
+    ClassCache* _lock_getCacheForUserIdentity(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass,
+                                              bool transient, STWErrorRef* error);
+
+    STWMetadataRef _containerForContainerIdentity(const STWContainerIdentityRef& identity, bool transient,
+                                                  bool updateSandbox, STWErrorRef* error);
+    std::optional<std::vector<STWMetadataRef>> _allContainersForUserIdentity(const STWUserIdentityRef& userIdentity,
+                                                                             STWContainerClass contentClass,
+                                                                             bool transient, bool populateSandboxCache,
+                                                                             STWErrorRef* error);
+    bool _addContainerMetadata(const STWMetadataRef& metadata, const std::filesystem::path& url, bool transient,
+                               bool updateSandbox, STWErrorRef* error);
+    // Removes the identifier's record; with `onlyRecord`, only when the cached record is
+    // still that one, so that repairing a stale record never drops its successor.
+    bool _removeContainerForUserIdentity(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass,
+                                         const std::string& identifier, bool transient,
+                                         const STWMetadataRef& onlyRecord, STWErrorRef* error);
+    bool _setSandboxContainerMappingForUserIdentity(const STWUserIdentityRef& userIdentity,
+                                                    const std::string& identifier, STWContainerClass containerClass,
+                                                    const std::optional<std::filesystem::path>& url);
+    // The stale-record check shared by the single and the bulk look-up: nullptr and the
+    // (logged) error when the record has no usable path or its metadata file is gone (then
+    // the record is dropped).
+    STWMetadataRef _validatedRecord(const STWMetadataRef& record, const std::string& cacheName, bool transient,
+                                    STWErrorRef* error);
+
+    // Call sites of subsystems that are not part of this build.
+    void _assertNotOnCodeSigningMappingQueue() const;
+    std::optional<std::string> _parentIdentifierForChildIdentifier(const std::string& identifier) const;
+    bool _isWellKnownContainerName(const std::string& name, STWContainerClass containerClass) const;
+
+    static void _storeRecord(ClassCache& cache, STWMetadataRef record);
+
+    std::unordered_map<std::string, ClassCache> _liveContainerCache;
+    std::unordered_map<std::string, ClassCache> _transientContainerCache;
+    CacheLock _cacheLock;
+    std::shared_ptr<STWUserIdentityCache> _userIdentityCache;
+};

@@ -1,0 +1,86 @@
+// The sandbox's per-user state store of container mappings: for each (user, persona, item
+// type, identifier) the path of one container, so that whoever enforces the sandbox can
+// resolve a container without asking the daemon. The container cache is the only writer.
+//
+// On Linux the store is a tree of symbolic links below the runtime directory:
+//
+//     ROOT/run/stowly/sandbox/UID/PERSONA/ITEMTYPE/IDENTIFIER -> container path
+//
+// UID and ITEMTYPE are decimal numbers. PERSONA is the persona unique string of the user
+// identity, or the word "nopersona" for an identity without one (no persona support, or the
+// default identity); a persona unique string equal to that word is refused, so the two can
+// never share a directory. A mapping is set by creating the link under a temporary name in
+// the same directory and renaming it over IDENTIFIER, so a reader sees the old path or the
+// new one, never neither; it is withdrawn by removing the link.
+//
+// Identifiers and persona strings come from clients and are treated as hostile: each must
+// be one safe path component (not empty, not "." or "..", no "/" and no NUL). The store's
+// directories are opened one component at a time without following symbolic links, so a
+// link planted in the tree can never redirect a write outside it.
+//
+// STWSandboxMappingStore is the interface; sharedInstance() is the Linux store of the
+// configured root prefix unless a test installed another with setSharedInstance().
+#pragma once
+
+#include <cstdint>
+#include <filesystem>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <sys/types.h>
+
+// Which item of the store: the fields the sandbox keys its user state by.
+struct STWSandboxMappingItem {
+    uid_t uid = 0;
+    // The identity's persona unique string; nullopt for an identity without one.
+    std::optional<std::string> personaUniqueString;
+    // The kernel's persona id of the identity. The Linux store names the persona by its
+    // unique string; the id is carried for stores (and fakes) that key by it.
+    uint32_t kernelPersonaID = 0;
+    uint64_t itemType = 0;
+    std::string identifier;
+
+    std::string description() const;
+};
+
+class STWSandboxMappingStore {
+public:
+    // The directory name used for an identity without a persona unique string.
+    static constexpr std::string_view noPersonaDirectoryName = "nopersona";
+
+    virtual ~STWSandboxMappingStore() = default;
+
+    static std::shared_ptr<STWSandboxMappingStore> sharedInstance();
+    static void setSharedInstance(std::shared_ptr<STWSandboxMappingStore> store);
+
+    // Sets the item to `path`, or withdraws it when `path` is nullopt (withdrawing an item
+    // that is not there succeeds). Answers 0 or an errno value: EINVAL for an identifier or
+    // persona string that is not one safe path component.
+    virtual int setUserStateItem(const STWSandboxMappingItem& item, const std::optional<std::filesystem::path>& path) = 0;
+
+    // The path the item maps to, or nullopt when there is none (or it cannot be read).
+    virtual std::optional<std::filesystem::path> userStateItem(const STWSandboxMappingItem& item) = 0;
+
+    // Whether `name` may be used as one component of a store path.
+    static bool isSafePathComponent(std::string_view name);
+};
+
+// The Linux store: symbolic links below `baseDirectory` (ROOT/run/stowly/sandbox for the
+// shared instance).
+class STWFileSandboxMappingStore : public STWSandboxMappingStore {
+public:
+    explicit STWFileSandboxMappingStore(std::filesystem::path baseDirectory);
+
+    const std::filesystem::path& baseDirectory() const { return _baseDirectory; }
+
+    int setUserStateItem(const STWSandboxMappingItem& item, const std::optional<std::filesystem::path>& path) override;
+    std::optional<std::filesystem::path> userStateItem(const STWSandboxMappingItem& item) override;
+
+private:
+    // Opens (creating with mode 0755 when `create`) the ITEMTYPE directory of the item,
+    // refusing symbolic links on the way. Answers the descriptor or -errno.
+    int _openItemDirectory(const STWSandboxMappingItem& item, bool create);
+
+    std::filesystem::path _baseDirectory;
+};

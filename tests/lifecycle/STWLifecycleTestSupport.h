@@ -1,0 +1,50 @@
+// Shared fixtures of the lifecycle tests: a private root with a personal persona, one
+// enterprise persona ("ENT-1", home /private/var/ent1) and a universal persona that shares
+// "com.shared.app" with everyone; containers made on disk with real metadata files; and a
+// sandbox mapping store that records what the cache pushed.
+#pragma once
+
+#include "Daemon/Model/STWMetadata.h"
+#include "platform/STWSandboxMappingStore.h"
+
+#include <atomic>
+#include <filesystem>
+#include <map>
+#include <mutex>
+#include <optional>
+#include <string>
+
+struct STWTestContainer {
+    std::filesystem::path url;
+    STWMetadataRef metadata;
+};
+
+// Installs the root and its personas and removes every container and mapping a previous
+// test of the same process left behind.
+void STWLifecycleTestSetUpRoot();
+STWUserIdentityRef STWTestPersonalIdentity();
+STWUserIdentityRef STWTestEnterpriseIdentity();
+
+// A container directory (named by a new UUID unless `directoryName` is given) in the class
+// directory, with a valid metadata file.
+STWTestContainer STWMakeTestContainer(const STWUserIdentityRef& userIdentity, const std::string& identifier,
+                                      STWContainerClass containerClass, bool transient = false,
+                                      const std::optional<std::string>& directoryName = std::nullopt);
+
+class STWRecordingSandboxMappingStore : public STWSandboxMappingStore {
+public:
+    int setUserStateItem(const STWSandboxMappingItem& item, const std::optional<std::filesystem::path>& path) override;
+    std::optional<std::filesystem::path> userStateItem(const STWSandboxMappingItem& item) override;
+
+    // "UID/PERSONA/ITEMTYPE/IDENTIFIER" -> path, as the file store would lay it out.
+    std::map<std::string, std::filesystem::path> mappings();
+    // How often a path was set for the identifier.
+    int pushCount(const std::string& identifier);
+
+    std::atomic<bool> throwOnSet{false};
+
+private:
+    std::mutex _mutex;
+    std::map<std::string, std::filesystem::path> _mappings;
+    std::map<std::string, int> _pushes;
+};

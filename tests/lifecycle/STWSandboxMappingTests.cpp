@@ -1,0 +1,194 @@
+#include "Daemon/Lifecycle/STWContainerCache.h"
+#include "Daemon/Model/STWUserIdentitySharedCache.h"
+#include "tests/lifecycle/STWLifecycleTestSupport.h"
+#include "tests/support/STWTestRoot.h"
+
+#include <gtest/gtest.h>
+
+#include <fstream>
+#include <set>
+#include <thread>
+
+namespace fs = std::filesystem;
+
+namespace {
+
+class STWSandboxMappingTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        STWLifecycleTestSetUpRoot();
+        base = STWTestRoot::shared().resolve("/run/stowly/sandbox");
+        store = std::make_shared<STWFileSandboxMappingStore>(base);
+        STWSandboxMappingStore::setSharedInstance(store);
+        cache = std::make_shared<STWContainerCache>(STWUserIdentitySharedCache::sharedInstance());
+        mobile = STWTestPersonalIdentity();
+        enterprise = STWTestEnterpriseIdentity();
+    }
+
+    // Every entry below `top` (links not followed) except the store's own tree.
+    std::set<fs::path> entries(const fs::path& top, bool skipStore) {
+        std::set<fs::path> found;
+        for (auto it = fs::recursive_directory_iterator(top); it != fs::recursive_directory_iterator(); ++it) {
+            if (skipStore && it->path() == base) {
+                it.disable_recursion_pending();
+                continue;
+            }
+            found.insert(it->path());
+        }
+        return found;
+    }
+    std::set<fs::path> links() {
+        std::set<fs::path> found;
+        if (fs::exists(base))
+            for (const fs::path& p : entries(base, false))
+                if (fs::is_symlink(p))
+                    found.insert(p);
+        return found;
+    }
+    bool add(const STWTestContainer& container, bool transient = false) {
+        STWErrorRef error;
+        bool added = cache->addContainerMetadata(container.metadata, container.url, transient, true, &error);
+        EXPECT_TRUE(added) << (error ? error->description() : "");
+        return added;
+    }
+    bool remove(const STWTestContainer& container) {
+        STWErrorRef error;
+        return cache->removeContainerForUserIdentity(container.metadata->userIdentity(),
+                                                     container.metadata->containerClass(),
+                                                     container.metadata->identifier(), false, &error);
+    }
+
+    fs::path base;
+    std::shared_ptr<STWFileSandboxMappingStore> store;
+    std::shared_ptr<STWContainerCache> cache;
+    STWUserIdentityRef mobile, enterprise;
+};
+
+TEST_F(STWSandboxMappingTest, MappingsArePushedOnAddAndWithdrawnOnRemove) {
+    auto data = STWMakeTestContainer(mobile, "com.example.app", 2);
+    auto group = STWMakeTestContainer(enterprise, "group.com.work", 7);
+    auto system = STWMakeTestContainer(STWUserIdentityCache::defaultUserIdentity(), "com.example.sys", 12);
+    ASSERT_TRUE(add(data) && add(group) && add(system));
+
+    // The default identity has no persona unique string; system containers map for user 0.
+    const std::set<fs::path> expected{base / "501/PERSONAL/1/com.example.app", base / "501/ENT-1/2/group.com.work",
+                                      base / "0/nopersona/4/com.example.sys"};
+    EXPECT_EQ(links(), expected);
+    EXPECT_EQ(fs::read_symlink(base / "501/PERSONAL/1/com.example.app"), data.url);
+    EXPECT_EQ(fs::read_symlink(base / "0/nopersona/4/com.example.sys"), system.url);
+
+    // Re-adding at a new place re-points the mapping.
+    auto moved = STWMakeTestContainer(mobile, "com.example.app", 2);
+    ASSERT_TRUE(add(moved));
+    EXPECT_EQ(fs::read_symlink(base / "501/PERSONAL/1/com.example.app"), moved.url);
+
+    EXPECT_TRUE(remove(data) && remove(group) && remove(system));
+    EXPECT_TRUE(links().empty());
+    // Withdrawing what is not there is no failure.
+    EXPECT_EQ(store->setUserStateItem({501, std::string("PERSONAL"), 1000, 1, "com.never.pushed"}, std::nullopt), 0);
+
+    // No mapping for: a bundle, a transient container, an enterprise identity's container of
+    // a bundle it shares with the personal persona, a personal container of an
+    // enterprise-only bundle.
+    ASSERT_TRUE(add(STWMakeTestContainer(STWUserIdentityCache::defaultUserIdentity(), "com.example.app", 1)));
+    ASSERT_TRUE(add(STWMakeTestContainer(mobile, "com.example.temp", 2, true), true));
+    ASSERT_TRUE(add(STWMakeTestContainer(enterprise, "com.shared.app", 2)));
+    ASSERT_TRUE(add(STWMakeTestContainer(mobile, "com.work.mail", 2)));
+    EXPECT_TRUE(links().empty());
+    // The owners do get theirs.
+    ASSERT_TRUE(add(STWMakeTestContainer(enterprise, "com.work.mail", 4)));
+    ASSERT_TRUE(add(STWMakeTestContainer(mobile, "com.shared.app", 11)));
+    EXPECT_EQ(links(), (std::set<fs::path>{base / "501/ENT-1/1/com.work.mail", base / "501/PERSONAL/1/com.shared.app"}));
+}
+
+TEST_F(STWSandboxMappingTest, HostileIdentifiersNeverLeaveTheStore) {
+    auto container = STWMakeTestContainer(mobile, "com.example.app", 2);
+    ASSERT_TRUE(add(container));
+    // A container whose metadata names a path as its identifier.
+    auto escaping = STWMakeTestContainer(mobile, "../../../../../../escape", 2);
+    const fs::path& root = STWTestRoot::shared().path();
+    std::set<fs::path> before = entries(root, true);
+
+    const std::string hostile[] = {"", ".", "..", "../../../../etc/passwd", "a/b", "/abs", std::string("a\0b", 3)};
+    for (const std::string& identifier : hostile) {
+        STWSandboxMappingItem item{501, std::string("PERSONAL"), 1000, 1, identifier};
+        EXPECT_EQ(store->setUserStateItem(item, container.url), EINVAL) << identifier;
+        EXPECT_EQ(store->setUserStateItem(item, std::nullopt), EINVAL) << identifier;
+    }
+    for (const char* persona : {"..", "x/y", "nopersona", ""}) {
+        STWSandboxMappingItem item{501, std::string(persona), 1000, 1, "com.example.app"};
+        EXPECT_EQ(store->setUserStateItem(item, container.url), EINVAL) << persona;
+    }
+    // Its add works; its push is refused.
+    ASSERT_TRUE(add(escaping));
+    EXPECT_TRUE(remove(escaping));
+    EXPECT_EQ(entries(root, true), before);
+    EXPECT_EQ(links(), std::set<fs::path>{base / "501/PERSONAL/1/com.example.app"});
+
+    // Odd but harmless names are stored as they are.
+    for (const char* odd : {"..hidden", "with space", "caf\xc3\xa9", "-"}) {
+        STWSandboxMappingItem item{501, std::string("PERSONAL"), 1000, 1, odd};
+        ASSERT_EQ(store->setUserStateItem(item, container.url), 0) << odd;
+        EXPECT_EQ(store->userStateItem(item), container.url);
+        EXPECT_EQ(fs::read_symlink(base / "501/PERSONAL/1" / odd), container.url);
+    }
+}
+
+TEST_F(STWSandboxMappingTest, LinksPlantedInTheStoreAreNeverFollowed) {
+    fs::path outside = STWTestRoot::shared().resolve("/private/var/outside");
+    fs::create_directories(outside / "1");
+    std::ofstream(outside / "1/com.example.app") << "victim";
+    fs::create_directories(base / "501");
+    fs::create_directory_symlink(outside, base / "501/PERSONAL");
+
+    STWSandboxMappingItem item{501, std::string("PERSONAL"), 1000, 1, "com.example.app"};
+    EXPECT_NE(store->setUserStateItem(item, fs::path("/somewhere")), 0);
+    EXPECT_NE(store->setUserStateItem(item, std::nullopt), 0);
+    auto container = STWMakeTestContainer(mobile, "com.example.app", 2);
+    ASSERT_TRUE(add(container)); // the failed push is logged, not returned
+    EXPECT_TRUE(remove(container));
+    EXPECT_TRUE(fs::is_regular_file(fs::symlink_status(outside / "1/com.example.app")));
+    EXPECT_EQ(entries(outside, false), (std::set<fs::path>{outside / "1", outside / "1/com.example.app"}));
+
+    // A link in the identifier's place is replaced, never written through.
+    fs::remove(base / "501/PERSONAL");
+    fs::create_directories(base / "501/PERSONAL/1");
+    fs::create_symlink(outside / "1/com.example.app", base / "501/PERSONAL/1/com.example.app");
+    ASSERT_TRUE(add(container));
+    EXPECT_EQ(fs::read_symlink(base / "501/PERSONAL/1/com.example.app"), container.url);
+    std::string content;
+    std::ifstream(outside / "1/com.example.app") >> content;
+    EXPECT_EQ(content, "victim");
+}
+
+TEST_F(STWSandboxMappingTest, ReplacingAMappingNeverLeavesItMissing) {
+    STWSandboxMappingItem item{501, std::string("PERSONAL"), 1000, 1, "com.example.app"};
+    const fs::path paths[] = {"/private/var/mobile/Containers/Data/Application/A",
+                              "/private/var/mobile/Containers/Data/Application/B"};
+    ASSERT_EQ(store->setUserStateItem(item, paths[0]), 0);
+    std::atomic<bool> done{false};
+    std::atomic<int> missing{0}, seen{0};
+    std::thread reader([&] {
+        while (!done) {
+            auto path = store->userStateItem(item);
+            if (!path || (*path != paths[0] && *path != paths[1]))
+                missing++;
+            seen++;
+        }
+    });
+    std::thread second([&] {
+        for (int i = 0; i < 500; ++i)
+            EXPECT_EQ(store->setUserStateItem(item, paths[i % 2]), 0);
+    });
+    for (int i = 0; i < 500; ++i)
+        EXPECT_EQ(store->setUserStateItem(item, paths[(i + 1) % 2]), 0);
+    second.join();
+    done = true;
+    reader.join();
+    EXPECT_GT(seen, 0);
+    EXPECT_EQ(missing, 0);
+    // No temporary link is left behind.
+    EXPECT_EQ(entries(base / "501/PERSONAL/1", false), std::set<fs::path>{base / "501/PERSONAL/1/com.example.app"});
+}
+
+} // namespace
