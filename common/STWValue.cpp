@@ -325,6 +325,11 @@ std::optional<uint64_t> STWDictionaryUInt64(const STWValue::Dictionary& dictiona
     return v ? v->uint64Value() : std::nullopt;
 }
 
+bool STWDictionaryBool(const STWValue::Dictionary& dictionary, std::string_view key) {
+    const STWValue* v = STWDictionaryFind(dictionary, key);
+    return v && v->boolValue().value_or(false);
+}
+
 const std::string* STWDictionaryString(const STWValue::Dictionary& dictionary, std::string_view key) {
     const STWValue* v = STWDictionaryFind(dictionary, key);
     return v ? v->string() : nullptr;

@@ -130,6 +130,8 @@ std::string STWDescribeDictionary(const STWValue::Dictionary& dictionary);
 // Typed reads from a dictionary, for decoding message bodies and files.
 const STWValue* STWDictionaryFind(const STWValue::Dictionary& dictionary, std::string_view key);
 std::optional<uint64_t> STWDictionaryUInt64(const STWValue::Dictionary& dictionary, std::string_view key);
+// A message flag: true only for a boolean true; absent or mistyped reads as false.
+bool STWDictionaryBool(const STWValue::Dictionary& dictionary, std::string_view key);
 const std::string* STWDictionaryString(const STWValue::Dictionary& dictionary, std::string_view key);
 const STWValue::Dictionary* STWDictionaryDictionary(const STWValue::Dictionary& dictionary,
                                                     std::string_view key);

@@ -1,5 +1,6 @@
 #include "Daemon/Lifecycle/STWContainerCache.h"
 
+#include "Daemon/CodeSigning/STWWhitelist.h"
 #include "Daemon/FileSystem/STWFileManager.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
@@ -128,12 +129,7 @@ std::optional<std::string> STWContainerCache::_parentIdentifierForChildIdentifie
 
 bool STWContainerCache::_isWellKnownContainerName(const std::string& name, STWContainerClass containerClass) const {
     // Well-known system (group) containers are named by their identifier instead of a UUID.
-    // The list of them is not part of this build, so only UUID-named directories are taken
-    // as containers until it is.
-    STW_LOG_DEBUG(STWLogCategory::Cache,
-                  "The well-known container list is not part of this build: %@ is not taken as a container of class %llu",
-                  name, containerClass);
-    return false;
+    return STWWhitelist::sharedWhitelist()->containerIdIsWellknown(name, containerClass);
 }
 
 // MARK: - Class caches

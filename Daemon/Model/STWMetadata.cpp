@@ -70,6 +70,9 @@ bool STWMetadata::writeMetadataToFileURL(const std::filesystem::path& fileURL, S
     STWErrorRef writeError;
     // Durable: the file's bytes reach the disk before the rename makes them visible.
     if (!STW_writeToURL(dictionary, temp, STWWriteDurable | STWWriteNoFileProtection, &writeError)) {
+        // A half-written temporary file must not stay behind in staging.
+        std::error_code ignored;
+        std::filesystem::remove(temp, ignored);
         STWSetError(error, STW_ERROR(STWErrorWriteFileFailed, writeError,
                                      "Failed to write metadata dictionary to URL %@ : %@:%ld", temp,
                                      writeError->domain(), writeError->code()));
@@ -77,6 +80,8 @@ bool STWMetadata::writeMetadataToFileURL(const std::filesystem::path& fileURL, S
     }
     STWErrorRef moveError;
     if (!STWFileManager::defaultManager()->moveItemAtURL(temp, fileURL, STWFileManagerMoveDurable, &moveError)) {
+        std::error_code ignored;
+        std::filesystem::remove(temp, ignored);
         STWSetError(error, STW_ERROR(STWErrorWriteFileFailed, moveError,
                                      "Failed to move metadata from staging: %@ to final: %@", temp, fileURL));
         return false;

@@ -5,7 +5,10 @@
 #pragma once
 
 #include "Daemon/Lifecycle/STWCommandQueue.h"
+#include "Daemon/Model/STWConcreteContainerIdentity.h"
 #include "Daemon/Model/STWContainerClass.h"
+#include "Daemon/Model/STWContainerIdentity.h"
+#include "Daemon/Model/STWMetadata.h"
 #include "Daemon/Model/STWUserIdentityCache.h"
 #include "Daemon/Request/STWClientIdentity.h"
 #include "common/STWValue.h"
@@ -19,6 +22,7 @@
 #include <optional>
 #include <set>
 #include <string>
+#include <vector>
 
 class STWClientConnection {
 public:
@@ -42,6 +46,38 @@ public:
     bool isEntitledForLookupWithClass(STWContainerClass containerClass, std::string_view identifier);
     std::optional<StringSet> _lookupForContainerClass(STWContainerClass containerClass);
     static StringSet _setOfStringsFromArray(const STWValue::Array& array);
+
+    // The container of `identity`, created first when it does not exist and
+    // `createIfNecessary` is set. A new container is built completely in staging
+    // (metadata, subdirectories) and moved into its class directory with one rename; a
+    // failure leaves nothing in the class directory. A transient container asked for again
+    // is retired to death row and made anew, empty. With `useLocking` the daemon-wide
+    // identifier lock orders this against every other change of the set of containers.
+    // nullptr with the code in `error` on failure.
+    std::shared_ptr<STWMetadata> createOrLookupContainerWithContainerIdentity(const STWContainerIdentityRef& identity,
+                                                                              bool createIfNecessary, bool transient,
+                                                                              bool useLocking, uint64_t* error);
+    // Every container of a class of the caller's user identity.
+    std::optional<std::vector<STWMetadataRef>> containersWithClass(STWContainerClass containerClass, bool transient,
+                                                                   uint64_t* error);
+    std::shared_ptr<STWMetadata> metadataWithContainerIdentity(const STWConcreteContainerIdentityRef& identity,
+                                                               uint64_t* error);
+    // Recreates missing standard subdirectories of an existing container.
+    bool recreateDefaultStructureWithContainerIdentity(const STWConcreteContainerIdentityRef& identity,
+                                                       uint64_t* error);
+
+    bool _createTopLevelContainerDirectory(const std::filesystem::path& url, STWContainerClass containerClass,
+                                           uid_t owner, STWErrorRef* error);
+    int32_t _dataProtectionClassForContainerMetadata(const STWMetadata& metadata);
+    bool _createSubDirectories(const std::filesystem::path& url, const STWMetadata& metadata, STWErrorRef* error);
+
+    // Death row: moves an item into a fresh "temp." directory of death row (a missing item
+    // counts as moved) and optionally starts a deletion pass.
+    bool _moveItemAtURLToDeathRow(const std::filesystem::path& url, bool isDir, bool startDeletionThread,
+                                  STWErrorRef* error);
+    static bool _removeItemOrMoveToTempAtURL(const std::filesystem::path& url, STWErrorRef* error);
+    // Empties death row on the death-row queue; the completion gets 1 or the last error's code.
+    static void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
 
     // Start-up work of the daemon's own connection: first-boot and every-start setup,
     // and the cleanups whose completions run later on the background queue.

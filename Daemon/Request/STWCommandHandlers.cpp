@@ -2,6 +2,7 @@
 
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Request/STWClientConnection.h"
+#include "Daemon/Request/STWRequestDecoder.h"
 #include "common/STWError.h"
 #include "common/STWLog.h"
 
@@ -26,15 +27,11 @@ void _operationNotInThisBuild(const char* command, uint64_t* error) {
         _operationNotInThisBuild(#name, error);                                                              \
     }
 
-STW_COMMAND_NOT_IN_THIS_BUILD(createOrLookupContainer)
-STW_COMMAND_NOT_IN_THIS_BUILD(containersWithClass)
 STW_COMMAND_NOT_IN_THIS_BUILD(replaceContainer)
 STW_COMMAND_NOT_IN_THIS_BUILD(stageContainerForDelete)
 STW_COMMAND_NOT_IN_THIS_BUILD(deleteContainersOnDeathRow)
 STW_COMMAND_NOT_IN_THIS_BUILD(setInfoValue)
 STW_COMMAND_NOT_IN_THIS_BUILD(infoValueForKey)
-STW_COMMAND_NOT_IN_THIS_BUILD(containerMetadata)
-STW_COMMAND_NOT_IN_THIS_BUILD(recreateDefaultStructure)
 STW_COMMAND_NOT_IN_THIS_BUILD(regenerateDirectoryUUID)
 STW_COMMAND_NOT_IN_THIS_BUILD(deleteContainer)
 STW_COMMAND_NOT_IN_THIS_BUILD(wipeContainer)
@@ -48,13 +45,70 @@ STW_COMMAND_NOT_IN_THIS_BUILD(processCodeSigningInfo)
 STW_COMMAND_NOT_IN_THIS_BUILD(codeSigningInfo)
 STW_COMMAND_NOT_IN_THIS_BUILD(invalidateCodeSigningInfo)
 STW_COMMAND_NOT_IN_THIS_BUILD(setDataProtection)
-STW_COMMAND_NOT_IN_THIS_BUILD(recreateDefaultStructure2)
 STW_COMMAND_NOT_IN_THIS_BUILD(diskUsage)
 STW_COMMAND_NOT_IN_THIS_BUILD(performDataMigration)
 STW_COMMAND_NOT_IN_THIS_BUILD(stageSharedContent)
 STW_COMMAND_NOT_IN_THIS_BUILD(userManagedAssetsPath)
 STW_COMMAND_NOT_IN_THIS_BUILD(deleteUserManagedAsset)
 STW_COMMAND_NOT_IN_THIS_BUILD(performPerUserDataMigration)
+
+STW_COMMAND_HANDLER(createOrLookupContainer) {
+    auto identity = STWRequestDecoder::classValidatedIdentity(request, connection, true, error);
+    if (!identity)
+        return;
+    bool create = STWDictionaryBool(request, "CreateIfNecessary");
+    bool transient = STWDictionaryBool(request, "Transient");
+    auto container = connection.createOrLookupContainerWithContainerIdentity(identity, create, transient, true, error);
+    if (!container)
+        return;
+    reply->set("ReplyUUID", STWValue(container->uuid()));
+    reply->set("ReplyExisted", STWValue(container->existed()));
+    reply->set("ReplyPath", STWValue(container->url().native()));
+    reply->set("ReplyIdentifier", STWValue(container->identifier()));
+    if (container->userIdentity() && container->userIdentity()->personaUniqueString())
+        reply->set("ReplyPersonaUniqueString", STWValue(*container->userIdentity()->personaUniqueString()));
+    STWRequestDecoder::issueSandboxExtension(reply->body(), "SandboxToken", *container, connection);
+}
+
+STW_COMMAND_HANDLER(containersWithClass) {
+    STWContainerClass containerClass = STWDictionaryUInt64(request, "ContainerClass").value_or(0);
+    auto containers = connection.containersWithClass(containerClass, STWDictionaryBool(request, "Transient"), error);
+    if (!containers)
+        return;
+    STWValue::Array identifiers, uuids, personas;
+    for (const auto& container : *containers) {
+        identifiers.emplace_back(container->identifier());
+        uuids.emplace_back(container->uuid());
+        const auto& persona = container->userIdentity() ? container->userIdentity()->personaUniqueString() : std::nullopt;
+        personas.emplace_back(persona ? *persona : std::string());
+    }
+    reply->set("ReplyIdsArray", STWValue(std::move(identifiers)));
+    reply->set("ReplyUUIDsArray", STWValue(std::move(uuids)));
+    reply->set("ReplyPersonaUniqueStringsArray", STWValue(std::move(personas)));
+}
+
+STW_COMMAND_HANDLER(containerMetadata) {
+    auto identity = STWRequestDecoder::concreteIdentityFromKeys(request, connection, {}, error);
+    if (!identity)
+        return;
+    auto container = connection.metadataWithContainerIdentity(identity, error);
+    if (!container)
+        return;
+    reply->set("ReplyPath", STWValue(container->url().native()));
+    reply->set("ReplyTransient", STWValue(container->transient()));
+    if (STWDictionaryBool(request, "InfoDictRequested") && container->info())
+        reply->set("ReplyInfoDictionary", STWValue(*container->info()));
+    STWRequestDecoder::issueSandboxExtension(reply->body(), "SandboxToken", *container, connection);
+}
+
+STW_COMMAND_HANDLER(recreateDefaultStructure) {
+    (void)reply;
+    auto identity = STWRequestDecoder::concreteIdentityFromKeys(request, connection, {}, error);
+    if (identity)
+        connection.recreateDefaultStructureWithContainerIdentity(identity, error);
+}
+
+STW_COMMAND_HANDLER(recreateDefaultStructure2) { recreateDefaultStructure(request, reply, connection, error); }
 
 STW_COMMAND_HANDLER(retryTest) {
     (void)reply;

@@ -7,6 +7,7 @@
 #include "platform/STWIPCListener.h"
 #include "platform/STWKeybag.h"
 #include "platform/STWPlatformConfiguration.h"
+#include "platform/STWSandboxExtension.h"
 #include "platform/STWTransaction.h"
 
 #include <CLI/CLI.hpp>
@@ -189,6 +190,9 @@ int STWDaemon::main(int argc, char** argv) {
     std::error_code ec;
     std::filesystem::create_directories(configuration->runtimeDirectory(), ec);
     chmod(configuration->runtimeDirectory().c_str(), 0755);
+    // A fresh key per start: tokens of an earlier run stop verifying.
+    if (int e = STWSandboxExtension::createKey(STWSandboxExtension::keyFile()))
+        STW_LOG_ERROR(STWLogCategory::Sandbox, "Cannot create the sandbox extension key: %s", strerror(e));
     if (configuration->isDeveloperMode())
         STW_LOG_FAULT(STWLogCategory::Startup,
                       "Developer mode is on: clients may declare any identity (root prefix %@)",

@@ -9,9 +9,11 @@
 #include <memory>
 #include <semaphore.h>
 #include <system_error>
+#include <tuple>
 
 void STWCTLCommands::addAll(CLI::App& app) {
     _addRaw(app);
+    _addContainerCommands(app);
     _addDevice(app);
     app.require_subcommand(1);
 }
@@ -47,6 +49,77 @@ void STWCTLCommands::_addRaw(CLI::App& app) {
             return session.usageError(reason);
         return session.send(*message);
     });
+}
+
+// The container commands: create, lookup, list, metadata and recreate-structure.
+void STWCTLCommands::_addContainerCommands(CLI::App& app) {
+    struct Arguments {
+        std::string identifier;
+        uint64_t containerClass = 2;
+        std::string uuid;
+        std::string persona;
+        bool transient = false;
+        bool info = false;
+    };
+    auto arguments = std::make_shared<Arguments>();
+    auto addIdentity = [&](CLI::App* command, bool identifierRequired) {
+        CLI::Option* identifier = command->add_option("IDENTIFIER", arguments->identifier, "Container identifier");
+        if (identifierRequired)
+            identifier->required();
+        command->add_option("-c,--class", arguments->containerClass, "Container class (1 to 13)")
+            ->capture_default_str();
+    };
+    // Builds the message of `command` from the arguments that were given.
+    auto message = [arguments](uint64_t command, bool create) {
+        STWValue::Dictionary m{{"Command", STWValue(command)}, {"ContainerClass", STWValue(arguments->containerClass)}};
+        if (!arguments->identifier.empty())
+            m["Identifier"] = STWValue(arguments->identifier);
+        if (command == 0) {
+            m["CreateIfNecessary"] = STWValue(create);
+            m["Transient"] = STWValue(arguments->transient);
+        }
+        if (command == 1)
+            m["Transient"] = STWValue(arguments->transient);
+        if (!arguments->persona.empty())
+            m["PersonaUniqueString"] = STWValue(arguments->persona);
+        return m;
+    };
+
+    CLI::App* create = app.add_subcommand("create", "Create a container (or find the existing one)");
+    addIdentity(create, false);
+    create->add_flag("--transient", arguments->transient, "A transient container");
+    _onRun(create, [message](STWCTLSession& session) { return session.send(message(0, true)); });
+
+    CLI::App* lookup = app.add_subcommand("lookup", "Find an existing container");
+    addIdentity(lookup, false);
+    lookup->add_flag("--transient", arguments->transient, "A transient container");
+    _onRun(lookup, [message](STWCTLSession& session) { return session.send(message(0, false)); });
+
+    CLI::App* list = app.add_subcommand("list", "List the containers of a class");
+    list->add_option("-c,--class", arguments->containerClass, "Container class (1 to 13)")->capture_default_str();
+    list->add_flag("--transient", arguments->transient, "Transient containers");
+    _onRun(list, [message](STWCTLSession& session) { return session.send(message(1, false)); });
+
+    for (auto [name, command, help] : {std::tuple{"metadata", uint64_t{7}, "Show where a container is"},
+                                       std::tuple{"recreate-structure", uint64_t{8},
+                                                  "Create missing standard subdirectories"}}) {
+        CLI::App* sub = app.add_subcommand(name, help);
+        addIdentity(sub, true);
+        sub->add_option("--uuid", arguments->uuid, "The container's UUID (as created)")->required();
+        sub->add_option("--persona", arguments->persona, "Persona unique string of the container's user");
+        if (command == 7)
+            sub->add_flag("--info", arguments->info, "Include the info dictionary");
+        _onRun(sub, [message, arguments, command = command](STWCTLSession& session) {
+            STWValue::Dictionary m = message(command, false);
+            std::optional<STWUUID> uuid = STWUUID::fromString(arguments->uuid);
+            if (!uuid)
+                return session.usageError("\"" + arguments->uuid + "\" is not a UUID");
+            m["UUID"] = STWValue(*uuid);
+            if (command == 7)
+                m["InfoDictRequested"] = STWValue(arguments->info);
+            return session.send(m);
+        });
+    }
 }
 
 // device lock|unlock: the keybag state the daemon watches under its root.

@@ -22,6 +22,7 @@ private:
     void _onRun(CLI::App* command, Action action);
 
     void _addRaw(CLI::App& app);
+    void _addContainerCommands(CLI::App& app);
     void _addDevice(CLI::App& app);
 
     STWCTLSession& _session;

@@ -1,6 +1,7 @@
 #include "tests/e2e/STWDaemonProcess.h"
 
 #include "common/STWDictionaryUtilities.h"
+#include "common/STWPropertyList.h"
 #include "platform/STWPlatformConfiguration.h"
 
 #include <gtest/gtest.h>
@@ -12,7 +13,7 @@
 #include <thread>
 #include <unistd.h>
 
-STWDaemonProcess::STWDaemonProcess(STWValue::Dictionary settings) {
+STWDaemonProcess::STWDaemonProcess(STWValue::Dictionary settings, STWValue::Array personas) {
     char templ[] = "/tmp/stowly-e2e-XXXXXX";
     if (!mkdtemp(templ))
         abort();
@@ -23,6 +24,10 @@ STWDaemonProcess::STWDaemonProcess(STWValue::Dictionary settings) {
                                            "mobile:x:501:501:Mobile:/private/var/mobile:/bin/sh\n";
     std::ofstream(_root / "etc/group") << "root:x:0:\nmobile:x:501:\nsystemusers:x:950:mobile\n";
     if (!STW_writeToURL(settings, _root / "etc/stowly/stowlyd.plist", STWWriteAtomic, nullptr))
+        abort();
+    if (!personas.empty() && STWWriteFileAtomically(_root / "etc/stowly/personas.plist",
+                                                    STWPropertyList::serializeBinary(STWValue(personas)), 0644,
+                                                    false) != 0)
         abort();
 
     _pid = fork();
@@ -62,24 +67,29 @@ std::unique_ptr<STWClient> STWDaemonProcess::connect() {
 }
 
 std::unique_ptr<STWClient> STWDaemonProcess::connectAs(const std::string& identifier,
-                                                      STWValue::Dictionary entitlements) {
+                                                      STWValue::Dictionary entitlements, bool sandboxed,
+                                                      std::optional<std::string> persona) {
     auto client = connect();
     if (!client)
         return nullptr;
     STWErrorRef error;
-    auto code = client->hello({{"CodeSigningIdentifier", STWValue(identifier)},
+    STWValue::Dictionary hello{{"CodeSigningIdentifier", STWValue(identifier)},
                                {"Entitlements", STWValue(std::move(entitlements))},
-                               {"Sandboxed", STWValue(false)}},
-                              timeout, &error);
+                               {"Sandboxed", STWValue(sandboxed)}};
+    if (persona)
+        hello["PersonaUniqueString"] = STWValue(*persona);
+    auto code = client->hello(hello, timeout, &error);
     EXPECT_EQ(code.value_or(0), STWErrorSuccess);
     return client;
 }
 
-uint64_t STWDaemonProcess::replyError(STWClient& client, uint64_t command, STWValue::Dictionary keys) {
+STWValue::Dictionary STWDaemonProcess::send(STWClient& client, uint64_t command, STWValue::Dictionary keys) {
     keys["Command"] = STWValue(command);
     STWErrorRef error;
     auto reply = client.sendMessage(keys, timeout, &error);
-    if (!reply)
-        return 0;
-    return STWDictionaryUInt64(*reply, "ReplyError").value_or(0);
+    return reply ? *reply : STWValue::Dictionary{};
+}
+
+uint64_t STWDaemonProcess::replyError(STWClient& client, uint64_t command, STWValue::Dictionary keys) {
+    return STWDictionaryUInt64(send(client, command, std::move(keys)), "ReplyError").value_or(0);
 }
