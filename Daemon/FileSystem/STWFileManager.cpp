@@ -1005,10 +1005,13 @@ std::optional<fs::path> STWFileManager::createTemporaryDirectoryInDirectoryURL(c
                                                                                const std::string& withNamePrefix,
                                                                                STWErrorRef* error) const {
     STWSetError(error, nullptr);
-    std::string path = joinPath(pathString(url), STWFormat("%@XXXXXX", withNamePrefix));
+    std::string templ = joinPath(pathString(url), STWFormat("%@XXXXXX", withNamePrefix));
+    // mkdtemp() leaves its last attempt in the buffer when it fails; the error names the
+    // template that was asked for.
+    std::string path = templ;
     if (!mkdtemp(path.data())) {
         int e = errno;
-        STWSetError(error, STW_POSIX_ERROR(e, "Failed to create temp dir at path %s : %s", path, strerror(e)));
+        STWSetError(error, STW_POSIX_ERROR(e, "Failed to create temp dir at path %s : %s", templ, strerror(e)));
         return std::nullopt;
     }
     return fs::path(path);
