@@ -1005,10 +1005,13 @@ std::optional<fs::path> STWFileManager::createTemporaryDirectoryInDirectoryURL(c
                                                                                const std::string& withNamePrefix,
                                                                                STWErrorRef* error) const {
     STWSetError(error, nullptr);
-    std::string path = joinPath(pathString(url), STWFormat("%@XXXXXX", withNamePrefix));
+    std::string templ = joinPath(pathString(url), STWFormat("%@XXXXXX", withNamePrefix));
+    // mkdtemp() leaves its last attempt in the buffer when it fails; the error names the
+    // template that was asked for.
+    std::string path = templ;
     if (!mkdtemp(path.data())) {
         int e = errno;
-        STWSetError(error, STW_POSIX_ERROR(e, "Failed to create temp dir at path %s : %s", path, strerror(e)));
+        STWSetError(error, STW_POSIX_ERROR(e, "Failed to create temp dir at path %s : %s", templ, strerror(e)));
         return std::nullopt;
     }
     return fs::path(path);
@@ -1454,25 +1457,27 @@ STWFileDescriptor STWFileManager::openBeneath(int dirfd, const fs::path& relativ
 STWFileDescriptor STWFileManager::_openBeneathByComponents(int dirfd, const fs::path& relativePath, int flags,
                                                            mode_t mode, STWErrorRef* error) const {
     const std::string& path = relativePath.native();
-    auto fail = [&](int e) {
-        STWSetError(error, STW_POSIX_ERROR_NOLOG(e, "Failed to open %@ beneath descriptor %d: %s", path, dirfd,
-                                                 strerror(e)));
+    // Each failure site passes its own line; the error names this operation, not the lambda.
+    const char* function = __func__;
+    auto fail = [&](int e, uint64_t line) {
+        STWSetError(error, STWErrorCreate(STWPOSIXErrorDomain, e, function, line, nullptr, false,
+                                          "Failed to open %@ beneath descriptor %d: %s", path, dirfd, strerror(e)));
         return STWFileDescriptor();
     };
     // Absolute paths and ".." answer EXDEV, as RESOLVE_BENEATH does for an escape; this walk
     // does not follow "..", even where it would stay inside.
     if (hasPrefix(path, "/"))
-        return fail(EXDEV);
+        return fail(EXDEV, __LINE__);
     std::vector<std::string> components;
     for (const std::string& component : pathComponents(path)) {
         if (component == "..")
-            return fail(EXDEV);
+            return fail(EXDEV, __LINE__);
         if (component != ".")
             components.push_back(component);
     }
     if (components.empty()) {
         int fd = openat(dirfd, ".", flags | O_CLOEXEC, mode);
-        return fd < 0 ? fail(errno) : STWFileDescriptor(fd);
+        return fd < 0 ? fail(errno, __LINE__) : STWFileDescriptor(fd);
     }
     STWFileDescriptor current;
     int at = dirfd;
@@ -1485,11 +1490,11 @@ STWFileDescriptor STWFileManager::_openBeneathByComponents(int dirfd, const fs::
             if (e == ENOTDIR && fstatat(at, components[i].c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0 &&
                 S_ISLNK(st.st_mode))
                 e = ELOOP;
-            return fail(e);
+            return fail(e, __LINE__);
         }
         current.reset(fd);
         at = fd;
     }
     int fd = openat(at, components.back().c_str(), flags | O_NOFOLLOW | O_CLOEXEC, mode);
-    return fd < 0 ? fail(errno) : STWFileDescriptor(fd);
+    return fd < 0 ? fail(errno, __LINE__) : STWFileDescriptor(fd);
 }

@@ -79,6 +79,9 @@ public:
     // stays, but it still gets `owner` (as user and group id) and `dataProtectionClass`
     // unless they are STWFileManagerOwnerUnchanged / STWFileManagerClassUnchanged. A symbolic
     // link in place of the directory is refused when an owner or class is to be set.
+    // The owner-only and class-only forms are this one with the other argument
+    // unchanged: as overloads of their own they would differ only in an integer type, and
+    // a literal owner would silently pick the class form.
     bool createDirectoryAtURL(const std::filesystem::path& url, bool withIntermediateDirectories, mode_t mode,
                               uid_t owner, int32_t dataProtectionClass, STWErrorRef* error = nullptr) const;
     bool createDirectoryAtURL(const std::filesystem::path& url, bool withIntermediateDirectories, mode_t mode,

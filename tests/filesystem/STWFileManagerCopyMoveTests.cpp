@@ -72,6 +72,7 @@ void buildRichTree(const fs::path& src) {
     setACL(src / "dir", ACL_TYPE_DEFAULT, "u::rwx,g::r-x,g:950:rwx,m::rwx,o::---");
     fs::create_symlink("file", src / "link");
     fs::create_symlink("missing-target", src / "dangling");
+    ASSERT_EQ(mkfifo((src / "dir/fifo").c_str(), 0640), 0);
     if (geteuid() == 0) {
         ASSERT_EQ(lchown((src / "file").c_str(), 501, 502), 0);
         ASSERT_EQ(lchown((src / "link").c_str(), 502, 501), 0);
@@ -82,7 +83,7 @@ void buildRichTree(const fs::path& src) {
 void expectSameTree(const fs::path& src, const fs::path& dst) {
     EXPECT_EQ(readFile(dst / "file"), "contents");
     EXPECT_EQ(readFile(dst / "dir/nested/deep"), readFile(src / "dir/nested/deep"));
-    for (const char* item : {"file", "dir", "dir/nested", "dir/nested/deep", "link", "dangling"}) {
+    for (const char* item : {"file", "dir", "dir/nested", "dir/nested/deep", "dir/fifo", "link", "dangling"}) {
         struct stat a = lstatOf(src / item), b = lstatOf(dst / item);
         EXPECT_EQ(a.st_mode, b.st_mode) << item;
         EXPECT_EQ(a.st_uid, b.st_uid) << item;

@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
+#include <cstring>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -133,6 +134,12 @@ TEST_F(Items, CreatingAnExistingDirectoryStillSetsOwnerAndClass) {
     fs::path dir = scratch() / "a/b/c";
     ASSERT_TRUE(fm()->createDirectoryAtURL(dir, true, 0750));
     EXPECT_EQ(fs::status(dir).permissions() & fs::perms::all, fs::perms(0750));
+    // Intermediate directories can always be written and searched by their owner, or
+    // nothing could be made below them.
+    ASSERT_TRUE(fm()->createDirectoryAtURL(scratch() / "r/s/t", true, 0500));
+    EXPECT_EQ(fs::status(scratch() / "r").permissions() & fs::perms::all, fs::perms(0700));
+    EXPECT_EQ(fs::status(scratch() / "r/s").permissions() & fs::perms::all, fs::perms(0700));
+    EXPECT_EQ(fs::status(scratch() / "r/s/t").permissions() & fs::perms::all, fs::perms(0500));
 
     STWErrorRef error;
     EXPECT_FALSE(fm()->createDirectoryAtURL(scratch() / "x/y", false, 0755, &error));
@@ -232,9 +239,9 @@ TEST_F(Items, TraversalStopsOnVisitorAndEntryErrors) {
     EXPECT_TRUE(error->message().starts_with("Error for path ")) << error->message();
 }
 
-// What `du -s --block-size=1` says, or nullopt where it cannot be run.
+// What `du -s -x --block-size=1` says, or nullopt where it cannot be run.
 std::optional<uint64_t> duBytes(const fs::path& path) {
-    std::string command = "du -s --block-size=1 '" + path.native() + "' 2>/dev/null";
+    std::string command = "du -s -x --block-size=1 '" + path.native() + "' 2>/dev/null";
     FILE* pipe = popen(command.c_str(), "r");
     if (!pipe)
         return std::nullopt;
@@ -258,11 +265,24 @@ TEST_F(Items, DiskUsageCountsAllocatedBytesLikeDu) {
         fputc('s', f);
         fclose(f);
     }
+    // Another file system mounted inside is not counted, and not walked into.
+    std::optional<ScopedTmpfs> mount;
+    mount.emplace(tree / "a/mnt");
+    if (mount->mounted())
+        writeFile(tree / "a/mnt/elsewhere", std::string(4 << 20, 'e'));
+    else
+        mount.reset();
     auto expected = duBytes(tree);
     if (!expected)
         GTEST_SKIP() << "du is not available";
     EXPECT_EQ(fm()->diskUsageForURL(tree), *expected);
-    EXPECT_LT(fm()->diskUsageForURL(tree), 10u << 20);
+    EXPECT_LT(fm()->diskUsageForURL(tree), 3u << 20);
+    bool crossed = false;
+    ASSERT_TRUE(fm()->_traverseDirectory(tree, nullptr, [&](FTSENT* entry, STWErrorRef*) {
+        crossed |= strcmp(entry->fts_name, "elsewhere") == 0;
+        return true;
+    }));
+    EXPECT_FALSE(crossed);
 
     STWTestRoot::shared().writeSettings({{"Features", STWValue(STWValue::Dictionary{
                                                           {"fast_container_sizing", STWValue(true)}})}});
