@@ -1,6 +1,6 @@
 // What the file layer tells its callers and the log: the exact POSIX errors that are
 // passed on to clients unchanged, and the orphan listing the start-up cleanup records.
-#include "Daemon/FileSystem/STWKeybag.h"
+#include "platform/STWKeybag.h"
 #include "common/STWFileIO.h"
 #include "common/STWLog.h"
 #include "tests/filesystem/STWFileSystemTestSupport.h"
