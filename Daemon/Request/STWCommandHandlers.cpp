@@ -1,10 +1,13 @@
 #include "Daemon/Request/STWCommandHandlers.h"
 
+#include "Daemon/Lifecycle/STWTestLocks.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Request/STWClientConnection.h"
 #include "Daemon/Request/STWRequestDecoder.h"
 #include "common/STWError.h"
 #include "common/STWLog.h"
+
+#include <mutex>
 
 namespace STWCommandHandlers {
 
@@ -135,8 +138,40 @@ STW_COMMAND_HANDLER(setTestLock) {
         STW_LOG_ERROR(STWLogCategory::Tolvan, "Unsupported call to set lock!");
         return;
     }
-    (void)request;
-    _operationNotInThisBuild("setTestLock", error);
+    // Which test locks this command holds, one bit per lock, across requests.
+    static std::mutex heldLock;
+    static uint32_t held = 0;
+    uint64_t lock = STWDictionaryUInt64(request, "TestLock").value_or(0);
+    bool enable = STWDictionaryBool(request, "Enable");
+    auto testLocks = STWTestLocks::sharedInstance();
+    std::lock_guard guard(heldLock);
+    if (lock == STWTestLocks::lockCount && !enable) {
+        testLocks->setEnabled(false);
+        return;
+    }
+    if (lock >= STWTestLocks::lockCount) {
+        *error = STWErrorInvalidArgument;
+        return;
+    }
+    uint32_t bit = 1u << lock;
+    if (enable) {
+        if (held & bit)
+            return;
+        testLocks->setEnabled(true);
+        if (!testLocks->acquireLock(lock)) {
+            *error = STWErrorInvalidArgument;
+            return;
+        }
+        held |= bit;
+        return;
+    }
+    if (!(held & bit))
+        return;
+    // The two daemon-wide locks are one bit pair: releasing either clears both.
+    held &= lock <= 1 ? ~3u : ~bit;
+    testLocks->releaseLock(lock);
+    if (held == 0)
+        testLocks->setEnabled(false);
 }
 
 } // namespace STWCommandHandlers

@@ -227,3 +227,27 @@ TEST_F(STWContainerCommandsTest, DataContainersAreMappedForTheSandboxAndBundlesA
     EXPECT_TRUE(targets.count(path(data)));
     EXPECT_FALSE(targets.count(path(bundle)));
 }
+
+// On internal builds a test client can hold the daemon-wide write lock; creation waits
+// for it, and releasing the lock lets the waiting request through.
+TEST(STWTestLockCommand, DaemonWideWriteLockParksCreationUntilReleased) {
+    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}});
+    STWValue::Dictionary tester{{"com.vorlane.private.Stowly.testability", STWValue(true)}};
+    auto control = daemon.connectAs("com.example.tester", tester);
+    ASSERT_NE(control, nullptr);
+    ASSERT_EQ(STWDaemonProcess::replyError(*control, 31, {{"TestLock", STWValue(1)}, {"Enable", STWValue(true)}}),
+              STWErrorSuccess);
+    std::atomic<uint64_t> result{0};
+    std::thread creator([&] {
+        auto client = daemon.connectAs("com.example.installer", allowed);
+        result = STWDaemonProcess::replyError(*client, 0, createKeys("com.example.parked", 2));
+    });
+    std::this_thread::sleep_for(std::chrono::milliseconds(300));
+    EXPECT_EQ(result.load(), 0u); // still waiting for the lock
+    EXPECT_EQ(STWDaemonProcess::replyError(*control, 31, {{"TestLock", STWValue(1)}, {"Enable", STWValue(false)}}),
+              STWErrorSuccess);
+    creator.join();
+    EXPECT_EQ(result.load(), STWErrorSuccess);
+    EXPECT_EQ(STWDaemonProcess::replyError(*control, 31, {{"TestLock", STWValue(7)}, {"Enable", STWValue(true)}}),
+              STWErrorInvalidArgument);
+}
