@@ -1,5 +1,7 @@
 #include "client/STWClient.h"
 
+#include "common/STWException.h"
+
 #include "common/STWLog.h"
 #include "platform/STWIPCFrame.h"
 
@@ -7,12 +9,10 @@
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
-#include <cxxabi.h>
 #include <exception>
 #include <poll.h>
 #include <sys/socket.h>
 #include <sys/un.h>
-#include <typeinfo>
 #include <unistd.h>
 
 // Errors are handed to the caller, who decides whether they are worth logging; a client
@@ -42,30 +42,6 @@ int pollTimeout(std::optional<std::chrono::steady_clock::time_point> deadline) {
         return -1;
     auto left = std::chrono::ceil<std::chrono::milliseconds>(*deadline - std::chrono::steady_clock::now());
     return static_cast<int>(std::clamp<int64_t>(left.count(), 0, 24 * 3600 * 1000));
-}
-
-std::string exceptionName(const std::type_info& type) {
-    int status = 0;
-    char* demangled = abi::__cxa_demangle(type.name(), nullptr, nullptr, &status);
-    std::string name = status == 0 && demangled ? demangled : type.name();
-    free(demangled);
-    return name;
-}
-
-// Exceptions (an allocation failure, a thread that cannot start) stop at the edge of a
-// client operation as the usual code 40 error.
-STWErrorRef errorForCurrentException(const char* function, uint64_t line) {
-    std::string name = "unknown exception";
-    std::string reason;
-    try {
-        throw;
-    } catch (const std::exception& e) {
-        name = exceptionName(typeid(e));
-        reason = e.what();
-    } catch (...) {
-    }
-    return STWErrorCreate(STWErrorDomain, STWErrorException, function, line, nullptr, true,
-                          "Got exception: %@ : %@", name, reason);
 }
 
 } // namespace
@@ -115,14 +91,14 @@ std::unique_ptr<STWClient> STWClient::connect(const std::filesystem::path& socke
         client.reset(new STWClient(fd));
     } catch (...) {
         close(fd);
-        STWSetError(error, errorForCurrentException(__func__, __LINE__));
+        STWSetError(error, STWErrorForCurrentException(__func__, __LINE__, false));
         return nullptr;
     }
     try {
         client->_reader = std::thread([c = client.get()] { c->_readReplies(); });
     } catch (...) {
         // The destructor closes the socket.
-        STWSetError(error, errorForCurrentException(__func__, __LINE__));
+        STWSetError(error, STWErrorForCurrentException(__func__, __LINE__, false));
         return nullptr;
     }
     return client;
@@ -148,7 +124,7 @@ std::optional<uint64_t> STWClient::hello(const STWValue::Dictionary& identity,
     try {
         reply = _exchange(STWFrameKindHello, identity, timeout, error);
     } catch (...) {
-        STWSetError(error, errorForCurrentException(__func__, __LINE__));
+        STWSetError(error, STWErrorForCurrentException(__func__, __LINE__, false));
     }
     if (!reply)
         return std::nullopt;
@@ -167,7 +143,7 @@ std::optional<STWValue::Dictionary> STWClient::sendMessage(const STWValue::Dicti
     try {
         return _exchange(STWFrameKindRequest, message, timeout, error);
     } catch (...) {
-        STWSetError(error, errorForCurrentException(__func__, __LINE__));
+        STWSetError(error, STWErrorForCurrentException(__func__, __LINE__, false));
         return std::nullopt;
     }
 }

@@ -4,13 +4,10 @@
 #include "Daemon/FileSystem/STWFileManager.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
+#include "common/STWException.h"
 #include "common/STWLog.h"
 #include "platform/STWSandboxMappingStore.h"
 
-#include <cxxabi.h>
-#include <execinfo.h>
-#include <pthread.h>
-#include <typeinfo>
 #include <unordered_set>
 
 namespace fs = std::filesystem;
@@ -23,61 +20,14 @@ void signpost(const char* interval, bool begin, STWContainerClass containerClass
     STW_LOG_DEBUG(STWLogCategory::Cache, "%s %s %llu", begin ? "begin" : "end", interval, containerClass);
 }
 
-std::string exceptionName(const std::type_info& type) {
-    int status = 0;
-    char* demangled = abi::__cxa_demangle(type.name(), nullptr, nullptr, &status);
-    std::string name = status == 0 && demangled ? demangled : type.name();
-    free(demangled);
-    return name;
-}
-
-// On an internal image an exception inside the cache is a bug to be fixed, not an error to
-// report: the daemon stops with the report as its crash message.
-[[noreturn]] void terminateWithUncaughtExceptionReport(const char* function, const std::string& name,
-                                                       const std::string& reason) {
-    std::string report = "** INTERNAL ERROR: Uncaught Exception **\nException: ";
-    char threadName[64] = {};
-    if (pthread_getname_np(pthread_self(), threadName, sizeof threadName) == 0 && threadName[0])
-        report += STWFormat("<%s> ", threadName);
-    if (!name.empty())
-        report += name + ": ";
-    report += reason;
-    report += "\nStack:\n";
-    void* frames[64];
-    int count = backtrace(frames, 64);
-    if (char** symbols = backtrace_symbols(frames, count)) {
-        for (int i = 0; i < count; ++i)
-            report += std::string(symbols[i]) + (i + 1 < count ? "\n" : "");
-        free(symbols);
-    }
-    STWLog::fatal(function, report);
-}
-
-// Turns the exception being handled into the code 40 error of the operation's edge.
-STWErrorRef errorForCurrentException(const char* function, uint64_t line) {
-    std::string name;
-    std::string reason;
-    try {
-        throw;
-    } catch (const std::exception& e) {
-        name = exceptionName(typeid(e));
-        reason = e.what();
-    } catch (...) {
-        name = "unknown exception";
-    }
-    if (STWGlobalConfiguration::sharedInstance()->isInternalImage())
-        terminateWithUncaughtExceptionReport(function, name, reason);
-    return STWErrorCreate(STWErrorDomain, STWErrorException, function, line, nullptr, true, "Got exception: %@ : %@",
-                          name, reason);
-}
-
 // Runs one public operation, so that no exception leaves it.
 template <class Result, class Body>
 Result guarded(const char* function, uint64_t line, STWErrorRef* error, Result failure, Body&& body) {
     try {
         return body();
     } catch (...) {
-        STWSetError(error, errorForCurrentException(function, line));
+        STWSetError(error, STWErrorForCurrentException(function, line,
+                                                       STWGlobalConfiguration::sharedInstance()->isInternalImage()));
         return failure;
     }
 }

@@ -7,6 +7,7 @@
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
 #include "Daemon/Request/STWDaemon.h"
 #include "Daemon/STWLocks.h"
+#include "common/STWException.h"
 #include "common/STWLog.h"
 #include "platform/STWContainerLibrary.h"
 #include "platform/STWPlatformConfiguration.h"
@@ -140,11 +141,8 @@ template <class T>
 T catchingExceptions(const char* function, uint64_t* error, T failure, const std::function<T()>& body) {
     try {
         return body();
-    } catch (const std::exception& e) {
-        if (STWGlobalConfiguration::sharedInstance()->isInternalImage())
-            STWLog::fatal(function, STWFormat("** INTERNAL ERROR: Uncaught Exception **\nException: %s\nStack:\n",
-                                              e.what()));
-        auto exceptionError = STW_ERROR(STWErrorException, nullptr, "Got exception: %@ : %@", "std::exception", e.what());
+    } catch (...) {
+        STWErrorForCurrentException(function, __LINE__, STWGlobalConfiguration::sharedInstance()->isInternalImage());
         *error = STWErrorException;
         return failure;
     }
