@@ -72,6 +72,10 @@ void STWIPCListener::stop() {
     }
     for (const auto& peer : connections)
         peer->cancel();
+    // The connection threads refer to this listener: give those still finishing a request
+    // time to end before it goes away.
+    std::unique_lock guard(_lock);
+    _connectionsGone.wait_for(guard, std::chrono::seconds(10), [&] { return _lock_connections.empty(); });
 }
 
 size_t STWIPCListener::connectionCount() const {
@@ -115,6 +119,8 @@ void STWIPCListener::_connectionChanged(const std::shared_ptr<STWPeerConnection>
     else
         _lock_connections.erase(peer);
     _lock_lastConnectionChange = std::chrono::steady_clock::now();
+    if (_lock_connections.empty())
+        _connectionsGone.notify_all();
 }
 
 void STWIPCListener::_serve(std::shared_ptr<STWPeerConnection> peer) {

@@ -11,6 +11,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <condition_variable>
 #include <filesystem>
 #include <functional>
 #include <memory>
@@ -65,6 +66,7 @@ private:
     std::thread _acceptThread;
 
     mutable std::mutex _lock;
+    std::condition_variable _connectionsGone;
     std::set<std::shared_ptr<STWPeerConnection>> _lock_connections;
     std::chrono::steady_clock::time_point _lock_lastConnectionChange = std::chrono::steady_clock::now();
 };
