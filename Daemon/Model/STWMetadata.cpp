@@ -17,7 +17,15 @@ constexpr const char* kInfoKey = "STWMetadataInfo";
 constexpr const char* kAssetsDirKey = "STWMetadataUserManagedAssetsDirName";
 constexpr const char* kPersonaKey = "STWMetadataPersona";
 
-STWFormatArg describe(const STWValue* v) { return v ? STWFormatArg(*v) : STWFormatArg(nullptr); }
+// A value found in a file as the messages show it: a string as its text, anything else as
+// its description, an absent value as "(null)".
+STWFormatArg describe(const STWValue* v) {
+    if (!v)
+        return STWFormatArg(nullptr);
+    if (const std::string* text = v->string())
+        return STWFormatArg(*text);
+    return STWFormatArg(*v);
+}
 
 } // namespace
 
@@ -68,8 +76,9 @@ bool STWMetadata::writeMetadataToFileURL(const std::filesystem::path& fileURL, S
     STW_LOG_DEBUG(STWLogCategory::Metadata, "[%s] Writing metadata to [%@]: %@ => %@", __func__, fileURL, *this,
                   STWValue(dictionary));
     STWErrorRef writeError;
-    // Durable: the file's bytes reach the disk before the rename makes them visible.
-    if (!STW_writeToURL(dictionary, temp, STWWriteDurable | STWWriteNoFileProtection, &writeError)) {
+    // Not synced here: the durable move below syncs the file before the rename makes it
+    // visible, and the directory after it; syncing twice would only double the cost.
+    if (!STW_writeToURL(dictionary, temp, STWWriteNoFileProtection, &writeError)) {
         STWSetError(error, STW_ERROR(STWErrorWriteFileFailed, writeError,
                                      "Failed to write metadata dictionary to URL %@ : %@:%ld", temp,
                                      writeError->domain(), writeError->code()));
@@ -118,7 +127,7 @@ std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtFileUrl(const
     }
     std::optional<STWUUID> uuid = STWUUID::fromString(*uuidValue->string());
     if (!uuid) {
-        STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata UUID: %@ at %@", *uuidValue,
+        STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata UUID: %@ at %@", describe(uuidValue),
                                      fileURL));
         return nullptr;
     }
@@ -142,14 +151,15 @@ std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtFileUrl(const
     if (!STWUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
         userIdentity = STWUserIdentityCache::defaultUserIdentity();
     } else {
-        uid_t expectedOwner = forUserIdentity->posixUIDForContainerClass(containerClass);
+        // Without an expected identity no owner can match (and no stored identity either).
+        uid_t expectedOwner = forUserIdentity ? forUserIdentity->posixUIDForContainerClass(containerClass) : 0;
         if (STWContainerClassIsPerUser(containerClass)) {
             const STWValue* persona = STWDictionaryFind(plist, kPersonaKey);
             if (!persona) {
                 plist[kPersonaKey] = STWValue(expectedOwner);
             } else if (persona->uint64Value() != static_cast<uint64_t>(expectedOwner)) {
                 STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Incorrect UserId: %@, expecting: %u for %@ at %@",
-                                             *persona, expectedOwner, identifier, fileURL));
+                                             describe(persona), expectedOwner, identifier, fileURL));
                 return nullptr;
             }
         }
@@ -179,7 +189,7 @@ std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtFileUrl(const
     std::optional<STWValue::Dictionary> info;
     if (const STWValue* infoValue = STWDictionaryFind(plist, kInfoKey)) {
         if (!infoValue->dictionary()) {
-            STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata Info: %@ at %@", *infoValue,
+            STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata Info: %@ at %@", describe(infoValue),
                                          fileURL));
             return nullptr;
         }
@@ -189,7 +199,7 @@ std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtFileUrl(const
     if (const STWValue* assets = STWDictionaryFind(plist, kAssetsDirKey)) {
         if (!assets->string()) {
             STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr,
-                                         "Invalid metadata User Managed Dir Name String: %@ at %@", *assets, fileURL));
+                                         "Invalid metadata User Managed Dir Name String: %@ at %@", describe(assets), fileURL));
             return nullptr;
         }
         assetsDirName = *assets->string();
