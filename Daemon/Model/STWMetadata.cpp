@@ -27,6 +27,32 @@ STWFormatArg describe(const STWValue* v) {
     return STWFormatArg(*v);
 }
 
+// The last component of `path`, which loses it (and the separators before it).
+std::string_view popComponent(std::string_view& path) {
+    while (!path.empty() && path.back() == '/')
+        path.remove_suffix(1);
+    size_t slash = path.rfind('/');
+    std::string_view last = slash == std::string_view::npos ? path : path.substr(slash + 1);
+    path = slash == std::string_view::npos ? std::string_view() : path.substr(0, slash);
+    return last;
+}
+
+// Whether the directory that holds `container` is the class directory of `containerClass`:
+// the container's path minus its last three components, plus the class directory name
+// (which always has two components). Compared as the two components that precede the
+// container's own name, so the check reads the path text without building new paths;
+// it runs for every container the cache finds.
+bool isInClassDirectory(std::string_view container, STWContainerClass containerClass) {
+    std::string_view name = STWContainerClassDirectoryName(containerClass);
+    size_t slash = name.find('/');
+    if (slash == std::string_view::npos)
+        return false;
+    popComponent(container);
+    std::string_view kind = popComponent(container);
+    std::string_view scope = popComponent(container);
+    return !kind.empty() && scope == name.substr(0, slash) && kind == name.substr(slash + 1);
+}
+
 } // namespace
 
 STWMetadata::STWMetadata(const STWConcreteContainerIdentityRef& containerIdentity,
@@ -96,13 +122,24 @@ bool STWMetadata::writeMetadataToFileURL(const std::filesystem::path& fileURL, S
 std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtUrl(const std::filesystem::path& containerURL,
                                                                        const STWUserIdentityRef& forUserIdentity,
                                                                        bool checkClassPath, STWErrorRef* error) {
-    return readAndValidateMetadataAtFileUrl(containerURL / fileName, forUserIdentity, checkClassPath, error);
+    // The container cache reads every container this way; the directory is at hand, so it
+    // is not derived again from the file's path (unless it was given with a trailing
+    // separator, which the record's url must not keep).
+    if (!containerURL.has_filename())
+        return readAndValidateMetadataAtFileUrl(containerURL / fileName, forUserIdentity, checkClassPath, error);
+    return _readAndValidateMetadata(containerURL / fileName, containerURL, forUserIdentity, checkClassPath, error);
 }
 
 std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtFileUrl(const std::filesystem::path& fileURL,
                                                                            const STWUserIdentityRef& forUserIdentity,
                                                                            bool checkClassPath, STWErrorRef* error) {
-    std::filesystem::path container = fileURL.parent_path();
+    return _readAndValidateMetadata(fileURL, fileURL.parent_path(), forUserIdentity, checkClassPath, error);
+}
+
+std::shared_ptr<STWMetadata> STWMetadata::_readAndValidateMetadata(const std::filesystem::path& fileURL,
+                                                                   const std::filesystem::path& container,
+                                                                   const STWUserIdentityRef& forUserIdentity,
+                                                                   bool checkClassPath, STWErrorRef* error) {
     // The container's owner may replace the file; never follow a link it put there.
     auto read = STW_dictionaryWithContentsOfURL(fileURL, STWReadNoFollow, nullptr);
     if (!read) {
@@ -205,14 +242,12 @@ std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtFileUrl(const
         assetsDirName = *assets->string();
     }
 
-    if (checkClassPath) {
+    if (checkClassPath && !isInClassDirectory(container.native(), containerClass)) {
         std::filesystem::path expected = container.parent_path().parent_path().parent_path() /
                                          STWContainerClassDirectoryName(containerClass);
-        if (container.parent_path() != expected) {
-            STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata-URLs should match: %@ : %@",
-                                         fileURL, expected));
-            return nullptr;
-        }
+        STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata-URLs should match: %@ : %@",
+                                     fileURL, expected));
+        return nullptr;
     }
 
     uint64_t identityCode = STWErrorSuccess;

@@ -63,6 +63,12 @@ public:
                                                                          bool checkClassPath, STWErrorRef* error);
 
 private:
+    // `container` is the directory that holds `fileURL`.
+    static std::shared_ptr<STWMetadata> _readAndValidateMetadata(const std::filesystem::path& fileURL,
+                                                                 const std::filesystem::path& container,
+                                                                 const STWUserIdentityRef& forUserIdentity,
+                                                                 bool checkClassPath, STWErrorRef* error);
+
     bool _transient = false;
     bool _existed = false;
     STWContainerClass _containerClass;

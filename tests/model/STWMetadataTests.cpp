@@ -231,4 +231,30 @@ TEST_F(STWMetadataTest, AWriteIsOnDiskBeforeItIsAcknowledged) {
     EXPECT_LT(bytes, rename);
 }
 
+TEST_F(STWMetadataTest, TheClassDirectoryIsCheckedOnThePathAsGiven) {
+    ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
+    STWErrorRef error;
+    // A trailing separator or a doubled one names the same directory.
+    auto slash = STWMetadata::readAndValidateMetadataAtUrl(container.string() + "/", mobile, true, &error);
+    ASSERT_TRUE(slash) << error->description();
+    EXPECT_EQ(slash->url(), container);
+    std::filesystem::path doubled = classDirectory.parent_path().string() + "//Application/" + uuid.string();
+    ASSERT_TRUE(STWMetadata::readAndValidateMetadataAtUrl(doubled, mobile, true, &error)) << error->description();
+    ASSERT_TRUE(STWMetadata::readAndValidateMetadataAtFileUrl(container / STWMetadata::fileName, mobile, true, &error));
+
+    // One level short ("Containers/Application/UUID") or one level too deep is not the class directory.
+    for (const std::filesystem::path& misplaced :
+         {classDirectory.parent_path().parent_path() / "Application" / uuid.string(),
+          classDirectory / "Nested" / uuid.string()}) {
+        std::filesystem::create_directories(misplaced);
+        std::filesystem::copy_file(container / STWMetadata::fileName, misplaced / STWMetadata::fileName);
+        error.reset();
+        EXPECT_FALSE(STWMetadata::readAndValidateMetadataAtUrl(misplaced, mobile, true, &error)) << misplaced;
+        ASSERT_TRUE(error);
+        EXPECT_NE(error->message().find("Invalid metadata-URLs should match:"), std::string::npos);
+        EXPECT_TRUE(STWMetadata::readAndValidateMetadataAtUrl(misplaced, mobile, false, nullptr));
+        std::filesystem::remove_all(misplaced);
+    }
+}
+
 } // namespace
