@@ -2,7 +2,9 @@
 
 #include <climits>
 #include <cstdlib>
+#include <cstring>
 #include <memory>
+#include <vector>
 #include <plist/plist.h>
 
 namespace {
@@ -158,6 +160,212 @@ std::optional<STWValue> fromPlist(plist_t node, int depth) {
     return std::nullopt;
 }
 
+// Binary property lists read straight into STWValue.
+//
+// Every container's metadata file is a small binary property list, and the container
+// cache reads all of them; building libplist's node tree only to copy it into STWValue
+// allocates everything twice. This reader covers what the daemon writes (booleans,
+// integers of up to eight bytes, reals, ASCII strings, data, arrays and dictionaries with
+// ASCII keys) and declines everything else: other object types, strings holding a NUL,
+// reference cycles, offsets or lengths it does not like, more work than the file's size
+// justifies. A declined file goes to libplist as before, so what parse() answers is
+// always what libplist answers; the reader only ever accepts a subset of what libplist
+// accepts, with the same values.
+class BinaryReader {
+public:
+    // False when the bytes are not a binary property list this reader takes on.
+    bool read(std::string_view bytes, STWValue& out) {
+        static constexpr size_t kHeader = 8, kTrailer = 32;
+        if (bytes.size() < kHeader + kTrailer || bytes.compare(0, kHeader, "bplist00") != 0)
+            return false;
+        _base = reinterpret_cast<const uint8_t*>(bytes.data());
+        const uint8_t* trailer = _base + bytes.size() - kTrailer;
+        _offsetSize = trailer[6];
+        _refSize = trailer[7];
+        _numObjects = bigEndian(trailer + 8, 8);
+        uint64_t root = bigEndian(trailer + 16, 8);
+        _offsetTable = bigEndian(trailer + 24, 8);
+        uint64_t tableEnd = bytes.size() - kTrailer;
+        if (_offsetSize < 1 || _offsetSize > 8 || _refSize < 1 || _refSize > 8 || _numObjects == 0 ||
+            root >= _numObjects || _offsetTable < kHeader || _offsetTable >= tableEnd ||
+            _numObjects > (tableEnd - _offsetTable) / _offsetSize)
+            return false;
+        // Shared objects (libplist's writer shares equal values) are read once per use;
+        // a file whose references fan out further than this is left to libplist.
+        _budget = 8 * _numObjects + 256;
+        return _object(root, 0, out);
+    }
+
+private:
+    static uint64_t bigEndian(const uint8_t* p, unsigned n) {
+        uint64_t v = 0;
+        for (unsigned i = 0; i < n; ++i)
+            v = v << 8 | p[i];
+        return v;
+    }
+
+    // The count of a data, string, array or dictionary object at `p`: the marker's low
+    // nibble, or for 0xF an integer object of up to eight bytes that follows.
+    bool _count(uint8_t info, const uint8_t*& p, const uint8_t* end, uint64_t& count) {
+        if (info != 0xF) {
+            count = info;
+            return true;
+        }
+        if (p >= end || (*p & 0xF0) != 0x10 || (*p & 0x0F) > 3)
+            return false;
+        unsigned n = 1u << (*p & 0x0F);
+        ++p;
+        if (static_cast<uint64_t>(end - p) < n)
+            return false;
+        count = bigEndian(p, n);
+        p += n;
+        return true;
+    }
+
+    // Finds the object at `index`: `p` just past its marker, `end` the end of the object
+    // area. False for an index, offset, depth or reference libplist would refuse, and for
+    // a file that has used up its budget.
+    bool _locate(uint64_t index, int depth, const uint8_t*& p, const uint8_t*& end, uint8_t& type, uint8_t& info) {
+        if (index >= _numObjects || depth > kMaxDepth || _budget == 0)
+            return false;
+        --_budget;
+        for (uint64_t ancestor : _path)
+            if (ancestor == index)
+                return false;
+        uint64_t offset = bigEndian(_base + _offsetTable + index * _offsetSize, _offsetSize);
+        if (offset < 8 || offset >= _offsetTable)
+            return false;
+        p = _base + offset;
+        end = _base + _offsetTable;
+        type = *p & 0xF0;
+        info = *p & 0x0F;
+        ++p;
+        return true;
+    }
+
+    // An ASCII string without NUL (libplist ends a string at its first NUL; such rare files
+    // are its to read).
+    bool _string(uint8_t info, const uint8_t* p, const uint8_t* end, std::string& out) {
+        uint64_t count;
+        if (!_count(info, p, end, count) || count > static_cast<uint64_t>(end - p) || memchr(p, 0, count))
+            return false;
+        out.assign(reinterpret_cast<const char*>(p), count);
+        return true;
+    }
+
+    bool _key(uint64_t index, int depth, std::string& out) {
+        const uint8_t *p, *end;
+        uint8_t type, info;
+        return _locate(index, depth, p, end, type, info) && type == 0x50 && _string(info, p, end, out);
+    }
+
+    // The object at `index`, or false to leave the whole file to libplist.
+    bool _object(uint64_t index, int depth, STWValue& out) {
+        const uint8_t *p, *end;
+        uint8_t type, info;
+        if (!_locate(index, depth, p, end, type, info))
+            return false;
+        switch (type) {
+        case 0x00:
+            if (info != 0x8 && info != 0x9)
+                return false;
+            out = STWValue(info == 0x9);
+            return true;
+        case 0x10: {
+            if (info > 3)
+                return false;
+            unsigned n = 1u << info;
+            if (static_cast<uint64_t>(end - p) < n)
+                return false;
+            uint64_t u = bigEndian(p, n);
+            if (u > static_cast<uint64_t>(INT64_MAX))
+                out = STWValue(static_cast<int64_t>(u));
+            else
+                out = STWValue(u);
+            return true;
+        }
+        case 0x20: {
+            if (info != 2 && info != 3)
+                return false;
+            unsigned n = 1u << info;
+            if (static_cast<uint64_t>(end - p) < n)
+                return false;
+            uint64_t bits = bigEndian(p, n);
+            if (n == 4) {
+                float f;
+                uint32_t b32 = static_cast<uint32_t>(bits);
+                memcpy(&f, &b32, sizeof f);
+                out = STWValue(static_cast<double>(f));
+            } else {
+                double d;
+                memcpy(&d, &bits, sizeof d);
+                out = STWValue(d);
+            }
+            return true;
+        }
+        case 0x40: {
+            uint64_t count;
+            if (!_count(info, p, end, count) || count > static_cast<uint64_t>(end - p))
+                return false;
+            out = STWValue(STWData(p, p + count));
+            return true;
+        }
+        case 0x50: {
+            std::string text;
+            if (!_string(info, p, end, text))
+                return false;
+            out = STWValue(std::move(text));
+            return true;
+        }
+        case 0xA0: {
+            uint64_t count;
+            // Every element costs at least one unit of the budget: a count beyond it is
+            // declined before anything is allocated for it.
+            if (!_count(info, p, end, count) || count > static_cast<uint64_t>(end - p) / _refSize ||
+                count > _budget)
+                return false;
+            out = STWValue(STWValue::Array());
+            STWValue::Array& array = *out.mutableArray();
+            array.resize(count);
+            _path.push_back(index);
+            for (uint64_t i = 0; i < count; ++i)
+                if (!_object(bigEndian(p + i * _refSize, _refSize), depth + 1, array[i]))
+                    return false;
+            _path.pop_back();
+            return true;
+        }
+        case 0xD0: {
+            uint64_t count;
+            if (!_count(info, p, end, count) || count > static_cast<uint64_t>(end - p) / _refSize / 2 ||
+                count > _budget / 2)
+                return false;
+            out = STWValue(STWValue::Dictionary());
+            STWValue::Dictionary& dictionary = *out.mutableDictionary();
+            _path.push_back(index);
+            for (uint64_t i = 0; i < count; ++i) {
+                std::string key;
+                if (!_key(bigEndian(p + i * _refSize, _refSize), depth + 1, key))
+                    return false;
+                // Writers emit keys in order, so the end is the usual place; a repeated
+                // key keeps the last value, as the libplist route does.
+                STWValue& slot = dictionary.insert_or_assign(dictionary.end(), std::move(key), STWValue())->second;
+                if (!_object(bigEndian(p + (count + i) * _refSize, _refSize), depth + 1, slot))
+                    return false;
+            }
+            _path.pop_back();
+            return true;
+        }
+        default:
+            return false;
+        }
+    }
+
+    const uint8_t* _base = nullptr;
+    uint64_t _numObjects = 0, _offsetTable = 0, _budget = 0;
+    unsigned _offsetSize = 0, _refSize = 0;
+    std::vector<uint64_t> _path;
+};
+
 template <void (*Encode)(plist_t, char**, uint32_t*), void (*Free)(char*)>
 std::string serialize(const STWValue& value) {
     PlistPtr root(toPlist(value));
@@ -177,6 +385,21 @@ std::string serialize(const STWValue& value) {
 namespace STWPropertyList {
 
 std::optional<STWValue> parse(std::string_view bytes) {
+    if (bytes.empty() || bytes.size() > UINT32_MAX)
+        return std::nullopt;
+    if (auto value = _parseBinaryDirectly(bytes))
+        return value;
+    return _parseWithLibplist(bytes);
+}
+
+std::optional<STWValue> _parseBinaryDirectly(std::string_view bytes) {
+    STWValue value;
+    if (!BinaryReader().read(bytes, value))
+        return std::nullopt;
+    return value;
+}
+
+std::optional<STWValue> _parseWithLibplist(std::string_view bytes) {
     if (bytes.empty() || bytes.size() > UINT32_MAX)
         return std::nullopt;
     plist_t root = nullptr;

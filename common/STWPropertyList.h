@@ -16,7 +16,14 @@
 namespace STWPropertyList {
 
 // Parses XML or binary property-list bytes; nullopt when they are not a property list.
+// Binary property lists of the common kinds are read directly; everything else goes
+// through libplist, whose answer is the reference.
 std::optional<STWValue> parse(std::string_view bytes);
+// The two routes of parse(), for the tests and the fuzzer that hold them to each other:
+// the direct reader of binary property lists (nullopt when it declines the bytes) and
+// libplist, the reference whose answer parse() gives.
+std::optional<STWValue> _parseBinaryDirectly(std::string_view bytes);
+std::optional<STWValue> _parseWithLibplist(std::string_view bytes);
 std::string serializeBinary(const STWValue& value);
 std::string serializeXML(const STWValue& value);
 

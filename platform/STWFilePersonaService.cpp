@@ -84,9 +84,9 @@ std::vector<STWPersonaRecord> STWFilePersonaService::personaList() {
     return recordsFromPlist(*root);
 }
 
-void STWFilePersonaService::registerForPersonaListUpdates(const std::string& observerName,
-                                                          std::function<void()> onUpdate,
-                                                          std::function<void(STWErrorRef)> completion) {
+int STWFilePersonaService::registerForPersonaListUpdates(const std::string& observerName,
+                                                         std::function<void()> onUpdate,
+                                                         std::function<void(STWErrorRef)> completion) {
     std::filesystem::path directory = personaFile().parent_path();
     std::error_code ec;
     std::filesystem::create_directories(directory, ec);
@@ -96,7 +96,13 @@ void STWFilePersonaService::registerForPersonaListUpdates(const std::string& obs
     });
     if (token < 0) {
         completion(STW_POSIX_ERROR_NOLOG(errno, "Could not watch %@ for %@", directory, observerName));
-        return;
+        return -1;
     }
     completion(nullptr);
+    return token;
+}
+
+void STWFilePersonaService::unregisterForPersonaListUpdates(int token) {
+    if (token >= 0)
+        STWFileWatcher::sharedInstance().removeWatch(token);
 }

@@ -16,8 +16,9 @@ public:
     static constexpr const char* defaultPersonalUniqueString = "00000000-0000-0000-0000-000000000501";
 
     std::vector<STWPersonaRecord> personaList() override;
-    void registerForPersonaListUpdates(const std::string& observerName, std::function<void()> onUpdate,
-                                       std::function<void(STWErrorRef)> completion) override;
+    int registerForPersonaListUpdates(const std::string& observerName, std::function<void()> onUpdate,
+                                      std::function<void(STWErrorRef)> completion) override;
+    void unregisterForPersonaListUpdates(int token) override;
 
     static std::filesystem::path personaFile();
     // Parses the file's dictionary entries; invalid entries are logged and skipped.

@@ -42,9 +42,12 @@ public:
     // Every persona with its attributes; empty when the service cannot answer.
     virtual std::vector<STWPersonaRecord> personaList() = 0;
     // Calls `onUpdate` whenever the persona list changes; `completion` reports once
-    // whether registration worked (nullptr on success).
-    virtual void registerForPersonaListUpdates(const std::string& observerName, std::function<void()> onUpdate,
-                                               std::function<void(STWErrorRef)> completion) = 0;
+    // whether registration worked (nullptr on success). Returns the token for
+    // unregisterForPersonaListUpdates(), or -1 when registration failed.
+    virtual int registerForPersonaListUpdates(const std::string& observerName, std::function<void()> onUpdate,
+                                              std::function<void(STWErrorRef)> completion) = 0;
+    // Ends the registration; an update already being delivered may still arrive.
+    virtual void unregisterForPersonaListUpdates(int token) = 0;
 
     // The persona the calling context acts for (see STWPersonaContext), or nullopt when
     // it acts for none.

@@ -2,7 +2,7 @@
 
 #include "common/STWLog.h"
 #include "common/STWPropertyList.h"
-#include "platform/STWPlatformConfiguration.h"
+#include "Daemon/Model/STWGlobalConfiguration.h"
 
 #include <cxxabi.h>
 #include <execinfo.h>
@@ -12,13 +12,16 @@
 #include <cstdlib>
 #include <exception>
 #include <new>
+#include <pthread.h>
 #include <typeinfo>
 
 namespace {
 
-// Runs on every open. CREATE ... IF NOT EXISTS makes it a no-op on an existing file; the
-// locking mode comes first so that the connection never shares the file, and auto_vacuum
-// precedes the first table because it can only be chosen for an empty file.
+// Runs on every open, exactly as the file format has always been set up. CREATE ... IF NOT
+// EXISTS makes it a no-op on an existing file; the locking mode comes first so that the
+// connection never shares the file. Note that switching a new file to WAL writes its
+// header, so the auto_vacuum that follows no longer takes effect: files made by this
+// script have auto-vacuum off (and have always had), which costs space, not correctness.
 // clang-format off
 constexpr const char* kSchemaScript =
     "PRAGMA locking_mode = EXCLUSIVE;"
@@ -126,22 +129,24 @@ std::string exceptionName(const std::type_info& type) {
     return name;
 }
 
-// Internal builds get the call stack of the catch site in the log, so that an exception
-// that should never happen can be traced back.
+// Internal builds get the uncaught-exception report of the catch site in the log, so that
+// an exception that should never happen can be traced back. The operation still fails
+// with code 40 and its transaction is still rolled back; the daemon goes on.
 void reportUncaughtException(const std::string& name, const std::string& reason) {
-    if (!STWPlatformConfiguration::sharedInstance()->isInternalImage())
+    if (!STWGlobalConfiguration::sharedInstance()->isInternalImage())
         return;
+    char thread[64] = "";
+    pthread_getname_np(pthread_self(), thread, sizeof thread);
     void* frames[64];
     int count = backtrace(frames, 64);
     std::string stack;
     if (char** symbols = backtrace_symbols(frames, count)) {
         for (int i = 0; i < count; ++i)
-            stack += STWFormat("%d %s\n", i, symbols[i]);
+            stack += STWFormat("%s\n", symbols[i]);
         free(symbols);
     }
-    STW_LOG_ERROR(STWLogCategory::Database,
-                  "** INTERNAL ERROR: Uncaught Exception **\nName: %@\nReason: %@\nCall stack:\n%@", name,
-                  reason, stack);
+    STW_LOG_ERROR(STWLogCategory::Database, "** INTERNAL ERROR: Uncaught Exception **\n%s\n%@: %@\nStack:\n%@",
+                  thread, name, reason, stack);
 }
 
 // Turns whatever was thrown into the code 40 error that callers of the database expect.

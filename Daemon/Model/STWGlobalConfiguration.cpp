@@ -45,19 +45,16 @@ STWGlobalConfiguration::STWGlobalConfiguration() {
     }
 }
 
-std::filesystem::path STWGlobalConfiguration::_directory(std::optional<std::filesystem::path>& slot,
-                                                         const std::filesystem::path& computed, uint16_t mode,
-                                                         uid_t owner, int32_t protectionClass,
+template <class Compute>
+std::filesystem::path STWGlobalConfiguration::_directory(std::optional<std::filesystem::path>& slot, Compute&& compute,
+                                                         uint16_t mode, uid_t owner, int32_t protectionClass,
                                                          const char* failureMessage) {
-    std::filesystem::path path;
-    {
-        std::lock_guard guard(_lock);
-        if (!slot)
-            slot = computed;
-        path = *slot;
-    }
-    STWCreateLayoutDirectory(path, mode, owner, protectionClass, failureMessage);
-    return path;
+    // The lock is recursive: computing a path asks the parent accessor, which takes it again.
+    std::lock_guard guard(_lock);
+    if (!slot)
+        slot = compute();
+    STWCreateLayoutDirectory(*slot, mode, owner, protectionClass, failureMessage);
+    return *slot;
 }
 
 std::filesystem::path STWGlobalConfiguration::homeDirectory() {
@@ -66,56 +63,67 @@ std::filesystem::path STWGlobalConfiguration::homeDirectory() {
 }
 
 std::filesystem::path STWGlobalConfiguration::sharedContainersDirectory() {
-    return _directory(_sharedContainersDirectory, underRoot("/private/var/containers"), kDirectoryMode, 0,
-                      kLeaveProtectionClass, "Failed to create shared container dir at \"%@\": %@");
+    return _directory(
+        _sharedContainersDirectory, [] { return underRoot("/private/var/containers"); }, kDirectoryMode, 0,
+        kLeaveProtectionClass, "Failed to create shared container dir at \"%@\": %@");
 }
 
 std::filesystem::path STWGlobalConfiguration::bundleDirectory() {
-    return _directory(_bundleDirectory, sharedContainersDirectory() / "Bundle", kDirectoryMode, 0, kLeaveProtectionClass,
-                      "Failed to create bundle dir at \"%@\": %@");
+    return _directory(
+        _bundleDirectory, [this] { return sharedContainersDirectory() / "Bundle"; }, kDirectoryMode, 0,
+        kLeaveProtectionClass, "Failed to create bundle dir at \"%@\": %@");
 }
 
 std::filesystem::path STWGlobalConfiguration::transientBundleDirectory() {
-    return _directory(_transientBundleDirectory, sharedContainersDirectory() / "Temp", kDirectoryMode,
-                      installationUID(), kLeaveProtectionClass, "Failed to create transient bundle dir at \"%@\": %@");
+    return _directory(
+        _transientBundleDirectory, [this] { return sharedContainersDirectory() / "Temp"; }, kDirectoryMode,
+        installationUID(), kLeaveProtectionClass, "Failed to create transient bundle dir at \"%@\": %@");
 }
 
 std::filesystem::path STWGlobalConfiguration::cachesDirectory() {
-    return _directory(_cachesDirectory, homeDirectory() / "Library/Caches/com.vorlane.stowlyd", kDirectoryMode, 0,
-                      kNoProtectionClass, "Failed to create cache dir at \"%@\": %@");
+    return _directory(
+        _cachesDirectory, [this] { return homeDirectory() / "Library/Caches/com.vorlane.stowlyd"; }, kDirectoryMode,
+        0, kNoProtectionClass, "Failed to create cache dir at \"%@\": %@");
 }
 
 std::filesystem::path STWGlobalConfiguration::stagingDirectory() {
-    return _directory(_stagingDirectory, cachesDirectory() / "Staging", kDirectoryMode, 0, kLeaveProtectionClass,
-                      "Failed to create staging dir at \"%@\": %@");
+    return _directory(
+        _stagingDirectory, [this] { return cachesDirectory() / "Staging"; }, kDirectoryMode, 0,
+        kLeaveProtectionClass, "Failed to create staging dir at \"%@\": %@");
 }
 
 std::filesystem::path STWGlobalConfiguration::deathrowDirectory() {
-    return _directory(_deathrowDirectory, cachesDirectory() / "Dead", kDirectoryMode, 0, kLeaveProtectionClass,
-                      "Failed to create deathrow dir at \"%@\": %@");
+    return _directory(
+        _deathrowDirectory, [this] { return cachesDirectory() / "Dead"; }, kDirectoryMode, 0, kLeaveProtectionClass,
+        "Failed to create deathrow dir at \"%@\": %@");
 }
 
 std::filesystem::path STWGlobalConfiguration::transientDirectory() {
-    return _directory(_transientDirectory, cachesDirectory() / "Temp", kDirectoryMode, 0, kLeaveProtectionClass,
-                      "Failed to create transient dir at \"%@\": %@");
+    return _directory(
+        _transientDirectory, [this] { return cachesDirectory() / "Temp"; }, kDirectoryMode, 0,
+        kLeaveProtectionClass, "Failed to create transient dir at \"%@\": %@");
 }
 
 std::filesystem::path STWGlobalConfiguration::libraryDirectory() {
-    return _directory(_libraryDirectory, homeDirectory() / "Library/Stowly", kDirectoryMode, 0, kNoProtectionClass,
-                      "Failed to create library dir at \"%@\": %@");
+    return _directory(
+        _libraryDirectory, [this] { return homeDirectory() / "Library/Stowly"; }, kDirectoryMode, 0,
+        kNoProtectionClass, "Failed to create library dir at \"%@\": %@");
 }
 
 std::filesystem::path STWGlobalConfiguration::replaceDirectory() {
-    return _directory(_replaceDirectory, libraryDirectory() / "Replace", kDirectoryMode, 0, kLeaveProtectionClass,
-                      "Failed to create replace dir at \"%@\": %@");
+    return _directory(
+        _replaceDirectory, [this] { return libraryDirectory() / "Replace"; }, kDirectoryMode, 0,
+        kLeaveProtectionClass, "Failed to create replace dir at \"%@\": %@");
 }
 
 std::filesystem::path STWGlobalConfiguration::pendingUpdatesDirectory() {
-    return _directory(_pendingUpdatesDirectory, libraryDirectory() / "PendingUpdates", kDirectoryMode, 0,
-                      kLeaveProtectionClass, "Failed to create updates dir at \"%@\": %@");
+    return _directory(
+        _pendingUpdatesDirectory, [this] { return libraryDirectory() / "PendingUpdates"; }, kDirectoryMode, 0,
+        kLeaveProtectionClass, "Failed to create updates dir at \"%@\": %@");
 }
 
 std::filesystem::path STWGlobalConfiguration::logDirectory() {
+    std::lock_guard guard(_lock);
     std::filesystem::path path = homeDirectory() / "Library/Logs/Stowly";
     STWCreateLayoutDirectory(path, kDirectoryMode, 0, kNoProtectionClass, "Failed to create log directory at \"%@\": %@");
     return path;

@@ -59,10 +59,11 @@ public:
     gid_t currentMobileGroupId() const { return _currentMobileGroupId; }
 
 private:
-    // Computes the path once under the lock, then creates it with the given attributes.
-    std::filesystem::path _directory(std::optional<std::filesystem::path>& slot,
-                                     const std::filesystem::path& computed, uint16_t mode, uid_t owner,
-                                     int32_t protectionClass, const char* failureMessage);
+    // Under the lock: computes the path once from its parent accessor (`compute`), then
+    // creates it with the given attributes, as on every call.
+    template <class Compute>
+    std::filesystem::path _directory(std::optional<std::filesystem::path>& slot, Compute&& compute, uint16_t mode,
+                                     uid_t owner, int32_t protectionClass, const char* failureMessage);
 
     std::recursive_mutex _lock;
     std::optional<std::filesystem::path> _homeDirectory, _sharedContainersDirectory, _cachesDirectory,

@@ -17,7 +17,41 @@ constexpr const char* kInfoKey = "STWMetadataInfo";
 constexpr const char* kAssetsDirKey = "STWMetadataUserManagedAssetsDirName";
 constexpr const char* kPersonaKey = "STWMetadataPersona";
 
-STWFormatArg describe(const STWValue* v) { return v ? STWFormatArg(*v) : STWFormatArg(nullptr); }
+// A value found in a file as the messages show it: a string as its text, anything else as
+// its description, an absent value as "(null)".
+STWFormatArg describe(const STWValue* v) {
+    if (!v)
+        return STWFormatArg(nullptr);
+    if (const std::string* text = v->string())
+        return STWFormatArg(*text);
+    return STWFormatArg(*v);
+}
+
+// The last component of `path`, which loses it (and the separators before it).
+std::string_view popComponent(std::string_view& path) {
+    while (!path.empty() && path.back() == '/')
+        path.remove_suffix(1);
+    size_t slash = path.rfind('/');
+    std::string_view last = slash == std::string_view::npos ? path : path.substr(slash + 1);
+    path = slash == std::string_view::npos ? std::string_view() : path.substr(0, slash);
+    return last;
+}
+
+// Whether the directory that holds `container` is the class directory of `containerClass`:
+// the container's path minus its last three components, plus the class directory name
+// (which always has two components). Compared as the two components that precede the
+// container's own name, so the check reads the path text without building new paths;
+// it runs for every container the cache finds.
+bool isInClassDirectory(std::string_view container, STWContainerClass containerClass) {
+    std::string_view name = STWContainerClassDirectoryName(containerClass);
+    size_t slash = name.find('/');
+    if (slash == std::string_view::npos)
+        return false;
+    popComponent(container);
+    std::string_view kind = popComponent(container);
+    std::string_view scope = popComponent(container);
+    return !kind.empty() && scope == name.substr(0, slash) && kind == name.substr(slash + 1);
+}
 
 } // namespace
 
@@ -68,8 +102,9 @@ bool STWMetadata::writeMetadataToFileURL(const std::filesystem::path& fileURL, S
     STW_LOG_DEBUG(STWLogCategory::Metadata, "[%s] Writing metadata to [%@]: %@ => %@", __func__, fileURL, *this,
                   STWValue(dictionary));
     STWErrorRef writeError;
-    // Durable: the file's bytes reach the disk before the rename makes them visible.
-    if (!STW_writeToURL(dictionary, temp, STWWriteDurable | STWWriteNoFileProtection, &writeError)) {
+    // Not synced here: the durable move below syncs the file before the rename makes it
+    // visible, and the directory after it; syncing twice would only double the cost.
+    if (!STW_writeToURL(dictionary, temp, STWWriteNoFileProtection, &writeError)) {
         // A half-written temporary file must not stay behind in staging.
         std::error_code ignored;
         std::filesystem::remove(temp, ignored);
@@ -92,13 +127,24 @@ bool STWMetadata::writeMetadataToFileURL(const std::filesystem::path& fileURL, S
 std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtUrl(const std::filesystem::path& containerURL,
                                                                        const STWUserIdentityRef& forUserIdentity,
                                                                        bool checkClassPath, STWErrorRef* error) {
-    return readAndValidateMetadataAtFileUrl(containerURL / fileName, forUserIdentity, checkClassPath, error);
+    // The container cache reads every container this way; the directory is at hand, so it
+    // is not derived again from the file's path (unless it was given with a trailing
+    // separator, which the record's url must not keep).
+    if (!containerURL.has_filename())
+        return readAndValidateMetadataAtFileUrl(containerURL / fileName, forUserIdentity, checkClassPath, error);
+    return _readAndValidateMetadata(containerURL / fileName, containerURL, forUserIdentity, checkClassPath, error);
 }
 
 std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtFileUrl(const std::filesystem::path& fileURL,
                                                                            const STWUserIdentityRef& forUserIdentity,
                                                                            bool checkClassPath, STWErrorRef* error) {
-    std::filesystem::path container = fileURL.parent_path();
+    return _readAndValidateMetadata(fileURL, fileURL.parent_path(), forUserIdentity, checkClassPath, error);
+}
+
+std::shared_ptr<STWMetadata> STWMetadata::_readAndValidateMetadata(const std::filesystem::path& fileURL,
+                                                                   const std::filesystem::path& container,
+                                                                   const STWUserIdentityRef& forUserIdentity,
+                                                                   bool checkClassPath, STWErrorRef* error) {
     // The container's owner may replace the file; never follow a link it put there.
     auto read = STW_dictionaryWithContentsOfURL(fileURL, STWReadNoFollow, nullptr);
     if (!read) {
@@ -123,7 +169,7 @@ std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtFileUrl(const
     }
     std::optional<STWUUID> uuid = STWUUID::fromString(*uuidValue->string());
     if (!uuid) {
-        STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata UUID: %@ at %@", *uuidValue,
+        STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata UUID: %@ at %@", describe(uuidValue),
                                      fileURL));
         return nullptr;
     }
@@ -147,14 +193,15 @@ std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtFileUrl(const
     if (!STWUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
         userIdentity = STWUserIdentityCache::defaultUserIdentity();
     } else {
-        uid_t expectedOwner = forUserIdentity->posixUIDForContainerClass(containerClass);
+        // Without an expected identity no owner can match (and no stored identity either).
+        uid_t expectedOwner = forUserIdentity ? forUserIdentity->posixUIDForContainerClass(containerClass) : 0;
         if (STWContainerClassIsPerUser(containerClass)) {
             const STWValue* persona = STWDictionaryFind(plist, kPersonaKey);
             if (!persona) {
                 plist[kPersonaKey] = STWValue(expectedOwner);
             } else if (persona->uint64Value() != static_cast<uint64_t>(expectedOwner)) {
                 STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Incorrect UserId: %@, expecting: %u for %@ at %@",
-                                             *persona, expectedOwner, identifier, fileURL));
+                                             describe(persona), expectedOwner, identifier, fileURL));
                 return nullptr;
             }
         }
@@ -184,7 +231,7 @@ std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtFileUrl(const
     std::optional<STWValue::Dictionary> info;
     if (const STWValue* infoValue = STWDictionaryFind(plist, kInfoKey)) {
         if (!infoValue->dictionary()) {
-            STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata Info: %@ at %@", *infoValue,
+            STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata Info: %@ at %@", describe(infoValue),
                                          fileURL));
             return nullptr;
         }
@@ -194,20 +241,18 @@ std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtFileUrl(const
     if (const STWValue* assets = STWDictionaryFind(plist, kAssetsDirKey)) {
         if (!assets->string()) {
             STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr,
-                                         "Invalid metadata User Managed Dir Name String: %@ at %@", *assets, fileURL));
+                                         "Invalid metadata User Managed Dir Name String: %@ at %@", describe(assets), fileURL));
             return nullptr;
         }
         assetsDirName = *assets->string();
     }
 
-    if (checkClassPath) {
+    if (checkClassPath && !isInClassDirectory(container.native(), containerClass)) {
         std::filesystem::path expected = container.parent_path().parent_path().parent_path() /
                                          STWContainerClassDirectoryName(containerClass);
-        if (container.parent_path() != expected) {
-            STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata-URLs should match: %@ : %@",
-                                         fileURL, expected));
-            return nullptr;
-        }
+        STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata-URLs should match: %@ : %@",
+                                     fileURL, expected));
+        return nullptr;
     }
 
     uint64_t identityCode = STWErrorSuccess;

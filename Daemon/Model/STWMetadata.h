@@ -21,6 +21,13 @@ class STWMetadata {
 public:
     static constexpr const char* fileName = ".com.vorlane.stowly.metadata.plist";
 
+    // Info keys the daemon itself keeps; every other info key belongs to the clients.
+    // The data-protection class chosen for a data container (an integer).
+    static constexpr const char* contentProtectionClassInfoKey = "com.vorlane.Setwright.ContentProtectionClass";
+    // Legacy values that the code-signing mapping reads and rewrites.
+    static constexpr const char* groupContainerIDsInfoKey = "com.vorlane.Setwright.GroupContainerIDs";
+    static constexpr const char* cachedCodeSigningInfoInfoKey = "com.vorlane.Setwright.CachedCodeSigningInfo";
+
     STWMetadata(const STWConcreteContainerIdentityRef& containerIdentity, std::optional<STWValue::Dictionary> info,
                 std::filesystem::path url, std::optional<std::string> userManagedAssetsDirName);
 
@@ -56,6 +63,12 @@ public:
                                                                          bool checkClassPath, STWErrorRef* error);
 
 private:
+    // `container` is the directory that holds `fileURL`.
+    static std::shared_ptr<STWMetadata> _readAndValidateMetadata(const std::filesystem::path& fileURL,
+                                                                 const std::filesystem::path& container,
+                                                                 const STWUserIdentityRef& forUserIdentity,
+                                                                 bool checkClassPath, STWErrorRef* error);
+
     bool _transient = false;
     bool _existed = false;
     STWContainerClass _containerClass;

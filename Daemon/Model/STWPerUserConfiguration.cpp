@@ -11,35 +11,38 @@ STWPerUserConfiguration::STWPerUserConfiguration(STWUserIdentityRef userIdentity
         STW_LOG_FAULT(STWLogCategory::Unspecified, "Home directory cannot be nil: %@", _userIdentity);
 }
 
-std::filesystem::path STWPerUserConfiguration::_created(std::optional<std::filesystem::path>& slot,
-                                                        const std::filesystem::path& computed,
+template <class Compute>
+std::filesystem::path STWPerUserConfiguration::_created(std::optional<std::filesystem::path>& slot, Compute&& compute,
                                                         const char* failureMessage) {
-    std::filesystem::path path;
-    {
-        std::lock_guard guard(_lock);
-        if (!slot)
-            slot = computed;
-        path = *slot;
-    }
-    STWCreateLayoutDirectory(path, 0755, _userIdentity->posixUID(), -1, failureMessage);
-    return path;
+    std::lock_guard guard(_lock);
+    if (!slot)
+        slot = compute();
+    STWCreateLayoutDirectory(*slot, 0755, _userIdentity->posixUID(), -1, failureMessage);
+    return *slot;
 }
 
 std::filesystem::path STWPerUserConfiguration::userBaseDirectory() {
-    return _created(_userBaseDirectory, _userHomeDirectory / "Containers", "Failed to create user base dir at \"%@\": %@");
+    return _created(
+        _userBaseDirectory, [this] { return _userHomeDirectory / "Containers"; },
+        "Failed to create user base dir at \"%@\": %@");
 }
 
 std::filesystem::path STWPerUserConfiguration::transientDirectory() {
-    return _created(_transientDirectory, userBaseDirectory() / "Temp", "Failed to create transient dir at \"%@\": %@");
+    return _created(
+        _transientDirectory, [this] { return userBaseDirectory() / "Temp"; },
+        "Failed to create transient dir at \"%@\": %@");
 }
 
 std::filesystem::path STWPerUserConfiguration::stagingDirectory() {
-    return _created(_stagingDirectory, userBaseDirectory() / "Staging", "Failed to create staging dir at \"%@\": %@");
+    return _created(
+        _stagingDirectory, [this] { return userBaseDirectory() / "Staging"; },
+        "Failed to create staging dir at \"%@\": %@");
 }
 
 std::filesystem::path STWPerUserConfiguration::libraryDirectory() {
-    return _created(_libraryDirectory, _userHomeDirectory / "Library/Stowly",
-                    "Failed to create user library dir at \"%@\": %@");
+    return _created(
+        _libraryDirectory, [this] { return _userHomeDirectory / "Library/Stowly"; },
+        "Failed to create user library dir at \"%@\": %@");
 }
 
 std::filesystem::path STWPerUserConfiguration::systemContainerBackupBaseDirectory() {
@@ -63,6 +66,7 @@ std::optional<std::filesystem::path> STWPerUserConfiguration::containerDirectory
                       contentClass);
         return std::nullopt;
     }
+    std::lock_guard guard(_lock);
     std::filesystem::path path = (transient ? transientDirectory() : userBaseDirectory()) /
                                  STWContainerClassDirectoryName(contentClass);
     STWCreateLayoutDirectory(path, 0755, _userIdentity->posixUID(), -1, "Failed to create container dir at \"%@\": %@");

@@ -31,7 +31,10 @@ public:
     bool existsUserBaseDirectory();
 
 private:
-    std::filesystem::path _created(std::optional<std::filesystem::path>& slot, const std::filesystem::path& computed,
+    // Under the lock: computes the path once (`compute` may ask a parent accessor), then
+    // creates it, as on every call.
+    template <class Compute>
+    std::filesystem::path _created(std::optional<std::filesystem::path>& slot, Compute&& compute,
                                    const char* failureMessage);
 
     std::recursive_mutex _lock;

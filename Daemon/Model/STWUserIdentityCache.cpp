@@ -35,8 +35,14 @@ STWValue describeRecords(const std::vector<STWPersonaRecord>& records) {
 
 std::shared_ptr<STWUserIdentityCache> STWUserIdentityCache::create() {
     std::shared_ptr<STWUserIdentityCache> cache(new STWUserIdentityCache);
-    std::weak_ptr<STWUserIdentityCache> weak = cache;
-    STWPersonaService::sharedInstance()->registerForPersonaListUpdates(
+    cache->_registerForPersonaListUpdates();
+    return cache;
+}
+
+void STWUserIdentityCache::_registerForPersonaListUpdates() {
+    std::weak_ptr<STWUserIdentityCache> weak = weak_from_this();
+    _personaService = STWPersonaService::sharedInstance();
+    _registrationToken = _personaService->registerForPersonaListUpdates(
         "com.vorlane.stowlyd.personaobserver",
         [weak] {
             if (auto strong = weak.lock())
@@ -53,7 +59,6 @@ std::shared_ptr<STWUserIdentityCache> STWUserIdentityCache::create() {
             strong->_registered = true;
             STW_LOG_NOTICE(STWLogCategory::Unspecified, "Registered for persona list updates.");
         });
-    return cache;
 }
 
 STWUserIdentityCache::STWUserIdentityCache() {
@@ -328,8 +333,8 @@ void STWUserIdentityCache::forEachAccessibleUserIdentitySynchronouslyExecuteBloc
             distinct.insert(identity);
         if (distinct.empty())
             STW_LOG_ERROR(STWLogCategory::Unspecified,
-                          "Expected to find at least one persona; self = %p, personaAttributeList = %@",
-                          static_cast<const void*>(this), describeRecords(STWPersonaService::sharedInstance()->personaList()));
+                          "Expected to find at least one persona; self = %@, personaAttributeList = %@", *this,
+                          describeRecords(STWPersonaService::sharedInstance()->personaList()));
     }
     if (distinct.empty()) {
         block(defaultUserIdentity());
@@ -384,7 +389,16 @@ void STWUserIdentityCache::personaListDidUpdate() {
     });
 }
 
-void STWUserIdentityCache::unregister() { _registered = false; }
+void STWUserIdentityCache::unregister() {
+    _registered = false;
+    int token = _registrationToken.exchange(-1);
+    if (token >= 0 && _personaService)
+        _personaService->unregisterForPersonaListUpdates(token);
+}
+
+std::string STWUserIdentityCache::description() const {
+    return STWFormat("<%@: %p>", _className(), static_cast<const void*>(this));
+}
 
 bool STWUserIdentityCache::isRegistered() const { return _registered; }
 

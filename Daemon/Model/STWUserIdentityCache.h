@@ -48,6 +48,7 @@ public:
     void flush();
     void flushAndRepopulateWithUserIdentities(const std::vector<STWUserIdentityRef>& identities);
     void personaListDidUpdate();
+    // Ends the registration for persona-list updates; also run at destruction.
     void unregister();
     bool isRegistered() const;
     bool cacheInvalid();
@@ -61,8 +62,14 @@ public:
     // Pause between attempts to fetch the persona list (one second; tests shorten it).
     static void setResyncRetryInterval(std::chrono::milliseconds interval);
 
+    std::string description() const;
+
 protected:
     STWUserIdentityCache();
+    // Registers with the persona service; the cache must already be owned by a shared_ptr,
+    // since the service holds it weakly.
+    void _registerForPersonaListUpdates();
+    virtual const char* _className() const { return "STWUserIdentityCache"; }
 
 private:
     void _lock_flush();
@@ -77,6 +84,9 @@ private:
     std::mutex _lock;
     std::shared_ptr<STWQueue> _flushQueue;
     std::atomic<bool> _registered{false};
+    // The service this cache registered with and the registration's token (-1: none).
+    std::shared_ptr<STWPersonaService> _personaService;
+    std::atomic<int> _registrationToken{-1};
     bool _cacheInvalid = true;
     std::unordered_map<std::string, STWUserIdentitySet> _lock_bundleToEnterpriseIdentitiesMap;
     std::unordered_map<std::string, STWUserIdentityRef> _lock_personaUniqueStringToUserIdentityMap;

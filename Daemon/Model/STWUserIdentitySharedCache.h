@@ -6,5 +6,12 @@
 
 class STWUserIdentitySharedCache : public STWUserIdentityCache {
 public:
+    // Created, and registered for persona-list updates, on first use.
     static std::shared_ptr<STWUserIdentityCache> sharedInstance();
+
+protected:
+    const char* _className() const override { return "STWUserIdentitySharedCache"; }
+
+private:
+    STWUserIdentitySharedCache() = default;
 };

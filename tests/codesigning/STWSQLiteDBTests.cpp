@@ -1,6 +1,10 @@
 #include "Daemon/CodeSigning/STWSQLiteDB.h"
 
+#include "Daemon/Model/STWGlobalConfiguration.h"
+#include "common/STWFileIO.h"
+#include "common/STWLog.h"
 #include "common/STWPropertyList.h"
+#include "tests/support/STWTestRoot.h"
 
 #include <gtest/gtest.h>
 
@@ -107,6 +111,65 @@ TEST_F(STWSQLiteDBTest, FirstWriteInsertsAndRewriteUpdatesTheSameRow) {
               rowID);
     EXPECT_EQ(queryInt("SELECT count(*) FROM code_signing_info;"), 1);
     EXPECT_EQ(queryInt("SELECT count(*) FROM code_signing_data;"), 1);
+}
+
+// The statements the connection runs, as SQLite saw them.
+class StatementTrace {
+public:
+    explicit StatementTrace(sqlite3* db) : _db(db) {
+        sqlite3_trace_v2(
+            _db, SQLITE_TRACE_STMT,
+            [](unsigned, void* context, void* statement, void*) {
+                static_cast<StatementTrace*>(context)->_statements.push_back(
+                    sqlite3_sql(static_cast<sqlite3_stmt*>(statement)));
+                return 0;
+            },
+            this);
+    }
+    ~StatementTrace() { sqlite3_trace_v2(_db, 0, nullptr, nullptr); }
+    // The first word of each statement, and for writes the table too: "UPDATE code_signing_info".
+    std::vector<std::string> take() {
+        std::vector<std::string> summary;
+        for (const std::string& sql : _statements) {
+            std::string words = sql.substr(0, sql.find(" ("));
+            if (words.rfind("INSERT OR REPLACE INTO ", 0) == 0 || words.rfind("INSERT INTO ", 0) == 0)
+                words = words.substr(0, words.find(' ', words.find("INTO ") + 5));
+            else if (words.rfind("UPDATE ", 0) == 0)
+                words = words.substr(0, words.find(" SET"));
+            else
+                words = words.substr(0, words.find(' '));
+            summary.push_back(words);
+        }
+        _statements.clear();
+        return summary;
+    }
+
+private:
+    sqlite3* _db;
+    std::vector<std::string> _statements;
+};
+
+TEST_F(STWSQLiteDBTest, ANewIdentifierIsInsertedAfterAnUpdateThatMatchedNothing) {
+    StatementTrace trace(db->db());
+    add(makeEntry("group.one"), "com.example.app");
+    EXPECT_EQ(trace.take(), (std::vector<std::string>{"BEGIN;", "UPDATE code_signing_info", "INSERT INTO code_signing_info",
+                                                      "INSERT OR REPLACE INTO code_signing_data", "COMMIT;"}));
+    auto second = makeEntry("group.two");
+    second->setChildBundleIdentifiers(std::vector<std::string>{"com.example.app.widget"});
+    add(second, "com.example.app");
+    EXPECT_EQ(trace.take(),
+              (std::vector<std::string>{"BEGIN;", "UPDATE code_signing_info", "INSERT OR REPLACE INTO code_signing_data",
+                                        "INSERT OR REPLACE INTO child_bundles", "COMMIT;"}));
+}
+
+TEST_F(STWSQLiteDBTest, TheConnectionHoldsAFullySyncedWriteAheadLog) {
+    sqlite3_stmt* statement = nullptr;
+    ASSERT_EQ(sqlite3_prepare_v2(db->db(), "PRAGMA journal_mode;", -1, &statement, nullptr), SQLITE_OK);
+    ASSERT_EQ(sqlite3_step(statement), SQLITE_ROW);
+    EXPECT_STREQ(reinterpret_cast<const char*>(sqlite3_column_text(statement, 0)), "wal");
+    sqlite3_finalize(statement);
+    EXPECT_EQ(queryInt("PRAGMA synchronous;"), 2); // FULL
+    EXPECT_EQ(queryInt("PRAGMA foreign_keys;"), 1);
 }
 
 TEST_F(STWSQLiteDBTest, FailedWriteLeavesNoTraceAndTheNextWriteWorks) {
@@ -391,6 +454,42 @@ TEST_F(STWSQLiteDBTest, UnusableFileStopsTheDaemon) {
     std::filesystem::create_directory(corrupt);
     std::ofstream(corrupt / "containers.sqlite3") << std::string(8192, 'x');
     EXPECT_DEATH(STWSQLiteDB::initWithParentDirectoryURL(corrupt), "Failed to initialize database, err = 26");
+}
+
+TEST_F(STWSQLiteDBTest, AnExceptionOnAnInternalBuildIsReportedWithItsStack) {
+    STWTestRoot::shared();
+    std::filesystem::path log = dir / "stowlyd.log";
+    ASSERT_TRUE(STWLog::openLogFile(log, "com.vorlane.stowlyd", STWLogLevel::Error));
+    STWLog::enableFileWriting(1, 1 << 20);
+    add(makeEntry("group.one"), "com.example.one");
+    auto thrower = [](const std::string&, const std::shared_ptr<STWCodeSigningEntry>&) {
+        throw std::length_error("too long");
+    };
+
+    STWGlobalConfiguration::sharedInstance()->setIsInternalImage(false);
+    STWErrorRef external = db->enumerateIdentifiersAndCodeSigningInfoUsingBlock(thrower);
+    STWLog::flush();
+    std::string text;
+    ASSERT_EQ(STWReadFileContents(log, &text), 0);
+    EXPECT_EQ(text.find("** INTERNAL ERROR: Uncaught Exception **"), std::string::npos) << text;
+
+    STWGlobalConfiguration::sharedInstance()->setIsInternalImage(true);
+    STWErrorRef internal = db->enumerateIdentifiersAndCodeSigningInfoUsingBlock(thrower);
+    STWGlobalConfiguration::sharedInstance()->setIsInternalImage(false);
+    STWLog::flush();
+    STWLog::closeLogFile();
+    ASSERT_EQ(STWReadFileContents(log, &text), 0);
+
+    for (const STWErrorRef& error : {external, internal}) {
+        ASSERT_TRUE(error);
+        EXPECT_TRUE(error->is(STWErrorException));
+        EXPECT_EQ(error->message(), "Got exception: std::length_error : too long");
+    }
+    size_t report = text.find("** INTERNAL ERROR: Uncaught Exception **");
+    ASSERT_NE(report, std::string::npos) << text;
+    EXPECT_NE(text.find("std::length_error: too long\nStack:\n", report), std::string::npos) << text;
+    // The daemon goes on: the connection still serves.
+    EXPECT_TRUE(read("com.example.one"));
 }
 
 } // namespace

@@ -1,5 +1,8 @@
+#include "Daemon/FileSystem/STWFileManager.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Model/STWUserIdentityCache.h"
+#include "common/STWFileIO.h"
+#include "common/STWLog.h"
 #include "tests/support/STWTestRoot.h"
 
 #include <gtest/gtest.h>
@@ -14,6 +17,11 @@ protected:
         root = &STWTestRoot::shared();
         global = STWGlobalConfiguration::sharedInstance();
         mobile = STWUserIdentityCache::defaultUserIdentity();
+    }
+    static int32_t protectionClassOf(const std::filesystem::path& p) {
+        int32_t dataProtectionClass = -1;
+        EXPECT_TRUE(STWFileManager::defaultManager()->dataProtectionClassOfItemAtURL(p, &dataProtectionClass)) << p;
+        return dataProtectionClass;
     }
     static struct stat statOf(const std::filesystem::path& p) {
         struct stat st {};
@@ -66,6 +74,85 @@ TEST_F(STWLayoutTest, ARemovedBaseDirectoryIsRepairedByTheNextCall) {
     EXPECT_FALSE(std::filesystem::exists(staging));
     EXPECT_EQ(global->stagingDirectory(), staging);
     EXPECT_TRUE(std::filesystem::is_directory(staging));
+}
+
+TEST_F(STWLayoutTest, StateDirectoriesCarryNoProtectionClassAndBackupsAreNeverCreated) {
+    EXPECT_EQ(protectionClassOf(global->cachesDirectory()), 4);
+    EXPECT_EQ(protectionClassOf(global->libraryDirectory()), 4);
+    EXPECT_EQ(protectionClassOf(global->logDirectory()), 4);
+    // The children inherit nothing: only the two bases are given a class.
+    EXPECT_EQ(protectionClassOf(global->stagingDirectory()), 0);
+
+    // An enterprise identity with a home of its own gets its per-user tree there.
+    std::filesystem::path home = root->resolve("/private/var/enterprise-layout");
+    auto enterprise = STWUserIdentity::initWithUID(502, 502, home, "ENT-LAYOUT", STWPersonaTypeEnterprise, 2000);
+    auto perUser = global->getPerUserConfigurationForUserIdentity(enterprise);
+    EXPECT_FALSE(perUser->existsUserBaseDirectory());
+    EXPECT_EQ(perUser->userBaseDirectory(), home / "Containers");
+    EXPECT_EQ(perUser->transientDirectory(), home / "Containers/Temp");
+    EXPECT_EQ(perUser->stagingDirectory(), home / "Containers/Staging");
+    EXPECT_EQ(perUser->libraryDirectory(), home / "Library/Stowly");
+    EXPECT_TRUE(perUser->existsUserBaseDirectory());
+    for (const char* created : {"Containers", "Containers/Temp", "Containers/Staging", "Library/Stowly"}) {
+        struct stat st = statOf(home / created);
+        EXPECT_EQ(st.st_uid, 502u) << created;
+        EXPECT_EQ(st.st_mode & 07777, 0755u) << created;
+    }
+    EXPECT_EQ(perUser->systemContainerBackupDirectory(), home / "Library/Backup/SystemContainers/Data");
+    EXPECT_EQ(perUser->systemGroupContainerBackupDirectory(), home / "Library/Backup/SystemContainers/Shared");
+    EXPECT_EQ(perUser->oldLoggingPath(), home / "Library/Logs/Stowly");
+    EXPECT_FALSE(std::filesystem::exists(home / "Library/Backup"));
+    EXPECT_FALSE(std::filesystem::exists(home / "Library/Logs"));
+    EXPECT_EQ(*global->containerDirectoryURLForUserIdentity(enterprise, 7, false), home / "Containers/Shared/AppGroup");
+    EXPECT_NE(global->getPerUserConfigurationForUserIdentity(enterprise), global->getPerUserConfigurationForUserIdentity(mobile));
+
+    std::filesystem::path legacy = root->resolve("/private/var/setwrightd/Library/Caches/com.vorlane.stowlyd");
+    std::filesystem::create_directories(legacy);
+    EXPECT_EQ(global->legacyTransientBundleDirectory(), legacy);
+    std::filesystem::remove_all(root->resolve("/private/var/setwrightd"));
+    EXPECT_FALSE(global->legacyTransientBundleDirectory());
+}
+
+TEST_F(STWLayoutTest, OwnersOfGlobalClassesComeFromTheConfiguration) {
+    root->writeSettings({{"InstallationUID", STWValue(77)}, {"SystemContainerUID", STWValue(78)}});
+    EXPECT_EQ(mobile->posixUIDForContainerClass(3), 77u);
+    EXPECT_EQ(mobile->posixGIDForContainerClass(13), 78u);
+    EXPECT_EQ(mobile->posixUIDForContainerClass(7), 501u);
+    struct stat plugin = statOf(*global->containerDirectoryURLForUserIdentity(mobile, 3, false));
+    EXPECT_EQ(plugin.st_uid, 77u);
+    EXPECT_EQ(plugin.st_gid, 77u);
+    EXPECT_EQ(statOf(global->transientBundleDirectory()).st_uid, 77u);
+    EXPECT_EQ(statOf(*global->containerDirectoryURLForUserIdentity(mobile, 12, true)).st_uid, 78u);
+
+    // Back to the defaults: the next call hands the bundle directory back to 33. Owner 0
+    // means "leave the ownership alone" (the daemon is root, so what it creates is root's),
+    // so the system directory keeps the owner it was given.
+    root->writeSettings({});
+    EXPECT_EQ(statOf(*global->containerDirectoryURLForUserIdentity(mobile, 3, false)).st_uid, 33u);
+    EXPECT_EQ(statOf(*global->containerDirectoryURLForUserIdentity(mobile, 12, true)).st_uid, 78u);
+    std::filesystem::path fresh = *global->containerDirectoryURLForUserIdentity(mobile, 13, true);
+    EXPECT_EQ(statOf(fresh).st_uid, 0u);
+}
+
+TEST_F(STWLayoutTest, AMissingMobileUserIsLoggedAndLeavesTheIdsAtZero) {
+    std::filesystem::path log = root->resolve("/private/var/root/layout-test.log");
+    std::filesystem::create_directories(log.parent_path());
+    ASSERT_TRUE(STWLog::openLogFile(log, "com.vorlane.stowlyd", STWLogLevel::Notice));
+    STWLog::enableFileWriting(1, 1 << 20);
+    root->writeSettings({{"MobileUserName", STWValue("nobody-by-this-name")}});
+    STWGlobalConfiguration missing;
+    root->writeSettings({});
+    STWGlobalConfiguration present;
+    STWLog::flush();
+    STWLog::closeLogFile();
+
+    EXPECT_EQ(missing.currentMobileUserId(), 0u);
+    EXPECT_EQ(missing.currentMobileGroupId(), 0u);
+    EXPECT_EQ(present.currentMobileUserId(), 501u);
+    std::string text;
+    ASSERT_EQ(STWReadFileContents(log, &text), 0);
+    EXPECT_NE(text.find("Failed to get mobile uid. This is bad"), std::string::npos) << text;
+    EXPECT_NE(text.find("Current mobile user ID is 501, group ID is 501"), std::string::npos) << text;
 }
 
 } // namespace

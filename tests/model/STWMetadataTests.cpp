@@ -1,10 +1,16 @@
+#include "Daemon/FileSystem/STWFileManager.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Model/STWMetadata.h"
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
 #include "common/STWDictionaryUtilities.h"
+#include "common/STWPropertyList.h"
 #include "tests/support/STWTestRoot.h"
 
 #include <gtest/gtest.h>
+
+#include <algorithm>
+#include <mutex>
+#include <vector>
 
 namespace {
 
@@ -73,11 +79,11 @@ TEST_F(STWMetadataTest, EachKindOfInvalidFileIsRejectedWithItsMessage) {
     ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
     EXPECT_NE(readError("STWMetadataContentClass", STWValue(0)).find("Invalid metadata Content Class: 0 at"), std::string::npos);
     EXPECT_NE(readError("STWMetadataContentClass", STWValue(14)).find("Invalid metadata Content Class: 14 at"), std::string::npos);
-    EXPECT_NE(readError("STWMetadataContentClass", STWValue("2")).find("Invalid metadata Class: \"2\" at"), std::string::npos);
+    EXPECT_NE(readError("STWMetadataContentClass", STWValue("2")).find("Invalid metadata Class: 2 at"), std::string::npos);
     ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
     EXPECT_NE(readError("STWMetadataIdentifier", STWValue(5)).find("Invalid metadata Identifier: 5 at"), std::string::npos);
     ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
-    EXPECT_NE(readError("STWMetadataUUID", STWValue("not-a-uuid")).find("Invalid metadata UUID: \"not-a-uuid\" at"), std::string::npos);
+    EXPECT_NE(readError("STWMetadataUUID", STWValue("not-a-uuid")).find("Invalid metadata UUID: not-a-uuid at"), std::string::npos);
     ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
     EXPECT_NE(readError("STWMetadataPersona", STWValue(502)).find("Incorrect UserId: 502, expecting: 501 for com.example.app at"),
               std::string::npos);
@@ -86,7 +92,26 @@ TEST_F(STWMetadataTest, EachKindOfInvalidFileIsRejectedWithItsMessage) {
     std::string wrongUser = readError("STWMetadataPersona", STWValue(), true, other);
     EXPECT_NE(wrongUser.find("Incorrect User Identity:"), std::string::npos) << wrongUser;
     ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
-    EXPECT_NE(readError("STWMetadataInfo", STWValue("text")).find("Invalid metadata Info:"), std::string::npos);
+    EXPECT_NE(readError("STWMetadataInfo", STWValue("text")).find("Invalid metadata Info: text at"), std::string::npos);
+    ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
+    EXPECT_NE(readError("STWMetadataUserManagedAssetsDirName", STWValue(STWValue::Array{}))
+                  .find("Invalid metadata User Managed Dir Name String: () at"),
+              std::string::npos);
+    ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
+    EXPECT_NE(readError("STWMetadataIdentifier", STWValue()).find("Invalid metadata Identifier: (null) at"),
+              std::string::npos);
+    ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
+    EXPECT_NE(readError("STWMetadataUUID", STWValue(5)).find("Invalid metadata UUID String: 5 at"), std::string::npos);
+    ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
+    STWValue::Dictionary badIdentity{{"posixUID", STWValue(501)}, {"posixGID", STWValue(501)}, {"type", STWValue(7)},
+                                     {"version", STWValue("2")}};
+    EXPECT_NE(readError("STWMetadataUserIdentity", STWValue(badIdentity)).find("Invalid metadata User Identity:"),
+              std::string::npos);
+    ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
+    // A legacy owner of 501 read for user 502: the recorded id decides, whatever identity is stored.
+    auto user502 = STWUserIdentitySharedCache::sharedInstance()->userIdentityForPersonalPersonaWithUID(502, 502);
+    EXPECT_NE(readError("STWMetadataPersona", STWValue(501), true, user502).find("Incorrect UserId: 501, expecting: 502"),
+              std::string::npos);
     ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
     // Class 4 stored in a Data/Application directory.
     EXPECT_NE(readError("STWMetadataContentClass", STWValue(4)).find("Invalid metadata-URLs should match:"), std::string::npos);
@@ -138,6 +163,98 @@ TEST_F(STWMetadataTest, AFailedWriteKeepsThePreviousFile) {
     EXPECT_EQ(error->code(), 34);
     EXPECT_NE(error->message().find("Failed to move metadata from staging:"), std::string::npos);
     EXPECT_TRUE(STWMetadata::readAndValidateMetadataAtUrl(container, mobile, true, nullptr));
+}
+
+TEST_F(STWMetadataTest, ReadingAcceptsXMLButNeverFollowsALinkOrAcceptsAnotherRoot) {
+    STWMetadata metadata = make();
+    ASSERT_TRUE(metadata.writeMetadataToDiskWithError(nullptr));
+    std::filesystem::path file = container / STWMetadata::fileName;
+    STWValue::Dictionary d = stored();
+    ASSERT_EQ(STWWriteFileAtomically(file, STWPropertyList::serializeXML(STWValue(d)), 0644, false), 0);
+    STWErrorRef error;
+    auto back = STWMetadata::readAndValidateMetadataAtUrl(container, mobile, true, &error);
+    ASSERT_TRUE(back) << error->description();
+    EXPECT_TRUE(back->containerIdentity()->isEqual(*metadata.containerIdentity()));
+
+    // The container's owner could point the file anywhere; a link is not a metadata file.
+    std::filesystem::path elsewhere = classDirectory / ("elsewhere-" + uuid.string());
+    ASSERT_EQ(STWWriteFileAtomically(elsewhere, STWPropertyList::serializeBinary(STWValue(d)), 0644, false), 0);
+    std::filesystem::remove(file);
+    std::filesystem::create_symlink(elsewhere, file);
+    error.reset();
+    EXPECT_FALSE(STWMetadata::readAndValidateMetadataAtUrl(container, mobile, true, &error));
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->code(), 12);
+    std::filesystem::remove(elsewhere);
+
+    std::filesystem::remove(file);
+    ASSERT_EQ(STWWriteFileAtomically(file, STWPropertyList::serializeBinary(STWValue(STWValue::Array{STWValue(d)})),
+                                     0644, false),
+              0);
+    error.reset();
+    EXPECT_FALSE(STWMetadata::readAndValidateMetadataAtUrl(container, mobile, true, &error));
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->code(), 12);
+}
+
+TEST_F(STWMetadataTest, WithoutAnExpectedIdentityOnlyGlobalContainersRead) {
+    ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
+    STWErrorRef error;
+    EXPECT_FALSE(STWMetadata::readAndValidateMetadataAtUrl(container, nullptr, true, &error));
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->code(), 29);
+
+    ASSERT_TRUE(make(1).writeMetadataToDiskWithError(nullptr));
+    // A bundle container needs no user identity; its class directory is elsewhere, so skip that check.
+    auto bundle = STWMetadata::readAndValidateMetadataAtUrl(container, nullptr, false, &error);
+    ASSERT_TRUE(bundle) << error->description();
+    EXPECT_EQ(*bundle->userIdentity(), *STWUserIdentityCache::defaultUserIdentity());
+}
+
+TEST_F(STWMetadataTest, AWriteIsOnDiskBeforeItIsAcknowledged) {
+    std::vector<std::string> synced;
+    std::mutex mutex;
+    STWFileManager::setSyncObserverForTesting([&](const std::string& path) {
+        std::lock_guard guard(mutex);
+        synced.push_back(path);
+    });
+    bool written = make().writeMetadataToDiskWithError(nullptr);
+    STWFileManager::setSyncObserverForTesting(nullptr);
+    ASSERT_TRUE(written);
+    std::filesystem::path staging = STWGlobalConfiguration::sharedInstance()->stagingDirectoryURLForUserIdentity(mobile, 2);
+    std::string temporary = (staging / ("temp_metadata-" + uuid.string() + ".plist")).string();
+    // The bytes under their temporary name, then the directory that now holds the final name.
+    auto bytes = std::find(synced.begin(), synced.end(), temporary);
+    auto rename = std::find(synced.begin(), synced.end(), container.string());
+    EXPECT_NE(bytes, synced.end());
+    EXPECT_NE(rename, synced.end());
+    EXPECT_LT(bytes, rename);
+}
+
+TEST_F(STWMetadataTest, TheClassDirectoryIsCheckedOnThePathAsGiven) {
+    ASSERT_TRUE(make().writeMetadataToDiskWithError(nullptr));
+    STWErrorRef error;
+    // A trailing separator or a doubled one names the same directory.
+    auto slash = STWMetadata::readAndValidateMetadataAtUrl(container.string() + "/", mobile, true, &error);
+    ASSERT_TRUE(slash) << error->description();
+    EXPECT_EQ(slash->url(), container);
+    std::filesystem::path doubled = classDirectory.parent_path().string() + "//Application/" + uuid.string();
+    ASSERT_TRUE(STWMetadata::readAndValidateMetadataAtUrl(doubled, mobile, true, &error)) << error->description();
+    ASSERT_TRUE(STWMetadata::readAndValidateMetadataAtFileUrl(container / STWMetadata::fileName, mobile, true, &error));
+
+    // One level short ("Containers/Application/UUID") or one level too deep is not the class directory.
+    for (const std::filesystem::path& misplaced :
+         {classDirectory.parent_path().parent_path() / "Application" / uuid.string(),
+          classDirectory / "Nested" / uuid.string()}) {
+        std::filesystem::create_directories(misplaced);
+        std::filesystem::copy_file(container / STWMetadata::fileName, misplaced / STWMetadata::fileName);
+        error.reset();
+        EXPECT_FALSE(STWMetadata::readAndValidateMetadataAtUrl(misplaced, mobile, true, &error)) << misplaced;
+        ASSERT_TRUE(error);
+        EXPECT_NE(error->message().find("Invalid metadata-URLs should match:"), std::string::npos);
+        EXPECT_TRUE(STWMetadata::readAndValidateMetadataAtUrl(misplaced, mobile, false, nullptr));
+        std::filesystem::remove_all(misplaced);
+    }
 }
 
 } // namespace

@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 
 #include <chrono>
+#include <future>
 #include <thread>
 
 namespace {
@@ -162,6 +163,57 @@ TEST_F(STWUserIdentityCacheTest, RepopulatingFromIdentitiesInventsTheUnspecificO
     EXPECT_TRUE(unspecific->isNoSpecificPersona());
     EXPECT_EQ(unspecific->kernelPersonaID(), 7u);
     EXPECT_EQ(cache->userIdentityWithPersonaID(8)->identifier(), "E");
+}
+
+TEST_F(STWUserIdentityCacheTest, AListWithoutAPersonalPersonaIsRetriedUntilItHasOne) {
+    STWUserIdentityCache::setResyncRetryInterval(std::chrono::milliseconds(20));
+    STWTestRoot::shared().writePersonas({persona("ENT-ONLY", 1020, "enterprise", {STWValue("com.only")})});
+    cache->flush();
+    // The rebuild keeps failing, holding the lock, until the list is fixed behind its back.
+    auto fixer = std::async(std::launch::async, [] {
+        std::this_thread::sleep_for(std::chrono::milliseconds(150));
+        STWTestRoot::shared().writePersonas({
+            persona("PERSONAL", 1000, "personal"),
+            persona("ENT-ONLY", 1020, "enterprise", {STWValue("com.only")}),
+        });
+    });
+    auto identities = cache->userIdentitiesForBundleIdentifier("com.only");
+    fixer.get();
+    EXPECT_EQ(identifiers(identities), std::set<std::string>{"ENT-ONLY"});
+    EXPECT_EQ(cache->userIdentityWithPersonaID(1000)->personaType(), STWPersonaTypePersonal);
+}
+
+TEST_F(STWUserIdentityCacheTest, ExhaustedRetriesStopTheDaemon) {
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    EXPECT_DEATH(
+        {
+            STWTestRoot::shared().writePersonas({});
+            cache->flush();
+            cache->userIdentityForPersonalPersona();
+        },
+        "Could not obtain persona attributes after exhausting retries\\.");
+}
+
+TEST_F(STWUserIdentityCacheTest, AnUnregisteredCacheKeepsWhatItHas) {
+    ASSERT_TRUE(cache->userIdentityForCurrentUserWithPersonaUniqueString(std::string("ENT-1")));
+    cache->unregister();
+    EXPECT_FALSE(cache->isRegistered());
+    STWTestRoot::shared().writePersonas({persona("PERSONAL", 1000, "personal")});
+    // A registered cache applies such a change within a few milliseconds (see above).
+    std::this_thread::sleep_for(std::chrono::milliseconds(300));
+    EXPECT_FALSE(cache->cacheInvalid());
+    EXPECT_TRUE(cache->userIdentityForCurrentUserWithPersonaUniqueString(std::string("ENT-1")));
+}
+
+TEST_F(STWUserIdentityCacheTest, AnEmptyPersonaMapStillVisitsTheDefaultIdentityOnce) {
+    auto home = STWTestRoot::shared().resolve("/private/var/mobile");
+    cache->flushAndRepopulateWithUserIdentities(
+        {STWUserIdentity::initWithUID(501, 501, home, std::nullopt, STWPersonaTypePersonal, 501)});
+    std::vector<STWUserIdentityRef> visited;
+    cache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
+        [&](const STWUserIdentityRef& identity) { visited.push_back(identity); });
+    ASSERT_EQ(visited.size(), 1u);
+    EXPECT_EQ(visited[0], STWUserIdentityCache::defaultUserIdentity());
 }
 
 } // namespace
