@@ -91,14 +91,14 @@ std::unique_ptr<STWClient> STWClient::connect(const std::filesystem::path& socke
         client.reset(new STWClient(fd));
     } catch (...) {
         close(fd);
-        STWSetError(error, STWErrorForCurrentException(__func__, __LINE__, false));
+        STWSetError(error, STWErrorForCurrentException(__func__, __LINE__, STWExceptionReport::None));
         return nullptr;
     }
     try {
         client->_reader = std::thread([c = client.get()] { c->_readReplies(); });
     } catch (...) {
         // The destructor closes the socket.
-        STWSetError(error, STWErrorForCurrentException(__func__, __LINE__, false));
+        STWSetError(error, STWErrorForCurrentException(__func__, __LINE__, STWExceptionReport::None));
         return nullptr;
     }
     return client;
@@ -124,7 +124,7 @@ std::optional<uint64_t> STWClient::hello(const STWValue::Dictionary& identity,
     try {
         reply = _exchange(STWFrameKindHello, identity, timeout, error);
     } catch (...) {
-        STWSetError(error, STWErrorForCurrentException(__func__, __LINE__, false));
+        STWSetError(error, STWErrorForCurrentException(__func__, __LINE__, STWExceptionReport::None));
     }
     if (!reply)
         return std::nullopt;
@@ -143,7 +143,7 @@ std::optional<STWValue::Dictionary> STWClient::sendMessage(const STWValue::Dicti
     try {
         return _exchange(STWFrameKindRequest, message, timeout, error);
     } catch (...) {
-        STWSetError(error, STWErrorForCurrentException(__func__, __LINE__, false));
+        STWSetError(error, STWErrorForCurrentException(__func__, __LINE__, STWExceptionReport::None));
         return std::nullopt;
     }
 }

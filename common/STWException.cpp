@@ -39,7 +39,11 @@ std::string STWUncaughtExceptionReport(const std::string& name, const std::strin
     return report;
 }
 
-STWErrorRef STWErrorForCurrentException(const char* function, uint64_t line, bool terminateWithReport) {
+STWExceptionReport STWExceptionReportForImage(bool internalImage) {
+    return internalImage ? STWExceptionReport::Terminate : STWExceptionReport::None;
+}
+
+STWErrorRef STWErrorForCurrentException(const char* function, uint64_t line, STWExceptionReport report) {
     std::string name = "unknown exception";
     std::string reason;
     try {
@@ -49,8 +53,11 @@ STWErrorRef STWErrorForCurrentException(const char* function, uint64_t line, boo
         reason = e.what();
     } catch (...) {
     }
-    if (terminateWithReport)
+    if (report == STWExceptionReport::Terminate)
         STWLog::fatal(function, STWUncaughtExceptionReport(name, reason));
+    if (report == STWExceptionReport::Log)
+        STW_LOG_FN(function, STWLogLevel::Error, STWLogCategory::Unspecified, "%@",
+                   STWUncaughtExceptionReport(name, reason));
     return STWErrorCreate(STWErrorDomain, STWErrorException, function, line, nullptr, true, "Got exception: %@ : %@",
                           name, reason);
 }

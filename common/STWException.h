@@ -9,8 +9,16 @@
 #include <cstdint>
 #include <string>
 
-// Call inside a catch block. With `terminateWithReport` the process stops instead.
-STWErrorRef STWErrorForCurrentException(const char* function, uint64_t line, bool terminateWithReport);
+enum class STWExceptionReport {
+    None,      // only the code 40 error
+    Log,       // the report goes to the log too, and the operation still fails with 40
+    Terminate, // the process stops with the report
+};
+
+// Call inside a catch block.
+STWErrorRef STWErrorForCurrentException(const char* function, uint64_t line, STWExceptionReport report);
+// Terminate on an internal image, else None: what most operation edges want.
+STWExceptionReport STWExceptionReportForImage(bool internalImage);
 
 // "** INTERNAL ERROR: Uncaught Exception **", the thread's name, the exception's name and
 // reason, "Stack:" and the call-stack symbols of the caller.

@@ -1,19 +1,16 @@
 #include "Daemon/CodeSigning/STWSQLiteDB.h"
 
+#include "common/STWException.h"
 #include "common/STWLog.h"
 #include "common/STWPropertyList.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
 
-#include <cxxabi.h>
-#include <execinfo.h>
 #include <sqlite3.h>
 
 #include <array>
 #include <cstdlib>
 #include <exception>
 #include <new>
-#include <pthread.h>
-#include <typeinfo>
 
 namespace {
 
@@ -121,48 +118,12 @@ constexpr std::array<QueryText, 12> kQueries = {{
     {"DELETE FROM code_signing_info WHERE (placeholder & ?) > 0;", PrepareKind::Delete},
 }};
 
-std::string exceptionName(const std::type_info& type) {
-    int status = 0;
-    char* demangled = abi::__cxa_demangle(type.name(), nullptr, nullptr, &status);
-    std::string name = status == 0 && demangled ? demangled : type.name();
-    free(demangled);
-    return name;
-}
-
-// Internal builds get the uncaught-exception report of the catch site in the log, so that
-// an exception that should never happen can be traced back. The operation still fails
-// with code 40 and its transaction is still rolled back; the daemon goes on.
-void reportUncaughtException(const std::string& name, const std::string& reason) {
-    if (!STWGlobalConfiguration::sharedInstance()->isInternalImage())
-        return;
-    char thread[64] = "";
-    pthread_getname_np(pthread_self(), thread, sizeof thread);
-    void* frames[64];
-    int count = backtrace(frames, 64);
-    std::string stack;
-    if (char** symbols = backtrace_symbols(frames, count)) {
-        for (int i = 0; i < count; ++i)
-            stack += STWFormat("%s\n", symbols[i]);
-        free(symbols);
-    }
-    STW_LOG_ERROR(STWLogCategory::Database, "** INTERNAL ERROR: Uncaught Exception **\n%s\n%@: %@\nStack:\n%@",
-                  thread, name, reason, stack);
-}
-
-// Turns whatever was thrown into the code 40 error that callers of the database expect.
+// Internal builds log the uncaught-exception report of the catch site, so that an
+// exception that should never happen can be traced back. The operation still fails with
+// code 40 and its transaction is still rolled back; the daemon goes on.
 STWErrorRef errorForCurrentException(const char* function, uint64_t line) {
-    std::string name = "unknown exception";
-    std::string reason;
-    try {
-        throw;
-    } catch (const std::exception& e) {
-        name = exceptionName(typeid(e));
-        reason = e.what();
-    } catch (...) {
-    }
-    reportUncaughtException(name, reason);
-    return STWErrorCreate(STWErrorDomain, STWErrorException, function, line, nullptr, true,
-                          "Got exception: %@ : %@", name, reason);
+    bool internal = STWGlobalConfiguration::sharedInstance()->isInternalImage();
+    return STWErrorForCurrentException(function, line, internal ? STWExceptionReport::Log : STWExceptionReport::None);
 }
 
 #define STW_EXCEPTION_ERROR() errorForCurrentException(__func__, __LINE__)

@@ -26,8 +26,9 @@ Result guarded(const char* function, uint64_t line, STWErrorRef* error, Result f
     try {
         return body();
     } catch (...) {
-        STWSetError(error, STWErrorForCurrentException(function, line,
-                                                       STWGlobalConfiguration::sharedInstance()->isInternalImage()));
+        STWSetError(error, STWErrorForCurrentException(
+                               function, line,
+                               STWExceptionReportForImage(STWGlobalConfiguration::sharedInstance()->isInternalImage())));
         return failure;
     }
 }

@@ -142,7 +142,8 @@ T catchingExceptions(const char* function, uint64_t* error, T failure, const std
     try {
         return body();
     } catch (...) {
-        STWErrorForCurrentException(function, __LINE__, STWGlobalConfiguration::sharedInstance()->isInternalImage());
+        STWErrorForCurrentException(function, __LINE__,
+                                    STWExceptionReportForImage(STWGlobalConfiguration::sharedInstance()->isInternalImage()));
         *error = STWErrorException;
         return failure;
     }
