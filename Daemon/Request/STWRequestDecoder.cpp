@@ -40,14 +40,14 @@ STWUserIdentityRef STWRequestDecoder::userIdentityForContainerIdentifier(const S
     if (!caller || !STWContainerClassIsPerUser(containerClass) || !caller->isNoSpecificPersona())
         return caller;
     // Plug-in data belongs to the persona of its parent application. The code-signing
-    // mapping that knows parents is not part of this build, so no child has a parent
-    // yet and the lookup below finds nothing for plug-in classes.
+    // mapping that knows parents is not part of this build, so no child has a parent yet;
+    // without one the lookup is that of an unknown bundle, which belongs to the personal
+    // persona.
     std::optional<std::string> lookupIdentifier = identifier;
     if (STWContainerClassIsChildData(containerClass))
         lookupIdentifier = std::nullopt;
-    STWUserIdentitySet identities;
-    if (lookupIdentifier)
-        identities = STWUserIdentitySharedCache::sharedInstance()->userIdentitiesForBundleIdentifier(*lookupIdentifier);
+    STWUserIdentitySet identities =
+        STWUserIdentitySharedCache::sharedInstance()->userIdentitiesForBundleIdentifier(lookupIdentifier.value_or(""));
     STW_LOG_DEBUG(STWLogCategory::Tolvan, "Chose bundleIdentifier: %@, userIdentities: %@ for identifier: %@, class: %llu",
                   lookupIdentifier ? STWFormatArg(*lookupIdentifier) : STWFormatArg(nullptr), describeSet(identities),
                   identifier, containerClass);

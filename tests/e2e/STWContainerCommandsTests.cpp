@@ -76,6 +76,11 @@ TEST_F(STWContainerCommandsTest, LookupWithoutCreateFindsNothingAndMakesNothing)
     // Class 0 and 14 are not classes.
     EXPECT_EQ(STWDaemonProcess::replyError(*client, 0, createKeys("com.example.absent", 0)), STWErrorUnexpectedClass);
     EXPECT_EQ(STWDaemonProcess::replyError(*client, 0, createKeys("com.example.absent", 14)), STWErrorUnexpectedClass);
+    // Plug-in data whose parent is unknown belongs, like any unknown bundle, to the
+    // personal persona.
+    auto plugin = STWDaemonProcess::send(*client, 0, createKeys("com.example.plugin", 4));
+    ASSERT_EQ(code(plugin), STWErrorSuccess);
+    EXPECT_EQ(*STWDictionaryString(plugin, "ReplyPersonaUniqueString"), "PERSONAL-1");
 }
 
 TEST_F(STWContainerCommandsTest, ConcurrentCreatesMakeExactlyOneContainer) {
