@@ -1,4 +1,4 @@
-#include "tests/e2e/STWDaemonProcess.h"
+#include "tests/support/STWDaemonProcess.h"
 
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWError.h"
