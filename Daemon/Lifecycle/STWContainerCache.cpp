@@ -8,6 +8,7 @@
 #include "common/STWLog.h"
 #include "platform/STWSandboxMappingStore.h"
 
+#include <malloc.h>
 #include <unordered_set>
 
 namespace fs = std::filesystem;
@@ -169,6 +170,12 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
             STW_LOG_ERROR(STWLogCategory::Cache, "Failed to set container mapping during create/lookup operation of %@, %llu",
                           record->identifier(), contentClass);
     }
+    // The listing was allocated before the records that stay and now lies free beneath
+    // them, where the allocator would keep it resident: a std::filesystem::path per entry
+    // holds a parsed copy of every component, several hundred bytes each, so a class of
+    // 100,000 containers would pin some 70 MB that nothing uses. Give those pages back.
+    entries.reset();
+    malloc_trim(0);
 
     auto inserted = caches.emplace(std::move(key), std::move(cache)).first;
     signpost("RebuildingCache", false, contentClass);
