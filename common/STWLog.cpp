@@ -32,8 +32,10 @@ std::atomic<bool> fileOpen{false};
 
 STWLogLevel levelFromEnvironment() {
     const char* env = getenv("STOWLY_LOG_LEVEL");
+    // Like the platform's own system log, info and debug lines are kept only when asked for:
+    // at info level every request would format and write the caller's whole description.
     if (!env)
-        return STWLogLevel::Info;
+        return STWLogLevel::Notice;
     static const std::pair<const char*, STWLogLevel> names[] = {
         {"fault", STWLogLevel::Fault},   {"error", STWLogLevel::Error}, {"default", STWLogLevel::Default},
         {"notice", STWLogLevel::Notice}, {"info", STWLogLevel::Info},   {"debug", STWLogLevel::Debug},
@@ -41,7 +43,7 @@ STWLogLevel levelFromEnvironment() {
     for (const auto& [name, level] : names)
         if (strcasecmp(env, name) == 0)
             return level;
-    return STWLogLevel::Info;
+    return STWLogLevel::Notice;
 }
 
 std::atomic<int> systemLevel{static_cast<int>(levelFromEnvironment())};

@@ -54,7 +54,8 @@ public:
     static void closeLogFile();
     static bool fileIsOpen();
 
-    // The most verbose level the system log takes (default Info, or STOWLY_LOG_LEVEL).
+    // The most verbose level the system log takes (default Notice, or STOWLY_LOG_LEVEL:
+    // fault, error, default, notice, info or debug).
     static void setSystemLogLevel(STWLogLevel level);
 
     // True when some destination takes this level; callers skip formatting otherwise.
