@@ -87,10 +87,10 @@ STWFrameReadResult STWFrameReader::read(STWFrame& frame, std::string* reason) {
                 return STWFrameReadResult::Frame;
             }
         }
-        size_t before = _end;
-        if (!_fill(reason))
+        size_t received = 0;
+        if (!_fill(&received, reason))
             return STWFrameReadResult::Error;
-        if (_end == before) {
+        if (received == 0) {
             if (_start == _end)
                 return STWFrameReadResult::EndOfStream;
             fail(reason, "connection closed inside a frame");
@@ -100,8 +100,10 @@ STWFrameReadResult STWFrameReader::read(STWFrame& frame, std::string* reason) {
     }
 }
 
-// Receives what is there (at least one byte, or end of stream) after the buffered bytes.
-bool STWFrameReader::_fill(std::string* reason) {
+// Receives what is there (at least one byte, or end of stream) after the buffered bytes;
+// `received` is 0 only at the end of the stream. The buffered bytes may move to the front
+// first, so the caller cannot tell what came from the size of the buffer.
+bool STWFrameReader::_fill(size_t* received, std::string* reason) {
     if (_start > 0) {
         // Move the unconsumed tail to the front instead of growing.
         memmove(_buffer.data(), _buffer.data() + _start, _end - _start);
@@ -113,7 +115,8 @@ bool STWFrameReader::_fill(std::string* reason) {
     for (;;) {
         ssize_t n = recv(_fd, _buffer.data() + _end, _buffer.size() - _end, 0);
         if (n >= 0) {
-            _end += static_cast<size_t>(n);
+            *received = static_cast<size_t>(n);
+            _end += *received;
             return true;
         }
         if (errno == EINTR)

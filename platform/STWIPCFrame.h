@@ -53,7 +53,7 @@ public:
     STWFrameReadResult read(STWFrame& frame, std::string* reason);
 
 private:
-    bool _fill(std::string* reason);
+    bool _fill(size_t* received, std::string* reason);
 
     int _fd;
     std::vector<char> _buffer;

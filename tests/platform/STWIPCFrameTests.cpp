@@ -116,6 +116,24 @@ TEST_F(STWFrameSocketTest, ReadsFramesPackedTogetherAndSplitApart) {
     writer.join();
 }
 
+TEST_F(STWFrameSocketTest, ReadOfAsManyBytesAsWereConsumedIsNotTheEnd) {
+    // The first frame and the head of the second arrive together; the rest of the second
+    // is exactly as long as the first. Once the reader has moved the head to the front of
+    // its buffer, that last read leaves the buffer as full as before it.
+    std::string first = STWFrameEncode(STWFrameKindRequest, 1, {{"N", STWValue(1)}});
+    std::string second = STWFrameEncode(STWFrameKindRequest, 2, {{"Blob", STWValue(STWData(100, 7))}});
+    ASSERT_GT(second.size(), first.size());
+    size_t head = second.size() - first.size();
+    writeRaw(first + second.substr(0, head));
+    STWFrameReader reader(fds[0]);
+    STWFrame frame;
+    std::string reason;
+    ASSERT_EQ(reader.read(frame, &reason), STWFrameReadResult::Frame) << reason;
+    writeRaw(second.substr(head));
+    ASSERT_EQ(reader.read(frame, &reason), STWFrameReadResult::Frame) << reason;
+    EXPECT_EQ(frame.id, 2u);
+}
+
 TEST_F(STWFrameSocketTest, EndOfStreamInsideAFrameIsAnError) {
     std::string frame = STWFrameEncode(STWFrameKindRequest, 1, {{"K", STWValue("value")}});
     for (size_t cut : {size_t(2), frame.size() - 1}) {
