@@ -91,3 +91,8 @@ template <class... Args>
 std::string STWFormat(std::string_view format, const Args&... args) {
     return STWFormatv(format, {STWFormatArg(args)...});
 }
+
+// The value of one hexadecimal digit (either case), or -1.
+int STWHexDigit(char c);
+// Lower-case hexadecimal text of `length` bytes.
+std::string STWHexString(const unsigned char* bytes, size_t length);

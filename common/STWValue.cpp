@@ -1,5 +1,7 @@
 #include "common/STWValue.h"
 
+#include "common/STWFormat.h"
+
 #include <cinttypes>
 #include <cmath>
 #include <cstdio>
@@ -13,16 +15,6 @@ namespace {
 
 size_t combine(size_t seed, size_t v) {
     return seed ^ (v + 0x9e3779b97f4a7c15ULL + (seed << 6) + (seed >> 2));
-}
-
-int hexDigit(char c) {
-    if (c >= '0' && c <= '9')
-        return c - '0';
-    if (c >= 'a' && c <= 'f')
-        return c - 'a' + 10;
-    if (c >= 'A' && c <= 'F')
-        return c - 'A' + 10;
-    return -1;
 }
 
 void appendQuoted(std::string& out, const std::string& s) {
@@ -68,7 +60,7 @@ std::optional<STWUUID> STWUUID::fromString(std::string_view text) {
             ++i;
             continue;
         }
-        int hi = hexDigit(text[i]), lo = hexDigit(text[i + 1]);
+        int hi = STWHexDigit(text[i]), lo = STWHexDigit(text[i + 1]);
         if (hi < 0 || lo < 0)
             return std::nullopt;
         u.bytes[b++] = static_cast<uint8_t>(hi << 4 | lo);

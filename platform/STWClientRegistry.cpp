@@ -228,12 +228,7 @@ std::optional<std::string> STWClientRegistry::_digestOfExecutable(int fd, STWErr
     unsigned char digest[EVP_MAX_MD_SIZE];
     unsigned int digestLength = 0;
     EVP_DigestFinal_ex(context.get(), digest, &digestLength);
-    static const char* hex = "0123456789abcdef";
-    std::string text;
-    for (unsigned i = 0; i < digestLength; i++) {
-        text += hex[digest[i] >> 4];
-        text += hex[digest[i] & 15];
-    }
+    std::string text = STWHexString(digest, digestLength);
     std::lock_guard guard(_digestLock);
     _digestLock_digests[key] = text;
     return text;

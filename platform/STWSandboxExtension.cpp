@@ -1,6 +1,7 @@
 #include "platform/STWSandboxExtension.h"
 
 #include "common/STWFileIO.h"
+#include "common/STWFormat.h"
 #include "platform/STWPlatformConfiguration.h"
 
 #include <cerrno>
@@ -48,13 +49,7 @@ std::string STWSandboxExtension::tokenWithKey(const std::string& key, std::strin
     unsigned int length = 0;
     HMAC(EVP_sha256(), key.data(), static_cast<int>(key.size()), reinterpret_cast<const unsigned char*>(message.data()),
          message.size(), digest, &length);
-    static const char* hex = "0123456789abcdef";
-    std::string token;
-    for (unsigned i = 0; i < length; i++) {
-        token += hex[digest[i] >> 4];
-        token += hex[digest[i] & 15];
-    }
-    return token;
+    return STWHexString(digest, length);
 }
 
 std::optional<std::string> STWSandboxExtension::issueFileExtension(std::string_view extensionClass,

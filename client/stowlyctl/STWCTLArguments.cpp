@@ -2,6 +2,7 @@
 
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWFileIO.h"
+#include "common/STWFormat.h"
 #include "common/STWPropertyList.h"
 
 #include <cctype>
@@ -30,16 +31,6 @@ std::vector<std::string_view> splitCommas(std::string_view text) {
             return parts;
         start = comma + 1;
     }
-}
-
-int hexDigit(char c) {
-    if (c >= '0' && c <= '9')
-        return c - '0';
-    if (c >= 'a' && c <= 'f')
-        return c - 'a' + 10;
-    if (c >= 'A' && c <= 'F')
-        return c - 'A' + 10;
-    return -1;
 }
 
 std::optional<std::string> utf8(std::string_view text) {
@@ -120,7 +111,7 @@ std::optional<STWValue> STWCTLParseTypedValue(std::string_view type, std::string
         STWData data;
         data.reserve(text.size() / 2);
         for (size_t i = 0; i < text.size(); i += 2) {
-            int hi = hexDigit(text[i]), lo = hexDigit(text[i + 1]);
+            int hi = STWHexDigit(text[i]), lo = STWHexDigit(text[i + 1]);
             if (hi < 0 || lo < 0)
                 return refuse(reason, quoted + " is not hexadecimal");
             data.push_back(static_cast<uint8_t>(hi << 4 | lo));
