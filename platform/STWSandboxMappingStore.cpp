@@ -16,21 +16,6 @@ namespace {
 std::mutex sharedMutex;
 std::shared_ptr<STWSandboxMappingStore> shared;
 
-class Descriptor {
-public:
-    explicit Descriptor(int fd = -1) : _fd(fd) {}
-    ~Descriptor() {
-        if (_fd >= 0)
-            close(_fd);
-    }
-    Descriptor(const Descriptor&) = delete;
-    Descriptor& operator=(const Descriptor&) = delete;
-    int get() const { return _fd; }
-
-private:
-    int _fd;
-};
-
 constexpr int directoryFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
 
 // Opens the directory `name` inside `parent`, creating it first when asked. A symbolic link
@@ -56,15 +41,27 @@ std::string personaDirectoryName(const STWSandboxMappingItem& item) {
                                     : std::string(STWSandboxMappingStore::noPersonaDirectoryName);
 }
 
-// A name for the link before it is renamed into place. Unique within the process; a
-// collision with a stray entry is retried with the next number.
-std::string temporaryName() {
-    static std::atomic<uint64_t> counter{0};
-    return STWFormat(".stowly-tmp-%d-%llu", static_cast<int>(getpid()),
-                     static_cast<unsigned long long>(counter.fetch_add(1)));
+std::string directoryKey(const STWSandboxMappingItem& item) {
+    return STWFormat("%u/%@/%llu", item.uid, personaDirectoryName(item),
+                     static_cast<unsigned long long>(item.itemType));
 }
 
 } // namespace
+
+class STWFileSandboxMappingStore::Directory {
+public:
+    explicit Directory(int fd) : _fd(fd) {}
+    ~Directory() {
+        if (_fd >= 0)
+            close(_fd);
+    }
+    Directory(const Directory&) = delete;
+    Directory& operator=(const Directory&) = delete;
+    int fd() const { return _fd; }
+
+private:
+    int _fd;
+};
 
 std::string STWSandboxMappingItem::description() const {
     return STWFormat("<mapping uid %u, persona %@ (%u), itemType %llu, identifier %@>", uid,
@@ -92,25 +89,28 @@ bool STWSandboxMappingStore::isSafePathComponent(std::string_view name) {
 }
 
 STWFileSandboxMappingStore::STWFileSandboxMappingStore(std::filesystem::path baseDirectory)
-    : _baseDirectory(std::move(baseDirectory)) {}
+    : _baseDirectory(std::move(baseDirectory)),
+      _temporaryPrefix(STWFormat(".stowly-tmp-%d-", static_cast<int>(getpid()))) {}
 
+// A name for a link before it is renamed into place. Unique within the process; a collision
+// with a stray entry (or a forked child's) is retried with the next number.
+std::string STWFileSandboxMappingStore::_temporaryName() {
+    static std::atomic<uint64_t> counter{0};
+    return _temporaryPrefix + std::to_string(counter.fetch_add(1));
+}
+
+// Walks from the base to the item's ITEMTYPE directory. Answers the descriptor or -errno.
 int STWFileSandboxMappingStore::_openItemDirectory(const STWSandboxMappingItem& item, bool create) {
-    if (!isSafePathComponent(item.identifier))
-        return -EINVAL;
-    if (item.personaUniqueString &&
-        (!isSafePathComponent(*item.personaUniqueString) || *item.personaUniqueString == noPersonaDirectoryName))
-        return -EINVAL;
-
     // The base directory is ours (from the configuration), so its parents may be links;
     // only the store's own tree is walked without following them.
     if (create) {
         std::error_code ec;
         std::filesystem::create_directories(_baseDirectory.parent_path(), ec);
     }
-    Descriptor parent(open(_baseDirectory.parent_path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (parent.get() < 0)
+    Directory parent(open(_baseDirectory.parent_path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (parent.fd() < 0)
         return -errno;
-    int current = openChildDirectory(parent.get(), _baseDirectory.filename().string(), create);
+    int current = openChildDirectory(parent.fd(), _baseDirectory.filename().string(), create);
     if (current < 0)
         return current;
 
@@ -126,48 +126,92 @@ int STWFileSandboxMappingStore::_openItemDirectory(const STWSandboxMappingItem& 
     return current;
 }
 
+STWFileSandboxMappingStore::DirectoryRef STWFileSandboxMappingStore::_itemDirectory(const STWSandboxMappingItem& item,
+                                                                                    bool create, int* error) {
+    if (!isSafePathComponent(item.identifier) ||
+        (item.personaUniqueString &&
+         (!isSafePathComponent(*item.personaUniqueString) || *item.personaUniqueString == noPersonaDirectoryName))) {
+        *error = EINVAL;
+        return nullptr;
+    }
+    std::string key = directoryKey(item);
+    std::lock_guard guard(_directoriesLock);
+    if (auto it = _directoriesLock_directories.find(key); it != _directoriesLock_directories.end())
+        return it->second;
+    int fd = _openItemDirectory(item, create);
+    if (fd < 0) {
+        *error = -fd;
+        return nullptr;
+    }
+    auto directory = std::make_shared<const Directory>(fd);
+    _directoriesLock_directories.emplace(std::move(key), directory);
+    return directory;
+}
+
+void STWFileSandboxMappingStore::_forgetItemDirectory(const STWSandboxMappingItem& item,
+                                                      const DirectoryRef& directory) {
+    std::lock_guard guard(_directoriesLock);
+    auto it = _directoriesLock_directories.find(directoryKey(item));
+    if (it != _directoriesLock_directories.end() && it->second == directory)
+        _directoriesLock_directories.erase(it);
+}
+
 int STWFileSandboxMappingStore::setUserStateItem(const STWSandboxMappingItem& item,
                                                  const std::optional<std::filesystem::path>& path) {
     if (path && (path->empty() || path->native().find('\0') != std::string::npos))
         return EINVAL;
-    int fd = _openItemDirectory(item, path.has_value());
-    if (fd < 0) {
+    int error = 0;
+    DirectoryRef directory = _itemDirectory(item, path.has_value(), &error);
+    if (!directory) {
         // Nothing to withdraw when the directories are not there.
-        if (!path && fd == -ENOENT)
-            return 0;
-        return -fd;
+        return !path && error == ENOENT ? 0 : error;
     }
-    Descriptor directory(fd);
 
     if (!path) {
-        if (unlinkat(directory.get(), item.identifier.c_str(), 0) == 0 || errno == ENOENT)
+        // In a directory removed since it was opened, the link is gone with it.
+        if (unlinkat(directory->fd(), item.identifier.c_str(), 0) == 0 || errno == ENOENT)
             return 0;
         return errno;
     }
 
-    std::string temporary;
+    // With no mapping there (the usual case: pushes withdraw first), the link is made under
+    // its own name. A mapping that is there is replaced through a temporary name and a
+    // rename, so that readers see the old path or the new one, never neither.
+    std::string name = item.identifier;
     for (int attempt = 0;; ++attempt) {
-        temporary = temporaryName();
-        if (symlinkat(path->c_str(), directory.get(), temporary.c_str()) == 0)
-            break;
-        if (errno != EEXIST || attempt == 100)
-            return errno;
+        if (symlinkat(path->c_str(), directory->fd(), name.c_str()) != 0) {
+            int e = errno;
+            if (e == ENOENT && attempt == 0) {
+                // The kept directory has been removed: walk to the current one.
+                _forgetItemDirectory(item, directory);
+                if (!(directory = _itemDirectory(item, true, &error)))
+                    return error;
+                continue;
+            }
+            if (e == EEXIST && attempt < 100) {
+                name = _temporaryName();
+                continue;
+            }
+            return e;
+        }
+        if (name == item.identifier)
+            return 0;
+        if (renameat(directory->fd(), name.c_str(), directory->fd(), item.identifier.c_str()) != 0) {
+            int e = errno;
+            unlinkat(directory->fd(), name.c_str(), 0);
+            return e;
+        }
+        return 0;
     }
-    if (renameat(directory.get(), temporary.c_str(), directory.get(), item.identifier.c_str()) != 0) {
-        int e = errno;
-        unlinkat(directory.get(), temporary.c_str(), 0);
-        return e;
-    }
-    return 0;
 }
 
 std::optional<std::filesystem::path> STWFileSandboxMappingStore::userStateItem(const STWSandboxMappingItem& item) {
-    int fd = _openItemDirectory(item, false);
-    if (fd < 0)
+    int error = 0;
+    DirectoryRef directory = _itemDirectory(item, false, &error);
+    if (!directory)
         return std::nullopt;
-    Descriptor directory(fd);
     char buffer[PATH_MAX];
-    ssize_t length = readlinkat(directory.get(), item.identifier.c_str(), buffer, sizeof(buffer));
+    ssize_t length = readlinkat(directory->fd(), item.identifier.c_str(), buffer, sizeof(buffer));
     if (length < 0 || static_cast<size_t>(length) >= sizeof(buffer))
         return std::nullopt;
     return std::filesystem::path(std::string(buffer, static_cast<size_t>(length)));

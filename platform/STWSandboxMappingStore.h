@@ -9,14 +9,21 @@
 // UID and ITEMTYPE are decimal numbers. PERSONA is the persona unique string of the user
 // identity, or the word "nopersona" for an identity without one (no persona support, or the
 // default identity); a persona unique string equal to that word is refused, so the two can
-// never share a directory. A mapping is set by creating the link under a temporary name in
-// the same directory and renaming it over IDENTIFIER, so a reader sees the old path or the
-// new one, never neither; it is withdrawn by removing the link.
+// never share a directory. A mapping is set by creating the link IDENTIFIER; one that is
+// there already is replaced by creating the link under a temporary name in the same
+// directory and renaming it over IDENTIFIER, so a reader sees the old path or the new one,
+// never neither. A mapping is withdrawn by removing the link.
 //
 // Identifiers and persona strings come from clients and are treated as hostile: each must
 // be one safe path component (not empty, not "." or "..", no "/" and no NUL). The store's
 // directories are opened one component at a time without following symbolic links, so a
 // link planted in the tree can never redirect a write outside it.
+//
+// A rebuild pushes one mapping per container, so the store keeps each ITEMTYPE directory
+// open once it has found it: a push is then a few calls on that descriptor rather than a
+// walk from the base. A directory removed behind the store's back (someone clearing the
+// runtime directory) is noticed when a link cannot be made in it, and is opened afresh.
+// Only root can write the tree, so nobody else can swap a kept directory for another.
 //
 // STWSandboxMappingStore is the interface; sharedInstance() is the Linux store of the
 // configured root prefix unless a test installed another with setSharedInstance().
@@ -25,10 +32,12 @@
 #include <cstdint>
 #include <filesystem>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <sys/types.h>
+#include <unordered_map>
 
 // Which item of the store: the fields the sandbox keys its user state by.
 struct STWSandboxMappingItem {
@@ -78,9 +87,21 @@ public:
     std::optional<std::filesystem::path> userStateItem(const STWSandboxMappingItem& item) override;
 
 private:
-    // Opens (creating with mode 0755 when `create`) the ITEMTYPE directory of the item,
-    // refusing symbolic links on the way. Answers the descriptor or -errno.
-    int _openItemDirectory(const STWSandboxMappingItem& item, bool create);
+    class Directory;
+    using DirectoryRef = std::shared_ptr<const Directory>;
 
-    std::filesystem::path _baseDirectory;
+    // The ITEMTYPE directory of the item: a kept one, or one opened (creating what is
+    // missing with mode 0755 when `create`) refusing symbolic links on the way, then kept.
+    // nullptr with `*error` set to the errno value when it cannot be opened.
+    DirectoryRef _itemDirectory(const STWSandboxMappingItem& item, bool create, int* error);
+    // Stops keeping `directory` for the item (unless another has replaced it already).
+    void _forgetItemDirectory(const STWSandboxMappingItem& item, const DirectoryRef& directory);
+    int _openItemDirectory(const STWSandboxMappingItem& item, bool create);
+    std::string _temporaryName();
+
+    const std::filesystem::path _baseDirectory;
+    const std::string _temporaryPrefix;
+    std::mutex _directoriesLock;
+    // "UID/PERSONA/ITEMTYPE" to its open directory.
+    std::unordered_map<std::string, DirectoryRef> _directoriesLock_directories;
 };

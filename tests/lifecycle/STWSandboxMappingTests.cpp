@@ -191,4 +191,19 @@ TEST_F(STWSandboxMappingTest, ReplacingAMappingNeverLeavesItMissing) {
     EXPECT_EQ(entries(base / "501/PERSONAL/1", false), std::set<fs::path>{base / "501/PERSONAL/1/com.example.app"});
 }
 
+TEST_F(STWSandboxMappingTest, AStoreClearedBehindItsBackIsBuiltAgain) {
+    STWSandboxMappingItem item{501, std::string("PERSONAL"), 1000, 1, "com.example.app"};
+    const fs::path container("/private/var/mobile/Containers/Data/Application/A");
+    ASSERT_EQ(store->setUserStateItem(item, container), 0);
+    // Whoever clears the runtime directory takes the directories the store keeps open.
+    fs::remove_all(base);
+    EXPECT_EQ(store->userStateItem(item), std::nullopt);
+    EXPECT_EQ(store->setUserStateItem(item, std::nullopt), 0);
+    ASSERT_EQ(store->setUserStateItem(item, container), 0);
+    EXPECT_EQ(fs::read_symlink(base / "501/PERSONAL/1/com.example.app"), container);
+    EXPECT_EQ(store->userStateItem(item), container);
+    EXPECT_EQ(store->setUserStateItem(item, std::nullopt), 0);
+    EXPECT_FALSE(fs::exists(fs::symlink_status(base / "501/PERSONAL/1/com.example.app")));
+}
+
 } // namespace
