@@ -1075,15 +1075,40 @@ bool STWFileManager::_traverseDirectory(const fs::path& url, STWErrorRef* error,
 std::optional<std::vector<fs::path>> STWFileManager::urlsForItemsInDirectoryAtURL(const fs::path& url,
                                                                                   STWErrorRef* error) const {
     std::string path = pathString(url);
+    std::vector<fs::path> items;
+    if (!_forEachItemInDirectory(path, __func__, error,
+                                 [&](int, const dirent& entry) { items.emplace_back(joinPath(path, entry.d_name)); }))
+        return std::nullopt;
+    return items;
+}
+
+std::optional<std::vector<STWFileManager::DirectoryItem>> STWFileManager::itemsInDirectoryAtURL(const fs::path& url,
+                                                                                              STWErrorRef* error) const {
+    std::string path = pathString(url);
+    std::vector<DirectoryItem> items;
+    bool listed = _forEachItemInDirectory(path, __func__, error, [&](int directory, const dirent& entry) {
+        bool isDirectory = entry.d_type == DT_DIR;
+        struct stat st;
+        if (entry.d_type == DT_UNKNOWN && fstatat(directory, entry.d_name, &st, AT_SYMLINK_NOFOLLOW) == 0)
+            isDirectory = S_ISDIR(st.st_mode);
+        items.push_back({joinPath(path, entry.d_name), isDirectory});
+    });
+    if (!listed)
+        return std::nullopt;
+    return items;
+}
+
+bool STWFileManager::_forEachItemInDirectory(const std::string& path, const char* function, STWErrorRef* error,
+                                             const std::function<void(int, const dirent&)>& body) const {
     DIR* directory = opendir(path.c_str());
     if (!directory) {
         int e = errno;
         if (e != ENOENT)
             STW_LOG_ERROR(STWLogCategory::FS, "opendir of %s failed: %s", path, strerror(e));
-        STWSetError(error, STW_POSIX_ERROR_NOLOG(e, "_IterateDirectory for %@ returned %s", path, strerror(e)));
-        return std::nullopt;
+        STWSetError(error, STWErrorCreate(STWPOSIXErrorDomain, e, function, __LINE__, nullptr, false,
+                                          "_IterateDirectory for %@ returned %s", path, strerror(e)));
+        return false;
     }
-    std::vector<fs::path> items;
     for (;;) {
         errno = 0;
         struct dirent* entry = readdir(directory);
@@ -1091,14 +1116,20 @@ std::optional<std::vector<fs::path>> STWFileManager::urlsForItemsInDirectoryAtUR
             int e = errno;
             closedir(directory);
             if (e) {
-                STWSetError(error, STW_POSIX_ERROR(e, "_IterateDirectory for %@ returned %s", path, strerror(e)));
-                return std::nullopt;
+                STWSetError(error, STWErrorCreate(STWPOSIXErrorDomain, e, function, __LINE__, nullptr, true,
+                                                  "_IterateDirectory for %@ returned %s", path, strerror(e)));
+                return false;
             }
-            return items;
+            return true;
         }
         if (entry->d_name[0] == '.')
             continue;
-        items.emplace_back(joinPath(path, entry->d_name));
+        try {
+            body(dirfd(directory), *entry);
+        } catch (...) {
+            closedir(directory);
+            throw;
+        }
     }
 }
 

@@ -127,6 +127,15 @@ public:
     // ENOENT.
     std::optional<std::vector<std::filesystem::path>> urlsForItemsInDirectoryAtURL(const std::filesystem::path& url,
                                                                                    STWErrorRef* error = nullptr) const;
+    // The same listing with each entry's own type (a symbolic link to a directory is not a
+    // directory), taken from the listing where the file system records it: no stat call
+    // per entry then.
+    struct DirectoryItem {
+        std::filesystem::path url;
+        bool isDirectory = false;
+    };
+    std::optional<std::vector<DirectoryItem>> itemsInDirectoryAtURL(const std::filesystem::path& url,
+                                                                    STWErrorRef* error = nullptr) const;
 
     // lstat-based: a dangling link exists. An item that cannot be examined (other than
     // ENOENT) answers NO to both.
@@ -179,4 +188,10 @@ public:
 
 private:
     STWFileManager() = default;
+
+    // The one directory listing behind both public forms: `body` sees each entry whose name
+    // does not begin with "." and the descriptor of the open directory. Errors carry
+    // `function` as their function name.
+    bool _forEachItemInDirectory(const std::string& path, const char* function, STWErrorRef* error,
+                                 const std::function<void(int directory, const struct dirent& entry)>& body) const;
 };

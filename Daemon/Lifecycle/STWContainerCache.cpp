@@ -6,10 +6,12 @@
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
 #include "common/STWException.h"
 #include "common/STWLog.h"
+#include "platform/STWQueue.h"
 #include "platform/STWSandboxMappingStore.h"
 
 #include <malloc.h>
 #include <unordered_set>
+#include <utility>
 
 namespace fs = std::filesystem;
 
@@ -45,7 +47,8 @@ std::shared_ptr<STWContainerCache> STWContainerCache::sharedInstance() {
 }
 
 STWContainerCache::STWContainerCache(std::shared_ptr<STWUserIdentityCache> userIdentityCache)
-    : _userIdentityCache(std::move(userIdentityCache)) {}
+    : _userIdentityCache(std::move(userIdentityCache)),
+      _rebuildMappingQueue(STWQueue::create("com.vorlane.stowlyd.cache.mappings")) {}
 
 std::string STWContainerCache::classCacheKey(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass) {
     std::string_view directoryName = STWContainerClassDirectoryName(contentClass);
@@ -107,6 +110,58 @@ bool STWContainerCache::containerURL(const fs::path& url, STWContainerClass isVa
     return false;
 }
 
+STWContainerCache::RebuildMappingPushes::RebuildMappingPushes(STWContainerCache& cache,
+                                                             STWContainerClass contentClass)
+    : _cache(cache), _contentClass(contentClass) {}
+
+STWContainerCache::RebuildMappingPushes::~RebuildMappingPushes() {
+    // When the rebuild ends early, queued pushes still refer to this object.
+    _drain();
+}
+
+void STWContainerCache::RebuildMappingPushes::add(STWMetadataRef record) {
+    _batch.push_back(std::move(record));
+    if (_batch.size() == kBatchSize)
+        _send();
+}
+
+void STWContainerCache::RebuildMappingPushes::finish() {
+    _send();
+    _drain();
+    // An exception inside a push is one inside the operation that rebuilds.
+    if (_exception)
+        std::rethrow_exception(std::exchange(_exception, nullptr));
+}
+
+void STWContainerCache::RebuildMappingPushes::_send() {
+    if (_batch.empty())
+        return;
+    _cache._rebuildMappingQueue->async([this, batch = std::move(_batch)] {
+        for (const STWMetadataRef& record : batch) {
+            if (_exception)
+                return;
+            try {
+                if (!_cache._setSandboxContainerMappingForUserIdentity(record->userIdentity(), record->identifier(),
+                                                                       _contentClass, record->url()))
+                    STW_LOG_ERROR(STWLogCategory::Cache,
+                                  "Failed to set container mapping during create/lookup operation of %@, %llu",
+                                  record->identifier(), _contentClass);
+            } catch (...) {
+                _exception = std::current_exception();
+            }
+        }
+    });
+    _batch.clear();
+    _queued = true;
+}
+
+void STWContainerCache::RebuildMappingPushes::_drain() {
+    if (_queued) {
+        _cache._rebuildMappingQueue->sync([] {});
+        _queued = false;
+    }
+}
+
 STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(const STWUserIdentityRef& userIdentity,
                                                                                 STWContainerClass contentClass,
                                                                                 bool transient, STWErrorRef* error) {
@@ -137,7 +192,7 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
         signpost("RebuildingCache", false, contentClass);
         return nullptr;
     }
-    auto entries = STWFileManager::defaultManager()->urlsForItemsInDirectoryAtURL(*directory, error);
+    auto entries = STWFileManager::defaultManager()->itemsInDirectoryAtURL(*directory, error);
     if (!entries) {
         signpost("RebuildingCache", false, contentClass);
         return nullptr;
@@ -146,30 +201,31 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
     ClassCache cache;
     cache.reserve(entries->size());
     bool pushMappings = populateSandboxCache && !transient;
-    for (const fs::path& entry : *entries) {
-        if (!containerURL(entry, contentClass))
+    // The mappings are pushed on their own queue, in listing order, while the next metadata
+    // files are read: a push is a few file-system calls of its own, and done inline they
+    // would double the time of a rebuild. All of them are done before the class cache is
+    // handed out, so nobody is given a container the sandbox cannot resolve yet.
+    RebuildMappingPushes pushes(*this, contentClass);
+    for (const STWFileManager::DirectoryItem& entry : *entries) {
+        if (!containerURL(entry.url, contentClass))
             continue;
         // Containers are always real directories. Per-user class directories belong to
         // their user, who could otherwise plant a link that passes the path checks of the
         // metadata reader and gets some other directory mapped into the sandbox.
-        std::error_code ec;
-        if (fs::symlink_status(entry, ec).type() != fs::file_type::directory)
+        if (!entry.isDirectory)
             continue;
         // The reader logs why a directory is not a container.
-        auto record = STWMetadata::readAndValidateMetadataAtUrl(entry, userIdentity, true, nullptr);
+        auto record = STWMetadata::readAndValidateMetadataAtUrl(entry.url, userIdentity, true, nullptr);
         if (!record)
             continue;
         record->setTransient(transient);
         // Two directories claiming one identifier: the later one in listing order stays.
         _storeRecord(cache, record);
-        if (pushMappings &&
-            _lock_shouldRegisterSandboxMappingWithUserIdentity(record->userIdentity(), record->identifier(),
-                                                               contentClass) &&
-            !_setSandboxContainerMappingForUserIdentity(record->userIdentity(), record->identifier(), contentClass,
-                                                        record->url()))
-            STW_LOG_ERROR(STWLogCategory::Cache, "Failed to set container mapping during create/lookup operation of %@, %llu",
-                          record->identifier(), contentClass);
+        if (pushMappings && _lock_shouldRegisterSandboxMappingWithUserIdentity(record->userIdentity(),
+                                                                               record->identifier(), contentClass))
+            pushes.add(record);
     }
+    pushes.finish();
     // The listing was allocated before the records that stay and now lies free beneath
     // them, where the allocator would keep it resident: a std::filesystem::path per entry
     // holds a parsed copy of every component, several hundred bytes each, so a class of

@@ -25,7 +25,10 @@
 #include "Daemon/Model/STWUserIdentityCache.h"
 #include "common/STWError.h"
 
+class STWQueue;
+
 #include <atomic>
+#include <exception>
 #include <filesystem>
 #include <memory>
 #include <mutex>
@@ -101,6 +104,32 @@ public:
 private:
     using ClassCache = std::unordered_map<std::string_view, STWMetadataRef>;
 
+    // The sandbox mappings a rebuild pushes: handed in batches, in order, to the rebuild
+    // mapping queue, and all done once finish() (or the destructor) returns. finish()
+    // rethrows an exception raised by a push; the pushes after it are not made.
+    class RebuildMappingPushes {
+    public:
+        RebuildMappingPushes(STWContainerCache& cache, STWContainerClass contentClass);
+        ~RebuildMappingPushes();
+        RebuildMappingPushes(const RebuildMappingPushes&) = delete;
+        RebuildMappingPushes& operator=(const RebuildMappingPushes&) = delete;
+
+        void add(STWMetadataRef record);
+        void finish();
+
+    private:
+        static constexpr size_t kBatchSize = 64;
+        void _send();
+        void _drain();
+
+        STWContainerCache& _cache;
+        const STWContainerClass _contentClass;
+        std::vector<STWMetadataRef> _batch;
+        bool _queued = false; // batches queued and maybe not yet run
+        // Set on the queue, read once a drain has waited for it.
+        std::exception_ptr _exception;
+    };
+
     // The non-recursive cache lock, with its owner recorded so that _lock_ methods can check
     // that their caller holds it.
     class CacheLock {
@@ -162,4 +191,6 @@ private:
     std::unordered_map<std::string, ClassCache> _transientContainerCache;
     CacheLock _cacheLock;
     std::shared_ptr<STWUserIdentityCache> _userIdentityCache;
+    // Runs the sandbox mapping pushes of rebuilds (see RebuildMappingPushes).
+    std::shared_ptr<STWQueue> _rebuildMappingQueue;
 };

@@ -8,6 +8,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <map>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -37,7 +38,23 @@ TEST_F(Items, ListingHidesDotNamesAndFailsForAMissingDirectory) {
     std::sort(sorted.begin(), sorted.end());
     EXPECT_EQ(sorted, (std::vector<fs::path>{scratch() / "dangling", scratch() / "dir", scratch() / "file"}));
 
+    // The typed listing: only a real directory is one, not a link to it.
+    fs::create_directory_symlink(scratch() / "dir", scratch() / "link-to-dir");
+    auto typed = fm()->itemsInDirectoryAtURL(scratch());
+    ASSERT_TRUE(typed);
+    std::map<fs::path, bool> types;
+    for (const auto& item : *typed)
+        types[item.url] = item.isDirectory;
+    EXPECT_EQ(types, (std::map<fs::path, bool>{{scratch() / "dangling", false},
+                                               {scratch() / "dir", true},
+                                               {scratch() / "file", false},
+                                               {scratch() / "link-to-dir", false}}));
+
     STWErrorRef error;
+    EXPECT_FALSE(fm()->itemsInDirectoryAtURL(scratch() / "missing", &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->isPOSIX(ENOENT));
+    error.reset();
     EXPECT_FALSE(fm()->urlsForItemsInDirectoryAtURL(scratch() / "missing", &error));
     ASSERT_TRUE(error);
     EXPECT_TRUE(error->isPOSIX(ENOENT));
