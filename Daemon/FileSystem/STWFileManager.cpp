@@ -1091,7 +1091,7 @@ std::optional<std::vector<STWFileManager::DirectoryItem>> STWFileManager::itemsI
         struct stat st;
         if (entry.d_type == DT_UNKNOWN && fstatat(directory, entry.d_name, &st, AT_SYMLINK_NOFOLLOW) == 0)
             isDirectory = S_ISDIR(st.st_mode);
-        items.push_back({joinPath(path, entry.d_name), isDirectory});
+        items.push_back({entry.d_name, isDirectory});
     });
     if (!listed)
         return std::nullopt;

@@ -127,11 +127,12 @@ public:
     // ENOENT.
     std::optional<std::vector<std::filesystem::path>> urlsForItemsInDirectoryAtURL(const std::filesystem::path& url,
                                                                                    STWErrorRef* error = nullptr) const;
-    // The same listing with each entry's own type (a symbolic link to a directory is not a
-    // directory), taken from the listing where the file system records it: no stat call
-    // per entry then.
+    // The same listing as names, with each entry's own type (a symbolic link to a directory
+    // is not a directory), taken from the listing where the file system records it: no stat
+    // call per entry then. Names keep a listing of many thousand entries small; a path
+    // holds a parsed copy of each of its components.
     struct DirectoryItem {
-        std::filesystem::path url;
+        std::string name;
         bool isDirectory = false;
     };
     std::optional<std::vector<DirectoryItem>> itemsInDirectoryAtURL(const std::filesystem::path& url,

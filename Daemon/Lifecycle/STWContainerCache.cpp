@@ -207,7 +207,8 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
     // handed out, so nobody is given a container the sandbox cannot resolve yet.
     RebuildMappingPushes pushes(*this, contentClass);
     for (const STWFileManager::DirectoryItem& entry : *entries) {
-        if (!containerURL(entry.url, contentClass))
+        fs::path url = *directory / entry.name;
+        if (!containerURL(url, contentClass))
             continue;
         // Containers are always real directories. Per-user class directories belong to
         // their user, who could otherwise plant a link that passes the path checks of the
@@ -215,7 +216,7 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
         if (!entry.isDirectory)
             continue;
         // The reader logs why a directory is not a container.
-        auto record = STWMetadata::readAndValidateMetadataAtUrl(entry.url, userIdentity, true, nullptr);
+        auto record = STWMetadata::readAndValidateMetadataAtUrl(url, userIdentity, true, nullptr);
         if (!record)
             continue;
         record->setTransient(transient);
@@ -227,9 +228,8 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
     }
     pushes.finish();
     // The listing was allocated before the records that stay and now lies free beneath
-    // them, where the allocator would keep it resident: a std::filesystem::path per entry
-    // holds a parsed copy of every component, several hundred bytes each, so a class of
-    // 100,000 containers would pin some 70 MB that nothing uses. Give those pages back.
+    // them, where the allocator would keep it resident (some 10 MB for a class of 100,000
+    // containers). Give those pages back.
     entries.reset();
     malloc_trim(0);
 
