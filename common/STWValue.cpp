@@ -209,6 +209,34 @@ bool STWValue::operator==(const STWValue& other) const {
     return _v == other._v;
 }
 
+bool STWValue::isIdenticalTo(const STWValue& other) const {
+    if (type() != other.type())
+        return false;
+    if (type() == Type::Real) {
+        double x = *realValue(), y = *other.realValue();
+        return memcmp(&x, &y, sizeof x) == 0;
+    }
+    if (const Array* items = array()) {
+        const Array& others = *other.array();
+        if (items->size() != others.size())
+            return false;
+        for (size_t i = 0; i < items->size(); ++i)
+            if (!(*items)[i].isIdenticalTo(others[i]))
+                return false;
+        return true;
+    }
+    if (const Dictionary* entries = dictionary()) {
+        const Dictionary& others = *other.dictionary();
+        if (entries->size() != others.size())
+            return false;
+        for (auto i = entries->begin(), j = others.begin(); i != entries->end(); ++i, ++j)
+            if (i->first != j->first || !i->second.isIdenticalTo(j->second))
+                return false;
+        return true;
+    }
+    return *this == other;
+}
+
 size_t STWValue::hash() const {
     size_t seed = std::hash<size_t>()(_v.index());
     switch (_v.index()) {

@@ -99,6 +99,10 @@ public:
     const STWValue* find(std::string_view key) const;
 
     bool operator==(const STWValue& other) const;
+    // Equal value for value, with reals compared bit for bit, so that a NaN is identical
+    // to itself (it is never == to anything). For checking that a value survived a round
+    // trip unchanged.
+    bool isIdenticalTo(const STWValue& other) const;
     size_t hash() const;
     std::string description() const;
 

@@ -13,38 +13,9 @@ inline void PrintTo(const STWValue& value, std::ostream* os) {
 
 namespace {
 
-// Equal value for value, with reals compared bit for bit (so that NaN equals itself).
-// Comparing encodings would not do: libplist's writer shares data objects by address.
-bool sameValue(const STWValue& a, const STWValue& b) {
-    if (a.type() != b.type())
-        return false;
-    if (a.type() == STWValue::Type::Real) {
-        double x = *a.realValue(), y = *b.realValue();
-        return memcmp(&x, &y, sizeof x) == 0;
-    }
-    if (const STWValue::Array* items = a.array()) {
-        const STWValue::Array& others = *b.array();
-        if (items->size() != others.size())
-            return false;
-        for (size_t i = 0; i < items->size(); ++i)
-            if (!sameValue((*items)[i], others[i]))
-                return false;
-        return true;
-    }
-    if (const STWValue::Dictionary* entries = a.dictionary()) {
-        const STWValue::Dictionary& others = *b.dictionary();
-        if (entries->size() != others.size())
-            return false;
-        for (auto i = entries->begin(), j = others.begin(); i != entries->end(); ++i, ++j)
-            if (i->first != j->first || !sameValue(i->second, j->second))
-                return false;
-        return true;
-    }
-    return a == b;
-}
-
+// Values, not encodings, are compared: libplist's writer shares data objects by address.
 bool same(const std::optional<STWValue>& a, const std::optional<STWValue>& b) {
-    return a && b ? sameValue(*a, *b) : !a && !b;
+    return a && b ? a->isIdenticalTo(*b) : !a && !b;
 }
 
 class RandomTrees {

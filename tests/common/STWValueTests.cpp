@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include <limits>
 #include <unordered_set>
 
 namespace {
@@ -48,6 +49,21 @@ TEST(STWValue, EqualityAndHashAreDeepAndCopiesAreIndependent) {
     EXPECT_NE(STWValue(3), STWValue(3.0));
     std::unordered_set<STWValue> set{a, b, c, STWValue(), STWValue("x")};
     EXPECT_EQ(set.size(), 4u);
+}
+
+TEST(STWValue, IdenticalComparesRealsBitForBit) {
+    auto nested = [](double real) {
+        return STWValue(STWValue::Dictionary{{"a", STWValue(STWValue::Array{STWValue("x"), STWValue(real)})}});
+    };
+    double nan = std::numeric_limits<double>::quiet_NaN();
+    EXPECT_NE(nested(nan), nested(nan));
+    EXPECT_TRUE(nested(nan).isIdenticalTo(nested(nan)));
+    EXPECT_EQ(nested(0.0), nested(-0.0));
+    EXPECT_FALSE(nested(0.0).isIdenticalTo(nested(-0.0)));
+    EXPECT_TRUE(sample().isIdenticalTo(sample()));
+    STWValue other = sample();
+    (*other.mutableDictionary())["n"] = STWValue(6);
+    EXPECT_FALSE(sample().isIdenticalTo(other));
 }
 
 TEST(STWValue, DescriptionIsReadable) {
