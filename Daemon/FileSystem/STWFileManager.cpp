@@ -886,19 +886,28 @@ bool STWFileManager::createDirectoryAtURL(const fs::path& url, bool withIntermed
                                 STWFileManagerClassUnchanged, error);
 }
 
+// For the "if exists" forms of copy and move: whether `source` is there (a missing source
+// is nothing to do), or nullopt with `error` set when it cannot be examined.
+static std::optional<bool> sourceExists(const std::string& source, const char* function, STWErrorRef* error) {
+    struct stat st;
+    if (lstat(source.c_str(), &st) == 0)
+        return true;
+    int e = errno;
+    if (e == ENOENT)
+        return false;
+    STWSetError(error, STWErrorCreate(STWPOSIXErrorDomain, e, function, __LINE__, nullptr, true,
+                                      "stat of %@ failed: %s", source, strerror(e)));
+    return std::nullopt;
+}
+
 bool STWFileManager::_copyItemAtURL(const fs::path& url, const fs::path& toURL, bool failIfSrcMissing,
                                     STWErrorRef* error) const {
     std::string source = pathString(url);
     std::string destination = pathString(toURL);
     if (!failIfSrcMissing) {
-        struct stat st;
-        if (lstat(source.c_str(), &st) != 0) {
-            int e = errno;
-            if (e == ENOENT)
-                return true;
-            STWSetError(error, STW_POSIX_ERROR(e, "stat of %@ failed: %s", source, strerror(e)));
-            return false;
-        }
+        std::optional<bool> exists = sourceExists(source, __func__, error);
+        if (!exists || !*exists)
+            return exists.has_value();
     }
     if (int e = copyTree(source, destination)) {
         STWSetError(error,
@@ -921,14 +930,9 @@ bool STWFileManager::_moveItemAtURL(const fs::path& url, const fs::path& toURL, 
     std::string source = pathString(url);
     std::string destination = pathString(toURL);
     if (!failIfSrcMissing) {
-        struct stat st;
-        if (lstat(source.c_str(), &st) != 0) {
-            int e = errno;
-            if (e == ENOENT)
-                return true;
-            STWSetError(error, STW_POSIX_ERROR(e, "stat of %@ failed: %s", source, strerror(e)));
-            return false;
-        }
+        std::optional<bool> exists = sourceExists(source, __func__, error);
+        if (!exists || !*exists)
+            return exists.has_value();
     }
     bool durable = options & STWFileManagerMoveDurable;
     // What is moved must be on disk before the rename that makes it visible can be.
