@@ -6,7 +6,7 @@
 
 option(STOWLY_FUZZ_REPLAY "Build the fuzz targets with clang and replay their seed corpora in CTest" ON)
 if(NOT STOWLY_FUZZ_REPLAY OR STOWLY_BUILD_FUZZ)
-  # A clang build with STOWLY_BUILD_FUZZ registers the replays itself (fuzz/*/CMakeLists.txt).
+  # A clang build with STOWLY_BUILD_FUZZ registers the replays itself (fuzz/CMakeLists.txt).
   return()
 endif()
 
