@@ -6,9 +6,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-namespace {
-
-int writeAll(int fd, std::string_view contents) {
+int STWWriteAll(int fd, std::string_view contents) {
     const char* p = contents.data();
     size_t left = contents.size();
     while (left > 0) {
@@ -24,6 +22,8 @@ int writeAll(int fd, std::string_view contents) {
     return 0;
 }
 
+namespace {
+
 int closeChecked(int fd) {
     return close(fd) == 0 || errno == EINTR ? 0 : errno;
 }
@@ -37,19 +37,23 @@ int STWReadFileContents(const std::filesystem::path& path, std::string* contents
     if (fd < 0)
         return errno;
     struct stat st;
-    if (fstat(fd, &st) != 0) {
-        int e = errno;
-        close(fd);
-        return e;
-    }
-    if (!S_ISREG(st.st_mode)) {
-        close(fd);
-        return S_ISDIR(st.st_mode) ? EISDIR : EINVAL;
-    }
-    if (static_cast<uint64_t>(st.st_size) > maxSize) {
-        close(fd);
+    int e = 0;
+    if (fstat(fd, &st) != 0)
+        e = errno;
+    else if (!S_ISREG(st.st_mode))
+        e = S_ISDIR(st.st_mode) ? EISDIR : EINVAL;
+    else
+        e = STWReadDescriptorContents(fd, contents, maxSize);
+    close(fd);
+    return e;
+}
+
+int STWReadDescriptorContents(int fd, std::string* contents, size_t maxSize) {
+    struct stat st;
+    if (fstat(fd, &st) != 0)
+        return errno;
+    if (static_cast<uint64_t>(st.st_size) > maxSize)
         return EFBIG;
-    }
     std::string data;
     data.resize(static_cast<size_t>(st.st_size));
     size_t used = 0;
@@ -58,9 +62,7 @@ int STWReadFileContents(const std::filesystem::path& path, std::string* contents
             // The file may have grown since fstat; keep reading up to the limit.
             if (data.size() >= maxSize) {
                 char probe;
-                ssize_t n = read(fd, &probe, 1);
-                close(fd);
-                if (n > 0)
+                if (read(fd, &probe, 1) > 0)
                     return EFBIG;
                 break;
             }
@@ -70,14 +72,10 @@ int STWReadFileContents(const std::filesystem::path& path, std::string* contents
         if (n < 0) {
             if (errno == EINTR)
                 continue;
-            int e = errno;
-            close(fd);
-            return e;
+            return errno;
         }
-        if (n == 0) {
-            close(fd);
+        if (n == 0)
             break;
-        }
         used += static_cast<size_t>(n);
     }
     data.resize(used);
@@ -89,7 +87,7 @@ int STWWriteFile(const std::filesystem::path& path, std::string_view contents, m
     int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, mode);
     if (fd < 0)
         return errno;
-    int e = writeAll(fd, contents);
+    int e = STWWriteAll(fd, contents);
     if (!e && sync && fsync(fd) != 0)
         e = errno;
     int c = closeChecked(fd);
@@ -107,7 +105,7 @@ int STWWriteFileAtomically(const std::filesystem::path& path, std::string_view c
         return errno;
     int e = fchmod(fd, mode) == 0 ? 0 : errno;
     if (!e)
-        e = writeAll(fd, contents);
+        e = STWWriteAll(fd, contents);
     if (!e && fsync(fd) != 0)
         e = errno;
     int c = closeChecked(fd);

@@ -1,6 +1,7 @@
 #include "Daemon/FileSystem/STWFileManager.h"
 
 #include "Daemon/FileSystem/STWDirectoryWalker.h"
+#include "Daemon/FileSystem/STWFileSystemPrimitives.h"
 #include "platform/STWKeybag.h"
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWFileIO.h"
@@ -30,29 +31,14 @@
 
 namespace fs = std::filesystem;
 
-namespace {
+namespace STWFileSystemPrimitives {
 
 constexpr const char* kProtectionClassAttribute = "trusted.stowly.protection-class";
-constexpr const char* kAccessACLAttribute = "system.posix_acl_access";
-constexpr const char* kDefaultACLAttribute = "system.posix_acl_default";
-
-// The path as the daemon names it: no trailing separator (except for "/" itself).
-std::string pathString(const fs::path& url) {
-    std::string path = url.native();
-    while (path.size() > 1 && path.back() == '/')
-        path.pop_back();
-    return path;
-}
 
 std::string joinPath(const std::string& directory, const std::string& name) {
     if (directory.empty())
         return name;
     return directory.back() == '/' ? directory + name : directory + "/" + name;
-}
-
-std::string parentPath(const std::string& path) {
-    fs::path parent = fs::path(path).parent_path();
-    return parent.empty() ? std::string(".") : parent.native();
 }
 
 // "/" followed by the non-empty components, as the real-path checks count them.
@@ -72,37 +58,9 @@ std::vector<std::string> pathComponents(std::string_view path) {
     return components;
 }
 
-std::string joinComponents(const std::vector<std::string>& components, size_t begin, size_t end) {
-    std::string path;
-    for (size_t i = begin; i < end; ++i) {
-        if (components[i] == "/")
-            path = "/";
-        else
-            path = path.empty() || path.back() == '/' ? path + components[i] : path + "/" + components[i];
-    }
-    return path;
-}
-
 bool hasPrefix(std::string_view text, std::string_view prefix) {
     return text.size() >= prefix.size() && text.compare(0, prefix.size(), prefix) == 0;
 }
-
-// Begins a trace interval: a debug line at each end (the toolchain has no USDT probes).
-class TraceInterval {
-public:
-    TraceInterval(const char* name, const std::string& path) : _name(name) {
-        STW_LOG_DEBUG(STWLogCategory::FS, "%s begin: %s", name, path);
-    }
-    void end(const std::string& path, uint64_t nodes, std::optional<uint64_t> size = std::nullopt) {
-        if (size)
-            STW_LOG_DEBUG(STWLogCategory::FS, "%s end: %s nodes: %llu size: %llu", _name, path, nodes, *size);
-        else
-            STW_LOG_DEBUG(STWLogCategory::FS, "%s end: %s nodes: %llu", _name, path, nodes);
-    }
-
-private:
-    const char* _name;
-};
 
 // MARK: durability
 
@@ -167,6 +125,19 @@ private:
     }
 };
 
+int syncTreeAt(int fd, const std::string& path) {
+    struct stat st;
+    if (fstat(fd, &st) != 0)
+        return errno;
+    if (S_ISDIR(st.st_mode)) {
+        SyncTreeContext context;
+        STWDirectoryWalker().walk(fd, path, context);
+        if (context.error)
+            return context.error;
+    }
+    return syncDescriptor(fd, path);
+}
+
 int syncTree(const std::string& path) {
     struct stat st;
     if (lstat(path.c_str(), &st) != 0)
@@ -177,13 +148,7 @@ int syncTree(const std::string& path) {
     STWFileDescriptor fd(open(path.c_str(), flags));
     if (!fd)
         return errno;
-    if (S_ISDIR(st.st_mode)) {
-        SyncTreeContext context;
-        STWDirectoryWalker().walk(fd.get(), path, context);
-        if (context.error)
-            return context.error;
-    }
-    return syncDescriptor(fd.get(), path);
+    return syncTreeAt(fd.get(), path);
 }
 
 // MARK: protection classes
@@ -223,6 +188,93 @@ int writeProtectionClass(int fd, int32_t dataProtectionClass) {
                               static_cast<unsigned char>(value >> 16), static_cast<unsigned char>(value >> 24)};
     return fsetxattr(fd, kProtectionClassAttribute, bytes, sizeof bytes, 0) == 0 ? 0 : errno;
 }
+
+int setUserImmutable(int fd, bool immutable) {
+    int flags = 0;
+    if (ioctl(fd, FS_IOC_GETFLAGS, &flags) != 0)
+        return errno;
+    int wanted = immutable ? (flags | FS_IMMUTABLE_FL) : (flags & ~FS_IMMUTABLE_FL);
+    if (wanted == flags)
+        return 0;
+    return ioctl(fd, FS_IOC_SETFLAGS, &wanted) == 0 ? 0 : errno;
+}
+
+bool isUserImmutable(int fd) {
+    int flags = 0;
+    return ioctl(fd, FS_IOC_GETFLAGS, &flags) == 0 && (flags & FS_IMMUTABLE_FL);
+}
+
+bool flagsUnsupported(int e) { return e == ENOTTY || e == ENOTSUP || e == EOPNOTSUPP || e == EINVAL; }
+
+// The owner (as user and group) and class of a directory open as `fd`, each unless
+// unchanged; errors name `path` and the public operation `function`.
+bool setOwnerAndClassOfDirectory(int fd, uid_t owner, int32_t dataProtectionClass, const std::string& path,
+                                 const char* function, STWErrorRef* error) {
+    int e = 0;
+    if (dataProtectionClass != STWFileManagerClassUnchanged && (e = writeProtectionClass(fd, dataProtectionClass))) {
+        STWSetError(error, STWErrorCreate(STWPOSIXErrorDomain, e, function, __LINE__, nullptr, true,
+                                          "Failed to setclass(%d) on directory %s: %s", dataProtectionClass, path,
+                                          strerror(e)));
+        return false;
+    }
+    if (owner != STWFileManagerOwnerUnchanged && fchown(fd, owner, owner) != 0) {
+        e = errno;
+        STWSetError(error, STWErrorCreate(STWPOSIXErrorDomain, e, function, __LINE__, nullptr, true,
+                                          "Failed to chown(%d,%d) %s: %s", owner, owner, path, strerror(e)));
+        return false;
+    }
+    return true;
+}
+
+} // namespace STWFileSystemPrimitives
+
+using namespace STWFileSystemPrimitives;
+
+namespace {
+
+constexpr const char* kAccessACLAttribute = "system.posix_acl_access";
+constexpr const char* kDefaultACLAttribute = "system.posix_acl_default";
+
+// The path as the daemon names it: no trailing separator (except for "/" itself).
+std::string pathString(const fs::path& url) {
+    std::string path = url.native();
+    while (path.size() > 1 && path.back() == '/')
+        path.pop_back();
+    return path;
+}
+
+std::string parentPath(const std::string& path) {
+    fs::path parent = fs::path(path).parent_path();
+    return parent.empty() ? std::string(".") : parent.native();
+}
+
+std::string joinComponents(const std::vector<std::string>& components, size_t begin, size_t end) {
+    std::string path;
+    for (size_t i = begin; i < end; ++i) {
+        if (components[i] == "/")
+            path = "/";
+        else
+            path = path.empty() || path.back() == '/' ? path + components[i] : path + "/" + components[i];
+    }
+    return path;
+}
+
+// Begins a trace interval: a debug line at each end (the toolchain has no USDT probes).
+class TraceInterval {
+public:
+    TraceInterval(const char* name, const std::string& path) : _name(name) {
+        STW_LOG_DEBUG(STWLogCategory::FS, "%s begin: %s", name, path);
+    }
+    void end(const std::string& path, uint64_t nodes, std::optional<uint64_t> size = std::nullopt) {
+        if (size)
+            STW_LOG_DEBUG(STWLogCategory::FS, "%s end: %s nodes: %llu size: %llu", _name, path, nodes, *size);
+        else
+            STW_LOG_DEBUG(STWLogCategory::FS, "%s end: %s nodes: %llu", _name, path, nodes);
+    }
+
+private:
+    const char* _name;
+};
 
 // MARK: removal
 
@@ -288,12 +340,10 @@ private:
         struct stat opened;
         if (!fd || fstat(fd.get(), &opened) != 0 || opened.st_ino != st.st_ino || opened.st_dev != st.st_dev)
             return false;
-        int flags = 0;
-        if (ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) != 0 || !(flags & FS_IMMUTABLE_FL))
+        if (!isUserImmutable(fd.get()))
             return false;
-        flags &= ~FS_IMMUTABLE_FL;
-        if (ioctl(fd.get(), FS_IOC_SETFLAGS, &flags) != 0) {
-            STW_LOG_ERROR(STWLogCategory::FS, "Failed to lchflags %s: %s", path, strerror(errno));
+        if (int e = setUserImmutable(fd.get(), false)) {
+            STW_LOG_ERROR(STWLogCategory::FS, "Failed to lchflags %s: %s", path, strerror(e));
             return false;
         }
         fd.reset();
@@ -865,19 +915,7 @@ bool STWFileManager::createDirectoryAtURL(const fs::path& url, bool withIntermed
         STWSetError(error, STW_POSIX_ERROR(e, "opendir of %s failed: %s", path, strerror(e)));
         return false;
     }
-    if (dataProtectionClass != STWFileManagerClassUnchanged) {
-        if (int e = writeProtectionClass(fd.get(), dataProtectionClass)) {
-            STWSetError(error, STW_POSIX_ERROR(e, "Failed to setclass(%d) on directory %s: %s", dataProtectionClass,
-                                               path, strerror(e)));
-            return false;
-        }
-    }
-    if (owner != STWFileManagerOwnerUnchanged && fchown(fd.get(), owner, owner) != 0) {
-        int e = errno;
-        STWSetError(error, STW_POSIX_ERROR(e, "Failed to chown(%d,%d) %s: %s", owner, owner, path, strerror(e)));
-        return false;
-    }
-    return true;
+    return setOwnerAndClassOfDirectory(fd.get(), owner, dataProtectionClass, path, __func__, error);
 }
 
 bool STWFileManager::createDirectoryAtURL(const fs::path& url, bool withIntermediateDirectories, mode_t mode,
@@ -1462,74 +1500,4 @@ std::optional<fs::path> STWFileManager::realPathForURL(const fs::path& url, cons
         }
     }
     return suspiciousReal;
-}
-
-STWFileDescriptor STWFileManager::openBeneath(int dirfd, const fs::path& relativePath, int flags, mode_t mode,
-                                              unsigned options, STWErrorRef* error) const {
-    std::string path = relativePath.empty() ? std::string(".") : relativePath.native();
-    struct open_how how = {};
-    how.flags = static_cast<uint64_t>(flags | O_CLOEXEC);
-    // O_TMPFILE includes O_DIRECTORY: test all of its bits.
-    how.mode = ((flags & O_CREAT) || (flags & O_TMPFILE) == O_TMPFILE) ? mode : 0;
-    how.resolve = RESOLVE_BENEATH | RESOLVE_NO_MAGICLINKS |
-                  ((options & STWOpenBeneathNoSymlinks) ? RESOLVE_NO_SYMLINKS : 0);
-    for (int attempt = 0;; ++attempt) {
-        long fd = syscall(SYS_openat2, dirfd, path.c_str(), &how, sizeof how);
-        if (fd >= 0)
-            return STWFileDescriptor(static_cast<int>(fd));
-        int e = errno;
-        // EAGAIN: a rename elsewhere raced the lookup and the kernel could not vouch for it.
-        if (e == EINTR || (e == EAGAIN && attempt < 16))
-            continue;
-        if (e == ENOSYS)
-            return _openBeneathByComponents(dirfd, relativePath, flags, mode, error);
-        STWSetError(error, STW_POSIX_ERROR_NOLOG(e, "Failed to open %@ beneath descriptor %d: %s", path, dirfd,
-                                                 strerror(e)));
-        return {};
-    }
-}
-
-STWFileDescriptor STWFileManager::_openBeneathByComponents(int dirfd, const fs::path& relativePath, int flags,
-                                                           mode_t mode, STWErrorRef* error) const {
-    const std::string& path = relativePath.native();
-    // Each failure site passes its own line; the error names this operation, not the lambda.
-    const char* function = __func__;
-    auto fail = [&](int e, uint64_t line) {
-        STWSetError(error, STWErrorCreate(STWPOSIXErrorDomain, e, function, line, nullptr, false,
-                                          "Failed to open %@ beneath descriptor %d: %s", path, dirfd, strerror(e)));
-        return STWFileDescriptor();
-    };
-    // Absolute paths and ".." answer EXDEV, as RESOLVE_BENEATH does for an escape; this walk
-    // does not follow "..", even where it would stay inside.
-    if (hasPrefix(path, "/"))
-        return fail(EXDEV, __LINE__);
-    std::vector<std::string> components;
-    for (const std::string& component : pathComponents(path)) {
-        if (component == "..")
-            return fail(EXDEV, __LINE__);
-        if (component != ".")
-            components.push_back(component);
-    }
-    if (components.empty()) {
-        int fd = openat(dirfd, ".", flags | O_CLOEXEC, mode);
-        return fd < 0 ? fail(errno, __LINE__) : STWFileDescriptor(fd);
-    }
-    STWFileDescriptor current;
-    int at = dirfd;
-    for (size_t i = 0; i + 1 < components.size(); ++i) {
-        int fd = openat(at, components[i].c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
-        if (fd < 0) {
-            int e = errno;
-            struct stat st;
-            // O_DIRECTORY answers ENOTDIR for a link; name it for what it is.
-            if (e == ENOTDIR && fstatat(at, components[i].c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0 &&
-                S_ISLNK(st.st_mode))
-                e = ELOOP;
-            return fail(e, __LINE__);
-        }
-        current.reset(fd);
-        at = fd;
-    }
-    int fd = openat(at, components.back().c_str(), flags | O_NOFOLLOW | O_CLOEXEC, mode);
-    return fd < 0 ? fail(errno, __LINE__) : STWFileDescriptor(fd);
 }

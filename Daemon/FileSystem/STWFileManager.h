@@ -28,6 +28,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <sys/stat.h>
 #include <sys/types.h>
 #include <vector>
 
@@ -183,6 +184,64 @@ public:
     // The walk of O_NOFOLLOW opens on its own (for kernels without openat2, and for tests).
     STWFileDescriptor _openBeneathByComponents(int dirfd, const std::filesystem::path& relativePath, int flags,
                                                mode_t mode, STWErrorRef* error = nullptr) const;
+
+    // MARK: Below a directory someone else owns
+    //
+    // Apps own their containers and the per-user class and staging directories, and may
+    // replace anything in them at any moment. Below such a directory the daemon names
+    // nothing by a path string: it opens each directory from its parent's descriptor
+    // without following links and acts on the descriptors (the `path` arguments only name
+    // the item in errors and logs). The anchor is a directory whose ancestors it trusts,
+    // opened with openDirectoryAtURL().
+
+    // Opens the directory itself, never a link in its place (O_DIRECTORY|O_NOFOLLOW).
+    STWFileDescriptor openDirectoryAtURL(const std::filesystem::path& url, STWErrorRef* error = nullptr) const;
+
+    // Makes the directory `relativePath` below `dirfd` one component at a time and answers
+    // its descriptor. A symbolic link found where a directory belongs is removed and a
+    // directory made in its place; any other kind of item fails with ENOTDIR. Directories it
+    // makes get `mode` (the parents plus owner write and search); an existing one keeps its
+    // mode. The last directory gets `owner` (user and group) and `dataProtectionClass`,
+    // unless they are the Unchanged values.
+    STWFileDescriptor createDirectoryBeneath(int dirfd, const std::filesystem::path& relativePath, mode_t mode,
+                                             uid_t owner, int32_t dataProtectionClass,
+                                             const std::filesystem::path& path, STWErrorRef* error = nullptr) const;
+
+    // Makes the new directory `name` in `dirfd` (EEXIST when the name is taken) and answers
+    // its descriptor, with owner and class as above. In a directory that someone else may
+    // write the new entry can be swapped before it is opened, so what is opened must be a
+    // directory of the daemon's own (ESTALE otherwise).
+    STWFileDescriptor createNewDirectoryAt(int dirfd, const std::string& name, mode_t mode, uid_t owner,
+                                           int32_t dataProtectionClass, const std::filesystem::path& path,
+                                           STWErrorRef* error = nullptr) const;
+
+    // Renames `name` of `fromfd` to `toName` of `tofd`, never over an existing item, and
+    // checks that what arrived is the directory open as `directoryfd`: if an item swapped
+    // in for it arrived instead, that is moved back and the move fails with ESTALE. With
+    // STWFileManagerMoveDurable the tree is synced before and both directories after.
+    bool moveDirectoryAt(int fromfd, const std::string& name, int tofd, const std::string& toName, int directoryfd,
+                         STWFileManagerMoveOptions options, const std::filesystem::path& from,
+                         const std::filesystem::path& to, STWErrorRef* error = nullptr) const;
+
+    // A new file beside the file it will replace: written, synced and still open.
+    struct TemporaryFile {
+        STWFileDescriptor fd;
+        std::string name;
+    };
+    std::optional<TemporaryFile> writeTemporaryFileAt(int dirfd, std::string_view contents, mode_t mode,
+                                                      const std::filesystem::path& directory,
+                                                      STWErrorRef* error = nullptr) const;
+    // Renames the temporary file over `name` of `dirfd` and syncs the directory; on failure
+    // the temporary file is removed. With `immutable` the old file's user-immutable flag is
+    // cleared for the rename and the new file gets it, where the file system has the flag.
+    // `identity` gets the new file's status.
+    bool replaceFileAt(int dirfd, TemporaryFile& file, const std::string& name, bool immutable, struct stat* identity,
+                       const std::filesystem::path& path, STWErrorRef* error = nullptr) const;
+
+    // Sets or clears the user-immutable flag of a file or directory (never through a link).
+    // A file system without the flag succeeds.
+    bool setUserImmutableOfItemAtURL(const std::filesystem::path& url, bool immutable,
+                                     STWErrorRef* error = nullptr) const;
 
     // Tests observe every fsync made for durability, with the path synced.
     static void setSyncObserverForTesting(std::function<void(const std::string& path)> observer);

@@ -193,7 +193,12 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
         return nullptr;
     }
     auto entries = STWFileManager::defaultManager()->itemsInDirectoryAtURL(*directory, error);
-    if (!entries) {
+    // Containers are read beneath the class directory's descriptor, so a link that the
+    // directory's owner planted anywhere on the way is never followed.
+    STWFileDescriptor classDirectory;
+    if (entries)
+        classDirectory = STWFileManager::defaultManager()->openDirectoryAtURL(*directory, error);
+    if (!entries || !classDirectory) {
         signpost("RebuildingCache", false, contentClass);
         return nullptr;
     }
@@ -210,13 +215,13 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
         fs::path url = *directory / entry.name;
         if (!containerURL(url, contentClass))
             continue;
-        // Containers are always real directories. Per-user class directories belong to
-        // their user, who could otherwise plant a link that passes the path checks of the
-        // metadata reader and gets some other directory mapped into the sandbox.
+        // Containers are always real directories (the reader refuses links too; this only
+        // spares it the attempt).
         if (!entry.isDirectory)
             continue;
         // The reader logs why a directory is not a container.
-        auto record = STWMetadata::readAndValidateMetadataAtUrl(url, userIdentity, true, nullptr);
+        auto record = STWMetadata::readAndValidateMetadataInDirectory(classDirectory.get(), entry.name, url,
+                                                                      userIdentity, true, nullptr);
         if (!record)
             continue;
         record->setTransient(transient);
@@ -254,11 +259,14 @@ STWMetadataRef STWContainerCache::_validatedRecord(const STWMetadataRef& record,
                                      transientMarker(transient), url));
         return nullptr;
     }
+    // Still the very file the record was read from or written to: a container that its app
+    // removed, or replaced (by a link to some other container, say), is no longer there.
     fs::path metadataFile = url / STWMetadata::fileName;
-    if (!STWFileManager::defaultManager()->itemDoesNotExistAtURL(metadataFile))
+    struct stat file;
+    if (lstat(metadataFile.c_str(), &file) == 0 && record->isRecordOfFile(file))
         return record;
 
-    // Deleted behind the daemon's back: drop the record so that the next look-up answers
+    // Gone behind the daemon's back: drop the record so that the next look-up answers
     // "not found" instead of handing out a path that is no container.
     STWErrorRef removeError;
     if (!_removeContainerForUserIdentity(record->userIdentity(), record->containerClass(), record->identifier(),

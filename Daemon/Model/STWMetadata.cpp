@@ -4,7 +4,13 @@
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
 #include "common/STWDictionaryUtilities.h"
+#include "common/STWFileIO.h"
 #include "common/STWLog.h"
+#include "common/STWPropertyList.h"
+
+#include <cstring>
+#include <fcntl.h>
+#include <unistd.h>
 
 namespace {
 
@@ -90,68 +96,151 @@ STWValue::Dictionary STWMetadata::dictionaryRepresentation() const {
     return d;
 }
 
-bool STWMetadata::writeMetadataToDiskWithError(STWErrorRef* error) const {
-    return writeMetadataToFileURL(url() / fileName, error);
+void STWMetadata::setFileIdentity(const struct stat& file) {
+    _fileDevice = file.st_dev;
+    _fileInode = file.st_ino;
 }
 
-bool STWMetadata::writeMetadataToFileURL(const std::filesystem::path& fileURL, STWErrorRef* error) const {
+bool STWMetadata::isRecordOfFile(const struct stat& file) const {
+    return _fileInode != 0 && file.st_dev == _fileDevice && file.st_ino == _fileInode;
+}
+
+STWFileDescriptor STWMetadata::openContainerDirectory(STWErrorRef* error) const {
+    auto fileManager = STWFileManager::defaultManager();
+    std::filesystem::path container = url();
+    STWFileDescriptor classDirectory = fileManager->openDirectoryAtURL(container.parent_path(), error);
+    if (!classDirectory)
+        return {};
+    STWFileDescriptor fd = fileManager->openBeneath(classDirectory.get(), container.filename(), O_RDONLY | O_DIRECTORY,
+                                                    0, STWOpenBeneathNoSymlinks, error);
+    if (!fd)
+        return {};
+    struct stat file;
+    if (fstatat(fd.get(), fileName, &file, AT_SYMLINK_NOFOLLOW) != 0 || !isRecordOfFile(file)) {
+        STWSetError(error, STW_POSIX_ERROR(ESTALE, "%@ no longer holds the metadata of %@", container, _identifier));
+        return {};
+    }
+    return fd;
+}
+
+bool STWMetadata::writeMetadataToDiskWithError(STWErrorRef* error) {
+    if (_fileInode == 0)
+        return writeMetadataToFileURL(url() / fileName, error);
+    STWFileDescriptor container = openContainerDirectory(error);
+    return container && writeMetadataToContainerDirectory(container.get(), error);
+}
+
+bool STWMetadata::writeMetadataToFileURL(const std::filesystem::path& fileURL, STWErrorRef* error) {
+    STWFileDescriptor directory = STWFileManager::defaultManager()->openDirectoryAtURL(fileURL.parent_path(), error);
+    return directory && _writeMetadataAt(directory.get(), fileURL.filename(), fileURL, error);
+}
+
+bool STWMetadata::writeMetadataToContainerDirectory(int containerfd, STWErrorRef* error) {
+    return _writeMetadataAt(containerfd, fileName, url() / fileName, error);
+}
+
+bool STWMetadata::_writeMetadataAt(int dirfd, const std::string& name, const std::filesystem::path& fileURL,
+                                   STWErrorRef* error) {
     STWValue::Dictionary dictionary = dictionaryRepresentation();
-    std::filesystem::path temp =
-        STWGlobalConfiguration::sharedInstance()->stagingDirectoryURLForUserIdentity(_userIdentity, _containerClass) /
-        STWFormat("temp_metadata-%@.plist", _uuid.string());
     STW_LOG_DEBUG(STWLogCategory::Metadata, "[%s] Writing metadata to [%@]: %@ => %@", __func__, fileURL, *this,
                   STWValue(dictionary));
-    STWErrorRef writeError;
-    // Not synced here: the durable move below syncs the file before the rename makes it
-    // visible, and the directory after it; syncing twice would only double the cost.
-    if (!STW_writeToURL(dictionary, temp, STWWriteNoFileProtection, &writeError)) {
-        // A half-written temporary file must not stay behind in staging.
-        std::error_code ignored;
-        std::filesystem::remove(temp, ignored);
-        STWSetError(error, STW_ERROR(STWErrorWriteFileFailed, writeError,
-                                     "Failed to write metadata dictionary to URL %@ : %@:%ld", temp,
-                                     writeError->domain(), writeError->code()));
+    auto fileManager = STWFileManager::defaultManager();
+    STWErrorRef stepError;
+    // Written beside its final name, through the directory's descriptor: a path through a
+    // directory the app owns could lead anywhere by the time it is used.
+    auto temp = fileManager->writeTemporaryFileAt(dirfd, STWPropertyList::serializeBinary(STWValue(dictionary)), 0644,
+                                                  fileURL.parent_path(), &stepError);
+    if (!temp) {
+        STWSetError(error, STW_ERROR(STWErrorWriteFileFailed, stepError,
+                                     "Failed to write metadata dictionary to URL %@ : %@:%ld", fileURL,
+                                     stepError->domain(), stepError->code()));
         return false;
     }
-    STWErrorRef moveError;
-    if (!STWFileManager::defaultManager()->moveItemAtURL(temp, fileURL, STWFileManagerMoveDurable, &moveError)) {
-        std::error_code ignored;
-        std::filesystem::remove(temp, ignored);
-        STWSetError(error, STW_ERROR(STWErrorWriteFileFailed, moveError,
-                                     "Failed to move metadata from staging: %@ to final: %@", temp, fileURL));
+    struct stat written;
+    if (!fileManager->replaceFileAt(dirfd, *temp, name, true, &written, fileURL, &stepError)) {
+        STWSetError(error, STW_ERROR(STWErrorWriteFileFailed, stepError,
+                                     "Failed to move metadata from staging: %@ to final: %@",
+                                     fileURL.parent_path() / temp->name, fileURL));
         return false;
     }
+    setFileIdentity(written);
     return true;
 }
 
 std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtUrl(const std::filesystem::path& containerURL,
                                                                        const STWUserIdentityRef& forUserIdentity,
                                                                        bool checkClassPath, STWErrorRef* error) {
-    // The container cache reads every container this way; the directory is at hand, so it
-    // is not derived again from the file's path (unless it was given with a trailing
-    // separator, which the record's url must not keep).
-    if (!containerURL.has_filename())
-        return readAndValidateMetadataAtFileUrl(containerURL / fileName, forUserIdentity, checkClassPath, error);
-    return _readAndValidateMetadata(containerURL / fileName, containerURL, forUserIdentity, checkClassPath, error);
+    // A trailing separator names the same container; the record's url must not keep it.
+    std::filesystem::path container = containerURL.has_filename() ? containerURL : containerURL.parent_path();
+    return readAndValidateMetadataAtFileUrl(container / fileName, forUserIdentity, checkClassPath, error);
 }
 
 std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtFileUrl(const std::filesystem::path& fileURL,
                                                                            const STWUserIdentityRef& forUserIdentity,
                                                                            bool checkClassPath, STWErrorRef* error) {
-    return _readAndValidateMetadata(fileURL, fileURL.parent_path(), forUserIdentity, checkClassPath, error);
-}
-
-std::shared_ptr<STWMetadata> STWMetadata::_readAndValidateMetadata(const std::filesystem::path& fileURL,
-                                                                   const std::filesystem::path& container,
-                                                                   const STWUserIdentityRef& forUserIdentity,
-                                                                   bool checkClassPath, STWErrorRef* error) {
-    // The container's owner may replace the file; never follow a link it put there.
-    auto read = STW_dictionaryWithContentsOfURL(fileURL, STWReadNoFollow, nullptr);
-    if (!read) {
+    std::filesystem::path container = fileURL.parent_path();
+    std::filesystem::path classDirectory = container.parent_path();
+    STWFileDescriptor classfd(open(classDirectory.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+    if (!classfd) {
         STWSetError(error, STW_ERROR(STWErrorReadFileFailed, nullptr, "Failed to read metadata at URL %@", fileURL));
         return nullptr;
     }
-    STWValue::Dictionary& plist = *read;
+    return _readAndValidateMetadata(classfd.get(), container.filename() / fileURL.filename(), fileURL, container,
+                                    forUserIdentity, checkClassPath, error);
+}
+
+std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataInDirectory(int classfd, const std::string& name,
+                                                                             const std::filesystem::path& containerURL,
+                                                                             const STWUserIdentityRef& forUserIdentity,
+                                                                             bool checkClassPath, STWErrorRef* error) {
+    return _readAndValidateMetadata(classfd, std::filesystem::path(name) / fileName, containerURL / fileName,
+                                    containerURL, forUserIdentity, checkClassPath, error);
+}
+
+std::shared_ptr<STWMetadata> STWMetadata::_readAndValidateMetadata(int dirfd, const std::filesystem::path& relativePath,
+                                                                   const std::filesystem::path& fileURL,
+                                                                   const std::filesystem::path& container,
+                                                                   const STWUserIdentityRef& forUserIdentity,
+                                                                   bool checkClassPath, STWErrorRef* error) {
+    // The container and the file are the app's to replace: no link is followed on the way,
+    // and nothing but a regular file of the daemon's own is read. O_NONBLOCK keeps a FIFO
+    // from hanging the open.
+    STWErrorRef openError;
+    STWFileDescriptor fd = STWFileManager::defaultManager()->openBeneath(
+        dirfd, relativePath, O_RDONLY | O_NONBLOCK | O_NOCTTY, 0, STWOpenBeneathNoSymlinks, &openError);
+    struct stat st;
+    std::string bytes;
+    std::optional<STWValue> root;
+    const char* problem = nullptr;
+    int e = 0;
+    if (!fd)
+        problem = "cannot be opened";
+    else if (fstat(fd.get(), &st) != 0)
+        e = errno;
+    else if (!S_ISREG(st.st_mode))
+        problem = "is not a regular file";
+    else if (static_cast<uint64_t>(st.st_size) > maximumFileSize)
+        problem = "is larger than 1 MiB";
+    else if (st.st_uid != geteuid()) {
+        // Anyone can copy another container's (readable) metadata into a directory of
+        // theirs; only what the daemon wrote makes a directory a container.
+        STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr,
+                                     "Metadata at %@ is owned by uid %u, not written by stowlyd: not a container",
+                                     fileURL, st.st_uid));
+        return nullptr;
+    } else if (!(e = STWReadDescriptorContents(fd.get(), &bytes, maximumFileSize))) {
+        root = STWPropertyList::parse(bytes);
+        if (!root || !root->isDictionary())
+            problem = "is not a property-list dictionary";
+    }
+    if (e || problem) {
+        STWErrorRef reason = openError ? openError
+                                       : STW_POSIX_ERROR_NOLOG(e ? e : EINVAL, "%@ %s", fileURL,
+                                                               e ? strerror(e) : problem);
+        STWSetError(error, STW_ERROR(STWErrorReadFileFailed, reason, "Failed to read metadata at URL %@", fileURL));
+        return nullptr;
+    }
+    STWValue::Dictionary& plist = *root->mutableDictionary();
 
     const STWValue* identifierValue = STWDictionaryFind(plist, kIdentifierKey);
     if (!identifierValue || !identifierValue->string()) {
@@ -264,6 +353,7 @@ std::shared_ptr<STWMetadata> STWMetadata::_readAndValidateMetadata(const std::fi
         return nullptr;
     }
     auto metadata = std::make_shared<STWMetadata>(identity, std::move(info), container, std::move(assetsDirName));
+    metadata->setFileIdentity(st);
     STW_LOG_DEBUG(STWLogCategory::Metadata, "[%s] Read metadata from [%@]: %@ <= %@", __func__, fileURL, *metadata,
                   STWValue(plist));
     return metadata;

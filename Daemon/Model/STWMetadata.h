@@ -1,10 +1,18 @@
 // The record of one container, kept inside it as ".com.vorlane.stowly.metadata.plist".
 // The file is the ground truth from which the container cache is rebuilt: a directory
-// whose metadata file is missing or invalid is not a container. Files are written as
-// binary property lists through the class's staging directory and renamed into place, so
-// readers never see a partial file; reading validates every field.
+// whose metadata file is missing or invalid is not a container.
+//
+// The container belongs to its app, which may replace anything in it; so the file counts
+// only when the daemon wrote it. It is written as root, mode 0644, beside its final name
+// inside the container and renamed into place through the container's descriptor, then
+// made immutable where the file system allows. A reader opens it beneath the class
+// directory without following any link, checks before reading that it is a regular file
+// of the daemon's own of at most 1 MiB (a FIFO, a device or a huge file is not read), and
+// validates every field. The record keeps the file's device and inode, so a look-up can
+// tell that the file it found is still the one it read.
 #pragma once
 
+#include "Daemon/FileSystem/STWFileDescriptor.h"
 #include "Daemon/Model/STWConcreteContainerIdentity.h"
 #include "common/STWError.h"
 #include "common/STWValue.h"
@@ -13,6 +21,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <sys/stat.h>
 
 class STWMetadata;
 using STWMetadataRef = std::shared_ptr<const STWMetadata>;
@@ -47,13 +56,25 @@ public:
     const std::optional<STWValue::Dictionary>& info() const { return _info; }
     void setInfo(std::optional<STWValue::Dictionary> info) { _info = std::move(info); }
 
+    // The metadata file this record was read from or written to.
+    void setFileIdentity(const struct stat& file);
+    bool isRecordOfFile(const struct stat& file) const;
+
     STWConcreteContainerIdentityRef containerIdentity() const;
     std::string description() const;
 
     // The dictionary stored in the file.
     STWValue::Dictionary dictionaryRepresentation() const;
-    bool writeMetadataToDiskWithError(STWErrorRef* error) const;
-    bool writeMetadataToFileURL(const std::filesystem::path& fileURL, STWErrorRef* error) const;
+    // Writes the file into the container at url(); once the record knows its file, only
+    // into the very directory that holds it.
+    bool writeMetadataToDiskWithError(STWErrorRef* error);
+    bool writeMetadataToFileURL(const std::filesystem::path& fileURL, STWErrorRef* error);
+    // Writes the file into the container directory open as `containerfd`.
+    bool writeMetadataToContainerDirectory(int containerfd, STWErrorRef* error);
+    // The container directory that holds this record's file, opened beneath the class
+    // directory without following links; ESTALE when the file there is not the one the
+    // record was read from (the app replaced its container).
+    STWFileDescriptor openContainerDirectory(STWErrorRef* error) const;
 
     static std::shared_ptr<STWMetadata> readAndValidateMetadataAtUrl(const std::filesystem::path& containerURL,
                                                                      const STWUserIdentityRef& forUserIdentity,
@@ -61,13 +82,24 @@ public:
     static std::shared_ptr<STWMetadata> readAndValidateMetadataAtFileUrl(const std::filesystem::path& fileURL,
                                                                          const STWUserIdentityRef& forUserIdentity,
                                                                          bool checkClassPath, STWErrorRef* error);
+    // The container `name` of the class directory open as `classfd` (at `containerURL`).
+    static std::shared_ptr<STWMetadata> readAndValidateMetadataInDirectory(int classfd, const std::string& name,
+                                                                           const std::filesystem::path& containerURL,
+                                                                           const STWUserIdentityRef& forUserIdentity,
+                                                                           bool checkClassPath, STWErrorRef* error);
+
+    // Larger files are not metadata the daemon wrote.
+    static constexpr size_t maximumFileSize = 1u << 20;
 
 private:
-    // `container` is the directory that holds `fileURL`.
-    static std::shared_ptr<STWMetadata> _readAndValidateMetadata(const std::filesystem::path& fileURL,
+    // Reads `relativePath` beneath `dirfd` (the file at `fileURL` inside `container`).
+    static std::shared_ptr<STWMetadata> _readAndValidateMetadata(int dirfd, const std::filesystem::path& relativePath,
+                                                                 const std::filesystem::path& fileURL,
                                                                  const std::filesystem::path& container,
                                                                  const STWUserIdentityRef& forUserIdentity,
                                                                  bool checkClassPath, STWErrorRef* error);
+    bool _writeMetadataAt(int dirfd, const std::string& name, const std::filesystem::path& fileURL,
+                          STWErrorRef* error);
 
     bool _transient = false;
     bool _existed = false;
@@ -81,4 +113,6 @@ private:
     std::string _url;
     std::optional<std::string> _userManagedAssetsDirName;
     std::optional<STWValue::Dictionary> _info;
+    uint64_t _fileDevice = 0;
+    uint64_t _fileInode = 0; // 0: no file known yet
 };

@@ -267,9 +267,13 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
         STW_LOG_DEBUG(STWLogCategory::Lifecycle, "begin CreatingContainer uuid=%@ identifier=%@ class=%llu", name, id, c);
         const STWUserIdentityRef& userIdentity = identity->userIdentity();
         auto configuration = STWGlobalConfiguration::sharedInstance();
-        std::filesystem::path staging = configuration->stagingDirectoryURLForUserIdentity(userIdentity, c) / name;
+        auto fileManager = STWFileManager::defaultManager();
+        std::filesystem::path stagingDirectory = configuration->stagingDirectoryURLForUserIdentity(userIdentity, c);
+        std::filesystem::path staging = stagingDirectory / name;
 
-        // From here on a failure sends whatever is in staging to death row.
+        // The staging directory belongs to the user whose apps may swap its entries at any
+        // moment: the new container is built only through the descriptor that made it, and
+        // what the final rename publishes is checked to be that directory.
         STWErrorRef failure;
         uint64_t failureCode = STWErrorSuccess;
         std::shared_ptr<STWMetadata> metadata;
@@ -278,7 +282,12 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
             failure = std::move(failedError);
         };
         STWErrorRef stepError;
-        if (!_createTopLevelContainerDirectory(staging, c, userIdentity->posixUIDForContainerClass(c), &stepError)) {
+        STWFileDescriptor stagingfd = fileManager->openDirectoryAtURL(stagingDirectory, &stepError);
+        STWFileDescriptor containerfd;
+        if (stagingfd)
+            containerfd = _createTopLevelContainerDirectory(stagingfd.get(), name, staging, c,
+                                                            userIdentity->posixUIDForContainerClass(c), &stepError);
+        if (!containerfd) {
             fail(STWErrorCreateStagingFailed,
                  STW_ERROR(STWErrorCreateStagingFailed, stepError, "Failed to create staging dir at %@ : %@", staging,
                            stepError));
@@ -290,7 +299,7 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
                 fail(identityError, nullptr);
             } else {
                 metadata = std::make_shared<STWMetadata>(concrete, std::nullopt, staging, std::nullopt);
-                if (!metadata->writeMetadataToDiskWithError(&stepError)) {
+                if (!metadata->writeMetadataToContainerDirectory(containerfd.get(), &stepError)) {
                     fail(codeOf(stepError), stepError);
                 } else if (STWContainerClassIsSystem(c)) {
                     // System containers get their ACLs here once ACL handling is part of the
@@ -298,7 +307,8 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
                     STW_LOG_DEBUG(STWLogCategory::Lifecycle, "No system-container ACL for %@: not part of this build",
                                   staging);
                 }
-                if (failureCode == STWErrorSuccess && !_createSubDirectories(staging, *metadata, &stepError))
+                if (failureCode == STWErrorSuccess &&
+                    !_createSubDirectories(containerfd.get(), staging, *metadata, &stepError))
                     fail(codeOf(stepError), stepError);
             }
         }
@@ -308,9 +318,14 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
             std::optional<std::filesystem::path> classDirectory =
                 configuration->containerDirectoryURLForUserIdentity(userIdentity, c, transient);
             std::optional<std::string> wellKnown = whitelist->wellknownContainerForId(id, c);
-            final = (classDirectory ? *classDirectory : std::filesystem::path()) / (wellKnown ? *wellKnown : name);
-            if (!classDirectory ||
-                !STWFileManager::defaultManager()->moveItemAtURL(staging, final, STWFileManagerMoveDurable, &stepError)) {
+            std::string finalName = wellKnown ? *wellKnown : name;
+            final = (classDirectory ? *classDirectory : std::filesystem::path()) / finalName;
+            STWFileDescriptor classfd;
+            if (classDirectory)
+                classfd = fileManager->openDirectoryAtURL(*classDirectory, &stepError);
+            if (!classfd || !fileManager->moveDirectoryAt(stagingfd.get(), name, classfd.get(), finalName,
+                                                          containerfd.get(), STWFileManagerMoveDurable, staging, final,
+                                                          &stepError)) {
                 fail(STWErrorMoveStagingFailed, STW_ERROR(STWErrorMoveStagingFailed, stepError,
                                                           "Failed to move staging dir: %@ to live dir: %@", staging,
                                                           final));
@@ -388,10 +403,13 @@ bool STWClientConnection::recreateDefaultStructureWithContainerIdentity(const ST
         lock_identifier_for_writing(key);
         bool success = false;
         if (auto found = STWContainerCache::sharedInstance()->containerForContainerIdentity(identity)) {
+            // The container is its app's: the subdirectories are made through the
+            // descriptor of the directory that holds the record's own metadata file.
             STWErrorRef stepError;
-            success = _createSubDirectories(found->url(), *found, &stepError);
+            STWFileDescriptor containerfd = found->openContainerDirectory(&stepError);
+            success = containerfd && _createSubDirectories(containerfd.get(), found->url(), *found, &stepError);
             if (!success)
-                *error = codeOf(stepError);
+                *error = containerfd ? codeOf(stepError) : uint64_t{STWErrorNotFound};
             // System containers get their ACLs reapplied here once ACL handling is part of
             // the daemon.
         } else {
@@ -403,14 +421,15 @@ bool STWClientConnection::recreateDefaultStructureWithContainerIdentity(const ST
     });
 }
 
-bool STWClientConnection::_createTopLevelContainerDirectory(const std::filesystem::path& url,
-                                                            STWContainerClass containerClass, uid_t owner,
-                                                            STWErrorRef* error) {
+STWFileDescriptor STWClientConnection::_createTopLevelContainerDirectory(int stagingfd, const std::string& name,
+                                                                     const std::filesystem::path& url,
+                                                                     STWContainerClass containerClass, uid_t owner,
+                                                                     STWErrorRef* error) {
     if (STWContainerClassIsBundle(containerClass))
         owner = STWPlatformConfiguration::sharedInstance()->installationUID();
     else if (STWContainerClassIsSystem(containerClass))
         owner = STWFileManagerOwnerUnchanged;
-    return STWFileManager::defaultManager()->createDirectoryAtURL(url, true, 0755, owner, 0, error);
+    return STWFileManager::defaultManager()->createNewDirectoryAt(stagingfd, name, 0755, owner, 0, url, error);
 }
 
 int32_t STWClientConnection::_dataProtectionClassForContainerMetadata(const STWMetadata& metadata) {
@@ -426,8 +445,8 @@ int32_t STWClientConnection::_dataProtectionClassForContainerMetadata(const STWM
     return 0;
 }
 
-bool STWClientConnection::_createSubDirectories(const std::filesystem::path& url, const STWMetadata& metadata,
-                                                STWErrorRef* error) {
+bool STWClientConnection::_createSubDirectories(int containerfd, const std::filesystem::path& url,
+                                                const STWMetadata& metadata, STWErrorRef* error) {
     STWContainerClass c = metadata.containerClass();
     mode_t mode = STWContainerClassIsSystem(c) ? 0 : 0755;
     uid_t owner = STWContainerClassIsBundle(c)   ? STWPlatformConfiguration::sharedInstance()->installationUID()
@@ -449,8 +468,8 @@ bool STWClientConnection::_createSubDirectories(const std::filesystem::path& url
         if (STWContainerClassIsPerUser(c) && std::find(excluded.begin(), excluded.end(), path) != excluded.end())
             itemClass = 0;
         STWErrorRef createError;
-        if (!STWFileManager::defaultManager()->createDirectoryAtURL(url / path, true, mode, owner, itemClass,
-                                                                    &createError)) {
+        if (!STWFileManager::defaultManager()->createDirectoryBeneath(containerfd, path, mode, owner, itemClass,
+                                                                      url / path, &createError)) {
             STWSetError(error, STW_ERROR(STWErrorCreateSubdirectoryFailed, createError,
                                          "Failed to create sub-dir for %@ at %@ (protClass: %d)", metadata.identifier(),
                                          path, itemClass));

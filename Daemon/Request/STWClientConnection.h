@@ -4,6 +4,7 @@
 // runs on privileged connections.
 #pragma once
 
+#include "Daemon/FileSystem/STWFileDescriptor.h"
 #include "Daemon/Lifecycle/STWCommandQueue.h"
 #include "Daemon/Model/STWConcreteContainerIdentity.h"
 #include "Daemon/Model/STWContainerClass.h"
@@ -66,10 +67,17 @@ public:
     bool recreateDefaultStructureWithContainerIdentity(const STWConcreteContainerIdentityRef& identity,
                                                        uint64_t* error);
 
-    bool _createTopLevelContainerDirectory(const std::filesystem::path& url, STWContainerClass containerClass,
-                                           uid_t owner, STWErrorRef* error);
+    // The new container directory `name` in the staging directory open as `stagingfd` (at
+    // `url`), owned as its class wants; its descriptor.
+    STWFileDescriptor _createTopLevelContainerDirectory(int stagingfd, const std::string& name,
+                                                        const std::filesystem::path& url,
+                                                        STWContainerClass containerClass, uid_t owner,
+                                                        STWErrorRef* error);
     int32_t _dataProtectionClassForContainerMetadata(const STWMetadata& metadata);
-    bool _createSubDirectories(const std::filesystem::path& url, const STWMetadata& metadata, STWErrorRef* error);
+    // The standard subdirectories of the class, made beneath the container directory open as
+    // `containerfd` (at `url`); a link in place of one is removed, never followed.
+    bool _createSubDirectories(int containerfd, const std::filesystem::path& url, const STWMetadata& metadata,
+                               STWErrorRef* error);
 
     // Death row: moves an item into a fresh "temp." directory of death row (a missing item
     // counts as moved) and optionally starts a deletion pass.

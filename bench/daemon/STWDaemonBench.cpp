@@ -16,6 +16,7 @@
 // /tmp, so its containers are on that disk, with its runtime directory on a tmpfs as /run
 // is, and its system log in a file. Usage: stowly_bench_daemon [--quick]
 #include "Daemon/Lifecycle/STWContainerCache.h"
+#include "Daemon/FileSystem/STWFileManager.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Model/STWMetadata.h"
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
@@ -240,9 +241,8 @@ public:
         _where = "on a tmpfs (" + _directory.string() + ")";
     }
     ~RuntimeDirectory() {
-        std::error_code ec;
         if (!_directory.empty())
-            fs::remove_all(_directory, ec);
+            STWFileManager::defaultManager()->removeItemAtURL(_directory);
     }
     const std::string& where() const { return _where; }
 
@@ -486,7 +486,7 @@ void DaemonBench::_creation() {
             die("direct creation in " + direct.string() + " failed");
         baseline.push_back(micros(Clock::now() - before));
     }
-    fs::remove_all(direct);
+    STWFileManager::defaultManager()->removeItemAtURL(direct);
     double d = percentile(daemon, 0.5), b = percentile(baseline, 0.5);
     printf("data containers created: %zu each, median stowlyd %.0f us, direct %.0f us\n", count, d, b);
     printf("create_data_container: ratio %.2f (goal <= 1.5)\n", d / b);

@@ -3,6 +3,7 @@
 //
 // Usage: stowly_bench_model [--quick]
 #include "Daemon/Model/STWGlobalConfiguration.h"
+#include "Daemon/FileSystem/STWFileManager.h"
 #include "Daemon/Model/STWMetadata.h"
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
 #include "common/STWDictionaryUtilities.h"
@@ -134,6 +135,6 @@ int main(int argc, char** argv) {
            "parse %.1f us/file\n",
            containers.size(), rounds, slice, turns, totalValidated / reads * 1e6, totalBare / reads * 1e6);
     printf("metadata_read_validate: ratio %.2f (goal <= 1.3)\n", median);
-    std::filesystem::remove_all(root);
+    STWFileManager::defaultManager()->removeItemAtURL(root);
     return 0;
 }

@@ -1,4 +1,5 @@
 #include "client/STWClient.h"
+#include "Daemon/FileSystem/STWFileManager.h"
 #include "platform/STWPlatformConfiguration.h"
 
 #include <gtest/gtest.h>
@@ -55,5 +56,5 @@ TEST(STWIdleExit, LeavesOnlyWhenNoConnectionIsLeft) {
     kill(pid, SIGKILL);
     waitpid(pid, nullptr, WNOHANG);
     sem_unlink(STWPlatformConfiguration(root).firstBootSemaphoreName().c_str());
-    std::filesystem::remove_all(root);
+    STWFileManager::defaultManager()->removeItemAtURL(root);
 }

@@ -82,7 +82,7 @@ TEST_F(STWContainerCacheTest, AContainerDeletedBehindTheCachesBackAnswers44OnceT
     ASSERT_TRUE(lookup("com.example.doomed", &error));
     ASSERT_EQ(store->mappings().size(), 1u);
 
-    fs::remove(doomed.url / STWMetadata::fileName);
+    STWFileManager::defaultManager()->removeItemAtURL(doomed.url / STWMetadata::fileName);
     EXPECT_FALSE(lookup("com.example.doomed", &error));
     ASSERT_TRUE(error);
     EXPECT_TRUE(error->is(44));
@@ -100,7 +100,7 @@ TEST_F(STWContainerCacheTest, AContainerDeletedBehindTheCachesBackAnswers44OnceT
     auto gone = STWMakeTestContainer(mobile, "com.example.gone", 2);
     ASSERT_TRUE(cache->addContainerMetadata(kept.metadata, kept.url, false, true, &error));
     ASSERT_TRUE(cache->addContainerMetadata(gone.metadata, gone.url, false, true, &error));
-    fs::remove_all(gone.url);
+    STWFileManager::defaultManager()->removeItemAtURL(gone.url);
     auto all = cache->allContainersForUserIdentity(mobile, 2, false, &error);
     ASSERT_TRUE(all);
     ASSERT_EQ(all->size(), 1u);

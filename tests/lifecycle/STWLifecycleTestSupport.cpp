@@ -1,4 +1,5 @@
 #include "tests/lifecycle/STWLifecycleTestSupport.h"
+#include "Daemon/FileSystem/STWFileManager.h"
 
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
@@ -37,7 +38,7 @@ void STWLifecycleTestSetUpRoot() {
     for (const char* path : {"/private/var/mobile/Containers", "/private/var/ent1", "/private/var/containers",
                              "/private/var/root/Library/Caches/com.vorlane.stowlyd/Temp", "/run/stowly/sandbox",
                              "/private/var/staged", "/private/var/outside"})
-        std::filesystem::remove_all(root.resolve(path));
+        STWFileManager::defaultManager()->removeItemAtURL(root.resolve(path));
 }
 
 STWUserIdentityRef STWTestPersonalIdentity() {

@@ -10,6 +10,8 @@
 
 #include <algorithm>
 #include <mutex>
+#include <sys/stat.h>
+#include <unistd.h>
 #include <vector>
 
 namespace {
@@ -24,12 +26,16 @@ protected:
         container = classDirectory / uuid.string();
         std::filesystem::create_directories(container);
     }
-    void TearDown() override { std::filesystem::remove_all(container); }
+    void TearDown() override { STWFileManager::defaultManager()->removeItemAtURL(container); }
 
     STWMetadata make(STWContainerClass c = 2) {
         auto identity = STWConcreteContainerIdentity::containerIdentityWithUUID(uuid, mobile, "com.example.app", c, nullptr);
         return STWMetadata(identity, STWValue::Dictionary{{"com.vorlane.Setwright.ContentProtectionClass", STWValue(3)}},
                            container, std::nullopt);
+    }
+    // The daemon's files are immutable; a test changes them as root would.
+    void unflag(const std::filesystem::path& file) {
+        ASSERT_TRUE(STWFileManager::defaultManager()->setUserImmutableOfItemAtURL(file, false, nullptr));
     }
     STWValue::Dictionary stored() {
         return *STW_dictionaryWithContentsOfURL(container / STWMetadata::fileName, STWReadDefault, nullptr);
@@ -42,6 +48,7 @@ protected:
             d.erase(key);
         else
             d[key] = value;
+        unflag(container / STWMetadata::fileName);
         EXPECT_TRUE(STW_writeToURL(d, container / STWMetadata::fileName, STWWriteAtomic, nullptr));
         STWErrorRef error;
         EXPECT_FALSE(STWMetadata::readAndValidateMetadataAtUrl(container, expected ? expected : mobile, checkClassPath, &error));
@@ -118,6 +125,7 @@ TEST_F(STWMetadataTest, EachKindOfInvalidFileIsRejectedWithItsMessage) {
     STWErrorRef error;
     EXPECT_TRUE(STWMetadata::readAndValidateMetadataAtUrl(container, mobile, false, &error)); // no class-path check
 
+    unflag(container / STWMetadata::fileName);
     std::filesystem::remove(container / STWMetadata::fileName);
     error.reset();
     EXPECT_FALSE(STWMetadata::readAndValidateMetadataAtUrl(container, mobile, true, &error));
@@ -131,6 +139,7 @@ TEST_F(STWMetadataTest, LegacyAndGlobalFilesFindTheirUserIdentity) {
     STWValue::Dictionary d = stored();
     d.erase("STWMetadataUserIdentity");
     d["STWMetadataPersona"] = STWValue(501);
+    unflag(container / STWMetadata::fileName);
     ASSERT_TRUE(STW_writeToURL(d, container / STWMetadata::fileName, STWWriteAtomic, nullptr));
     STWErrorRef error;
     auto legacy = STWMetadata::readAndValidateMetadataAtUrl(container, mobile, true, &error);
@@ -149,7 +158,7 @@ TEST_F(STWMetadataTest, LegacyAndGlobalFilesFindTheirUserIdentity) {
     auto system = STWMetadata::readAndValidateMetadataAtUrl(systemContainer, other, true, &error);
     ASSERT_TRUE(system);
     EXPECT_EQ(*system->userIdentity(), *STWUserIdentityCache::defaultUserIdentity());
-    std::filesystem::remove_all(systemContainer);
+    STWFileManager::defaultManager()->removeItemAtURL(systemContainer);
 }
 
 TEST_F(STWMetadataTest, AFailedWriteKeepsThePreviousFile) {
@@ -170,6 +179,7 @@ TEST_F(STWMetadataTest, ReadingAcceptsXMLButNeverFollowsALinkOrAcceptsAnotherRoo
     ASSERT_TRUE(metadata.writeMetadataToDiskWithError(nullptr));
     std::filesystem::path file = container / STWMetadata::fileName;
     STWValue::Dictionary d = stored();
+    unflag(file);
     ASSERT_EQ(STWWriteFileAtomically(file, STWPropertyList::serializeXML(STWValue(d)), 0644, false), 0);
     STWErrorRef error;
     auto back = STWMetadata::readAndValidateMetadataAtUrl(container, mobile, true, &error);
@@ -211,7 +221,7 @@ TEST_F(STWMetadataTest, WithoutAnExpectedIdentityOnlyGlobalContainersRead) {
     EXPECT_EQ(*bundle->userIdentity(), *STWUserIdentityCache::defaultUserIdentity());
 }
 
-TEST_F(STWMetadataTest, AWriteIsOnDiskBeforeItIsAcknowledged) {
+TEST_F(STWMetadataTest, AWriteIsOnDiskBeforeItIsAcknowledgedAndStaysTheDaemons) {
     std::vector<std::string> synced;
     std::mutex mutex;
     STWFileManager::setSyncObserverForTesting([&](const std::string& path) {
@@ -221,14 +231,30 @@ TEST_F(STWMetadataTest, AWriteIsOnDiskBeforeItIsAcknowledged) {
     bool written = make().writeMetadataToDiskWithError(nullptr);
     STWFileManager::setSyncObserverForTesting(nullptr);
     ASSERT_TRUE(written);
-    std::filesystem::path staging = STWGlobalConfiguration::sharedInstance()->stagingDirectoryURLForUserIdentity(mobile, 2);
-    std::string temporary = (staging / ("temp_metadata-" + uuid.string() + ".plist")).string();
-    // The bytes under their temporary name, then the directory that now holds the final name.
-    auto bytes = std::find(synced.begin(), synced.end(), temporary);
+    // The bytes under their temporary name beside the file, then the directory that now
+    // holds the final name.
+    auto bytes = std::find_if(synced.begin(), synced.end(), [&](const std::string& path) {
+        return path.rfind((container / ".temp.").string(), 0) == 0;
+    });
     auto rename = std::find(synced.begin(), synced.end(), container.string());
     EXPECT_NE(bytes, synced.end());
     EXPECT_NE(rename, synced.end());
     EXPECT_LT(bytes, rename);
+
+    // Written by root, readable by all, and owned by nobody else: a copy that someone else
+    // owns is no metadata.
+    std::filesystem::path file = container / STWMetadata::fileName;
+    struct stat st;
+    ASSERT_EQ(stat(file.c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 07777, 0644u);
+    EXPECT_EQ(st.st_uid, 0u);
+    EXPECT_NE(unlink(file.c_str()), 0) << "the file is immutable";
+    unflag(file);
+    ASSERT_EQ(chown(file.c_str(), 501, 501), 0);
+    STWErrorRef error;
+    EXPECT_FALSE(STWMetadata::readAndValidateMetadataAtUrl(container, mobile, true, &error));
+    ASSERT_TRUE(error);
+    EXPECT_EQ(error->code(), 29);
 }
 
 TEST_F(STWMetadataTest, TheClassDirectoryIsCheckedOnThePathAsGiven) {
@@ -248,12 +274,14 @@ TEST_F(STWMetadataTest, TheClassDirectoryIsCheckedOnThePathAsGiven) {
           classDirectory / "Nested" / uuid.string()}) {
         std::filesystem::create_directories(misplaced);
         std::filesystem::copy_file(container / STWMetadata::fileName, misplaced / STWMetadata::fileName);
+        // A copy is the copier's; this one stands for one the daemon wrote.
+        ASSERT_EQ(chown((misplaced / STWMetadata::fileName).c_str(), 0, 0), 0);
         error.reset();
         EXPECT_FALSE(STWMetadata::readAndValidateMetadataAtUrl(misplaced, mobile, true, &error)) << misplaced;
         ASSERT_TRUE(error);
         EXPECT_NE(error->message().find("Invalid metadata-URLs should match:"), std::string::npos);
         EXPECT_TRUE(STWMetadata::readAndValidateMetadataAtUrl(misplaced, mobile, false, nullptr));
-        std::filesystem::remove_all(misplaced);
+        STWFileManager::defaultManager()->removeItemAtURL(misplaced);
     }
 }
 

@@ -1,4 +1,5 @@
 #include "tests/support/STWDaemonProcess.h"
+#include "Daemon/FileSystem/STWFileManager.h"
 
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWFileIO.h"
@@ -73,8 +74,7 @@ STWDaemonProcess::~STWDaemonProcess() {
         stop();
     // The first-boot marker lives outside the root; a daemon of another root never shares it.
     sem_unlink(STWPlatformConfiguration(_root).firstBootSemaphoreName().c_str());
-    std::error_code ec;
-    std::filesystem::remove_all(_root, ec);
+    STWFileManager::defaultManager()->removeItemAtURL(_root);
 }
 
 bool STWDaemonProcess::start() {

@@ -1,4 +1,5 @@
 #include "tests/support/STWTestRoot.h"
+#include "Daemon/FileSystem/STWFileManager.h"
 
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWPropertyList.h"
@@ -8,20 +9,30 @@
 #include <fstream>
 #include <gtest/gtest.h>
 
+// A death test's child process runs the test binary anew and would make (and, dying,
+// leave behind) a root of its own; it takes over its parent's instead.
+constexpr const char* kInheritedRootVariable = "STOWLY_TEST_ROOT";
+
 STWTestRoot& STWTestRoot::shared() {
     static STWTestRoot* root = [] {
-        auto* r = new STWTestRoot;
+        const char* inherited = getenv(kInheritedRootVariable);
+        if (inherited && std::filesystem::is_directory(inherited))
+            return new STWTestRoot(inherited);
+        auto* r = new STWTestRoot(std::nullopt);
+        setenv(kInheritedRootVariable, r->path().c_str(), 1);
         static std::filesystem::path cleanup = r->path();
-        atexit([] {
-            std::error_code ec;
-            std::filesystem::remove_all(cleanup, ec);
-        });
+        atexit([] { STWFileManager::defaultManager()->removeItemAtURL(cleanup); });
         return r;
     }();
     return *root;
 }
 
-STWTestRoot::STWTestRoot() {
+STWTestRoot::STWTestRoot(const std::optional<std::filesystem::path>& existing) {
+    if (existing) {
+        _path = *existing;
+        _reload();
+        return;
+    }
     char templ[] = "/tmp/stowly-test-root-XXXXXX";
     if (!mkdtemp(templ))
         abort();

@@ -8,6 +8,7 @@
 #include "common/STWValue.h"
 
 #include <filesystem>
+#include <optional>
 
 class STWTestRoot {
 public:
@@ -21,7 +22,8 @@ public:
     void writePersonas(const STWValue::Array& personas);
 
 private:
-    STWTestRoot();
+    // A new root, or the one at `existing`.
+    explicit STWTestRoot(const std::optional<std::filesystem::path>& existing);
     void _reload();
     std::filesystem::path _path;
 };
