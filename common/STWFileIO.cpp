@@ -43,19 +43,16 @@ int STWReadFileContents(const std::filesystem::path& path, std::string* contents
     else if (!S_ISREG(st.st_mode))
         e = S_ISDIR(st.st_mode) ? EISDIR : EINVAL;
     else
-        e = STWReadDescriptorContents(fd, contents, maxSize);
+        e = STWReadDescriptorContents(fd, static_cast<size_t>(st.st_size), contents, maxSize);
     close(fd);
     return e;
 }
 
-int STWReadDescriptorContents(int fd, std::string* contents, size_t maxSize) {
-    struct stat st;
-    if (fstat(fd, &st) != 0)
-        return errno;
-    if (static_cast<uint64_t>(st.st_size) > maxSize)
+int STWReadDescriptorContents(int fd, size_t expectedSize, std::string* contents, size_t maxSize) {
+    if (expectedSize > maxSize)
         return EFBIG;
     std::string data;
-    data.resize(static_cast<size_t>(st.st_size));
+    data.resize(expectedSize);
     size_t used = 0;
     while (true) {
         if (used == data.size()) {

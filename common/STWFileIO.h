@@ -21,9 +21,10 @@ inline constexpr size_t STWMaxReadFileSize = 64u << 20;
 
 int STWReadFileContents(const std::filesystem::path& path, std::string* contents,
                         unsigned options = STWReadDefault, size_t maxSize = STWMaxReadFileSize);
-// The same for a descriptor already open (and checked by the caller): reads to the end,
-// EFBIG past `maxSize`.
-int STWReadDescriptorContents(int fd, std::string* contents, size_t maxSize = STWMaxReadFileSize);
+// The same for a descriptor already open and checked by the caller, whose fstat gave
+// `expectedSize`: reads to the end, EFBIG past `maxSize`.
+int STWReadDescriptorContents(int fd, size_t expectedSize, std::string* contents,
+                              size_t maxSize = STWMaxReadFileSize);
 // Writes all of `contents`, across partial writes and EINTR.
 int STWWriteAll(int fd, std::string_view contents);
 

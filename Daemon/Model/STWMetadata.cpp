@@ -228,7 +228,7 @@ std::shared_ptr<STWMetadata> STWMetadata::_readAndValidateMetadata(int dirfd, co
                                      "Metadata at %@ is owned by uid %u, not written by stowlyd: not a container",
                                      fileURL, st.st_uid));
         return nullptr;
-    } else if (!(e = STWReadDescriptorContents(fd.get(), &bytes, maximumFileSize))) {
+    } else if (!(e = STWReadDescriptorContents(fd.get(), static_cast<size_t>(st.st_size), &bytes, maximumFileSize))) {
         root = STWPropertyList::parse(bytes);
         if (!root || !root->isDictionary())
             problem = "is not a property-list dictionary";

@@ -88,4 +88,42 @@ TEST_P(OpenBeneath, LinksInsideFollowOnlyWhenAllowed) {
 INSTANTIATE_TEST_SUITE_P(, OpenBeneath, ::testing::Values(false, true),
                          [](const auto& info) { return info.param ? "ComponentWalk" : "Openat2"; });
 
+
+// A staged directory swapped for a link after it was made: the publishing rename notices
+// that something else arrived, sends it back and fails; nothing stays published.
+using PublishStaged = FileSystemTest;
+TEST_F(PublishStaged, AnImpostorIsSentBackAndNothingIsPublished) {
+    fs::create_directories(scratch() / "staging");
+    fs::create_directories(scratch() / "live");
+    fs::create_directories(scratch() / "elsewhere");
+    STWFileDescriptor staging = fm()->openDirectoryAtURL(scratch() / "staging");
+    STWFileDescriptor live = fm()->openDirectoryAtURL(scratch() / "live");
+    ASSERT_TRUE(staging && live);
+    STWFileDescriptor made = fm()->createNewDirectoryAt(staging.get(), "new", 0755, STWFileManagerOwnerUnchanged,
+                                                        STWFileManagerClassUnchanged, scratch() / "staging/new");
+    ASSERT_TRUE(made);
+    fs::rename(scratch() / "staging/new", scratch() / "staging/moved");
+    fs::create_directory_symlink(scratch() / "elsewhere", scratch() / "staging/new");
+    STWErrorRef error;
+    EXPECT_FALSE(fm()->moveDirectoryAt(staging.get(), "new", live.get(), "final", made.get(), STWFileManagerMoveDurable,
+                                       scratch() / "staging/new", scratch() / "live/final", &error));
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(error->isPOSIX(ESTALE));
+    EXPECT_TRUE(fs::is_empty(scratch() / "live"));
+    EXPECT_TRUE(fs::is_symlink(scratch() / "staging/new"));
+
+    // The real one goes, and a second publication under the same name never replaces it.
+    fs::remove(scratch() / "staging/new");
+    fs::rename(scratch() / "staging/moved", scratch() / "staging/new");
+    ASSERT_TRUE(fm()->moveDirectoryAt(staging.get(), "new", live.get(), "final", made.get(), STWFileManagerMoveDefault,
+                                      scratch() / "staging/new", scratch() / "live/final"));
+    fs::create_directory(scratch() / "staging/again");
+    STWFileDescriptor again = fm()->openDirectoryAtURL(scratch() / "staging/again");
+    error.reset();
+    EXPECT_FALSE(fm()->moveDirectoryAt(staging.get(), "again", live.get(), "final", again.get(),
+                                       STWFileManagerMoveDefault, scratch() / "staging/again",
+                                       scratch() / "live/final", &error));
+    EXPECT_TRUE(error && error->isPOSIX(EEXIST));
+}
+
 } // namespace
