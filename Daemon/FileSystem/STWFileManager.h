@@ -179,7 +179,9 @@ public:
     // symbolic link (nor a /proc magic link) can lead out of it, however the tree changes
     // meanwhile: openat2 with RESOLVE_BENEATH, or where the kernel lacks it a walk of
     // O_NOFOLLOW opens that refuses every link and every "..". `mode` is used with O_CREAT.
-    STWFileDescriptor openBeneath(int dirfd, const std::filesystem::path& relativePath, int flags, mode_t mode,
+    // (The path is a plain string: it is on the path of every metadata read, and a
+    // std::filesystem::path parses its components when it is made.)
+    STWFileDescriptor openBeneath(int dirfd, const std::string& relativePath, int flags, mode_t mode,
                                   unsigned options, STWErrorRef* error = nullptr) const;
     // The walk of O_NOFOLLOW opens on its own (for kernels without openat2, and for tests).
     STWFileDescriptor _openBeneathByComponents(int dirfd, const std::filesystem::path& relativePath, int flags,

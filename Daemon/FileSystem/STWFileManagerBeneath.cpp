@@ -70,9 +70,10 @@ int openOrMakeDirectory(int at, const std::string& name, mode_t mode, const std:
 
 } // namespace
 
-STWFileDescriptor STWFileManager::openBeneath(int dirfd, const fs::path& relativePath, int flags, mode_t mode,
+STWFileDescriptor STWFileManager::openBeneath(int dirfd, const std::string& relativePath, int flags, mode_t mode,
                                               unsigned options, STWErrorRef* error) const {
-    std::string path = relativePath.empty() ? std::string(".") : relativePath.native();
+    static const std::string here = ".";
+    const std::string& path = relativePath.empty() ? here : relativePath;
     struct open_how how = {};
     how.flags = static_cast<uint64_t>(flags | O_CLOEXEC);
     // O_TMPFILE includes O_DIRECTORY: test all of its bits.

@@ -59,6 +59,12 @@ bool isInClassDirectory(std::string_view container, STWContainerClass containerC
     return !kind.empty() && scope == name.substr(0, slash) && kind == name.substr(slash + 1);
 }
 
+// Whom the metadata files the daemon writes belong to (root, in production).
+uid_t daemonUser() {
+    static const uid_t user = geteuid();
+    return user;
+}
+
 } // namespace
 
 STWMetadata::STWMetadata(const STWConcreteContainerIdentityRef& containerIdentity,
@@ -185,7 +191,7 @@ std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtFileUrl(const
         STWSetError(error, STW_ERROR(STWErrorReadFileFailed, nullptr, "Failed to read metadata at URL %@", fileURL));
         return nullptr;
     }
-    return _readAndValidateMetadata(classfd.get(), container.filename() / fileURL.filename(), fileURL, container,
+    return _readAndValidateMetadata(classfd.get(), (container.filename() / fileURL.filename()).native(), fileURL, container,
                                     forUserIdentity, checkClassPath, error);
 }
 
@@ -193,11 +199,11 @@ std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataInDirectory(int
                                                                              const std::filesystem::path& containerURL,
                                                                              const STWUserIdentityRef& forUserIdentity,
                                                                              bool checkClassPath, STWErrorRef* error) {
-    return _readAndValidateMetadata(classfd, std::filesystem::path(name) / fileName, containerURL / fileName,
-                                    containerURL, forUserIdentity, checkClassPath, error);
+    return _readAndValidateMetadata(classfd, name + "/" + fileName, containerURL / fileName, containerURL,
+                                    forUserIdentity, checkClassPath, error);
 }
 
-std::shared_ptr<STWMetadata> STWMetadata::_readAndValidateMetadata(int dirfd, const std::filesystem::path& relativePath,
+std::shared_ptr<STWMetadata> STWMetadata::_readAndValidateMetadata(int dirfd, const std::string& relativePath,
                                                                    const std::filesystem::path& fileURL,
                                                                    const std::filesystem::path& container,
                                                                    const STWUserIdentityRef& forUserIdentity,
@@ -221,7 +227,7 @@ std::shared_ptr<STWMetadata> STWMetadata::_readAndValidateMetadata(int dirfd, co
         problem = "is not a regular file";
     else if (static_cast<uint64_t>(st.st_size) > maximumFileSize)
         problem = "is larger than 1 MiB";
-    else if (st.st_uid != geteuid()) {
+    else if (st.st_uid != daemonUser()) {
         // Anyone can copy another container's (readable) metadata into a directory of
         // theirs; only what the daemon wrote makes a directory a container.
         STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr,

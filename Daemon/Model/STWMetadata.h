@@ -93,7 +93,7 @@ public:
 
 private:
     // Reads `relativePath` beneath `dirfd` (the file at `fileURL` inside `container`).
-    static std::shared_ptr<STWMetadata> _readAndValidateMetadata(int dirfd, const std::filesystem::path& relativePath,
+    static std::shared_ptr<STWMetadata> _readAndValidateMetadata(int dirfd, const std::string& relativePath,
                                                                  const std::filesystem::path& fileURL,
                                                                  const std::filesystem::path& container,
                                                                  const STWUserIdentityRef& forUserIdentity,

@@ -540,8 +540,10 @@ void DaemonBench::_firstLookupAfterRestart() {
     // mapping (to the daemon's own store, with the values it holds already).
     auto before = Clock::now();
     std::vector<STWMetadataRef> records;
+    STWFileDescriptor classfd = STWFileManager::defaultManager()->openDirectoryAtURL(_main.classDirectory);
     for (const fs::path& container : containers)
-        if (auto record = STWMetadata::readAndValidateMetadataAtUrl(container, _mobile, true, nullptr))
+        if (auto record = STWMetadata::readAndValidateMetadataInDirectory(classfd.get(), container.filename(), container,
+                                                                          _mobile, true, nullptr))
             records.push_back(record);
     double reads = seconds(Clock::now() - before);
     before = Clock::now();

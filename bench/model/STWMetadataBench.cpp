@@ -84,8 +84,11 @@ int main(int argc, char** argv) {
         plist_free(p);
         return parsed;
     };
+    // As the container cache reads a class: beneath the class directory's descriptor.
+    STWFileDescriptor classfd = STWFileManager::defaultManager()->openDirectoryAtURL(classDirectory);
     auto validated = [&](const std::filesystem::path& container) {
-        return STWMetadata::readAndValidateMetadataAtUrl(container, mobile, true, nullptr) != nullptr;
+        return STWMetadata::readAndValidateMetadataInDirectory(classfd.get(), container.filename(), container, mobile,
+                                                               true, nullptr) != nullptr;
     };
     auto timedSlice = [&](size_t first, size_t last, auto&& read) {
         auto start = Clock::now();
