@@ -9,6 +9,7 @@
 #include <memory>
 #include <mutex>
 #include <shared_mutex>
+#include <utility>
 
 namespace {
 
@@ -221,3 +222,30 @@ STWLocksSnapshot STWLocksCurrentState() {
     return {locks.allReaderWriterState, locks.identifierReaderCount, locks.identifierWriterCount,
             locks.identifierToLockMap.size()};
 }
+
+STWAllIdentifiersLockGuard::STWAllIdentifiersLockGuard(STWLockMode mode, bool use) : _held(use) {
+    if (!use)
+        return;
+    if (mode == STWLockMode::Writing)
+        lock_all_identifiers_for_writing();
+    else
+        lock_all_identifiers_for_reading();
+}
+
+void STWAllIdentifiersLockGuard::unlock() {
+    if (std::exchange(_held, false))
+        unlock_all_identifiers();
+}
+
+STWIdentifierLockGuard::STWIdentifierLockGuard(std::string identifier, STWLockMode mode)
+    : STWIdentifierLockGuard(std::vector<std::string>{std::move(identifier)}, mode) {}
+
+STWIdentifierLockGuard::STWIdentifierLockGuard(std::vector<std::string> identifiers, STWLockMode mode)
+    : _identifiers(std::move(identifiers)) {
+    if (mode == STWLockMode::Writing)
+        lock_identifier_for_writing(_identifiers);
+    else
+        lock_identifier_for_reading(_identifiers);
+}
+
+STWIdentifierLockGuard::~STWIdentifierLockGuard() { unlock_identifier(_identifiers); }

@@ -10,6 +10,7 @@
 #include "common/STWException.h"
 #include "common/STWLog.h"
 #include "platform/STWContainerLibrary.h"
+#include "platform/STWCrashPoint.h"
 #include "platform/STWPlatformConfiguration.h"
 
 #include <algorithm>
@@ -149,28 +150,6 @@ T catchingExceptions(const char* function, uint64_t* error, T failure, const std
     }
 }
 
-// Takes the daemon-wide identifier lock when asked, and releases it on every way out.
-class GlobalLock {
-public:
-    GlobalLock(bool use, bool write) : _held(use) {
-        if (!_held)
-            return;
-        if (write)
-            lock_all_identifiers_for_writing();
-        else
-            lock_all_identifiers_for_reading();
-    }
-    ~GlobalLock() { release(); }
-    void release() {
-        if (_held)
-            unlock_all_identifiers();
-        _held = false;
-    }
-
-private:
-    bool _held;
-};
-
 uint64_t codeOf(const STWErrorRef& error) {
     return error && error->domain() == STWErrorDomain ? static_cast<uint64_t>(error->code())
                                                       : uint64_t{STWErrorItemOperationFailed};
@@ -224,7 +203,7 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
 
         auto cache = STWContainerCache::sharedInstance();
         if (!transient) {
-            GlobalLock lock(useLocking, false);
+            STWAllIdentifiersLockGuard lock(STWLockMode::Reading, useLocking);
             STWErrorRef lookupError;
             if (auto found = cache->containerForContainerIdentity(identity, false, true, &lookupError)) {
                 auto result = std::make_shared<STWMetadata>(*found);
@@ -242,7 +221,7 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
             return nullptr;
         }
 
-        GlobalLock lock(useLocking, true);
+        STWAllIdentifiersLockGuard lock(STWLockMode::Writing, useLocking);
         STWErrorRef lookupError;
         if (auto found = cache->containerForContainerIdentity(identity, transient, true, &lookupError)) {
             if (!transient) {
@@ -315,6 +294,7 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
 
         std::filesystem::path final;
         if (failureCode == STWErrorSuccess) {
+            STW_CRASH_POINT(STWCrashPoint::createAfterStaging);
             std::optional<std::filesystem::path> classDirectory =
                 configuration->containerDirectoryURLForUserIdentity(userIdentity, c, transient);
             std::optional<std::string> wellKnown = whitelist->wellknownContainerForId(id, c);
@@ -329,6 +309,8 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
                 fail(STWErrorMoveStagingFailed, STW_ERROR(STWErrorMoveStagingFailed, stepError,
                                                           "Failed to move staging dir: %@ to live dir: %@", staging,
                                                           final));
+            } else {
+                STW_CRASH_POINT(STWCrashPoint::createAfterRename);
             }
         }
         if (failureCode != STWErrorSuccess) {
@@ -346,6 +328,7 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
         metadata->setUrl(final);
         metadata->setExisted(false);
         metadata->setTransient(transient);
+        STW_CRASH_POINT(STWCrashPoint::createBeforeCacheAdd);
         STWErrorRef addError;
         if (!cache->addContainerMetadata(metadata, final, transient, true, &addError)) {
             STW_ERROR(STWErrorCacheAddFailed, addError, "Failed to add to cache : %@, url: %@, transient: %d",
@@ -368,7 +351,7 @@ STWClientConnection::containersWithClass(STWContainerClass containerClass, bool 
             return std::nullopt;
         }
         STWUserIdentityRef userIdentity = _clientIdentity ? _clientIdentity->userIdentity() : nullptr;
-        GlobalLock lock(true, false);
+        STWAllIdentifiersLockGuard lock(STWLockMode::Reading);
         STWErrorRef cacheError;
         auto all = STWContainerCache::sharedInstance()->allContainersForUserIdentity(userIdentity, containerClass,
                                                                                      transient, &cacheError);
@@ -383,10 +366,11 @@ STWClientConnection::containersWithClass(STWContainerClass containerClass, bool 
 std::shared_ptr<STWMetadata> STWClientConnection::metadataWithContainerIdentity(
     const STWConcreteContainerIdentityRef& identity, uint64_t* error) {
     return catchingExceptions<std::shared_ptr<STWMetadata>>(__func__, error, nullptr, [&]() -> std::shared_ptr<STWMetadata> {
-        std::string key = identity->uuid().string();
-        lock_identifier_for_reading(key);
-        auto found = STWContainerCache::sharedInstance()->containerForContainerIdentity(identity);
-        unlock_identifier(key);
+        STWMetadataRef found;
+        {
+            STWIdentifierLockGuard lock(identity->uuid().string(), STWLockMode::Reading);
+            found = STWContainerCache::sharedInstance()->containerForContainerIdentity(identity);
+        }
         if (!found) {
             STW_ERROR(STWErrorNotFound, nullptr, "No Container with user identity: %@", identity);
             *error = STWErrorNotFound;
@@ -399,8 +383,7 @@ std::shared_ptr<STWMetadata> STWClientConnection::metadataWithContainerIdentity(
 bool STWClientConnection::recreateDefaultStructureWithContainerIdentity(const STWConcreteContainerIdentityRef& identity,
                                                                         uint64_t* error) {
     return catchingExceptions<bool>(__func__, error, false, [&]() -> bool {
-        std::string key = identity->uuid().string();
-        lock_identifier_for_writing(key);
+        STWIdentifierLockGuard lock(identity->uuid().string(), STWLockMode::Writing);
         bool success = false;
         if (auto found = STWContainerCache::sharedInstance()->containerForContainerIdentity(identity)) {
             // The container is its app's: the subdirectories are made through the
@@ -416,7 +399,6 @@ bool STWClientConnection::recreateDefaultStructureWithContainerIdentity(const ST
             STW_ERROR(STWErrorNotFound, nullptr, "No Container with identity: %@", identity);
             *error = STWErrorNotFound;
         }
-        unlock_identifier(key);
         return success;
     });
 }

@@ -4,6 +4,7 @@
 #include "Daemon/Request/STWClientConnection.h"
 #include "Daemon/Request/STWRequestDispatcher.h"
 #include "common/STWLog.h"
+#include "platform/STWCrashPoint.h"
 #include "platform/STWIPCListener.h"
 #include "platform/STWKeybag.h"
 #include "platform/STWPlatformConfiguration.h"
@@ -187,6 +188,7 @@ int STWDaemon::main(int argc, char** argv) {
         return 1;
     }
     STWPlatformConfiguration::setSharedInstance(configuration);
+    STWCrashPoint::armFromEnvironment(configuration->isInternalImage());
     std::error_code ec;
     std::filesystem::create_directories(configuration->runtimeDirectory(), ec);
     chmod(configuration->runtimeDirectory().c_str(), 0755);

@@ -1,6 +1,8 @@
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Model/STWUserIdentityCache.h"
 #include "Daemon/Request/STWClientConnection.h"
+#include "Daemon/STWLocks.h"
+#include "platform/STWCrashPoint.h"
 #include "tests/support/STWTestRoot.h"
 
 #include <gtest/gtest.h>
@@ -8,6 +10,7 @@
 #include <csignal>
 #include <fstream>
 #include <future>
+#include <stdexcept>
 #include <sys/resource.h>
 
 namespace {
@@ -81,4 +84,29 @@ TEST(STWCreateOrLookup, DeathRowPassesToleratePlainFilesAndMissingItems) {
     EXPECT_TRUE(connection._moveItemAtURLToDeathRow(scratch, true, false, &error));
     drainDeathRow();
     EXPECT_TRUE(visibleEntries(deathRow).empty());
+}
+
+// An exception in the middle of a create (here thrown at a crash point) is code 40 and
+// leaves no lock held: the next create of the same identity goes through.
+TEST(STWCreateOrLookup, AnExceptionInsideALockedCreateReleasesTheLock) {
+    STWTestRoot::shared();
+    STWClientConnection connection;
+    auto user = STWUserIdentityCache::defaultUserIdentity();
+    auto identity = STWContainerIdentity::containerIdentityWithUserIdentity(user, "com.example.thrown", 2, nullptr);
+    STWCrashPoint::setHandlerForTesting([](std::string_view name) {
+        if (name == STWCrashPoint::createAfterStaging)
+            throw std::runtime_error("the disk went away");
+    });
+    uint64_t error = STWErrorSuccess;
+    auto thrown = connection.createOrLookupContainerWithContainerIdentity(identity, true, false, true, &error);
+    STWCrashPoint::setHandlerForTesting(nullptr);
+    EXPECT_EQ(thrown, nullptr);
+    EXPECT_EQ(error, STWErrorException);
+    STWLocksSnapshot locks = STWLocksCurrentState();
+    EXPECT_EQ(locks.allReaderWriterState, 0u);
+    EXPECT_EQ(locks.identifierWriterCount + locks.identifierReaderCount, 0u);
+    error = STWErrorSuccess;
+    auto created = connection.createOrLookupContainerWithContainerIdentity(identity, true, false, true, &error);
+    ASSERT_NE(created, nullptr) << error;
+    EXPECT_FALSE(created->existed());
 }

@@ -121,6 +121,18 @@ bool STWDaemonProcess::stop() {
     return clean;
 }
 
+std::optional<int> STWDaemonProcess::waitForExit(std::chrono::milliseconds timeout) {
+    auto deadline = std::chrono::steady_clock::now() + timeout;
+    while (isRunning() && std::chrono::steady_clock::now() < deadline)
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    if (!_exitStatus)
+        return std::nullopt;
+    std::optional<int> status = _exitStatus;
+    _pid = -1;
+    _exitStatus.reset();
+    return status;
+}
+
 bool STWDaemonProcess::isRunning() {
     if (_pid <= 0 || _exitStatus)
         return false;

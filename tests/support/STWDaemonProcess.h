@@ -38,6 +38,9 @@ public:
     bool start();
     // SIGTERM, then waits for the exit; true when the daemon exited with status 0.
     bool stop();
+    // Waits for a daemon that is to end by itself (at a crash point, say) and answers its
+    // wait status, or nullopt when it still runs after `timeout`; no failure is reported.
+    std::optional<int> waitForExit(std::chrono::milliseconds timeout);
     // Where the daemon's standard error (its system log off systemd) goes from the next
     // start on; by default it is ours.
     void setStandardErrorFile(std::filesystem::path file) { _standardErrorFile = std::move(file); }

@@ -1,0 +1,74 @@
+#include "platform/STWCrashPoint.h"
+
+#include "common/STWLog.h"
+
+#include <algorithm>
+#include <csignal>
+#include <cstdlib>
+#include <mutex>
+#include <string>
+#include <unistd.h>
+
+namespace STWCrashPoint {
+
+std::atomic<bool> armed{false};
+
+namespace {
+
+std::mutex stateLock;
+std::string armedName;        // guarded by stateLock
+uint64_t remainingPasses = 0; // guarded by stateLock
+std::function<void(std::string_view)> testHandler;
+
+} // namespace
+
+void _reached(const char* name) {
+    std::function<void(std::string_view)> handler;
+    {
+        std::lock_guard guard(stateLock);
+        handler = testHandler;
+        if (!handler && (armedName != name || --remainingPasses > 0))
+            return;
+    }
+    if (handler) {
+        handler(name);
+        return;
+    }
+    STW_LOG_NOTICE(STWLogCategory::Unspecified, "Crash point %s reached: stopping as a power cut would", name);
+    STWLog::flush();
+    kill(getpid(), SIGKILL);
+    _exit(137); // not reached
+}
+
+void armFromEnvironment(bool internalImage) {
+    const char* value = getenv("STOWLY_CRASH_AT");
+    if (!value || !*value)
+        return;
+    if (!internalImage) {
+        STW_LOG_ERROR(STWLogCategory::Unspecified, "Ignoring STOWLY_CRASH_AT=%s: not an internal image", value);
+        return;
+    }
+    std::string spec = value;
+    uint64_t pass = 1;
+    if (size_t colon = spec.find(':'); colon != std::string::npos) {
+        pass = std::strtoull(spec.c_str() + colon + 1, nullptr, 10);
+        spec.resize(colon);
+    }
+    if (pass == 0 || std::find(all.begin(), all.end(), spec) == all.end()) {
+        STW_LOG_ERROR(STWLogCategory::Unspecified, "Ignoring STOWLY_CRASH_AT=%s: no such crash point", value);
+        return;
+    }
+    std::lock_guard guard(stateLock);
+    armedName = spec;
+    remainingPasses = pass;
+    armed = true;
+    STW_LOG_NOTICE(STWLogCategory::Unspecified, "Crash point %s armed for pass %llu", spec, pass);
+}
+
+void setHandlerForTesting(std::function<void(std::string_view name)> handler) {
+    std::lock_guard guard(stateLock);
+    testHandler = std::move(handler);
+    armed = testHandler != nullptr || !armedName.empty();
+}
+
+} // namespace STWCrashPoint

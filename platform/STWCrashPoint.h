@@ -1,0 +1,44 @@
+// Crash points: named places in multi-step disk changes where a test stops the daemon as a
+// power cut would, to show that the next start finds every acknowledged container exactly
+// once and nothing half-made.
+//
+// A point is armed in a daemon whose configuration says InternalImage, by the environment
+// variable STOWLY_CRASH_AT="name" (the first pass) or "name:N" (the Nth pass); the daemon
+// then SIGKILLs itself there, after flushing its log. Unarmed, a point costs one
+// well-predicted branch on an atomic flag. In-process tests may install a handler that
+// every point calls (it may throw, to test unwinding through the step).
+//
+// Every point is named here, so that tests can walk them all.
+#pragma once
+
+#include <array>
+#include <atomic>
+#include <functional>
+#include <string_view>
+
+namespace STWCrashPoint {
+
+// Creation of a container: built in staging, published in its class directory, known to
+// the cache.
+inline constexpr const char* createAfterStaging = "create.after-staging";
+inline constexpr const char* createAfterRename = "create.after-rename";
+inline constexpr const char* createBeforeCacheAdd = "create.before-cache-add";
+
+inline constexpr std::array<std::string_view, 3> all = {createAfterStaging, createAfterRename, createBeforeCacheAdd};
+
+extern std::atomic<bool> armed;
+void _reached(const char* name);
+
+inline void reach(const char* name) {
+    if (__builtin_expect(armed.load(std::memory_order_relaxed), 0))
+        _reached(name);
+}
+
+// Reads STOWLY_CRASH_AT once at start; ignored (with a log line) unless `internalImage`.
+void armFromEnvironment(bool internalImage);
+// Every point calls `handler` with its name while it is set (nullptr removes it).
+void setHandlerForTesting(std::function<void(std::string_view name)> handler);
+
+} // namespace STWCrashPoint
+
+#define STW_CRASH_POINT(name) STWCrashPoint::reach(name)
