@@ -25,6 +25,8 @@
 #include <string>
 #include <vector>
 
+// The operations live with their subsystems (Daemon/Lifecycle/STWClientConnection+*.cpp:
+// create-or-lookup, death row, setup); this header is their index.
 class STWClientConnection {
 public:
     using StringSet = std::set<std::string, std::less<>>;
@@ -114,6 +116,22 @@ public:
     const std::shared_ptr<STWUserIdentityCache>& userIdentityCache() const { return _userIdentityCache; }
 
 private:
+    // The code of an error for a client: its own in the daemon's domain, else 34.
+    static uint64_t _codeOfError(const STWErrorRef& error);
+    static void _reportException(const char* function);
+    // Runs `body`, turning an exception into code 40 (an internal image stops instead, so
+    // the report is not lost): no exception leaves a client operation.
+    template <class T>
+    static T _catchingExceptions(const char* function, uint64_t* error, T failure, const std::function<T()>& body) {
+        try {
+            return body();
+        } catch (...) {
+            _reportException(function);
+            *error = STWErrorException;
+            return failure;
+        }
+    }
+
     mutable std::mutex _lock; // guards the settable strings and the creation of _sanitizedLookup
     std::shared_ptr<std::map<std::string, StringSet, std::less<>>> _sanitizedLookup;
     std::mutex _sanitizedLookupLock;
