@@ -190,6 +190,11 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
         if (!cache->addContainerMetadata(metadata, final, transient, true, &addError)) {
             STW_ERROR(STWErrorCacheAddFailed, addError, "Failed to add to cache : %@, url: %@, transient: %d",
                       metadata, final, transient ? 1 : 0);
+            // Published but unknown to the cache: it must not stay behind, or every retry
+            // would leave one more.
+            STWErrorRef cleanupError;
+            if (!_moveItemAtURLToDeathRow(final, true, true, &cleanupError))
+                STW_ERROR(STWErrorRemoveStagingFailed, cleanupError, "Failed to remove staging dir: %@", final);
             *code = STWErrorCacheAddFailed;
             return nullptr;
         }

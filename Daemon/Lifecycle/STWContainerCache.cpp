@@ -434,10 +434,6 @@ bool STWContainerCache::_addContainerMetadata(const STWMetadataRef& metadata, co
                                      static_cast<long long>(contentClass)));
         return false;
     }
-    if (metadata->identifier().empty()) {
-        STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Invalid metadata Identifier: %@", nullptr));
-        return false;
-    }
     if (url.empty() || !url.is_absolute()) {
         STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Invalid input: URL: %@",
                                      url.empty() ? nullptr : url.c_str()));
@@ -494,10 +490,6 @@ bool STWContainerCache::_removeContainerForUserIdentity(const STWUserIdentityRef
     if (!STWContainerClassIsValid(contentClass)) {
         STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Invalid Content Class: %ld",
                                      static_cast<long>(contentClass)));
-        return false;
-    }
-    if (identifier.empty()) {
-        STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Invalid Identifier: %@", nullptr));
         return false;
     }
     if (!userIdentity) {

@@ -257,3 +257,21 @@ TEST(STWTestLockCommand, DaemonWideWriteLockParksCreationUntilReleased) {
     EXPECT_EQ(STWDaemonProcess::replyError(*control, 31, {{"TestLock", STWValue(7)}, {"Enable", STWValue(true)}}),
               STWErrorInvalidArgument);
 }
+
+// The empty string is an identifier like any other, before and after a restart, and
+// making it leaves exactly one directory.
+TEST_F(STWContainerCommandsTest, TheEmptyIdentifierIsAnIdentifier) {
+    auto client = daemon->connectAs("com.example.installer", allowed);
+    auto created = STWDaemonProcess::send(*client, 0, createKeys("", 2));
+    ASSERT_EQ(code(created), STWErrorSuccess);
+    std::filesystem::path classDirectory = std::filesystem::path(path(created)).parent_path();
+    size_t before = entries(classDirectory).size();
+    EXPECT_EQ(path(STWDaemonProcess::send(*client, 0, createKeys("", 2))), path(created));
+    ASSERT_TRUE(daemon->stop());
+    ASSERT_TRUE(daemon->start());
+    client = daemon->connectAs("com.example.installer", allowed);
+    auto found = STWDaemonProcess::send(*client, 0, createKeys("", 2, false));
+    EXPECT_EQ(code(found), STWErrorSuccess);
+    EXPECT_EQ(path(found), path(created));
+    EXPECT_EQ(entries(classDirectory).size(), before);
+}
