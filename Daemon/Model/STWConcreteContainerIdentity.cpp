@@ -10,11 +10,8 @@ STWConcreteContainerIdentity::STWConcreteContainerIdentity(STWUUID uuid, STWUser
 STWConcreteContainerIdentityRef STWConcreteContainerIdentity::containerIdentityWithUUID(
     const STWUUID& uuid, const STWUserIdentityRef& userIdentity, const STWValue& identifier,
     STWContainerClass containerClass, uint64_t* error) {
+    // Every UUID is one, the all-zero one included.
     uint64_t code = _validate(userIdentity, identifier, containerClass);
-    if (code == STWErrorSuccess && uuid.isNull()) {
-        STW_LOG_ERROR(STWLogCategory::Unspecified, "Invalid object: uuid = [%@]", uuid);
-        code = STWErrorInvalidClass;
-    }
     if (code != STWErrorSuccess) {
         if (error)
             *error = code;

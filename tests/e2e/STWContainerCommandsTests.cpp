@@ -178,6 +178,10 @@ TEST_F(STWContainerCommandsTest, MetadataAndStructureCommandsActOnTheConcreteCon
     }
     concrete["UUID"] = STWValue(STWUUID::random());
     EXPECT_EQ(STWDaemonProcess::replyError(*client, 7, concrete), STWErrorNotFound);
+    // The all-zero UUID is a UUID like any other.
+    concrete["UUID"] = STWValue(*STWUUID::fromString("00000000-0000-0000-0000-000000000000"));
+    for (uint64_t command : {7u, 8u, 22u})
+        EXPECT_EQ(STWDaemonProcess::replyError(*client, command, concrete), STWErrorNotFound) << command;
     concrete.erase("Identifier");
     EXPECT_EQ(STWDaemonProcess::replyError(*client, 8, concrete), STWErrorNoIdentifier);
 }
