@@ -24,7 +24,13 @@ inline constexpr const char* createAfterStaging = "create.after-staging";
 inline constexpr const char* createAfterRename = "create.after-rename";
 inline constexpr const char* createBeforeCacheAdd = "create.before-cache-add";
 
-inline constexpr std::array<std::string_view, 3> all = {createAfterStaging, createAfterRename, createBeforeCacheAdd};
+inline constexpr std::array<std::string_view, 3> creation = {createAfterStaging, createAfterRename,
+                                                             createBeforeCacheAdd};
+// A move to death row: its fresh "temp." directory made, the item not yet renamed into it.
+inline constexpr const char* deathRowAfterTemporaryDirectory = "deathrow.after-temporary-directory";
+
+inline constexpr std::array<std::string_view, 4> all = {createAfterStaging, createAfterRename, createBeforeCacheAdd,
+                                                        deathRowAfterTemporaryDirectory};
 
 extern std::atomic<bool> armed;
 void _reached(const char* name);

@@ -6,6 +6,7 @@
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Request/STWDaemon.h"
 #include "common/STWLog.h"
+#include "platform/STWCrashPoint.h"
 #include "platform/STWPlatformConfiguration.h"
 
 bool STWClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& url, bool isDir,
@@ -13,22 +14,29 @@ bool STWClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& 
     (void)isDir;
     auto fileManager = STWFileManager::defaultManager();
     auto deathRow = STWGlobalConfiguration::sharedInstance()->deathrowDirectory();
-    STWErrorRef stepError;
-    auto unique = fileManager->createTemporaryDirectoryInDirectoryURL(deathRow, "temp.", &stepError);
-    if (!unique) {
-        STWSetError(error, STW_ERROR(STWErrorItemOperationFailed, stepError, "Failed to create unique directory at: %@",
-                                     deathRow));
-        return false;
-    }
-    std::filesystem::path destination = *unique / url.filename();
-    if (!fileManager->moveItemAtURL(url, destination, &stepError)) {
-        if (stepError && stepError->isPOSIX(ENOENT)) {
-            // Nothing to move; the empty unique directory goes with the next pass.
-            return true;
+    // A deletion pass running meanwhile may remove the fresh, still empty "temp." directory
+    // before the item is renamed into it; the rename's ENOENT then means that, not a missing
+    // item, and the move is tried again in a new one.
+    for (int attempt = 0;; ++attempt) {
+        STWErrorRef stepError;
+        auto unique = fileManager->createTemporaryDirectoryInDirectoryURL(deathRow, "temp.", &stepError);
+        if (!unique) {
+            STWSetError(error, STW_ERROR(STWErrorItemOperationFailed, stepError,
+                                         "Failed to create unique directory at: %@", deathRow));
+            return false;
         }
-        STWSetError(error, STW_ERROR(STWErrorItemOperationFailed, stepError, "Failed to move item at: %@ to: %@", url,
-                                     destination));
-        return false;
+        STW_CRASH_POINT(STWCrashPoint::deathRowAfterTemporaryDirectory);
+        std::filesystem::path destination = *unique / url.filename();
+        if (fileManager->moveItemAtURL(url, destination, &stepError))
+            break;
+        bool missing = stepError && stepError->isPOSIX(ENOENT);
+        if (missing && fileManager->itemDoesNotExistAtURL(url))
+            return true; // nothing to move; the empty directory goes with the next pass
+        if (!missing || attempt == 8) {
+            STWSetError(error, STW_ERROR(STWErrorItemOperationFailed, stepError, "Failed to move item at: %@ to: %@",
+                                         url, destination));
+            return false;
+        }
     }
     if (startDeletionThread)
         deleteContainersOnDeathRowWithCompletion(nullptr);

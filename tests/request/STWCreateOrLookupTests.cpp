@@ -110,3 +110,26 @@ TEST(STWCreateOrLookup, AnExceptionInsideALockedCreateReleasesTheLock) {
     ASSERT_NE(created, nullptr) << error;
     EXPECT_FALSE(created->existed());
 }
+
+// A deletion pass may remove a move's fresh "temp." directory before the item is renamed
+// into it: the move still moves its item (here the pass strikes at exactly that moment).
+TEST(STWCreateOrLookup, AMoveToDeathRowOutlivesAPassThatTookItsDirectory) {
+    STWTestRoot::shared();
+    STWClientConnection connection;
+    auto deathRow = STWGlobalConfiguration::sharedInstance()->deathrowDirectory();
+    std::filesystem::path item = STWTestRoot::shared().path() / "raced";
+    std::filesystem::create_directories(item);
+    bool struck = false;
+    STWCrashPoint::setHandlerForTesting([&](std::string_view name) {
+        if (name == STWCrashPoint::deathRowAfterTemporaryDirectory && !std::exchange(struck, true))
+            for (const auto& entry : visibleEntries(deathRow))
+                std::filesystem::remove(entry);
+    });
+    STWErrorRef error;
+    bool moved = connection._moveItemAtURLToDeathRow(item, true, false, &error);
+    STWCrashPoint::setHandlerForTesting(nullptr);
+    EXPECT_TRUE(moved);
+    EXPECT_TRUE(struck);
+    EXPECT_FALSE(std::filesystem::exists(item));
+    drainDeathRow();
+}
