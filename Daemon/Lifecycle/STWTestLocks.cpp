@@ -29,13 +29,30 @@ bool STWTestLocks::acquireLock(uint64_t lock) {
         STW_LOG_ERROR(STWLogCategory::Test, "Invalid test lock: %llu", lock);
         return false;
     }
-    return _stateQueue->syncResult([&, function = __func__] {
-        if (!_onQueue_updateLock(lock, 1))
+    bool takeDaemonWide = false;
+    bool acquired = _stateQueue->syncResult([&, function = __func__] {
+        if (!_onQueue_updateLock(lock, 1, &takeDaemonWide))
             return false;
         STW_LOG_FN(function, STWLogLevel::Notice, STWLogCategory::Test,
                    "Acquired test lock: %llu; count: %ld", lock, _lockCount[lock]);
         return true;
     });
+    if (acquired && takeDaemonWide) {
+        // Waiting for the daemon-wide lock happens here, off the state queue, so that
+        // every other request to the test locks (a release above all) still gets in.
+        if (lock == daemonWideWriteLock)
+            lock_all_identifiers_for_writing();
+        else
+            lock_all_identifiers_for_reading();
+        _stateQueue->sync([&] {
+            --_daemonWideTakesPending;
+            if (_daemonWideDropsPending > 0) {
+                --_daemonWideDropsPending; // released while we waited
+                unlock_all_identifiers();
+            }
+        });
+    }
+    return acquired;
 }
 
 bool STWTestLocks::releaseLock(uint64_t lock) {
@@ -63,7 +80,7 @@ void STWTestLocks::_onQueue_releaseAllLocks() {
     STW_LOG_NOTICE(STWLogCategory::Test, "Released all test locks.");
 }
 
-bool STWTestLocks::_onQueue_updateLock(uint64_t lock, int64_t delta) {
+bool STWTestLocks::_onQueue_updateLock(uint64_t lock, int64_t delta, bool* takeDaemonWide) {
     _stateQueue->assertCurrent(__func__);
     int64_t from = _lockCount[lock];
     int64_t to = from + delta;
@@ -85,7 +102,13 @@ bool STWTestLocks::_onQueue_updateLock(uint64_t lock, int64_t delta) {
             }
         }
         _lockCount[lock] = to;
-        _onQueue_takeLock(lock);
+        if (lock == daemonWideReadLock || lock == daemonWideWriteLock) {
+            ++_daemonWideTakesPending;
+            if (takeDaemonWide)
+                *takeDaemonWide = true;
+        } else {
+            _onQueue_takeLock(lock);
+        }
     } else if (from != 0 && to == 0) {
         _lockCount[lock] = to;
         _onQueue_dropLock(lock);
@@ -96,25 +119,13 @@ bool STWTestLocks::_onQueue_updateLock(uint64_t lock, int64_t delta) {
 }
 
 void STWTestLocks::_onQueue_takeLock(uint64_t lock) {
-    switch (lock) {
-    case daemonWideReadLock:
-        lock_all_identifiers_for_reading();
-        return;
-    case daemonWideWriteLock:
-        lock_all_identifiers_for_writing();
-        return;
-    default:
-        // The barrier holds back every waitOnLock() submitted after it until the
-        // release signals the semaphore.
-        _lockQueue[lock]->asyncBarrier([this, lock, function = __func__] {
-            STW_LOG_FN(function, STWLogLevel::Notice, STWLogCategory::Test, "Blocking waiters for lock: %llu",
-                       lock);
-            _lockSemaphore[lock]->acquire();
-            STW_LOG_FN(function, STWLogLevel::Notice, STWLogCategory::Test,
-                       "Unblocking waiters for lock: %llu", lock);
-        });
-        return;
-    }
+    // The barrier holds back every waitOnLock() submitted after it until the release
+    // signals the semaphore.
+    _lockQueue[lock]->asyncBarrier([this, lock, function = __func__] {
+        STW_LOG_FN(function, STWLogLevel::Notice, STWLogCategory::Test, "Blocking waiters for lock: %llu", lock);
+        _lockSemaphore[lock]->acquire();
+        STW_LOG_FN(function, STWLogLevel::Notice, STWLogCategory::Test, "Unblocking waiters for lock: %llu", lock);
+    });
 }
 
 void STWTestLocks::_onQueue_dropLock(uint64_t lock) {
@@ -122,8 +133,12 @@ void STWTestLocks::_onQueue_dropLock(uint64_t lock) {
     case daemonWideReadLock:
     case daemonWideWriteLock:
         // The daemon-wide lock is owned by this lock's count, not by a thread: only the
-        // change back to 0 that matches the change that took it releases it.
-        unlock_all_identifiers();
+        // change back to 0 that matches the change that took it releases it. While its
+        // taker still waits for it, the taker releases it once it has it.
+        if (_daemonWideTakesPending == 0)
+            unlock_all_identifiers();
+        else
+            ++_daemonWideDropsPending;
         return;
     default:
         _lockSemaphore[lock]->release();

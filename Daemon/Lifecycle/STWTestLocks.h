@@ -50,7 +50,9 @@ public:
     STWTestLocks& operator=(const STWTestLocks&) = delete;
 
 private:
-    bool _onQueue_updateLock(uint64_t lock, int64_t delta);
+    // `takeDaemonWide` is set when the caller must now take the daemon-wide lock for lock 0
+    // or 1 (off the state queue, since that may wait).
+    bool _onQueue_updateLock(uint64_t lock, int64_t delta, bool* takeDaemonWide = nullptr);
     void _onQueue_releaseAllLocks();
     void _onQueue_takeLock(uint64_t lock);
     void _onQueue_dropLock(uint64_t lock);
@@ -60,5 +62,9 @@ private:
     std::array<std::shared_ptr<STWConcurrentQueue>, lockCount> _lockQueue;
     std::array<std::unique_ptr<std::counting_semaphore<>>, lockCount> _lockSemaphore;
     std::atomic<bool> _enabled{false};
+    // On the state queue: takes of the daemon-wide lock decided but not yet done, and
+    // releases that came meanwhile (their takers release as soon as they have the lock).
+    int64_t _daemonWideTakesPending = 0;
+    int64_t _daemonWideDropsPending = 0;
     std::shared_ptr<STWQueue> _stateQueue;
 };

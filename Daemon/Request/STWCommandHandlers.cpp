@@ -144,7 +144,6 @@ STW_COMMAND_HANDLER(setTestLock) {
     uint64_t lock = STWDictionaryUInt64(request, "TestLock").value_or(0);
     bool enable = STWDictionaryBool(request, "Enable");
     auto testLocks = STWTestLocks::sharedInstance();
-    std::lock_guard guard(heldLock);
     if (lock == STWTestLocks::lockCount && !enable) {
         testLocks->setEnabled(false);
         return;
@@ -155,16 +154,23 @@ STW_COMMAND_HANDLER(setTestLock) {
     }
     uint32_t bit = 1u << lock;
     if (enable) {
-        if (held & bit)
-            return;
-        testLocks->setEnabled(true);
-        if (!testLocks->acquireLock(lock)) {
-            *error = STWErrorInvalidArgument;
-            return;
+        {
+            std::lock_guard guard(heldLock);
+            if (held & bit)
+                return;
+            held |= bit; // claimed before the acquire, which may wait
         }
-        held |= bit;
+        testLocks->setEnabled(true);
+        // Not under heldLock: acquiring lock 1 waits for the daemon-wide lock, and the
+        // release that lets a parked request finish must still get in.
+        if (!testLocks->acquireLock(lock)) {
+            std::lock_guard guard(heldLock);
+            held &= ~bit;
+            *error = STWErrorInvalidArgument;
+        }
         return;
     }
+    std::lock_guard guard(heldLock);
     if (!(held & bit))
         return;
     // The two daemon-wide locks are one bit pair: releasing either clears both.

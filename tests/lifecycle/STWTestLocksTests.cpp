@@ -220,3 +220,20 @@ TEST_F(STWTestLocksTest, ReleaseAllLocksReleasesEveryHeldLockAtOnce) {
 }
 
 } // namespace
+
+// While test lock 1 waits for the daemon-wide lock, every other request to the test locks
+// gets in, its own release included; the lock it then gets is let go at once.
+TEST_F(STWTestLocksTest, WaitingForTheDaemonWideLockBlocksNoOtherRequest) {
+    lock_all_identifiers_for_reading(); // a request that holds the daemon-wide lock
+    Attempt taker([&] { EXPECT_TRUE(locks->acquireLock(STWTestLocks::daemonWideWriteLock)); });
+    EXPECT_FALSE(taker.done());
+    Attempt others([&] {
+        EXPECT_TRUE(locks->acquireLock(3));
+        EXPECT_TRUE(locks->releaseLock(3));
+        EXPECT_TRUE(locks->releaseLock(STWTestLocks::daemonWideWriteLock));
+    });
+    EXPECT_TRUE(others.done(2000ms));
+    unlock_all_identifiers();
+    EXPECT_TRUE(taker.done(2000ms));
+    EXPECT_EQ(locks->countForLock(STWTestLocks::daemonWideWriteLock), 0);
+}
