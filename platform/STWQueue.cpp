@@ -1,5 +1,7 @@
 #include "platform/STWQueue.h"
 
+#include <system_error>
+
 #include "common/STWLog.h"
 #include "platform/STWTransaction.h"
 
@@ -21,25 +23,38 @@ struct CurrentQueue {
 
 // Threads that drain queues. A thread is added whenever work waits and no thread is idle,
 // so work that blocks (file I/O, locks, synchronous submission to another queue) never
-// starves the queues behind it; threads idle for a while go away.
+// starves the queues behind it; threads idle for a while go away. The pool has a bound:
+// past it, work waits for a thread to come free. A thread that cannot be created is
+// logged, and the work waits for the threads there are (or for the next submission).
 class WorkerPool {
 public:
+    static constexpr size_t maximumThreads = 64;
+
     explicit WorkerPool(STWQueue::Priority priority) : _priority(priority) {}
 
     void submit(std::function<void()> task) {
         std::lock_guard guard(_mutex);
         _tasks.push_back(std::move(task));
-        if (_tasks.size() > _idle) {
-            std::thread([this] { _work(); }).detach();
-        } else {
+        if (_tasks.size() <= _idle) {
             _available.notify_one();
+            return;
+        }
+        if (_threads >= maximumThreads)
+            return;
+        try {
+            std::thread([this] { _work(); }).detach();
+            ++_threads;
+        } catch (const std::system_error& e) {
+            STW_LOG_ERROR(STWLogCategory::Unspecified, "Cannot start a queue thread (%zu running): %s", _threads,
+                          e.what());
         }
     }
 
 private:
     void _work() {
-        if (_priority == STWQueue::Priority::Background)
-            setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()), 19);
+        if (_priority != STWQueue::Priority::Default)
+            setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()),
+                        _priority == STWQueue::Priority::Background ? 19 : -5);
         std::unique_lock lock(_mutex);
         while (true) {
             if (_tasks.empty()) {
@@ -47,8 +62,10 @@ private:
                 bool woken =
                     _available.wait_for(lock, std::chrono::seconds(10), [&] { return !_tasks.empty(); });
                 --_idle;
-                if (!woken)
+                if (!woken) {
+                    --_threads;
                     return;
+                }
             }
             std::function<void()> task = std::move(_tasks.front());
             _tasks.pop_front();
@@ -64,13 +81,22 @@ private:
     std::condition_variable _available;
     std::deque<std::function<void()>> _tasks;
     size_t _idle = 0;
+    size_t _threads = 0;
 };
 
 WorkerPool& pool(STWQueue::Priority priority) {
     // Leaked on purpose: detached workers may still run while static objects are destroyed.
     static WorkerPool* defaultPool = new WorkerPool(STWQueue::Priority::Default);
     static WorkerPool* backgroundPool = new WorkerPool(STWQueue::Priority::Background);
-    return priority == STWQueue::Priority::Background ? *backgroundPool : *defaultPool;
+    static WorkerPool* userInitiatedPool = new WorkerPool(STWQueue::Priority::UserInitiated);
+    switch (priority) {
+    case STWQueue::Priority::Background:
+        return *backgroundPool;
+    case STWQueue::Priority::UserInitiated:
+        return *userInitiatedPool;
+    default:
+        return *defaultPool;
+    }
 }
 
 // Items run per turn on a pool thread before the queue yields it to others.

@@ -1,7 +1,7 @@
 // Serial queues: the daemon's unit of ordering.
 //
 // Work submitted to one queue runs one item at a time, in submission order, on threads of
-// a shared pool that grows when its threads block. A suspended queue runs nothing until
+// a shared pool (one per priority) that grows when its threads block, up to a bound. A suspended queue runs nothing until
 // resumed. Synchronous submission runs the work on the caller's thread when the queue is
 // idle, and otherwise waits for its turn; submitting synchronously to the queue the caller
 // is already running on would deadlock and is stopped as a programming error.
@@ -20,7 +20,9 @@
 
 class STWQueue : public std::enable_shared_from_this<STWQueue> {
 public:
-    enum class Priority { Default, Background };
+    // Background work runs at the lowest scheduling priority; user-initiated work (a
+    // process waiting to launch) above the default.
+    enum class Priority { Default, Background, UserInitiated };
     struct Attributes {
         Priority priority = Priority::Default;
         // Each submitted item holds an IPC transaction from submission until it has run,
