@@ -50,13 +50,7 @@ TEST_F(Items, ListingHidesDotNamesAndFailsForAMissingDirectory) {
 
     STWErrorRef error;
     EXPECT_FALSE(fm()->itemsInDirectoryAtURL(scratch() / "missing", &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ENOENT));
-    error.reset();
-    EXPECT_FALSE(fm()->urlsForItemsInDirectoryAtURL(scratch() / "missing", &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ENOENT));
-    EXPECT_TRUE(error->message().starts_with("_IterateDirectory for ")) << error->message();
+    EXPECT_TRUE(error && error->isPOSIX(ENOENT));
 }
 
 TEST_F(Items, ExistenceOfDanglingLinksAndOfItemsThatCannotBeExamined) {
@@ -106,9 +100,7 @@ TEST_F(Items, ClassPredicateDecidesAndLinksAreNeverFollowed) {
     fs::create_symlink(file, scratch() / "link");
     STWErrorRef error;
     EXPECT_FALSE(fm()->setDataProtectionClassOfItemAtURL(scratch() / "link", 1, nullptr, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ELOOP));
-    EXPECT_TRUE(error->message().starts_with("Failed to open ")) << error->message();
+    EXPECT_TRUE(error && error->isPOSIX(ELOOP));
     ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(file, &value));
     EXPECT_EQ(value, 4);
 }
@@ -129,12 +121,10 @@ TEST_F(Items, ClassOneIsOutOfReachWhileLocked) {
     ASSERT_TRUE(fm()->setDataProtectionClassOfItemAtURL(complete, 1, nullptr));
     ASSERT_TRUE(fm()->setDataProtectionClassOfItemAtURL(other, 3, nullptr));
 
+    // What each refusal reports is in the reporting tests.
     STWKeybag::setLockStateOverrideForTesting(true);
     int32_t value = 0;
-    STWErrorRef error;
-    EXPECT_FALSE(fm()->dataProtectionClassOfItemAtURL(complete, &value, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(EPERM));
+    EXPECT_FALSE(fm()->dataProtectionClassOfItemAtURL(complete, &value));
     EXPECT_FALSE(fm()->setDataProtectionClassOfItemAtURL(complete, 3, nullptr));
     EXPECT_FALSE(fm()->setDataProtectionClassOfItemAtURL(other, 1, nullptr));
     EXPECT_TRUE(fm()->setDataProtectionClassOfItemAtURL(other, 4, nullptr));
@@ -157,11 +147,6 @@ TEST_F(Items, CreatingAnExistingDirectoryStillSetsOwnerAndClass) {
     EXPECT_EQ(fs::status(scratch() / "r/s/t").permissions() & fs::perms::all, fs::perms(0500));
 
     STWErrorRef error;
-    EXPECT_FALSE(fm()->createDirectoryAtURL(scratch() / "x/y", false, 0755, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ENOENT));
-    EXPECT_TRUE(error->message().starts_with("mkdir of ")) << error->message();
-
     ASSERT_TRUE(fm()->createDirectoryAtURL(dir, true, 0700, 501, 4, &error)) << error->description();
     struct stat st;
     ASSERT_EQ(stat(dir.c_str(), &st), 0);
@@ -179,8 +164,7 @@ TEST_F(Items, CreatingAnExistingDirectoryStillSetsOwnerAndClass) {
     for (bool intermediates : {false, true}) {
         error.reset();
         EXPECT_FALSE(fm()->createDirectoryAtURL(scratch() / "file", intermediates, 0755, &error));
-        ASSERT_TRUE(error);
-        EXPECT_TRUE(error->isPOSIX(ENOTDIR));
+        EXPECT_TRUE(error && error->isPOSIX(ENOTDIR)) << intermediates;
     }
 }
 
@@ -192,8 +176,7 @@ TEST_F(Items, OwnerAndClassAreNeverGivenToALinkTarget) {
     ASSERT_EQ(stat(target.c_str(), &before), 0);
     STWErrorRef error;
     EXPECT_FALSE(fm()->createDirectoryAtURL(scratch() / "planted", true, 0755, 501, 3, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ELOOP) || error->isPOSIX(ENOTDIR)) << error->description();
+    EXPECT_TRUE(error && (error->isPOSIX(ELOOP) || error->isPOSIX(ENOTDIR)));
     struct stat after;
     ASSERT_EQ(stat(target.c_str(), &after), 0);
     EXPECT_EQ(after.st_uid, before.st_uid);
@@ -206,17 +189,11 @@ TEST_F(Items, TemporaryDirectoriesAreUniqueAndPrefixed) {
     auto first = fm()->createTemporaryDirectoryInDirectoryURL(scratch());
     auto second = fm()->createTemporaryDirectoryInDirectoryURL(scratch(), "com.example.Assets.");
     ASSERT_TRUE(first && second);
+    EXPECT_NE(*first, *second);
     EXPECT_TRUE(fs::is_directory(*first));
     EXPECT_TRUE(first->filename().native().starts_with("temp."));
-    EXPECT_EQ(first->filename().native().size(), 11u);
     EXPECT_TRUE(second->filename().native().starts_with("com.example.Assets."));
-    EXPECT_EQ(first->parent_path(), scratch());
-
-    STWErrorRef error = STW_POSIX_ERROR_NOLOG(1, "stale");
-    EXPECT_FALSE(fm()->createTemporaryDirectoryInDirectoryURL(scratch() / "missing", &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ENOENT));
-    EXPECT_TRUE(error->message().starts_with("Failed to create temp dir at path ")) << error->message();
+    EXPECT_EQ(second->parent_path(), scratch());
 }
 
 TEST_F(Items, TraversalStopsOnVisitorAndEntryErrors) {
@@ -246,12 +223,6 @@ TEST_F(Items, TraversalStopsOnVisitorAndEntryErrors) {
     EXPECT_EQ(visits, 1);
     ASSERT_TRUE(error);
     EXPECT_EQ(error->message(), "visitor gave up");
-
-    error.reset();
-    EXPECT_FALSE(fm()->_traverseDirectory(scratch() / "missing", &error, [](FTSENT*, STWErrorRef*) { return true; }));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ENOENT));
-    EXPECT_TRUE(error->message().starts_with("Error for path ")) << error->message();
 }
 
 // What `du -s -x --block-size=1` says, or nullopt where it cannot be run.
