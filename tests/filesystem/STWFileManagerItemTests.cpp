@@ -23,6 +23,11 @@ protected:
         STWKeybag::setLockStateOverrideForTesting(std::nullopt);
         FileSystemTest::TearDown();
     }
+    // The item's protection class, or nullopt when it cannot be read.
+    std::optional<int32_t> classOf(const fs::path& path) {
+        int32_t value = -1;
+        return fm()->dataProtectionClassOfItemAtURL(path, &value) ? std::optional(value) : std::nullopt;
+    }
 };
 
 TEST_F(Items, ListingHidesDotNamesAndFailsForAMissingDirectory) {
@@ -77,9 +82,7 @@ TEST_F(Items, ExistenceOfDanglingLinksAndOfItemsThatCannotBeExamined) {
 TEST_F(Items, ClassPredicateDecidesAndLinksAreNeverFollowed) {
     fs::path file = scratch() / "file";
     writeFile(file, "x");
-    int32_t value = -5;
-    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(file, &value));
-    EXPECT_EQ(value, 0) << "no class yet";
+    EXPECT_EQ(classOf(file), 0) << "no class yet";
 
     ASSERT_TRUE(fm()->setDataProtectionClassOfItemAtURL(file, 3, nullptr));
     std::vector<int32_t> seen;
@@ -87,22 +90,19 @@ TEST_F(Items, ClassPredicateDecidesAndLinksAreNeverFollowed) {
         seen.push_back(current);
         return false;
     }));
-    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(file, &value));
-    EXPECT_EQ(value, 3) << "a predicate answering NO changes nothing";
+    EXPECT_EQ(classOf(file), 3) << "a predicate answering NO changes nothing";
     EXPECT_TRUE(fm()->setDataProtectionClassOfItemAtURL(file, 4, [&](int32_t current) {
         seen.push_back(current);
         return current != 4;
     }));
-    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(file, &value));
-    EXPECT_EQ(value, 4);
+    EXPECT_EQ(classOf(file), 4);
     EXPECT_EQ(seen, (std::vector<int32_t>{3, 3}));
 
     fs::create_symlink(file, scratch() / "link");
     STWErrorRef error;
     EXPECT_FALSE(fm()->setDataProtectionClassOfItemAtURL(scratch() / "link", 1, nullptr, &error));
     EXPECT_TRUE(error && error->isPOSIX(ELOOP));
-    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(file, &value));
-    EXPECT_EQ(value, 4);
+    EXPECT_EQ(classOf(file), 4);
 }
 
 TEST_F(Items, ClassOneIsOutOfReachWhileLocked) {
@@ -123,16 +123,14 @@ TEST_F(Items, ClassOneIsOutOfReachWhileLocked) {
 
     // What each refusal reports is in the reporting tests.
     STWKeybag::setLockStateOverrideForTesting(true);
-    int32_t value = 0;
-    EXPECT_FALSE(fm()->dataProtectionClassOfItemAtURL(complete, &value));
+    EXPECT_EQ(classOf(complete), std::nullopt);
     EXPECT_FALSE(fm()->setDataProtectionClassOfItemAtURL(complete, 3, nullptr));
     EXPECT_FALSE(fm()->setDataProtectionClassOfItemAtURL(other, 1, nullptr));
     EXPECT_TRUE(fm()->setDataProtectionClassOfItemAtURL(other, 4, nullptr));
     EXPECT_FALSE(fm()->createDirectoryAtURL(scratch() / "new", false, 0755, 0, 1));
 
     STWKeybag::setLockStateOverrideForTesting(false);
-    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(complete, &value));
-    EXPECT_EQ(value, 1);
+    EXPECT_EQ(classOf(complete), 1);
 }
 
 TEST_F(Items, CreatingAnExistingDirectoryStillSetsOwnerAndClass) {
@@ -142,9 +140,8 @@ TEST_F(Items, CreatingAnExistingDirectoryStillSetsOwnerAndClass) {
     // Intermediate directories can always be written and searched by their owner, or
     // nothing could be made below them.
     ASSERT_TRUE(fm()->createDirectoryAtURL(scratch() / "r/s/t", true, 0500));
-    EXPECT_EQ(fs::status(scratch() / "r").permissions() & fs::perms::all, fs::perms(0700));
-    EXPECT_EQ(fs::status(scratch() / "r/s").permissions() & fs::perms::all, fs::perms(0700));
-    EXPECT_EQ(fs::status(scratch() / "r/s/t").permissions() & fs::perms::all, fs::perms(0500));
+    for (auto [path, mode] : {std::pair{"r", 0700}, {"r/s", 0700}, {"r/s/t", 0500}})
+        EXPECT_EQ(fs::status(scratch() / path).permissions() & fs::perms::all, fs::perms(mode)) << path;
 
     STWErrorRef error;
     ASSERT_TRUE(fm()->createDirectoryAtURL(dir, true, 0700, 501, 4, &error)) << error->description();
@@ -155,9 +152,7 @@ TEST_F(Items, CreatingAnExistingDirectoryStillSetsOwnerAndClass) {
         EXPECT_EQ(st.st_uid, 501u);
         EXPECT_EQ(st.st_gid, 501u) << "one id serves as user and group";
     }
-    int32_t value = 0;
-    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(dir, &value));
-    EXPECT_EQ(value, 4);
+    EXPECT_EQ(classOf(dir), 4);
 
     // A file in the way is not a directory, with or without intermediate directories.
     writeFile(scratch() / "file", "");
@@ -180,9 +175,7 @@ TEST_F(Items, OwnerAndClassAreNeverGivenToALinkTarget) {
     struct stat after;
     ASSERT_EQ(stat(target.c_str(), &after), 0);
     EXPECT_EQ(after.st_uid, before.st_uid);
-    int32_t value = -1;
-    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(target, &value));
-    EXPECT_EQ(value, 0);
+    EXPECT_EQ(classOf(target), 0);
 }
 
 TEST_F(Items, TemporaryDirectoriesAreUniqueAndPrefixed) {
