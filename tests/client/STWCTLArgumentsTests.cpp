@@ -1,12 +1,10 @@
 #include "client/stowlyctl/STWCTLArguments.h"
 #include "client/stowlyctl/STWCTLOutput.h"
-#include "common/STWPropertyList.h"
+#include "common/STWValue.h"
 
 #include <gtest/gtest.h>
 
 #include <cmath>
-#include <fstream>
-#include <unistd.h>
 
 inline void PrintTo(const STWValue& value, std::ostream* os) {
     *os << value.description();
@@ -58,19 +56,6 @@ TEST(STWCTLArguments, TypedValues) {
         EXPECT_FALSE(parse(bad)) << bad;
 }
 
-TEST(STWCTLArguments, PlistValueTakesTheFileRoot) {
-    char path[] = "/tmp/stowly-ctl-plist-XXXXXX";
-    int fd = mkstemp(path);
-    ASSERT_GE(fd, 0);
-    close(fd);
-    STWValue root(STWValue::Array{STWValue("a"), STWValue(STWValue::Dictionary{{"n", STWValue(1)}})});
-    std::ofstream(path, std::ios::binary) << STWPropertyList::serializeXML(root);
-    EXPECT_EQ(parse(("K=plist:" + std::string(path)).c_str()), root);
-    std::ofstream(path, std::ios::binary) << "not a property list";
-    EXPECT_FALSE(parse(("K=plist:" + std::string(path)).c_str()));
-    unlink(path);
-}
-
 TEST(STWCTLArguments, Message) {
     std::string reason;
     auto message = STWCTLMessageWithArguments(12, {"A=u64:1", "B=str:x"}, &reason);
@@ -100,10 +85,9 @@ TEST(STWCTLOutput, JSONOfEveryType) {
               "\"List\":[null,true,{}],\"Negative\":-3,\"NotANumber\":null,\"Real\":0.1,\"ReplyError\":1,"
               "\"Text\":\"quote\\\" back\\\\ tab\\t ctl\\u0001 \xc3\xa9\","
               "\"UUID\":\"01234567-89AB-CDEF-0123-456789ABCDEF\"}");
-    EXPECT_EQ(STWCTLBase64({}), "");
-    EXPECT_EQ(STWCTLBase64({'f'}), "Zg==");
-    EXPECT_EQ(STWCTLBase64({'f', 'o'}), "Zm8=");
-    EXPECT_EQ(STWCTLBase64({'f', 'o', 'o'}), "Zm9v");
+    for (auto [data, text] : std::vector<std::pair<STWData, const char*>>{
+             {{}, ""}, {{'f'}, "Zg=="}, {{'f', 'o'}, "Zm8="}, {{'f', 'o', 'o'}, "Zm9v"}})
+        EXPECT_EQ(STWCTLBase64(data), text);
 }
 
 TEST(STWCTLOutput, TextPutsReplyErrorFirst) {

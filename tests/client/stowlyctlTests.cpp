@@ -88,29 +88,17 @@ TEST_F(stowlyctlTest, RawSendsTypedKeysAndPrintsTheReply) {
     STW_writeToURL({{"Nested", STWValue(true)}}, plist, STWWriteDefault, nullptr);
     answerOnce(daemon, {{"ReplyError", STWValue(1)}, {"Path", STWValue("/c/A")}, {"Count", STWValue(3)}},
                &received);
-    Outcome r = run({"raw", "18446744073709551615", "Name=str:a=b:c", "Size=u64:7", "Delta=i64:-5",
-                 "On=bool:true", "Ratio=real:0.5", "ID=uuid:00000000-0000-0000-0000-000000000001",
-                 "Blob=data:0aff", "Names=strarr:x,y", "Counts=u64arr:1,2", "Info=plist:" + plist.string()});
+    // Each type's parsing is in the argument tests; here what reaches the wire.
+    Outcome r = run({"raw", "18446744073709551615", "Name=str:a=b:c", "Counts=u64arr:1,2", "Info=plist:" + plist.string()});
     daemon.join();
     EXPECT_EQ(r.status, 0) << r.err;
     EXPECT_EQ(r.out, "ReplyError: 1 (Success)\nCount: 3\nPath: \"/c/A\"\n");
     ASSERT_EQ(received.size(), 1u);
     EXPECT_EQ(received[0].kind, STWFrameKindRequest);
-    STWUUID id{};
-    id.bytes[15] = 1;
-    EXPECT_EQ(received[0].body, (Dictionary{
-                                    {"Command", STWValue(UINT64_MAX)},
-                                    {"Name", STWValue("a=b:c")},
-                                    {"Size", STWValue(7)},
-                                    {"Delta", STWValue(-5)},
-                                    {"On", STWValue(true)},
-                                    {"Ratio", STWValue(0.5)},
-                                    {"ID", STWValue(id)},
-                                    {"Blob", STWValue(STWData{0x0a, 0xff})},
-                                    {"Names", STWValue(STWValue::Array{STWValue("x"), STWValue("y")})},
-                                    {"Counts", STWValue(STWValue::Array{STWValue(1), STWValue(2)})},
-                                    {"Info", STWValue(Dictionary{{"Nested", STWValue(true)}})},
-                                }));
+    EXPECT_EQ(received[0].body, (Dictionary{{"Command", STWValue(UINT64_MAX)},
+                                            {"Name", STWValue("a=b:c")},
+                                            {"Counts", STWValue(STWValue::Array{STWValue(1), STWValue(2)})},
+                                            {"Info", STWValue(Dictionary{{"Nested", STWValue(true)}})}}));
 }
 
 TEST_F(stowlyctlTest, ReplyErrorOtherThanSuccessExitsOne) {
@@ -185,7 +173,6 @@ TEST_F(stowlyctlTest, BadArgumentsAreRefusedBeforeConnecting) {
              {"raw", "18446744073709551616"},
              {"raw", "1", "K=u64:-1"},
              {"raw", "1", "K=u64:1", "K=str:x"},
-             {"raw", "1", "K"},
              {"--as", "x", "--entitlements", "/nonexistent.plist", "raw", "1"},
              {"--timeout", "0", "raw", "1"},
              {"--sandboxed", "raw", "1"},

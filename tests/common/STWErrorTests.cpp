@@ -32,15 +32,4 @@ TEST(STWError, CarriesCodeMessageSiteAndUnderlyingError) {
                                         std::to_string(posixLine) + ", Reason=No such file or directory}}");
 }
 
-TEST(STWError, EveryCodeOfTheTableHasAName) {
-    const uint64_t codes[] = {1,  4,  5,  6,  7,  8,  9,  10, 11, 12, 14, 15, 17, 18, 20, 21, 22,
-                              23, 24, 27, 28, 29, 33, 34, 35, 36, 38, 40, 41, 43, 44, 45, 46, 47,
-                              48, 49, 55, 60, 61, 62, 63, 64, 66, 67, 68, 69, 71, 73, 75, 76, 77};
-    for (uint64_t code : codes)
-        EXPECT_NE(STWErrorCodeName(code), nullptr) << code;
-    EXPECT_STREQ(STWErrorCodeName(55), "NotEntitled");
-    EXPECT_STREQ(STWErrorCodeName(49), "UnsupportedCommand");
-    EXPECT_EQ(STWErrorCodeName(2), nullptr);
-}
-
 } // namespace

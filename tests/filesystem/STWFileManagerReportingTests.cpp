@@ -5,9 +5,11 @@
 #include "common/STWLog.h"
 #include "tests/filesystem/STWFileSystemTestSupport.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 #include <fcntl.h>
+#include <functional>
 #include <set>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -23,100 +25,77 @@ protected:
         STWKeybag::setLockStateOverrideForTesting(std::nullopt);
         FileSystemTest::TearDown();
     }
-
-    // Checks one failure: its domain and code, the exact message, the operation it names
-    // and a failure site; remembers the site so that sites can be compared.
-    void expectError(const STWErrorRef& error, int code, const std::string& message, const char* function) {
-        ASSERT_TRUE(error) << message;
-        EXPECT_TRUE(error->isPOSIX(code)) << error->description();
-        EXPECT_EQ(error->message(), message);
-        EXPECT_EQ(error->functionName(), function);
-        EXPECT_GT(error->sourceFileLine(), 0u);
-        sites.insert({error->functionName(), error->sourceFileLine()});
-    }
-
-    std::set<std::pair<std::string, uint64_t>> sites;
 };
 
 TEST_F(Reporting, FailuresCarryTheirErrnoExactMessageOperationAndSite) {
-    std::string dir = scratch().native();
-    std::string missing = dir + "/missing";
-    std::string noent = strerror(ENOENT);
-    writeFile(scratch() / "file", "f");
-    STWErrorRef error;
-
-    EXPECT_FALSE(fm()->createDirectoryAtURL(missing + "/child", false, 0755, &error));
-    expectError(error, ENOENT, "mkdir of " + missing + "/child failed: " + noent, "createDirectoryAtURL");
-    error.reset();
-    EXPECT_FALSE(fm()->createDirectoryAtURL(dir + "/file/child", true, 0755, &error));
-    expectError(error, ENOTDIR, "mkpath_np of " + dir + "/file/child failed: " + strerror(ENOTDIR),
-                "createDirectoryAtURL");
-
-    error.reset();
-    EXPECT_FALSE(fm()->copyItemAtURL(missing, dir + "/copy", &error));
-    expectError(error, ENOENT, "copyfile of " + missing + " to " + dir + "/copy failed: " + noent, "_copyItemAtURL");
-    error.reset();
-    EXPECT_FALSE(fm()->moveItemAtURL(missing, dir + "/moved", &error));
-    expectError(error, ENOENT, "rename of " + missing + " to " + dir + "/moved failed: " + noent, "_moveItemAtURL");
-
-    error.reset();
-    EXPECT_FALSE(fm()->createTemporaryDirectoryInDirectoryURL(missing, "p.", &error));
-    expectError(error, ENOENT, "Failed to create temp dir at path " + missing + "/p.XXXXXX : " + noent,
-                "createTemporaryDirectoryInDirectoryURL");
-
-    error.reset();
-    EXPECT_FALSE(fm()->urlsForItemsInDirectoryAtURL(missing, &error));
-    expectError(error, ENOENT, "_IterateDirectory for " + missing + " returned " + noent,
-                "urlsForItemsInDirectoryAtURL");
-    error.reset();
-    EXPECT_FALSE(fm()->_traverseDirectory(missing, &error, [](FTSENT*, STWErrorRef*) { return true; }));
-    expectError(error, ENOENT, "Error for path " + missing + ": " + noent, "_traverseDirectory");
-
+    std::string dir = scratch().native(), missing = dir + "/missing", file = dir + "/file";
+    std::string noent = strerror(ENOENT), eperm = strerror(EPERM);
+    writeFile(file, "f");
+    ASSERT_TRUE(fm()->setDataProtectionClassOfItemAtURL(file, 1, nullptr));
     int32_t value = 0;
-    error.reset();
-    EXPECT_FALSE(fm()->dataProtectionClassOfItemAtURL(missing, &value, &error));
-    expectError(error, ENOENT, "Failed to open " + missing + " : " + noent, "dataProtectionClassOfItemAtURL");
-    ASSERT_TRUE(fm()->setDataProtectionClassOfItemAtURL(dir + "/file", 1, nullptr));
-    STWKeybag::setLockStateOverrideForTesting(true);
-    std::string eperm = strerror(EPERM);
-    error.reset();
-    EXPECT_FALSE(fm()->dataProtectionClassOfItemAtURL(dir + "/file", &value, &error));
-    expectError(error, EPERM, "Failed to getclass of file " + dir + "/file: " + eperm,
-                "dataProtectionClassOfItemAtURL");
-    error.reset();
-    EXPECT_FALSE(fm()->setDataProtectionClassOfItemAtURL(dir + "/file", 3, nullptr, &error));
-    expectError(error, EPERM, "Failed to setclass(3) on file " + dir + "/file: " + eperm,
-                "setDataProtectionClassOfItemAtURL");
-    error.reset();
-    EXPECT_FALSE(fm()->setDataProtectionClassOfItemAtURL(dir + "/file", 3, [](int32_t) { return true; }, &error));
-    expectError(error, EPERM, "Failed to getclass of file " + dir + "/file: " + eperm,
-                "setDataProtectionClassOfItemAtURL");
-    error.reset();
-    EXPECT_FALSE(fm()->createDirectoryAtURL(dir + "/protected", false, 0755, 0, 1, &error));
-    expectError(error, EPERM, "Failed to setclass(1) on directory " + dir + "/protected: " + eperm,
-                "createDirectoryAtURL");
+    using Operation = std::function<bool(STWErrorRef*)>;
+    struct Case {
+        Operation operation;
+        int code;
+        std::string message;
+        const char* function;
+        bool locked = false;
+    } cases[] = {
+        {[&](STWErrorRef* e) { return fm()->createDirectoryAtURL(missing + "/child", false, 0755, e); }, ENOENT,
+         "mkdir of " + missing + "/child failed: " + noent, "createDirectoryAtURL"},
+        {[&](STWErrorRef* e) { return fm()->createDirectoryAtURL(file + "/child", true, 0755, e); }, ENOTDIR,
+         "mkpath_np of " + file + "/child failed: " + strerror(ENOTDIR), "createDirectoryAtURL"},
+        {[&](STWErrorRef* e) { return fm()->copyItemAtURL(missing, dir + "/copy", e); }, ENOENT,
+         "copyfile of " + missing + " to " + dir + "/copy failed: " + noent, "_copyItemAtURL"},
+        {[&](STWErrorRef* e) { return fm()->moveItemAtURL(missing, dir + "/moved", e); }, ENOENT,
+         "rename of " + missing + " to " + dir + "/moved failed: " + noent, "_moveItemAtURL"},
+        {[&](STWErrorRef* e) { return bool(fm()->createTemporaryDirectoryInDirectoryURL(missing, "p.", e)); },
+         ENOENT, "Failed to create temp dir at path " + missing + "/p.XXXXXX : " + noent,
+         "createTemporaryDirectoryInDirectoryURL"},
+        {[&](STWErrorRef* e) { return bool(fm()->urlsForItemsInDirectoryAtURL(missing, e)); }, ENOENT,
+         "_IterateDirectory for " + missing + " returned " + noent, "urlsForItemsInDirectoryAtURL"},
+        {[&](STWErrorRef* e) { return fm()->_traverseDirectory(missing, e, [](FTSENT*, STWErrorRef*) { return true; }); },
+         ENOENT, "Error for path " + missing + ": " + noent, "_traverseDirectory"},
+        {[&](STWErrorRef* e) { return fm()->dataProtectionClassOfItemAtURL(missing, &value, e); }, ENOENT,
+         "Failed to open " + missing + " : " + noent, "dataProtectionClassOfItemAtURL"},
+        {[&](STWErrorRef* e) { return fm()->dataProtectionClassOfItemAtURL(file, &value, e); }, EPERM,
+         "Failed to getclass of file " + file + ": " + eperm, "dataProtectionClassOfItemAtURL", true},
+        {[&](STWErrorRef* e) { return fm()->setDataProtectionClassOfItemAtURL(file, 3, nullptr, e); }, EPERM,
+         "Failed to setclass(3) on file " + file + ": " + eperm, "setDataProtectionClassOfItemAtURL", true},
+        {[&](STWErrorRef* e) { return fm()->setDataProtectionClassOfItemAtURL(file, 3, [](int32_t) { return true; }, e); },
+         EPERM, "Failed to getclass of file " + file + ": " + eperm, "setDataProtectionClassOfItemAtURL", true},
+        {[&](STWErrorRef* e) { return fm()->createDirectoryAtURL(dir + "/protected", false, 0755, 0, 1, e); }, EPERM,
+         "Failed to setclass(1) on directory " + dir + "/protected: " + eperm, "createDirectoryAtURL", true},
+    };
+    std::set<std::pair<std::string, uint64_t>> sites;
+    for (const Case& c : cases) {
+        STWKeybag::setLockStateOverrideForTesting(c.locked);
+        STWErrorRef error;
+        EXPECT_FALSE(c.operation(&error)) << c.message;
+        ASSERT_TRUE(error) << c.message;
+        EXPECT_TRUE(error->isPOSIX(c.code)) << error->description();
+        EXPECT_EQ(error->message(), c.message);
+        EXPECT_EQ(error->functionName(), c.function);
+        EXPECT_GT(error->sourceFileLine(), 0u);
+        sites.insert({error->functionName(), error->sourceFileLine()});
+    }
+    // Failures of one operation at different steps are different sites.
+    EXPECT_EQ(std::count_if(sites.begin(), sites.end(), [](auto& site) { return site.first == "createDirectoryAtURL"; }),
+              3)
+        << "mkdir, mkpath_np and setclass fail at three sites";
 
     // The walk that stands in for openat2 names itself, not a helper, and tells its
     // refusals apart from its failed opens.
     STWFileDescriptor directory(open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     ASSERT_TRUE(directory);
-    error.reset();
-    EXPECT_FALSE(fm()->_openBeneathByComponents(directory.get(), "../x", O_RDONLY, 0, &error));
-    ASSERT_TRUE(error);
-    EXPECT_EQ(error->functionName(), "_openBeneathByComponents");
-    uint64_t refusal = error->sourceFileLine();
-    error.reset();
-    EXPECT_FALSE(fm()->_openBeneathByComponents(directory.get(), "missing/x", O_RDONLY, 0, &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ENOENT));
-    EXPECT_EQ(error->functionName(), "_openBeneathByComponents");
-    EXPECT_NE(error->sourceFileLine(), refusal);
-
-    // Failures of one operation at different steps are different sites.
-    size_t createSites = 0;
-    for (const auto& site : sites)
-        createSites += site.first == "createDirectoryAtURL";
-    EXPECT_EQ(createSites, 3u) << "mkdir, mkpath_np and setclass fail at three sites";
+    STWErrorRef refusal, failure;
+    EXPECT_FALSE(fm()->_openBeneathByComponents(directory.get(), "../x", O_RDONLY, 0, &refusal));
+    EXPECT_FALSE(fm()->_openBeneathByComponents(directory.get(), "missing/x", O_RDONLY, 0, &failure));
+    ASSERT_TRUE(refusal && failure);
+    EXPECT_TRUE(failure->isPOSIX(ENOENT));
+    EXPECT_EQ(refusal->functionName(), "_openBeneathByComponents");
+    EXPECT_EQ(failure->functionName(), "_openBeneathByComponents");
+    EXPECT_NE(failure->sourceFileLine(), refusal->sourceFileLine());
 }
 
 // The orphan cleanup records what it is about to remove: one line per item, directories

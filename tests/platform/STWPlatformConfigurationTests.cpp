@@ -24,21 +24,14 @@ protected:
     std::filesystem::path root;
 };
 
-TEST_F(STWPlatformConfigurationTest, MissingFileMeansDefaultsUnderTheRoot) {
+TEST_F(STWPlatformConfigurationTest, MissingFileMeansDefaultsAndEveryKeyIsRead) {
     STWErrorRef error;
-    auto configuration = STWPlatformConfiguration::loadFromRoot(root, &error);
-    ASSERT_TRUE(configuration) << error->description();
-    EXPECT_EQ(configuration->resolve("/private/var/containers"), root / "private/var/containers");
-    EXPECT_EQ(configuration->runtimeDirectory(), root / "run/stowly");
-    EXPECT_FALSE(configuration->isInternalImage());
-    EXPECT_EQ(configuration->installationUID(), 33u);
-    EXPECT_EQ(configuration->systemContainerUID(), 0u);
-    EXPECT_EQ(configuration->mobileUserName(), "mobile");
-    EXPECT_FALSE(configuration->isFeatureEnabled("fast_container_sizing"));
+    auto defaults = STWPlatformConfiguration::loadFromRoot(root, &error);
+    ASSERT_TRUE(defaults) << error->description();
+    EXPECT_EQ(defaults->resolve("/private/var/containers"), root / "private/var/containers");
+    EXPECT_EQ(defaults->runtimeDirectory(), root / "run/stowly");
     EXPECT_EQ(STWPlatformConfiguration("/").resolve("/private/var"), "/private/var");
-}
 
-TEST_F(STWPlatformConfigurationTest, ReadsEveryKeyAndTheOSRelease) {
     writeSettings({{"InternalImage", STWValue(true)},
                    {"MultiUser", STWValue(true)},
                    {"PersonasUnsupported", STWValue(true)},
@@ -49,18 +42,19 @@ TEST_F(STWPlatformConfigurationTest, ReadsEveryKeyAndTheOSRelease) {
                    {"Features", STWValue(STWValue::Dictionary{{"fast_container_sizing", STWValue(true)}})}});
     std::ofstream(root / "etc/os-release")
         << "NAME=\"Stowly OS\"\nBUILD_ID=21A100\nVERSION_ID=\"17.1\"\n# comment\nRELEASE_TYPE='Internal'\n";
-    STWErrorRef error;
-    auto configuration = STWPlatformConfiguration::loadFromRoot(root, &error);
-    ASSERT_TRUE(configuration);
-    EXPECT_TRUE(configuration->isInternalImage());
-    EXPECT_TRUE(configuration->isMultiUser());
-    EXPECT_TRUE(configuration->personasUnsupported());
-    EXPECT_TRUE(configuration->isDeveloperMode());
-    EXPECT_EQ(configuration->installationUID(), 1000u);
-    EXPECT_EQ(configuration->systemContainerUID(), 7u);
-    EXPECT_EQ(configuration->mobileUserName(), "phone");
-    EXPECT_TRUE(configuration->isFeatureEnabled("fast_container_sizing"));
-    const auto& version = configuration->systemVersion();
+    auto set = STWPlatformConfiguration::loadFromRoot(root, &error);
+    ASSERT_TRUE(set);
+    for (const auto& [configuration, on] : {std::pair{defaults.get(), false}, std::pair{set.get(), true}}) {
+        EXPECT_EQ(configuration->isInternalImage(), on);
+        EXPECT_EQ(configuration->isMultiUser(), on);
+        EXPECT_EQ(configuration->personasUnsupported(), on);
+        EXPECT_EQ(configuration->isDeveloperMode(), on);
+        EXPECT_EQ(configuration->installationUID(), on ? 1000u : 33u);
+        EXPECT_EQ(configuration->systemContainerUID(), on ? 7u : 0u);
+        EXPECT_EQ(configuration->mobileUserName(), on ? "phone" : "mobile");
+        EXPECT_EQ(configuration->isFeatureEnabled("fast_container_sizing"), on);
+    }
+    const auto& version = set->systemVersion();
     EXPECT_EQ(*STWDictionaryString(version, "BuildVersion"), "21A100");
     EXPECT_EQ(*STWDictionaryString(version, "ProductVersion"), "17.1");
     EXPECT_EQ(*STWDictionaryString(version, "ReleaseType"), "Internal");

@@ -26,14 +26,6 @@ std::vector<uint64_t> connectedCommands(const STWClientIdentityRef& identity) {
     return commands;
 }
 
-uint64_t mask(bool (*pick)(const STWCommandTableEntry&)) {
-    uint64_t bits = 0;
-    for (const auto& entry : STWCommandTable)
-        if (pick(entry))
-            bits |= uint64_t{1} << entry.command;
-    return bits;
-}
-
 const STWValue::Dictionary lookupOnly{
     {"com.vorlane.private.Stowly.lookup",
      STWValue(STWValue::Dictionary{{"appData", STWValue(STWValue::Array{STWValue("com.other.app")})}})}};
@@ -45,25 +37,16 @@ protected:
 
 } // namespace
 
-TEST_F(STWEntitlementDecisionTest, TableRowsAreIndexedAndCarryTheirFlags) {
-    for (uint64_t c = 0; c < STWCommandCount; c++) {
-        EXPECT_EQ(STWCommandTable[c].command, c);
-        EXPECT_EQ(STWCommandTable[c].spare, 0);
-        EXPECT_NE(STWCommandTable[c].handler, nullptr);
-    }
-    EXPECT_EQ(mask([](const STWCommandTableEntry& e) { return e.allowsUnentitled != 0; }), 0x1003A001u);
-    EXPECT_EQ(mask([](const STWCommandTableEntry& e) { return e.acceptsLookupEntitlement != 0; }), 0x83E003u);
-    EXPECT_EQ(mask([](const STWCommandTableEntry& e) { return e.sendsReply == 0; }), (1u << 4) | (1u << 21));
-}
-
 TEST_F(STWEntitlementDecisionTest, CallersWithoutEntitlementsOnlyReachTheOpenCommands) {
+    // The dispatcher finds a command's row by its number.
+    for (uint64_t c = 0; c < STWCommandCount; c++)
+        EXPECT_EQ(STWCommandTable[c].command, c);
     std::vector<uint64_t> open{0, 13, 15, 16, 17, 28};
     EXPECT_EQ(connectedCommands(caller({})), open);
     // No identity at all (no signing identifier): the same commands, with no client.
     EXPECT_EQ(connectedCommands(nullptr), open);
     auto connection = decide(0, caller({}));
-    EXPECT_FALSE(connection->entitled());
-    EXPECT_FALSE(connection->unrestricted());
+    EXPECT_FALSE(connection->entitled() || connection->unrestricted());
     EXPECT_EQ(connection->clientBundleIdentifier().value_or(""), "com.example.caller");
     EXPECT_FALSE(decide(0, nullptr)->clientBundleIdentifier().has_value());
 }
@@ -72,15 +55,12 @@ TEST_F(STWEntitlementDecisionTest, AllowedIsUnrestrictedExceptWhereTestabilityIs
     auto allowed = caller({{"com.vorlane.private.Stowly.allowed", STWValue(true)}});
     for (uint64_t c = 0; c < STWCommandCount; c++) {
         auto connection = decide(c, allowed);
-        bool testability = c == 25 || c == 31;
-        if (testability) {
+        if (c == 25 || c == 31) {
             EXPECT_EQ(connection, nullptr) << "command " << c;
             continue;
         }
         ASSERT_NE(connection, nullptr) << "command " << c;
-        EXPECT_TRUE(connection->entitled());
-        EXPECT_TRUE(connection->unrestricted());
-        EXPECT_TRUE(connection->allowOtherIdLookup());
+        EXPECT_TRUE(connection->entitled() && connection->unrestricted() && connection->allowOtherIdLookup()) << c;
         EXPECT_FALSE(connection->lookup().has_value());
     }
     auto both = caller({{"com.vorlane.private.Stowly.allowed", STWValue(true)},
@@ -114,9 +94,8 @@ TEST_F(STWEntitlementDecisionTest, OtherIdLookupAndSpecificEntitlements) {
                             {"com.vorlane.private.Stowly.dataMigration", STWValue("true")}});
     auto assets = decide(29, identity);
     ASSERT_NE(assets, nullptr);
-    EXPECT_TRUE(assets->entitled());
+    EXPECT_TRUE(assets->entitled() && assets->allowOtherIdLookup());
     EXPECT_FALSE(assets->unrestricted());
-    EXPECT_TRUE(assets->allowOtherIdLookup());
     EXPECT_NE(decide(4, identity), nullptr);
     // A string is not a boolean entitlement.
     EXPECT_EQ(decide(24, identity), nullptr);
@@ -130,16 +109,14 @@ TEST_F(STWEntitlementDecisionTest, WipeContainerArrayEntitlesOnItsOwn) {
     ASSERT_NE(connection, nullptr);
     EXPECT_TRUE(connection->entitled());
     EXPECT_FALSE(connection->unrestricted());
-    ASSERT_TRUE(connection->entitledWipeIdentifiers().has_value());
-    EXPECT_EQ(connection->entitledWipeIdentifiers()->size(), 1u);
+    EXPECT_EQ(connection->entitledWipeIdentifiers().value_or(STWValue::Array()).size(), 1u);
     // The array alone opens nothing else.
     EXPECT_EQ(decide(10, wiper), nullptr);
 
     // Allowed without the array: entitled as unrestricted, no identifiers.
     auto allowed = decide(11, caller({{"com.vorlane.private.Stowly.allowed", STWValue(true)}}));
     ASSERT_NE(allowed, nullptr);
-    EXPECT_TRUE(allowed->entitled());
-    EXPECT_FALSE(allowed->entitledWipeIdentifiers().has_value());
+    EXPECT_TRUE(allowed->entitled() && !allowed->entitledWipeIdentifiers());
     // A boolean wipeContainer entitlement is not an array.
     EXPECT_EQ(decide(11, caller({{"com.vorlane.private.Stowly.wipeContainer", STWValue(true)}})), nullptr);
 }
@@ -159,19 +136,11 @@ TEST_F(STWEntitlementDecisionTest, SanitisedLookupDropsWhatIsNotAStringList) {
     EXPECT_FALSE(connection->_lookupForContainerClass(14).has_value());
 }
 
-TEST_F(STWEntitlementDecisionTest, DispatchAnswersInvalidCommandsAndUnentitledCallers) {
+// Command numbers outside the table and unentitled callers are answered in the end-to-end tests.
+TEST_F(STWEntitlementDecisionTest, DispatchAnswersWhatFailsEarlyAndTreatsAMissingCommandAsZero) {
     auto reply = std::make_shared<STWReply>(nullptr, 1);
-    for (uint64_t command : {uint64_t{32}, uint64_t{1} << 63, UINT64_MAX}) {
-        uint64_t error = 1;
-        EXPECT_TRUE(STWRequestDispatcher::dispatch({{"Command", STWValue(command)}}, reply, caller({}), &error));
-        EXPECT_EQ(error, STWErrorUnsupportedCommand) << command;
-    }
-    uint64_t error = 1;
-    EXPECT_TRUE(STWRequestDispatcher::dispatch({{"Command", STWValue(2)}}, reply, caller({}), &error));
-    EXPECT_EQ(error, STWErrorNotEntitled);
-
     // A command that fails before its asynchronous part is answered by the dispatcher.
-    error = 1;
+    uint64_t error = 1;
     auto allowed = caller({{"com.vorlane.private.Stowly.allowed", STWValue(true)}});
     EXPECT_TRUE(STWRequestDispatcher::dispatch({{"Command", STWValue(21)}}, reply, allowed, &error));
     EXPECT_NE(error, STWErrorSuccess);
