@@ -148,6 +148,23 @@ std::optional<STWValue::Dictionary> STWClient::sendMessage(const STWValue::Dicti
     }
 }
 
+bool STWClient::_waitToWrite(std::optional<Clock::time_point> deadline) {
+    std::unique_lock guard(_writeStateLock);
+    auto free = [&] { return !_writing; };
+    if (deadline ? !_writerDone.wait_until(guard, *deadline, free) : (_writerDone.wait(guard, free), false))
+        return false;
+    _writing = true;
+    return true;
+}
+
+void STWClient::_doneWriting() {
+    {
+        std::lock_guard guard(_writeStateLock);
+        _writing = false;
+    }
+    _writerDone.notify_one();
+}
+
 std::optional<STWValue::Dictionary> STWClient::_exchange(uint64_t kind, const STWValue::Dictionary& body,
                                                          std::chrono::milliseconds timeout,
                                                          STWErrorRef* error) {
@@ -184,16 +201,14 @@ std::optional<STWValue::Dictionary> STWClient::_exchange(uint64_t kind, const ST
         return std::nullopt;
     }
 
-    std::unique_lock writing(_writeLock, std::defer_lock);
-    bool locked = deadline ? writing.try_lock_until(*deadline) : (writing.lock(), true);
-    if (!locked) {
+    if (!_waitToWrite(deadline)) {
         STWSetError(error, CLIENT_ERROR(ETIMEDOUT, "Timed out waiting to send request %llu", id));
         return std::nullopt;
     }
     size_t sent = 0;
     if (!_writeFrame(frame, deadline, &sent)) {
         int code = errno;
-        writing.unlock();
+        _doneWriting();
         std::lock_guard guard(_lock);
         // A frame cut short leaves the daemon reading our next frame from its middle:
         // this connection is finished.
@@ -211,7 +226,7 @@ std::optional<STWValue::Dictionary> STWClient::_exchange(uint64_t kind, const ST
             STWSetError(error, CLIENT_ERROR(code, "Failed to send request %llu", id));
         return std::nullopt;
     }
-    writing.unlock();
+    _doneWriting();
 
     std::unique_lock lock(_lock);
     while (!waiter->done) {

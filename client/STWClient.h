@@ -70,9 +70,14 @@ private:
     const int _fd;
     std::thread _reader;
 
-    // Frames go out whole and one at a time; a timed mutex so that waiting for another
-    // sender still honours the caller's time-out.
-    std::timed_mutex _writeLock;
+    // Frames go out whole and one at a time: a sender waits (honouring its time-out) until
+    // no other is writing. A flag under a mutex rather than a timed mutex, whose timed lock
+    // ThreadSanitizer cannot follow.
+    bool _waitToWrite(std::optional<Clock::time_point> deadline);
+    void _doneWriting();
+    std::mutex _writeStateLock;
+    std::condition_variable _writerDone;
+    bool _writing = false;
 
     mutable std::mutex _lock;
     std::unordered_map<uint64_t, std::shared_ptr<Waiter>> _waiters;

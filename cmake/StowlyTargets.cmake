@@ -1,7 +1,19 @@
 # Shared settings for every target of the project.
 
+# STOWLY_SANITIZE=thread builds everything under ThreadSanitizer (scripts/test does so with
+# clang for the concurrency tests).
+set(STOWLY_SANITIZE "" CACHE STRING "Sanitizer to build with (thread, address, ...); empty for none")
+if(STOWLY_SANITIZE)
+  add_compile_options(-fsanitize=${STOWLY_SANITIZE} -fno-omit-frame-pointer)
+  add_link_options(-fsanitize=${STOWLY_SANITIZE})
+endif()
+
 function(stowly_target_defaults target)
   target_compile_options(${target} PRIVATE -Wall -Wextra -Werror)
+  # clang checks the lock annotations (common/STWThreadSafety.h).
+  if(CMAKE_CXX_COMPILER_ID STREQUAL "Clang")
+    target_compile_options(${target} PRIVATE -Wthread-safety)
+  endif()
   # GCC 12 at -O3 (the Release builds of bench/run) reports -Wrestrict inside libstdc++'s
   # own string concatenation ("x" + s) where nothing overlaps (GCC bug 105329, fixed in
   # 13). It stays a warning there rather than failing the build.

@@ -7,6 +7,7 @@
 #include <cerrno>
 #include <climits>
 #include <fcntl.h>
+#include <openssl/sha.h>
 #include <mutex>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -36,14 +37,8 @@ int openChildDirectory(int parent, const std::string& name, bool create) {
     return fd;
 }
 
-std::string personaDirectoryName(const STWSandboxMappingItem& item) {
-    return item.personaUniqueString ? *item.personaUniqueString
-                                    : std::string(STWSandboxMappingStore::noPersonaDirectoryName);
-}
-
 std::string directoryKey(const STWSandboxMappingItem& item) {
-    return STWFormat("%u/%@/%llu", item.uid, personaDirectoryName(item),
-                     static_cast<unsigned long long>(item.itemType));
+    return STWFormat("%u/%u/%llu", item.uid, item.kernelPersonaID, static_cast<unsigned long long>(item.itemType));
 }
 
 } // namespace
@@ -64,8 +59,7 @@ private:
 };
 
 std::string STWSandboxMappingItem::description() const {
-    return STWFormat("<mapping uid %u, persona %@ (%u), itemType %llu, identifier %@>", uid,
-                     personaUniqueString ? *personaUniqueString : std::string("(null)"), kernelPersonaID,
+    return STWFormat("<mapping uid %u, persona %u, itemType %llu, identifier %@>", uid, kernelPersonaID,
                      static_cast<unsigned long long>(itemType), identifier);
 }
 
@@ -82,10 +76,15 @@ void STWSandboxMappingStore::setSharedInstance(std::shared_ptr<STWSandboxMapping
     shared = std::move(store);
 }
 
-bool STWSandboxMappingStore::isSafePathComponent(std::string_view name) {
-    if (name.empty() || name == "." || name == "..")
-        return false;
-    return name.find('/') == std::string_view::npos && name.find('\0') == std::string_view::npos;
+std::string STWSandboxMappingStore::nameForIdentifier(std::string_view identifier) {
+    bool plain = !identifier.empty() && identifier.size() <= NAME_MAX && identifier.front() != '.' &&
+                 identifier.front() != '%' && identifier.find('/') == std::string_view::npos &&
+                 identifier.find('\0') == std::string_view::npos;
+    if (plain)
+        return std::string(identifier);
+    unsigned char digest[SHA256_DIGEST_LENGTH];
+    SHA256(reinterpret_cast<const unsigned char*>(identifier.data()), identifier.size(), digest);
+    return "%" + STWHexString(digest, sizeof digest);
 }
 
 STWFileSandboxMappingStore::STWFileSandboxMappingStore(std::filesystem::path baseDirectory)
@@ -114,7 +113,7 @@ int STWFileSandboxMappingStore::_openItemDirectory(const STWSandboxMappingItem& 
     if (current < 0)
         return current;
 
-    const std::string components[] = {STWFormat("%u", item.uid), personaDirectoryName(item),
+    const std::string components[] = {STWFormat("%u", item.uid), STWFormat("%u", item.kernelPersonaID),
                                       STWFormat("%llu", static_cast<unsigned long long>(item.itemType))};
     for (const std::string& component : components) {
         int next = openChildDirectory(current, component, create);
@@ -128,12 +127,6 @@ int STWFileSandboxMappingStore::_openItemDirectory(const STWSandboxMappingItem& 
 
 STWFileSandboxMappingStore::DirectoryRef STWFileSandboxMappingStore::_itemDirectory(const STWSandboxMappingItem& item,
                                                                                     bool create, int* error) {
-    if (!isSafePathComponent(item.identifier) ||
-        (item.personaUniqueString &&
-         (!isSafePathComponent(*item.personaUniqueString) || *item.personaUniqueString == noPersonaDirectoryName))) {
-        *error = EINVAL;
-        return nullptr;
-    }
     std::string key = directoryKey(item);
     std::lock_guard guard(_directoriesLock);
     if (auto it = _directoriesLock_directories.find(key); it != _directoriesLock_directories.end())
@@ -169,7 +162,7 @@ int STWFileSandboxMappingStore::setUserStateItem(const STWSandboxMappingItem& it
 
     if (!path) {
         // In a directory removed since it was opened, the link is gone with it.
-        if (unlinkat(directory->fd(), item.identifier.c_str(), 0) == 0 || errno == ENOENT)
+        if (unlinkat(directory->fd(), nameForIdentifier(item.identifier).c_str(), 0) == 0 || errno == ENOENT)
             return 0;
         return errno;
     }
@@ -177,7 +170,8 @@ int STWFileSandboxMappingStore::setUserStateItem(const STWSandboxMappingItem& it
     // With no mapping there (the usual case: pushes withdraw first), the link is made under
     // its own name. A mapping that is there is replaced through a temporary name and a
     // rename, so that readers see the old path or the new one, never neither.
-    std::string name = item.identifier;
+    const std::string target = nameForIdentifier(item.identifier);
+    std::string name = target;
     for (int attempt = 0;; ++attempt) {
         if (symlinkat(path->c_str(), directory->fd(), name.c_str()) != 0) {
             int e = errno;
@@ -194,9 +188,9 @@ int STWFileSandboxMappingStore::setUserStateItem(const STWSandboxMappingItem& it
             }
             return e;
         }
-        if (name == item.identifier)
+        if (name == target)
             return 0;
-        if (renameat(directory->fd(), name.c_str(), directory->fd(), item.identifier.c_str()) != 0) {
+        if (renameat(directory->fd(), name.c_str(), directory->fd(), target.c_str()) != 0) {
             int e = errno;
             unlinkat(directory->fd(), name.c_str(), 0);
             return e;
@@ -211,7 +205,7 @@ std::optional<std::filesystem::path> STWFileSandboxMappingStore::userStateItem(c
     if (!directory)
         return std::nullopt;
     char buffer[PATH_MAX];
-    ssize_t length = readlinkat(directory->fd(), item.identifier.c_str(), buffer, sizeof(buffer));
+    ssize_t length = readlinkat(directory->fd(), nameForIdentifier(item.identifier).c_str(), buffer, sizeof(buffer));
     if (length < 0 || static_cast<size_t>(length) >= sizeof(buffer))
         return std::nullopt;
     return std::filesystem::path(std::string(buffer, static_cast<size_t>(length)));

@@ -4,20 +4,22 @@
 //
 // On Linux the store is a tree of symbolic links below the runtime directory:
 //
-//     ROOT/run/stowly/sandbox/UID/PERSONA/ITEMTYPE/IDENTIFIER -> container path
+//     ROOT/run/stowly/sandbox/UID/PERSONA/ITEMTYPE/NAME -> container path
 //
-// UID and ITEMTYPE are decimal numbers. PERSONA is the persona unique string of the user
-// identity, or the word "nopersona" for an identity without one (no persona support, or the
-// default identity); a persona unique string equal to that word is refused, so the two can
-// never share a directory. A mapping is set by creating the link IDENTIFIER; one that is
-// there already is replaced by creating the link under a temporary name in the same
-// directory and renaming it over IDENTIFIER, so a reader sees the old path or the new one,
-// never neither. A mapping is withdrawn by removing the link.
+// UID, PERSONA and ITEMTYPE are decimal numbers: PERSONA is the user identity's kernel
+// persona id (an identity built without persona data gives its POSIX user id), so one
+// container has the same item at every start. NAME is the identifier itself when that is
+// a plain file name (not empty, no "/" or NUL, at most 255 bytes, not beginning with "."
+// or "%"); any other identifier, the empty one included, is stored under "%" and the
+// SHA-256 of the identifier in hex, which no plain name can equal and which never climbs
+// out of its directory. nameForIdentifier() gives the name, for readers of the store.
 //
-// Identifiers and persona strings come from clients and are treated as hostile: each must
-// be one safe path component (not empty, not "." or "..", no "/" and no NUL). The store's
-// directories are opened one component at a time without following symbolic links, so a
-// link planted in the tree can never redirect a write outside it.
+// A mapping is set by creating the link NAME; one that is there already is replaced by
+// creating the link under a temporary name in the same directory and renaming it over
+// NAME, so a reader sees the old path or the new one, never neither. A mapping is
+// withdrawn by removing the link. The store's directories are opened one component at a
+// time without following symbolic links, so a link planted in the tree can never redirect
+// a write outside it.
 //
 // A rebuild pushes one mapping per container, so the store keeps each ITEMTYPE directory
 // open once it has found it: a push is then a few calls on that descriptor rather than a
@@ -42,10 +44,7 @@
 // Which item of the store: the fields the sandbox keys its user state by.
 struct STWSandboxMappingItem {
     uid_t uid = 0;
-    // The identity's persona unique string; nullopt for an identity without one.
-    std::optional<std::string> personaUniqueString;
-    // The kernel's persona id of the identity. The Linux store names the persona by its
-    // unique string; the id is carried for stores (and fakes) that key by it.
+    // The kernel's persona id of the identity (its POSIX user id when it has no persona).
     uint32_t kernelPersonaID = 0;
     uint64_t itemType = 0;
     std::string identifier;
@@ -55,24 +54,20 @@ struct STWSandboxMappingItem {
 
 class STWSandboxMappingStore {
 public:
-    // The directory name used for an identity without a persona unique string.
-    static constexpr std::string_view noPersonaDirectoryName = "nopersona";
-
     virtual ~STWSandboxMappingStore() = default;
 
     static std::shared_ptr<STWSandboxMappingStore> sharedInstance();
     static void setSharedInstance(std::shared_ptr<STWSandboxMappingStore> store);
 
     // Sets the item to `path`, or withdraws it when `path` is nullopt (withdrawing an item
-    // that is not there succeeds). Answers 0 or an errno value: EINVAL for an identifier or
-    // persona string that is not one safe path component.
+    // that is not there succeeds). Answers 0 or an errno value.
     virtual int setUserStateItem(const STWSandboxMappingItem& item, const std::optional<std::filesystem::path>& path) = 0;
 
     // The path the item maps to, or nullopt when there is none (or it cannot be read).
     virtual std::optional<std::filesystem::path> userStateItem(const STWSandboxMappingItem& item) = 0;
 
-    // Whether `name` may be used as one component of a store path.
-    static bool isSafePathComponent(std::string_view name);
+    // The file name under which the identifier's link is stored.
+    static std::string nameForIdentifier(std::string_view identifier);
 };
 
 // The Linux store: symbolic links below `baseDirectory` (ROOT/run/stowly/sandbox for the

@@ -603,8 +603,9 @@ bool STWContainerCache::_setSandboxContainerMappingForUserIdentity(const STWUser
     STWSandboxMappingItem item;
     // System containers belong to no user; their mappings live in the state of user 0.
     item.uid = STWContainerClassIsSystem(containerClass) ? 0 : userIdentity->posixUIDForContainerClass(containerClass);
-    item.personaUniqueString = userIdentity->personaUniqueString();
-    item.kernelPersonaID = userIdentity->kernelPersonaID();
+    // Keyed by the kernel persona id, which an identity has at every start; one built
+    // without persona data goes by its user id.
+    item.kernelPersonaID = userIdentity->kernelPersonaID() ? userIdentity->kernelPersonaID() : userIdentity->posixUID();
     item.itemType = *itemType;
     item.identifier = identifier;
     const char* path = url ? url->c_str() : nullptr;

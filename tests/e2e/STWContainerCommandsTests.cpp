@@ -222,20 +222,31 @@ TEST_F(STWContainerCommandsTest, SandboxedEnterpriseCallerGetsAVerifiableToken) 
     EXPECT_FALSE(plain.count("SandboxToken"));
 }
 
+// A data container's mapping sits under its user, the kernel persona id (PERSONAL-1 is
+// 1000) and its item type, once, also after a restart; a bundle has none.
 TEST_F(STWContainerCommandsTest, DataContainersAreMappedForTheSandboxAndBundlesAreNot) {
     auto client = daemon->connectAs("com.example.installer", allowed);
     auto data = STWDaemonProcess::send(*client, 0, createKeys("com.example.mapped", 2));
     auto bundle = STWDaemonProcess::send(*client, 0, createKeys("com.example.mapped", 1));
     ASSERT_EQ(code(data), STWErrorSuccess);
     ASSERT_EQ(code(bundle), STWErrorSuccess);
-    std::set<std::string> targets;
-    std::error_code ec;
-    for (std::filesystem::recursive_directory_iterator it(daemon->root() / "run/stowly/sandbox", ec), end;
-         !ec && it != end; it.increment(ec))
-        if (it->is_symlink())
-            targets.insert(std::filesystem::read_symlink(it->path()).native());
-    EXPECT_TRUE(targets.count(path(data)));
-    EXPECT_FALSE(targets.count(path(bundle)));
+    auto linksTo = [&](const std::string& target) {
+        std::vector<std::filesystem::path> found;
+        std::error_code ec;
+        for (std::filesystem::recursive_directory_iterator it(daemon->root() / "run/stowly/sandbox", ec), end;
+             !ec && it != end; it.increment(ec))
+            if (it->is_symlink() && std::filesystem::read_symlink(it->path()) == target)
+                found.push_back(it->path());
+        return found;
+    };
+    auto expected = std::vector<std::filesystem::path>{daemon->root() / "run/stowly/sandbox/501/1000/1/com.example.mapped"};
+    EXPECT_EQ(linksTo(path(data)), expected);
+    EXPECT_TRUE(linksTo(path(bundle)).empty());
+    ASSERT_TRUE(daemon->stop());
+    ASSERT_TRUE(daemon->start());
+    client = daemon->connectAs("com.example.installer", allowed);
+    ASSERT_EQ(code(STWDaemonProcess::send(*client, 0, createKeys("com.example.mapped", 2, false))), STWErrorSuccess);
+    EXPECT_EQ(linksTo(path(data)), expected);
 }
 
 // On internal builds a test client can hold the daemon-wide write lock; creation waits

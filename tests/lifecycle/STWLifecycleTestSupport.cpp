@@ -20,9 +20,8 @@ STWValue persona(const char* unique, uint32_t id, const char* type, STWValue::Ar
 }
 
 std::string itemKey(const STWSandboxMappingItem& item) {
-    return STWFormat("%u/%@/%llu/%@", item.uid,
-                     item.personaUniqueString.value_or(std::string(STWSandboxMappingStore::noPersonaDirectoryName)),
-                     static_cast<unsigned long long>(item.itemType), item.identifier);
+    return STWFormat("%u/%u/%llu/%@", item.uid, item.kernelPersonaID, static_cast<unsigned long long>(item.itemType),
+                     item.identifier);
 }
 
 } // namespace

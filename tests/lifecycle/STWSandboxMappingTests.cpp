@@ -70,22 +70,23 @@ TEST_F(STWSandboxMappingTest, MappingsArePushedOnAddAndWithdrawnOnRemove) {
     auto system = STWMakeTestContainer(STWUserIdentityCache::defaultUserIdentity(), "com.example.sys", 12);
     ASSERT_TRUE(add(data) && add(group) && add(system));
 
-    // The default identity has no persona unique string; system containers map for user 0.
-    const std::set<fs::path> expected{base / "501/PERSONAL/1/com.example.app", base / "501/ENT-1/2/group.com.work",
-                                      base / "0/nopersona/4/com.example.sys"};
+    // Items go by the kernel persona id (PERSONAL is 1000, ENT-1 1001); the default identity
+    // has no persona data and goes by its user id; system containers map for user 0.
+    const std::set<fs::path> expected{base / "501/1000/1/com.example.app", base / "501/1001/2/group.com.work",
+                                      base / "0/501/4/com.example.sys"};
     EXPECT_EQ(links(), expected);
-    EXPECT_EQ(fs::read_symlink(base / "501/PERSONAL/1/com.example.app"), data.url);
-    EXPECT_EQ(fs::read_symlink(base / "0/nopersona/4/com.example.sys"), system.url);
+    EXPECT_EQ(fs::read_symlink(base / "501/1000/1/com.example.app"), data.url);
+    EXPECT_EQ(fs::read_symlink(base / "0/501/4/com.example.sys"), system.url);
 
     // Re-adding at a new place re-points the mapping.
     auto moved = STWMakeTestContainer(mobile, "com.example.app", 2);
     ASSERT_TRUE(add(moved));
-    EXPECT_EQ(fs::read_symlink(base / "501/PERSONAL/1/com.example.app"), moved.url);
+    EXPECT_EQ(fs::read_symlink(base / "501/1000/1/com.example.app"), moved.url);
 
     EXPECT_TRUE(remove(data) && remove(group) && remove(system));
     EXPECT_TRUE(links().empty());
     // Withdrawing what is not there is no failure.
-    EXPECT_EQ(store->setUserStateItem({501, std::string("PERSONAL"), 1000, 1, "com.never.pushed"}, std::nullopt), 0);
+    EXPECT_EQ(store->setUserStateItem({501, 1000, 1, "com.never.pushed"}, std::nullopt), 0);
 
     // No mapping for: a bundle, a transient container, an enterprise identity's container of
     // a bundle it shares with the personal persona, a personal container of an
@@ -98,40 +99,43 @@ TEST_F(STWSandboxMappingTest, MappingsArePushedOnAddAndWithdrawnOnRemove) {
     // The owners do get theirs.
     ASSERT_TRUE(add(STWMakeTestContainer(enterprise, "com.work.mail", 4)));
     ASSERT_TRUE(add(STWMakeTestContainer(mobile, "com.shared.app", 11)));
-    EXPECT_EQ(links(), (std::set<fs::path>{base / "501/ENT-1/1/com.work.mail", base / "501/PERSONAL/1/com.shared.app"}));
+    EXPECT_EQ(links(), (std::set<fs::path>{base / "501/1001/1/com.work.mail", base / "501/1000/1/com.shared.app"}));
 }
 
-TEST_F(STWSandboxMappingTest, HostileIdentifiersNeverLeaveTheStore) {
+TEST_F(STWSandboxMappingTest, IdentifiersThatAreNoFileNameAreStoredEscapedAndNeverClimb) {
     auto container = STWMakeTestContainer(mobile, "com.example.app", 2);
-    ASSERT_TRUE(add(container));
     // A container whose metadata names a path as its identifier.
     auto escaping = STWMakeTestContainer(mobile, "../../../../../../escape", 2);
+    ASSERT_TRUE(add(container));
     const fs::path& root = STWTestRoot::shared().path();
     std::set<fs::path> before = entries(root, true);
+    fs::path directory = base / "501/1000/1";
 
-    const std::string hostile[] = {"", ".", "..", "../../../../etc/passwd", "a/b", "/abs", std::string("a\0b", 3)};
+    const std::string hostile[] = {"", ".", "..", "../../../../etc/passwd", "a/b", "/abs", std::string("a\0b", 3),
+                                   std::string(256, 'x'), "%escaped", ".hidden"};
+    std::set<std::string> names;
     for (const std::string& identifier : hostile) {
-        STWSandboxMappingItem item{501, std::string("PERSONAL"), 1000, 1, identifier};
-        EXPECT_EQ(store->setUserStateItem(item, container.url), EINVAL) << identifier;
-        EXPECT_EQ(store->setUserStateItem(item, std::nullopt), EINVAL) << identifier;
+        STWSandboxMappingItem item{501, 1000, 1, identifier};
+        ASSERT_EQ(store->setUserStateItem(item, container.url), 0) << identifier;
+        EXPECT_EQ(store->userStateItem(item), container.url);
+        std::string name = STWSandboxMappingStore::nameForIdentifier(identifier);
+        EXPECT_EQ(name.size(), 65u);
+        EXPECT_EQ(name[0], '%');
+        EXPECT_EQ(fs::read_symlink(directory / name), container.url);
+        names.insert(name);
     }
-    for (const char* persona : {"..", "x/y", "nopersona", ""}) {
-        STWSandboxMappingItem item{501, std::string(persona), 1000, 1, "com.example.app"};
-        EXPECT_EQ(store->setUserStateItem(item, container.url), EINVAL) << persona;
+    EXPECT_EQ(names.size(), std::size(hostile)) << "one name per identifier";
+    // Plain names, odd as they may be, are stored as they are.
+    for (const char* odd : {"a..b", "with space", "caf\xc3\xa9", "-", "a%b"}) {
+        STWSandboxMappingItem item{501, 1000, 1, odd};
+        ASSERT_EQ(store->setUserStateItem(item, container.url), 0) << odd;
+        EXPECT_EQ(fs::read_symlink(directory / odd), container.url);
     }
-    // Its add works; its push is refused.
+    // Its mapping lives inside the store too.
     ASSERT_TRUE(add(escaping));
+    EXPECT_EQ(store->userStateItem({501, 1000, 1, "../../../../../../escape"}), escaping.url);
     EXPECT_TRUE(remove(escaping));
     EXPECT_EQ(entries(root, true), before);
-    EXPECT_EQ(links(), std::set<fs::path>{base / "501/PERSONAL/1/com.example.app"});
-
-    // Odd but harmless names are stored as they are.
-    for (const char* odd : {"..hidden", "with space", "caf\xc3\xa9", "-"}) {
-        STWSandboxMappingItem item{501, std::string("PERSONAL"), 1000, 1, odd};
-        ASSERT_EQ(store->setUserStateItem(item, container.url), 0) << odd;
-        EXPECT_EQ(store->userStateItem(item), container.url);
-        EXPECT_EQ(fs::read_symlink(base / "501/PERSONAL/1" / odd), container.url);
-    }
 }
 
 TEST_F(STWSandboxMappingTest, LinksPlantedInTheStoreAreNeverFollowed) {
@@ -139,9 +143,9 @@ TEST_F(STWSandboxMappingTest, LinksPlantedInTheStoreAreNeverFollowed) {
     fs::create_directories(outside / "1");
     std::ofstream(outside / "1/com.example.app") << "victim";
     fs::create_directories(base / "501");
-    fs::create_directory_symlink(outside, base / "501/PERSONAL");
+    fs::create_directory_symlink(outside, base / "501/1000");
 
-    STWSandboxMappingItem item{501, std::string("PERSONAL"), 1000, 1, "com.example.app"};
+    STWSandboxMappingItem item{501, 1000, 1, "com.example.app"};
     EXPECT_NE(store->setUserStateItem(item, fs::path("/somewhere")), 0);
     EXPECT_NE(store->setUserStateItem(item, std::nullopt), 0);
     auto container = STWMakeTestContainer(mobile, "com.example.app", 2);
@@ -151,18 +155,18 @@ TEST_F(STWSandboxMappingTest, LinksPlantedInTheStoreAreNeverFollowed) {
     EXPECT_EQ(entries(outside, false), (std::set<fs::path>{outside / "1", outside / "1/com.example.app"}));
 
     // A link in the identifier's place is replaced, never written through.
-    fs::remove(base / "501/PERSONAL");
-    fs::create_directories(base / "501/PERSONAL/1");
-    fs::create_symlink(outside / "1/com.example.app", base / "501/PERSONAL/1/com.example.app");
+    fs::remove(base / "501/1000");
+    fs::create_directories(base / "501/1000/1");
+    fs::create_symlink(outside / "1/com.example.app", base / "501/1000/1/com.example.app");
     ASSERT_TRUE(add(container));
-    EXPECT_EQ(fs::read_symlink(base / "501/PERSONAL/1/com.example.app"), container.url);
+    EXPECT_EQ(fs::read_symlink(base / "501/1000/1/com.example.app"), container.url);
     std::string content;
     std::ifstream(outside / "1/com.example.app") >> content;
     EXPECT_EQ(content, "victim");
 }
 
 TEST_F(STWSandboxMappingTest, ReplacingAMappingNeverLeavesItMissing) {
-    STWSandboxMappingItem item{501, std::string("PERSONAL"), 1000, 1, "com.example.app"};
+    STWSandboxMappingItem item{501, 1000, 1, "com.example.app"};
     const fs::path paths[] = {"/private/var/mobile/Containers/Data/Application/A",
                               "/private/var/mobile/Containers/Data/Application/B"};
     ASSERT_EQ(store->setUserStateItem(item, paths[0]), 0);
@@ -188,11 +192,11 @@ TEST_F(STWSandboxMappingTest, ReplacingAMappingNeverLeavesItMissing) {
     EXPECT_GT(seen, 0);
     EXPECT_EQ(missing, 0);
     // No temporary link is left behind.
-    EXPECT_EQ(entries(base / "501/PERSONAL/1", false), std::set<fs::path>{base / "501/PERSONAL/1/com.example.app"});
+    EXPECT_EQ(entries(base / "501/1000/1", false), std::set<fs::path>{base / "501/1000/1/com.example.app"});
 }
 
 TEST_F(STWSandboxMappingTest, AStoreClearedBehindItsBackIsBuiltAgain) {
-    STWSandboxMappingItem item{501, std::string("PERSONAL"), 1000, 1, "com.example.app"};
+    STWSandboxMappingItem item{501, 1000, 1, "com.example.app"};
     const fs::path container("/private/var/mobile/Containers/Data/Application/A");
     ASSERT_EQ(store->setUserStateItem(item, container), 0);
     // Whoever clears the runtime directory takes the directories the store keeps open.
@@ -200,10 +204,10 @@ TEST_F(STWSandboxMappingTest, AStoreClearedBehindItsBackIsBuiltAgain) {
     EXPECT_EQ(store->userStateItem(item), std::nullopt);
     EXPECT_EQ(store->setUserStateItem(item, std::nullopt), 0);
     ASSERT_EQ(store->setUserStateItem(item, container), 0);
-    EXPECT_EQ(fs::read_symlink(base / "501/PERSONAL/1/com.example.app"), container);
+    EXPECT_EQ(fs::read_symlink(base / "501/1000/1/com.example.app"), container);
     EXPECT_EQ(store->userStateItem(item), container);
     EXPECT_EQ(store->setUserStateItem(item, std::nullopt), 0);
-    EXPECT_FALSE(fs::exists(fs::symlink_status(base / "501/PERSONAL/1/com.example.app")));
+    EXPECT_FALSE(fs::exists(fs::symlink_status(base / "501/1000/1/com.example.app")));
 }
 
 } // namespace
