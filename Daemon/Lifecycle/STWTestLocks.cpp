@@ -13,8 +13,10 @@ bool isParkPoint(uint64_t lock) {
 } // namespace
 
 std::shared_ptr<STWTestLocks> STWTestLocks::sharedInstance() {
-    static const std::shared_ptr<STWTestLocks> instance = std::make_shared<STWTestLocks>();
-    return instance;
+    // Lives for the process: the threads that hold back waiters may still be finishing
+    // when static objects are destroyed at exit.
+    static const auto* instance = new std::shared_ptr<STWTestLocks>(std::make_shared<STWTestLocks>());
+    return *instance;
 }
 
 STWTestLocks::STWTestLocks() : _stateQueue(STWQueue::create("com.vorlane.stowlyd.STWTestLocks.stateQueue")) {
