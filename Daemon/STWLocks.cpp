@@ -1,6 +1,7 @@
 #include "Daemon/STWLocks.h"
 
 #include "common/STWLog.h"
+#include "common/STWThreadSafety.h"
 
 #include <algorithm>
 #include <atomic>
@@ -22,17 +23,17 @@ struct LockRecord {
 };
 
 struct STWLocks {
-    std::mutex mutex;
-    std::map<std::string, std::unique_ptr<LockRecord>, std::less<>> identifierToLockMap;
-    uint32_t allReaderWriterState = 0;
-    uint32_t identifierReaderCount = 0;
-    uint32_t identifierWriterCount = 0;
+    STWMutex mutex;
+    std::map<std::string, std::unique_ptr<LockRecord>, std::less<>> identifierToLockMap STW_GUARDED_BY(mutex);
+    uint32_t allReaderWriterState STW_GUARDED_BY(mutex) = 0;
+    uint32_t identifierReaderCount STW_GUARDED_BY(mutex) = 0;
+    uint32_t identifierWriterCount STW_GUARDED_BY(mutex) = 0;
     std::condition_variable identifierWriterCondition;
     std::condition_variable identifierReaderCondition;
     std::condition_variable allWriterCondition;
     std::condition_variable allReaderCondition;
 
-    bool _lock_nothingHeld() const {
+    bool _lock_nothingHeld() const STW_REQUIRES(mutex) {
         return identifierWriterCount == 0 && identifierReaderCount == 0 && allReaderWriterState == 0;
     }
 };
@@ -70,12 +71,18 @@ void take_one_lock(const std::string& identifier, bool write) {
     STWLocks& locks = gSTWLocks();
     LockRecord* record;
     {
-        std::unique_lock guard(locks.mutex);
+        STWUniqueLock guard(locks.mutex);
         if (write) {
-            locks.identifierWriterCondition.wait(guard, [&] { return locks.allReaderWriterState == 0; });
+            locks.identifierWriterCondition.wait(guard.native(), [&] {
+                locks.mutex.assertHeld();
+                return locks.allReaderWriterState == 0;
+            });
             locks.identifierWriterCount++;
         } else {
-            locks.identifierReaderCondition.wait(guard, [&] { return locks.allReaderWriterState != kWriteLocked; });
+            locks.identifierReaderCondition.wait(guard.native(), [&] {
+                locks.mutex.assertHeld();
+                return locks.allReaderWriterState != kWriteLocked;
+            });
             locks.identifierReaderCount++;
         }
         auto& slot = locks.identifierToLockMap[identifier];
@@ -102,7 +109,7 @@ void take_one_lock(const std::string& identifier, bool write) {
 
 void unlock_one_lock(const std::string& identifier) {
     STWLocks& locks = gSTWLocks();
-    std::lock_guard guard(locks.mutex);
+    STWLockGuard guard(locks.mutex);
     auto it = locks.identifierToLockMap.find(identifier);
     check(it != locks.identifierToLockMap.end(), "unlocking an identifier that has no lock record");
     LockRecord* record = it->second.get();
@@ -165,13 +172,17 @@ static void _lock_all_identifiers(bool write) {
     STWLocks& locks = gSTWLocks();
     const char* mode = write ? "writing" : "reading";
     STW_LOG_DEBUG(STWLogCategory::Locking, "Waiting to lock all identifiers for %s", mode);
-    std::unique_lock guard(locks.mutex);
+    STWUniqueLock guard(locks.mutex);
     if (write) {
-        locks.allWriterCondition.wait(guard, [&] { return locks._lock_nothingHeld(); });
+        locks.allWriterCondition.wait(guard.native(), [&] {
+            locks.mutex.assertHeld();
+            return locks._lock_nothingHeld();
+        });
         locks.allReaderWriterState = kWriteLocked;
         signpost("GlobalWriteLock", true);
     } else {
-        locks.allReaderCondition.wait(guard, [&] {
+        locks.allReaderCondition.wait(guard.native(), [&] {
+            locks.mutex.assertHeld();
             return locks.identifierWriterCount == 0 && locks.allReaderWriterState < kWriteLocked - 1;
         });
         locks.allReaderWriterState++;
@@ -195,7 +206,7 @@ void lock_all_identifiers_for_writing() {
 void unlock_all_identifiers() {
     STWLocks& locks = gSTWLocks();
     {
-        std::lock_guard guard(locks.mutex);
+        STWLockGuard guard(locks.mutex);
         if (locks.allReaderWriterState != kWriteLocked) {
             check(locks.allReaderWriterState > 0, "unlocking all identifiers without holding them");
             locks.allReaderWriterState--;
@@ -218,7 +229,7 @@ void unlock_all_identifiers() {
 
 STWLocksSnapshot STWLocksCurrentState() {
     STWLocks& locks = gSTWLocks();
-    std::lock_guard guard(locks.mutex);
+    STWLockGuard guard(locks.mutex);
     return {locks.allReaderWriterState, locks.identifierReaderCount, locks.identifierWriterCount,
             locks.identifierToLockMap.size()};
 }

@@ -107,11 +107,14 @@ std::unique_ptr<STWClient> STWClient::connect(const std::filesystem::path& socke
 STWClient::STWClient(int fd) : _fd(fd) {}
 
 STWClient::~STWClient() {
-    std::unique_lock lock(_lock);
+    STWUniqueLock lock(_lock);
     _lock_failConnection(ECANCELED, "the client was closed");
     // Wakes the reader and any sender blocked on a full socket.
     shutdown(_fd, SHUT_RDWR);
-    _callsDone.wait(lock, [this] { return _activeCalls == 0; });
+    _callsDone.wait(lock.native(), [this] {
+        _lock.assertHeld();
+        return _activeCalls == 0;
+    });
     lock.unlock();
     if (_reader.joinable())
         _reader.join();
@@ -149,9 +152,13 @@ std::optional<STWValue::Dictionary> STWClient::sendMessage(const STWValue::Dicti
 }
 
 bool STWClient::_waitToWrite(std::optional<Clock::time_point> deadline) {
-    std::unique_lock guard(_writeStateLock);
-    auto free = [&] { return !_writing; };
-    if (deadline ? !_writerDone.wait_until(guard, *deadline, free) : (_writerDone.wait(guard, free), false))
+    STWUniqueLock guard(_writeStateLock);
+    auto free = [&] {
+        _writeStateLock.assertHeld();
+        return !_writing;
+    };
+    if (deadline ? !_writerDone.wait_until(guard.native(), *deadline, free)
+                 : (_writerDone.wait(guard.native(), free), false))
         return false;
     _writing = true;
     return true;
@@ -159,7 +166,7 @@ bool STWClient::_waitToWrite(std::optional<Clock::time_point> deadline) {
 
 void STWClient::_doneWriting() {
     {
-        std::lock_guard guard(_writeStateLock);
+        STWLockGuard guard(_writeStateLock);
         _writing = false;
     }
     _writerDone.notify_one();
@@ -172,7 +179,7 @@ std::optional<STWValue::Dictionary> STWClient::_exchange(uint64_t kind, const ST
     uint64_t id;
     auto waiter = std::make_shared<Waiter>();
     {
-        std::lock_guard guard(_lock);
+        STWLockGuard guard(_lock);
         if (_failure) {
             STWSetError(error, _lock_connectionError());
             return std::nullopt;
@@ -187,7 +194,7 @@ std::optional<STWValue::Dictionary> STWClient::_exchange(uint64_t kind, const ST
         STWClient* client;
         uint64_t id;
         ~Leave() {
-            std::lock_guard guard(client->_lock);
+            STWLockGuard guard(client->_lock);
             client->_waiters.erase(id);
             if (--client->_activeCalls == 0)
                 client->_callsDone.notify_all();
@@ -209,7 +216,7 @@ std::optional<STWValue::Dictionary> STWClient::_exchange(uint64_t kind, const ST
     if (!_writeFrame(frame, deadline, &sent)) {
         int code = errno;
         _doneWriting();
-        std::lock_guard guard(_lock);
+        STWLockGuard guard(_lock);
         // A frame cut short leaves the daemon reading our next frame from its middle:
         // this connection is finished.
         if (sent > 0 && sent < frame.size()) {
@@ -228,11 +235,11 @@ std::optional<STWValue::Dictionary> STWClient::_exchange(uint64_t kind, const ST
     }
     _doneWriting();
 
-    std::unique_lock lock(_lock);
+    STWUniqueLock lock(_lock);
     while (!waiter->done) {
         if (!deadline) {
-            waiter->wakeUp.wait(lock);
-        } else if (waiter->wakeUp.wait_until(lock, *deadline) == std::cv_status::timeout && !waiter->done) {
+            waiter->wakeUp.wait(lock.native());
+        } else if (waiter->wakeUp.wait_until(lock.native(), *deadline) == std::cv_status::timeout && !waiter->done) {
             STWSetError(error, CLIENT_ERROR(ETIMEDOUT, "No reply to request %llu in %lld ms", id,
                                             static_cast<long long>(timeout.count())));
             return std::nullopt;
@@ -280,7 +287,7 @@ void STWClient::_readReplies() {
             int code = result == STWFrameReadResult::EndOfStream ? ECONNRESET : errno;
             if (result == STWFrameReadResult::EndOfStream)
                 reason = "the daemon closed the connection";
-            std::lock_guard guard(_lock);
+            STWLockGuard guard(_lock);
             _lock_failConnection(code ? code : EPROTO, reason);
             return;
         }
@@ -289,7 +296,7 @@ void STWClient::_readReplies() {
                           "Ignoring frame of kind %llu (id %llu) from the daemon", frame.kind, frame.id);
             continue;
         }
-        std::lock_guard guard(_lock);
+        STWLockGuard guard(_lock);
         auto it = _waiters.find(frame.id);
         if (it == _waiters.end() || it->second->done) {
             // The caller gave up on it.

@@ -14,6 +14,7 @@
 #pragma once
 
 #include "common/STWError.h"
+#include "common/STWThreadSafety.h"
 #include "common/STWValue.h"
 
 #include <chrono>
@@ -64,8 +65,8 @@ private:
                                                   std::chrono::milliseconds timeout, STWErrorRef* error);
     bool _writeFrame(const std::string& frame, std::optional<Clock::time_point> deadline, size_t* sent);
     void _readReplies();
-    void _lock_failConnection(int code, std::string reason);
-    STWErrorRef _lock_connectionError() const;
+    void _lock_failConnection(int code, std::string reason) STW_REQUIRES(_lock);
+    STWErrorRef _lock_connectionError() const STW_REQUIRES(_lock);
 
     const int _fd;
     std::thread _reader;
@@ -75,15 +76,16 @@ private:
     // ThreadSanitizer cannot follow.
     bool _waitToWrite(std::optional<Clock::time_point> deadline);
     void _doneWriting();
-    std::mutex _writeStateLock;
+    STWMutex _writeStateLock;
     std::condition_variable _writerDone;
-    bool _writing = false;
+    bool _writing STW_GUARDED_BY(_writeStateLock) = false;
 
-    mutable std::mutex _lock;
-    std::unordered_map<uint64_t, std::shared_ptr<Waiter>> _waiters;
-    uint64_t _nextID = 1;
-    int _failure = 0; // errno that ended the connection, 0 while it is up
-    std::string _failureReason;
-    size_t _activeCalls = 0;
+    // Guards the waiters (and what each holds), the ids and the connection's failure.
+    mutable STWMutex _lock;
+    std::unordered_map<uint64_t, std::shared_ptr<Waiter>> _waiters STW_GUARDED_BY(_lock);
+    uint64_t _nextID STW_GUARDED_BY(_lock) = 1;
+    int _failure STW_GUARDED_BY(_lock) = 0; // errno that ended the connection, 0 while it is up
+    std::string _failureReason STW_GUARDED_BY(_lock);
+    size_t _activeCalls STW_GUARDED_BY(_lock) = 0;
     std::condition_variable _callsDone;
 };

@@ -126,7 +126,7 @@ void STWClientRegistry::reload() {
         STW_LOG_ERROR(STWLogCategory::Tolvan, "Cannot read client registry %@: %s", _directory, ec.message());
     STW_LOG_INFO(STWLogCategory::Tolvan, "Client registry %@ holds %llu programs", _directory,
                  static_cast<uint64_t>(entries.size()));
-    std::unique_lock guard(_lock);
+    STWLockGuard guard(_lock);
     _lock_entriesByExecutable = std::move(entries);
 }
 
@@ -169,7 +169,7 @@ STWClientRegistryEntryRef STWClientRegistry::entryForExecutable(const std::files
                                                                 int executableFD, STWErrorRef* error) {
     STWClientRegistryEntryRef entry;
     {
-        std::shared_lock guard(_lock);
+        STWSharedLockGuard guard(_lock);
         auto it = _lock_entriesByExecutable.find(path.lexically_normal());
         if (it != _lock_entriesByExecutable.end())
             entry = it->second;
@@ -199,7 +199,7 @@ std::optional<std::string> STWClientRegistry::_digestOfExecutable(int fd, STWErr
     }
     DigestKey key{st.st_dev, st.st_ino, st.st_size, st.st_mtim.tv_sec, st.st_mtim.tv_nsec};
     {
-        std::lock_guard guard(_digestLock);
+        STWLockGuard guard(_digestLock);
         auto it = _digestLock_digests.find(key);
         if (it != _digestLock_digests.end())
             return it->second;
@@ -229,7 +229,7 @@ std::optional<std::string> STWClientRegistry::_digestOfExecutable(int fd, STWErr
     unsigned int digestLength = 0;
     EVP_DigestFinal_ex(context.get(), digest, &digestLength);
     std::string text = STWHexString(digest, digestLength);
-    std::lock_guard guard(_digestLock);
+    STWLockGuard guard(_digestLock);
     _digestLock_digests[key] = text;
     return text;
 }

@@ -9,6 +9,7 @@
 // declare its identity in a hello frame (STWPeerConnection::declaredIdentity).
 #pragma once
 
+#include "common/STWThreadSafety.h"
 #include "common/STWError.h"
 #include "common/STWValue.h"
 
@@ -66,13 +67,13 @@ private:
     std::optional<std::string> _digestOfExecutable(int fd, STWErrorRef* error);
 
     const std::filesystem::path _directory;
-    std::shared_mutex _lock;
-    std::map<std::filesystem::path, STWClientRegistryEntryRef> _lock_entriesByExecutable;
+    STWSharedMutex _lock;
+    std::map<std::filesystem::path, STWClientRegistryEntryRef> _lock_entriesByExecutable STW_GUARDED_BY(_lock);
     int _watchToken = -1;
 
     // Digests are costly; an executable keeps its digest while its inode, size and
     // modification time stay the same.
     using DigestKey = std::tuple<dev_t, ino_t, off_t, int64_t, int64_t>;
-    std::mutex _digestLock;
-    std::map<DigestKey, std::string> _digestLock_digests;
+    STWMutex _digestLock;
+    std::map<DigestKey, std::string> _digestLock_digests STW_GUARDED_BY(_digestLock);
 };

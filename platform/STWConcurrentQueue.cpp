@@ -20,14 +20,18 @@ uint64_t STWConcurrentQueue::_lock_submit(bool barrier) {
 }
 
 void STWConcurrentQueue::_waitForTurn(uint64_t ticket, bool barrier) {
-    std::unique_lock lock(_mutex);
+    STWUniqueLock lock(_mutex);
     if (barrier) {
         // The oldest item not yet started, with nothing running.
-        _changed.wait(lock, [&] { return *_pending.begin() == ticket && _running == 0 && !_barrierRunning; });
+        _changed.wait(lock.native(), [&] {
+            _mutex.assertHeld();
+            return *_pending.begin() == ticket && _running == 0 && !_barrierRunning;
+        });
         _pendingBarriers.erase(ticket);
         _barrierRunning = true;
     } else {
-        _changed.wait(lock, [&] {
+        _changed.wait(lock.native(), [&] {
+            _mutex.assertHeld();
             return !_barrierRunning && (_pendingBarriers.empty() || *_pendingBarriers.begin() > ticket);
         });
         ++_running;
@@ -38,7 +42,7 @@ void STWConcurrentQueue::_waitForTurn(uint64_t ticket, bool barrier) {
 }
 
 void STWConcurrentQueue::_finished(bool barrier) {
-    std::lock_guard guard(_mutex);
+    STWLockGuard guard(_mutex);
     if (barrier)
         _barrierRunning = false;
     else
@@ -49,7 +53,7 @@ void STWConcurrentQueue::_finished(bool barrier) {
 void STWConcurrentQueue::sync(const std::function<void()>& work) {
     uint64_t ticket;
     {
-        std::lock_guard guard(_mutex);
+        STWLockGuard guard(_mutex);
         ticket = _lock_submit(false);
     }
     _waitForTurn(ticket, false);
@@ -63,7 +67,7 @@ void STWConcurrentQueue::sync(const std::function<void()>& work) {
 void STWConcurrentQueue::asyncBarrier(std::function<void()> work) {
     uint64_t ticket;
     {
-        std::lock_guard guard(_mutex);
+        STWLockGuard guard(_mutex);
         ticket = _lock_submit(true);
     }
     std::thread([self = shared_from_this(), ticket, work = std::move(work)] {

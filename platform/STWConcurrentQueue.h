@@ -6,6 +6,8 @@
 // on a hot path uses this queue, so each barrier simply gets a thread of its own.
 #pragma once
 
+#include "common/STWThreadSafety.h"
+
 #include <condition_variable>
 #include <cstdint>
 #include <functional>
@@ -38,16 +40,16 @@ public:
 private:
     // Tickets are taken at submission, so the order of submission decides the order of
     // barriers and ordinary items, whichever thread gets to run first.
-    uint64_t _lock_submit(bool barrier);
+    uint64_t _lock_submit(bool barrier) STW_REQUIRES(_mutex);
     void _waitForTurn(uint64_t ticket, bool barrier);
     void _finished(bool barrier);
 
     const std::string _name;
-    std::mutex _mutex;
+    STWMutex _mutex;
     std::condition_variable _changed;
-    uint64_t _nextTicket = 0;
-    std::set<uint64_t> _pending;         // submitted, not started
-    std::set<uint64_t> _pendingBarriers; // the barriers among them
-    size_t _running = 0;                 // ordinary items running
-    bool _barrierRunning = false;
+    uint64_t _nextTicket STW_GUARDED_BY(_mutex) = 0;
+    std::set<uint64_t> _pending STW_GUARDED_BY(_mutex);         // submitted, not started
+    std::set<uint64_t> _pendingBarriers STW_GUARDED_BY(_mutex); // the barriers among them
+    size_t _running STW_GUARDED_BY(_mutex) = 0;                 // ordinary items running
+    bool _barrierRunning STW_GUARDED_BY(_mutex) = false;
 };

@@ -122,7 +122,7 @@ void STWQueue::async(std::function<void()> work) {
     bool holds = _attributes.holdsTransactions;
     if (holds)
         STWTransaction::begin();
-    std::lock_guard guard(_mutex);
+    STWLockGuard guard(_mutex);
     _items.push_back(Item{std::move(work), holds});
     if (!_draining && _suspendCount == 0)
         _lock_scheduleDrain();
@@ -151,7 +151,7 @@ void STWQueue::_drain() {
     for (int turn = 0;; ++turn) {
         Item item;
         {
-            std::lock_guard guard(_mutex);
+            STWLockGuard guard(_mutex);
             if (_suspendCount > 0 || _items.empty()) {
                 _draining = false;
                 return;
@@ -170,7 +170,7 @@ void STWQueue::_drain() {
 void STWQueue::sync(const std::function<void()>& work) {
     if (isCurrent())
         STW_FATAL("synchronous submission to queue %s from its own thread would deadlock", _name);
-    std::unique_lock lock(_mutex);
+    STWUniqueLock lock(_mutex);
     if (!_draining && _suspendCount == 0 && _items.empty()) {
         // Idle: run on the caller's thread, holding the queue as a drain would.
         _draining = true;
@@ -178,7 +178,7 @@ void STWQueue::sync(const std::function<void()>& work) {
         struct Release {
             STWQueue* queue;
             ~Release() {
-                std::lock_guard guard(queue->_mutex);
+                STWLockGuard guard(queue->_mutex);
                 queue->_draining = false;
                 if (!queue->_items.empty() && queue->_suspendCount == 0)
                     queue->_lock_scheduleDrain();
@@ -213,12 +213,12 @@ void STWQueue::sync(const std::function<void()>& work) {
 }
 
 void STWQueue::suspend() {
-    std::lock_guard guard(_mutex);
+    STWLockGuard guard(_mutex);
     ++_suspendCount;
 }
 
 void STWQueue::resume() {
-    std::lock_guard guard(_mutex);
+    STWLockGuard guard(_mutex);
     if (_suspendCount == 0)
         STW_FATAL("queue %s resumed more often than suspended", _name);
     if (--_suspendCount == 0 && !_draining && !_items.empty())
@@ -226,7 +226,7 @@ void STWQueue::resume() {
 }
 
 bool STWQueue::isSuspended() const {
-    std::lock_guard guard(_mutex);
+    STWLockGuard guard(_mutex);
     return _suspendCount > 0;
 }
 

@@ -7,6 +7,8 @@
 // is already running on would deadlock and is stopped as a programming error.
 #pragma once
 
+#include "common/STWThreadSafety.h"
+
 #include <condition_variable>
 #include <deque>
 #include <exception>
@@ -79,14 +81,14 @@ private:
         bool holdsTransaction;
     };
 
-    void _lock_scheduleDrain();
+    void _lock_scheduleDrain() STW_REQUIRES(_mutex);
     void _drain();
     void _runItem(Item& item);
 
     const std::string _name;
     const Attributes _attributes;
-    mutable std::mutex _mutex;
-    std::deque<Item> _items;
-    bool _draining = false;
-    unsigned _suspendCount = 0;
+    mutable STWMutex _mutex;
+    std::deque<Item> _items STW_GUARDED_BY(_mutex);
+    bool _draining STW_GUARDED_BY(_mutex) = false;
+    unsigned _suspendCount STW_GUARDED_BY(_mutex) = 0;
 };

@@ -11,21 +11,21 @@ void STWCommandQueue::insertCommand(STWCommandRef command) {
     uint64_t number = command->command();
     const void* address = command.get();
     {
-        std::lock_guard guard(_commandsLock);
+        STWLockGuard guard(_commandsLock);
         _commands.push_back(std::move(command));
     }
     STW_LOG_INFO(STWLogCategory::Unspecified, "Added command <%p; %llu> to queue", address, number);
 }
 
 size_t STWCommandQueue::count() const {
-    std::lock_guard guard(_commandsLock);
+    STWLockGuard guard(_commandsLock);
     return _commands.size();
 }
 
 bool STWCommandQueue::executeNextCommandWithError(uint64_t* error) {
     STWCommandRef command;
     {
-        std::lock_guard guard(_commandsLock);
+        STWLockGuard guard(_commandsLock);
         if (_commands.empty()) {
             *error = STWErrorCommandQueueExhausted;
             return false;

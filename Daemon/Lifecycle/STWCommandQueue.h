@@ -3,6 +3,7 @@
 // own connection.
 #pragma once
 
+#include "common/STWThreadSafety.h"
 #include "Daemon/Lifecycle/STWCommand.h"
 #include "platform/STWQueue.h"
 
@@ -30,6 +31,6 @@ public:
 
 private:
     std::shared_ptr<STWQueue> _queue;
-    mutable std::mutex _commandsLock;
-    std::deque<STWCommandRef> _commands;
+    mutable STWMutex _commandsLock;
+    std::deque<STWCommandRef> _commands STW_GUARDED_BY(_commandsLock);
 };

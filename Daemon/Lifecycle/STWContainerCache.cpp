@@ -87,6 +87,11 @@ bool STWContainerCache::_isWellKnownContainerName(const std::string& name, STWCo
     return STWWhitelist::sharedWhitelist()->containerIdIsWellknown(name, containerClass);
 }
 
+void STWContainerCache::CacheLock::assertHeld(const char* function) const {
+    if (_owner.load(std::memory_order_relaxed) != std::this_thread::get_id())
+        STW_FATAL("%s called without the container cache lock", function);
+}
+
 // MARK: - Class caches
 
 void STWContainerCache::_storeRecord(ClassCache& cache, STWMetadataRef record) {
@@ -173,8 +178,7 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
                                                                                 bool transient,
                                                                                 bool populateSandboxCache,
                                                                                 STWErrorRef* error) {
-    if (!_cacheLock.isHeldByCurrentThread())
-        STW_FATAL("%s called without the container cache lock", __func__);
+    _cacheLock.assertHeld(__func__);
 
     std::string key = classCacheKey(userIdentity, contentClass);
     auto& caches = transient ? _transientContainerCache : _liveContainerCache;
@@ -302,7 +306,7 @@ STWMetadataRef STWContainerCache::_containerForContainerIdentity(const STWContai
 
     STWMetadataRef record;
     {
-        std::lock_guard guard(_cacheLock);
+        STWLockGuard guard(_cacheLock);
         STWErrorRef underlying;
         ClassCache* cache = _lock_getCacheForUserIdentity(userIdentity, contentClass, transient, updateSandbox,
                                                           &underlying);
@@ -370,7 +374,7 @@ std::optional<std::vector<STWMetadataRef>> STWContainerCache::_allContainersForU
 
     std::vector<STWMetadataRef> records;
     {
-        std::lock_guard guard(_cacheLock);
+        STWLockGuard guard(_cacheLock);
         std::vector<ClassCache*> caches;
         std::unordered_set<ClassCache*> seen;
         STWErrorRef failure;
@@ -379,6 +383,7 @@ std::optional<std::vector<STWMetadataRef>> STWContainerCache::_allContainersForU
         auto collect = [&](const STWUserIdentityRef& identity) {
             if (failure)
                 return;
+            _cacheLock.assertHeld(__func__);
             STWErrorRef underlying;
             ClassCache* cache = _lock_getCacheForUserIdentity(identity, contentClass, transient, populateSandboxCache,
                                                               &underlying);
@@ -446,7 +451,7 @@ bool STWContainerCache::_addContainerMetadata(const STWMetadataRef& metadata, co
     std::string cacheName = classCacheKey(userIdentity, contentClass);
     bool shouldRegister = false;
     {
-        std::lock_guard guard(_cacheLock);
+        STWLockGuard guard(_cacheLock);
         STWErrorRef underlying;
         ClassCache* cache = _lock_getCacheForUserIdentity(userIdentity, contentClass, transient, true, &underlying);
         if (!cache) {
@@ -502,7 +507,7 @@ bool STWContainerCache::_removeContainerForUserIdentity(const STWUserIdentityRef
     bool shouldRegister;
     bool superseded = false;
     {
-        std::lock_guard guard(_cacheLock);
+        STWLockGuard guard(_cacheLock);
         STWErrorRef underlying;
         ClassCache* cache = _lock_getCacheForUserIdentity(userIdentity, contentClass, transient, true, &underlying);
         if (!cache) {
@@ -537,7 +542,7 @@ bool STWContainerCache::shouldRegisterSandboxMappingWithUserIdentity(const STWUs
                                                                      const std::string& identifier,
                                                                      STWContainerClass containerClass) {
     return STW_CACHE_GUARDED(nullptr, false, [&] {
-        std::lock_guard guard(_cacheLock);
+        STWLockGuard guard(_cacheLock);
         return _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier, containerClass);
     });
 }
@@ -545,8 +550,7 @@ bool STWContainerCache::shouldRegisterSandboxMappingWithUserIdentity(const STWUs
 bool STWContainerCache::_lock_shouldRegisterSandboxMappingWithUserIdentity(const STWUserIdentityRef& userIdentity,
                                                                            const std::string& identifier,
                                                                            STWContainerClass containerClass) {
-    if (!_cacheLock.isHeldByCurrentThread())
-        STW_FATAL("%s called without the container cache lock", __func__);
+    _cacheLock.assertHeld(__func__);
     if (!userIdentity)
         return false;
     bool shouldRegister;

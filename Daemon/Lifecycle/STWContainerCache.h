@@ -24,6 +24,7 @@
 #include "Daemon/Model/STWUserIdentity.h"
 #include "Daemon/Model/STWUserIdentityCache.h"
 #include "common/STWError.h"
+#include "common/STWThreadSafety.h"
 
 class STWQueue;
 
@@ -92,7 +93,7 @@ public:
                                                       const std::string& identifier, STWContainerClass containerClass);
     bool _lock_shouldRegisterSandboxMappingWithUserIdentity(const STWUserIdentityRef& userIdentity,
                                                             const std::string& identifier,
-                                                            STWContainerClass containerClass);
+                                                            STWContainerClass containerClass) STW_REQUIRES(_cacheLock);
 
     // Whether a directory entry may be a container of the class: its name is a UUID, or,
     // for system and system group containers, a well-known identifier.
@@ -132,19 +133,19 @@ private:
 
     // The non-recursive cache lock, with its owner recorded so that _lock_ methods can check
     // that their caller holds it.
-    class CacheLock {
+    class STW_CAPABILITY("mutex") CacheLock {
     public:
-        void lock() {
+        void lock() STW_ACQUIRE() {
             _mutex.lock();
             _owner.store(std::this_thread::get_id(), std::memory_order_relaxed);
         }
-        void unlock() {
+        void unlock() STW_RELEASE() {
             _owner.store(std::thread::id(), std::memory_order_relaxed);
             _mutex.unlock();
         }
-        bool isHeldByCurrentThread() const {
-            return _owner.load(std::memory_order_relaxed) == std::this_thread::get_id();
-        }
+        // Stops the process unless the calling thread holds the lock; tells the analysis
+        // that it does where it cannot see it (in a callback, say).
+        void assertHeld(const char* function) const STW_THREAD_ANNOTATION(assert_capability(this));
 
     private:
         std::mutex _mutex;
@@ -154,9 +155,9 @@ private:
     // The class cache, built from disk when missing; nullptr and the listing error when the
     // class directory cannot be listed (nothing is cached then).
     ClassCache* _lock_getCacheForUserIdentity(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass,
-                                              bool transient, bool populateSandboxCache, STWErrorRef* error);
+                                              bool transient, bool populateSandboxCache, STWErrorRef* error) STW_REQUIRES(_cacheLock);
     ClassCache* _lock_getCacheForUserIdentity(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass,
-                                              bool transient, STWErrorRef* error);
+                                              bool transient, STWErrorRef* error) STW_REQUIRES(_cacheLock);
 
     STWMetadataRef _containerForContainerIdentity(const STWContainerIdentityRef& identity, bool transient,
                                                   bool updateSandbox, STWErrorRef* error);
@@ -187,9 +188,9 @@ private:
 
     static void _storeRecord(ClassCache& cache, STWMetadataRef record);
 
-    std::unordered_map<std::string, ClassCache> _liveContainerCache;
-    std::unordered_map<std::string, ClassCache> _transientContainerCache;
     CacheLock _cacheLock;
+    std::unordered_map<std::string, ClassCache> _liveContainerCache STW_GUARDED_BY(_cacheLock);
+    std::unordered_map<std::string, ClassCache> _transientContainerCache STW_GUARDED_BY(_cacheLock);
     std::shared_ptr<STWUserIdentityCache> _userIdentityCache;
     // Runs the sandbox mapping pushes of rebuilds (see RebuildMappingPushes).
     std::shared_ptr<STWQueue> _rebuildMappingQueue;

@@ -98,11 +98,9 @@ void STWUserIdentityCache::_applyBaseUserIDRule(uid_t& uid, gid_t& gid) {
         mobileIDs(uid, gid);
 }
 
-std::unique_lock<std::mutex> STWUserIdentityCache::_lockValid() {
-    std::unique_lock lock(_lock);
+void STWUserIdentityCache::_lock_makeValid() {
     if (_cacheInvalid)
         _lock_resync();
-    return lock;
 }
 
 void STWUserIdentityCache::_lock_flush() {
@@ -228,12 +226,14 @@ STWUserIdentityRef STWUserIdentityCache::userIdentityForPersonalPersona() {
 
 STWUserIdentityRef STWUserIdentityCache::userIdentityForPersonalPersonaWithUID(uid_t uid, gid_t gid) {
     _applyBaseUserIDRule(uid, gid);
-    auto lock = _lockValid();
+    STWUniqueLock lock(_lock);
+    _lock_makeValid();
     return _lock_identityWithIDs(_lock_userIdentityForPersonalPersona, uid, gid);
 }
 
 STWUserIdentityRef STWUserIdentityCache::unspecificUserIdentity() {
-    auto lock = _lockValid();
+    STWUniqueLock lock(_lock);
+    _lock_makeValid();
     return _lock_userIdentityForUnspecificPersona;
 }
 
@@ -241,7 +241,8 @@ STWUserIdentityRef STWUserIdentityCache::userIdentityForCurrentUserWithPersonaUn
     const std::optional<std::string>& unique) {
     if (!personasAreSupported())
         return userIdentityForPersonalPersona();
-    auto lock = _lockValid();
+    STWUniqueLock lock(_lock);
+    _lock_makeValid();
     if (!unique)
         return _lock_userIdentityForUnspecificPersona;
     auto it = _lock_personaUniqueStringToUserIdentityMap.find(*unique);
@@ -253,7 +254,8 @@ STWUserIdentityRef STWUserIdentityCache::userIdentityForPersonaUniqueString(cons
     _applyBaseUserIDRule(uid, gid);
     if (!personasAreSupported())
         return userIdentityForPersonalPersonaWithUID(uid, gid);
-    auto lock = _lockValid();
+    STWUniqueLock lock(_lock);
+    _lock_makeValid();
     STWUserIdentityRef identity;
     if (!unique) {
         identity = _lock_userIdentityForUnspecificPersona;
@@ -265,13 +267,15 @@ STWUserIdentityRef STWUserIdentityCache::userIdentityForPersonaUniqueString(cons
 }
 
 STWUserIdentityRef STWUserIdentityCache::userIdentityWithPersonaID(uint32_t personaID) {
-    auto lock = _lockValid();
+    STWUniqueLock lock(_lock);
+    _lock_makeValid();
     auto it = _lock_personaIDToUserIdentityMap.find(personaID);
     return it == _lock_personaIDToUserIdentityMap.end() ? nullptr : it->second;
 }
 
 STWUserIdentitySet STWUserIdentityCache::userIdentitiesForBundleIdentifier(const std::string& bundleIdentifier) {
-    auto lock = _lockValid();
+    STWUniqueLock lock(_lock);
+    _lock_makeValid();
     auto it = _lock_bundleToEnterpriseIdentitiesMap.find(bundleIdentifier);
     if (it != _lock_bundleToEnterpriseIdentitiesMap.end())
         return it->second;
@@ -328,7 +332,8 @@ void STWUserIdentityCache::forEachAccessibleUserIdentitySynchronouslyExecuteBloc
     }
     STWUserIdentitySet distinct;
     {
-        auto lock = _lockValid();
+        STWUniqueLock lock(_lock);
+        _lock_makeValid();
         for (const auto& [unique, identity] : _lock_personaUniqueStringToUserIdentityMap)
             distinct.insert(identity);
         if (distinct.empty())
@@ -345,12 +350,12 @@ void STWUserIdentityCache::forEachAccessibleUserIdentitySynchronouslyExecuteBloc
 }
 
 void STWUserIdentityCache::flush() {
-    std::lock_guard guard(_lock);
+    STWLockGuard guard(_lock);
     _lock_flush();
 }
 
 void STWUserIdentityCache::flushAndRepopulateWithUserIdentities(const std::vector<STWUserIdentityRef>& identities) {
-    std::lock_guard guard(_lock);
+    STWLockGuard guard(_lock);
     STWUserIdentityRef personal, unspecific;
     for (const STWUserIdentityRef& identity : identities) {
         if (!identity)
@@ -403,12 +408,12 @@ std::string STWUserIdentityCache::description() const {
 bool STWUserIdentityCache::isRegistered() const { return _registered; }
 
 bool STWUserIdentityCache::cacheInvalid() {
-    std::lock_guard guard(_lock);
+    STWLockGuard guard(_lock);
     return _cacheInvalid;
 }
 
 void STWUserIdentityCache::setCacheInvalid(bool invalid) {
-    std::lock_guard guard(_lock);
+    STWLockGuard guard(_lock);
     _cacheInvalid = invalid;
 }
 

@@ -6,6 +6,7 @@
 // request or a stored file means. The process-wide instance is STWUserIdentitySharedCache.
 #pragma once
 
+#include "common/STWThreadSafety.h"
 #include "Daemon/Model/STWUserIdentity.h"
 #include "platform/STWPersonaService.h"
 #include "platform/STWQueue.h"
@@ -72,25 +73,28 @@ protected:
     virtual const char* _className() const { return "STWUserIdentityCache"; }
 
 private:
-    void _lock_flush();
-    void _lock_resync();
-    bool _lock_resync_fromUserPersonaAttributes(const std::vector<STWPersonaRecord>& personas);
-    // Takes the lock, rebuilding first when the cache is invalid.
-    std::unique_lock<std::mutex> _lockValid();
+    void _lock_flush() STW_REQUIRES(_lock);
+    void _lock_resync() STW_REQUIRES(_lock);
+    bool _lock_resync_fromUserPersonaAttributes(const std::vector<STWPersonaRecord>& personas) STW_REQUIRES(_lock);
+    // Rebuilds the cache when it is invalid.
+    void _lock_makeValid() STW_REQUIRES(_lock);
     // The base user id rule: role users stand for the mobile user.
     static void _applyBaseUserIDRule(uid_t& uid, gid_t& gid);
-    STWUserIdentityRef _lock_identityWithIDs(const STWUserIdentityRef& identity, uid_t uid, gid_t gid);
+    STWUserIdentityRef _lock_identityWithIDs(const STWUserIdentityRef& identity, uid_t uid, gid_t gid)
+        STW_REQUIRES(_lock);
 
-    std::mutex _lock;
+    // Taken after the container cache's lock, never before it (see architecture.md).
+    STWMutex _lock;
     std::shared_ptr<STWQueue> _flushQueue;
     std::atomic<bool> _registered{false};
     // The service this cache registered with and the registration's token (-1: none).
     std::shared_ptr<STWPersonaService> _personaService;
     std::atomic<int> _registrationToken{-1};
-    bool _cacheInvalid = true;
-    std::unordered_map<std::string, STWUserIdentitySet> _lock_bundleToEnterpriseIdentitiesMap;
-    std::unordered_map<std::string, STWUserIdentityRef> _lock_personaUniqueStringToUserIdentityMap;
-    std::unordered_map<uint32_t, STWUserIdentityRef> _lock_personaIDToUserIdentityMap;
-    STWUserIdentityRef _lock_userIdentityForPersonalPersona;
-    STWUserIdentityRef _lock_userIdentityForUnspecificPersona;
+    bool _cacheInvalid STW_GUARDED_BY(_lock) = true;
+    std::unordered_map<std::string, STWUserIdentitySet> _lock_bundleToEnterpriseIdentitiesMap STW_GUARDED_BY(_lock);
+    std::unordered_map<std::string, STWUserIdentityRef> _lock_personaUniqueStringToUserIdentityMap
+        STW_GUARDED_BY(_lock);
+    std::unordered_map<uint32_t, STWUserIdentityRef> _lock_personaIDToUserIdentityMap STW_GUARDED_BY(_lock);
+    STWUserIdentityRef _lock_userIdentityForPersonalPersona STW_GUARDED_BY(_lock);
+    STWUserIdentityRef _lock_userIdentityForUnspecificPersona STW_GUARDED_BY(_lock);
 };

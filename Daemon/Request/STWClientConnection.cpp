@@ -48,22 +48,15 @@ bool STWClientConnection::isEntitledForLookupWithClass(STWContainerClass contain
 
 std::optional<STWClientConnection::StringSet> STWClientConnection::_lookupForContainerClass(STWContainerClass containerClass) {
     std::string_view word = STWContainerClassLookupWord(containerClass);
-    std::shared_ptr<std::map<std::string, StringSet, std::less<>>> sanitized;
-    {
-        std::lock_guard guard(_lock);
-        if (word.empty() || !_lookup)
-            return std::nullopt;
-        if (!_sanitizedLookup)
-            _sanitizedLookup = std::make_shared<std::map<std::string, StringSet, std::less<>>>();
-        sanitized = _sanitizedLookup;
-    }
-    std::lock_guard guard(_sanitizedLookupLock);
-    auto it = sanitized->find(word);
-    if (it == sanitized->end()) {
+    if (word.empty() || !_lookup)
+        return std::nullopt;
+    STWLockGuard guard(_lock);
+    auto it = _sanitizedLookup.find(word);
+    if (it == _sanitizedLookup.end()) {
         // A value that is not an array (a lone string, a number) allows nothing.
         const STWValue* value = STWDictionaryFind(*_lookup, word);
         StringSet identifiers = value && value->array() ? _setOfStringsFromArray(*value->array()) : StringSet();
-        it = sanitized->emplace(std::string(word), std::move(identifiers)).first;
+        it = _sanitizedLookup.emplace(std::string(word), std::move(identifiers)).first;
     }
     return it->second;
 }
@@ -83,17 +76,17 @@ std::optional<std::string> STWClientConnection::clientBundleIdentifier() const {
 }
 
 void STWClientConnection::setClientBundleIdentifier(std::optional<std::string> identifier) {
-    std::lock_guard guard(_lock);
+    STWLockGuard guard(_lock);
     _clientBundleIdentifier = std::move(identifier);
 }
 
 std::optional<STWValue::Array> STWClientConnection::entitledWipeIdentifiers() const {
-    std::lock_guard guard(_lock);
+    STWLockGuard guard(_lock);
     return _entitledWipeIdentifiers;
 }
 
 void STWClientConnection::setEntitledWipeIdentifiers(std::optional<STWValue::Array> identifiers) {
-    std::lock_guard guard(_lock);
+    STWLockGuard guard(_lock);
     _entitledWipeIdentifiers = std::move(identifiers);
 }
 

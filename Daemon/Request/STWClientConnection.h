@@ -12,6 +12,7 @@
 #include "Daemon/Model/STWMetadata.h"
 #include "Daemon/Model/STWUserIdentityCache.h"
 #include "Daemon/Request/STWClientIdentity.h"
+#include "common/STWThreadSafety.h"
 #include "common/STWValue.h"
 #include "platform/STWQueue.h"
 
@@ -132,9 +133,9 @@ private:
         }
     }
 
-    mutable std::mutex _lock; // guards the settable strings and the creation of _sanitizedLookup
-    std::shared_ptr<std::map<std::string, StringSet, std::less<>>> _sanitizedLookup;
-    std::mutex _sanitizedLookupLock;
+    mutable STWMutex _lock;
+    // The lookup entitlement's identifiers by class word, sanitised on first use.
+    std::map<std::string, StringSet, std::less<>> _sanitizedLookup STW_GUARDED_BY(_lock);
     std::shared_ptr<STWQueue> _backgroundQueue;
     std::atomic<bool> _entitled;
     std::atomic<bool> _allowOtherIdLookup;
@@ -142,8 +143,8 @@ private:
     std::atomic<bool> _unrestricted;
     STWClientIdentityRef _clientIdentity;
     std::shared_ptr<STWCommandQueue> _commandQueue;
-    std::optional<std::string> _clientBundleIdentifier;
-    std::optional<STWValue::Array> _entitledWipeIdentifiers;
+    std::optional<std::string> _clientBundleIdentifier STW_GUARDED_BY(_lock);
+    std::optional<STWValue::Array> _entitledWipeIdentifiers STW_GUARDED_BY(_lock);
     std::optional<STWValue::Dictionary> _lookup;
     std::shared_ptr<STWUserIdentityCache> _userIdentityCache;
 };
