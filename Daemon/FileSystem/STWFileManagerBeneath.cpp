@@ -1,7 +1,8 @@
-// The file layer below directories that someone else owns: opening beneath a directory
-// descriptor, making directories component by component, publishing a staged directory,
-// and replacing a file of the daemon's own. See "Below a directory someone else owns" in
-// STWFileManager.h.
+// Descriptor-relative operations below directories that someone else owns.
+//
+// Opening beneath a directory descriptor, making directories component by component,
+// publishing a staged directory, and replacing a file of the daemon's own. See "Below a
+// directory someone else owns" in STWFileManager.h.
 #include "Daemon/FileSystem/STWFileManager.h"
 
 #include "Daemon/FileSystem/STWFileSystemPrimitives.h"
@@ -28,11 +29,6 @@ namespace {
 constexpr int kSwapRetries = 8;
 
 bool sameItem(const struct stat& a, const struct stat& b) { return a.st_dev == b.st_dev && a.st_ino == b.st_ino; }
-
-std::string parentOf(const fs::path& path) {
-    fs::path parent = path.parent_path();
-    return parent.empty() ? std::string(".") : parent.native();
-}
 
 // Opens the directory `name` of `at`, making it first when missing. A link in its place is
 // removed (never followed) and the step tried again. 0 or the errno.
@@ -225,9 +221,9 @@ bool STWFileManager::moveDirectoryAt(int fromfd, const std::string& name, int to
     }
     if (!durable)
         return true;
-    e = syncDescriptor(tofd, parentOf(to));
-    if (!e && parentOf(to) != parentOf(from))
-        e = syncDescriptor(fromfd, parentOf(from));
+    e = syncDescriptor(tofd, parentPath(to));
+    if (!e && parentPath(to) != parentPath(from))
+        e = syncDescriptor(fromfd, parentPath(from));
     if (e) {
         STWSetError(error, STW_POSIX_ERROR(e, "Failed to sync the directories of %@ after moving it from %@: %s", to,
                                            from, strerror(e)));
@@ -287,7 +283,7 @@ bool STWFileManager::replaceFileAt(int dirfd, TemporaryFile& file, const std::st
         return false;
     }
     struct stat st;
-    e = fstat(file.fd.get(), &st) != 0 ? errno : syncDescriptor(dirfd, parentOf(path));
+    e = fstat(file.fd.get(), &st) != 0 ? errno : syncDescriptor(dirfd, parentPath(path));
     if (e) {
         STWSetError(error, STW_POSIX_ERROR(e, "Failed to sync the directory of %@: %s", path, strerror(e)));
         return false;
