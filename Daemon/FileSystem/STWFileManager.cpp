@@ -40,7 +40,7 @@ namespace {
 
 // The make-path routine: 0, EEXIST when the directory was there, or the errno.
 int makePath(const std::string& path, mode_t mode) {
-    if (mkdir(path.c_str(), mode) == 0)
+    if (disk::mkdirat(AT_FDCWD, path.c_str(), mode) == 0)
         return 0;
     int e = errno;
     if (e == EEXIST) {
@@ -55,7 +55,7 @@ int makePath(const std::string& path, mode_t mode) {
     e = makePath(parent, mode | S_IWUSR | S_IXUSR);
     if (e && e != EEXIST)
         return e;
-    if (mkdir(path.c_str(), mode) == 0)
+    if (disk::mkdirat(AT_FDCWD, path.c_str(), mode) == 0)
         return 0;
     e = errno;
     if (e == EEXIST) { // made by someone else meanwhile
@@ -76,7 +76,7 @@ bool STWFileManager::createDirectoryAtURL(const fs::path& url, bool withIntermed
             STWSetError(error, STW_POSIX_ERROR(e, "mkpath_np of %s failed: %s", path, strerror(e)));
             return false;
         }
-    } else if (mkdir(path.c_str(), mode) != 0) {
+    } else if (disk::mkdirat(AT_FDCWD, path.c_str(), mode) != 0) {
         int e = errno;
         struct stat st;
         if (e == EEXIST && !(stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode)))
@@ -113,7 +113,7 @@ std::optional<fs::path> STWFileManager::createTemporaryDirectoryInDirectoryURL(c
     // mkdtemp() leaves its last attempt in the buffer when it fails; the error names the
     // template that was asked for.
     std::string path = templ;
-    if (!mkdtemp(path.data())) {
+    if (!disk::mkdtemp(path.data())) {
         int e = errno;
         STWSetError(error, STW_POSIX_ERROR(e, "Failed to create temp dir at path %s : %s", templ, strerror(e)));
         return std::nullopt;

@@ -42,8 +42,8 @@ int copyExtendedAttributes(int sourceFd, int destinationFd, const std::string& s
         return byPath ? lgetxattr(sourcePath.c_str(), name, buffer, size) : fgetxattr(sourceFd, name, buffer, size);
     };
     auto set = [&](const char* name, const void* value, size_t size) {
-        return byPath ? lsetxattr(destinationPath.c_str(), name, value, size, 0)
-                      : fsetxattr(destinationFd, name, value, size, 0);
+        return byPath ? disk::lsetxattr(destinationPath.c_str(), name, value, size, 0)
+                      : disk::fsetxattr(destinationFd, name, value, size, 0);
     };
     std::vector<char> names;
     for (;;) {
@@ -96,7 +96,8 @@ int copyACLs(int sourceFd, int destinationFd, bool isDirectory) {
         acl_t acl = acl_get_fd(sourceFd);
         if (!acl)
             return errno;
-        int e = acl_set_fd(destinationFd, acl) == 0 ? 0 : errno;
+        bool set = !disk::injected(STWFaultPoint::SetAttribute) && acl_set_fd(destinationFd, acl) == 0;
+        int e = set ? 0 : errno;
         acl_free(acl);
         if (e && !ignorableAttributeError(e))
             return e;
@@ -115,7 +116,7 @@ int copyACLs(int sourceFd, int destinationFd, bool isDirectory) {
     }
     if (size < 0)
         return errno == ENODATA || ignorableAttributeError(errno) ? 0 : errno;
-    if (fsetxattr(destinationFd, kDefaultACLAttribute, value.data(), static_cast<size_t>(size), 0) != 0 &&
+    if (disk::fsetxattr(destinationFd, kDefaultACLAttribute, value.data(), static_cast<size_t>(size), 0) != 0 &&
         !ignorableAttributeError(errno))
         return errno;
     return 0;
@@ -129,10 +130,10 @@ int copyOwner(int e) {
 // Ownership before mode (chown clears set-id bits), attributes after chown (it clears file
 // capabilities), ACLs last (on Linux their mask is the group bits of the mode).
 int copyMetadata(int sourceFd, int destinationFd, const struct stat& st, bool isDirectory) {
-    if (fchown(destinationFd, st.st_uid, st.st_gid) != 0)
+    if (disk::fchown(destinationFd, st.st_uid, st.st_gid) != 0)
         if (int e = copyOwner(errno))
             return e;
-    if (fchmod(destinationFd, st.st_mode & 07777) != 0)
+    if (disk::fchmod(destinationFd, st.st_mode & 07777) != 0)
         return errno;
     if (int e = copyExtendedAttributes(sourceFd, destinationFd, {}, {}))
         return e;
@@ -140,6 +141,8 @@ int copyMetadata(int sourceFd, int destinationFd, const struct stat& st, bool is
 }
 
 int copyData(int sourceFd, int destinationFd) {
+    if (int e = STWFaultInjection::check(STWFaultPoint::Write))
+        return e;
     if (ioctl(destinationFd, FICLONE, sourceFd) == 0)
         return 0;
     bool copiedAny = false;
@@ -189,8 +192,8 @@ int copyRegularFile(int sourceDirfd, const std::string& sourceName, int destinat
         return errno;
     if (!S_ISREG(st.st_mode))
         return EAGAIN; // replaced since it was examined
-    STWFileDescriptor out(openat(destinationDirfd, destinationName.c_str(),
-                                 O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_NOCTTY | O_CLOEXEC, 0600));
+    int flags = O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_NOCTTY | O_CLOEXEC;
+    STWFileDescriptor out(disk::openat(destinationDirfd, destinationName.c_str(), flags, 0600));
     if (!out)
         return errno;
     if (int e = copyData(in.get(), out.get()))
@@ -212,18 +215,19 @@ int copyLink(int sourceDirfd, const std::string& sourceDirectory, const std::str
         }
         target.resize(target.size() * 2);
     }
-    if (symlinkat(target.c_str(), destinationDirfd, destinationName.c_str()) != 0) {
+    if (disk::symlinkat(target.c_str(), destinationDirfd, destinationName.c_str()) != 0) {
         if (errno != EEXIST)
             return errno;
         struct stat existing;
         if (fstatat(destinationDirfd, destinationName.c_str(), &existing, AT_SYMLINK_NOFOLLOW) == 0 &&
             S_ISDIR(existing.st_mode))
             return EEXIST;
-        if (unlinkat(destinationDirfd, destinationName.c_str(), 0) != 0 ||
-            symlinkat(target.c_str(), destinationDirfd, destinationName.c_str()) != 0)
+        if (disk::unlinkat(destinationDirfd, destinationName.c_str(), 0) != 0 ||
+            disk::symlinkat(target.c_str(), destinationDirfd, destinationName.c_str()) != 0)
             return errno;
     }
-    if (fchownat(destinationDirfd, destinationName.c_str(), st.st_uid, st.st_gid, AT_SYMLINK_NOFOLLOW) != 0)
+    if (disk::fchownat(destinationDirfd, destinationName.c_str(), st.st_uid, st.st_gid,
+                       AT_SYMLINK_NOFOLLOW) != 0)
         if (int e = copyOwner(errno))
             return e;
     return copyExtendedAttributes(-1, -1, joinPath(sourceDirectory, sourceName),
@@ -233,13 +237,16 @@ int copyLink(int sourceDirfd, const std::string& sourceDirectory, const std::str
 int copySpecialFile(const std::string& sourceDirectory, const std::string& sourceName, const struct stat& st,
                     int destinationDirfd, const std::string& destinationDirectory,
                     const std::string& destinationName) {
-    if (mknodat(destinationDirfd, destinationName.c_str(), st.st_mode & (S_IFMT | 0600), st.st_rdev) != 0)
+    if (disk::mknodat(destinationDirfd, destinationName.c_str(), st.st_mode & (S_IFMT | 0600),
+                      st.st_rdev) != 0)
         return errno;
-    if (fchownat(destinationDirfd, destinationName.c_str(), st.st_uid, st.st_gid, AT_SYMLINK_NOFOLLOW) != 0)
+    if (disk::fchownat(destinationDirfd, destinationName.c_str(), st.st_uid, st.st_gid,
+                       AT_SYMLINK_NOFOLLOW) != 0)
         if (int e = copyOwner(errno))
             return e;
     // AT_SYMLINK_NOFOLLOW: a link swapped in for the new node must not have its target chmodded.
-    if (fchmodat(destinationDirfd, destinationName.c_str(), st.st_mode & 07777, AT_SYMLINK_NOFOLLOW) != 0)
+    if (disk::fchmodat(destinationDirfd, destinationName.c_str(), st.st_mode & 07777,
+                       AT_SYMLINK_NOFOLLOW) != 0)
         return errno;
     return copyExtendedAttributes(-1, -1, joinPath(sourceDirectory, sourceName),
                                   joinPath(destinationDirectory, destinationName));
@@ -257,7 +264,7 @@ int copyItem(int sourceDirfd, const std::string& sourceDirectory, const std::str
                         destinationName);
     case S_IFDIR:
         // Private until its contents and metadata are in place.
-        if (mkdirat(destinationDirfd, destinationName.c_str(), 0700) != 0 && errno != EEXIST)
+        if (disk::mkdirat(destinationDirfd, destinationName.c_str(), 0700) != 0 && errno != EEXIST)
             return errno;
         return 0;
     default:
@@ -340,7 +347,7 @@ int copyTree(const std::string& source, const std::string& destination) {
     STWFileDescriptor sourceFd(open(source.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
     if (!sourceFd)
         return errno;
-    if (mkdir(destination.c_str(), 0700) != 0 && errno != EEXIST)
+    if (disk::mkdirat(AT_FDCWD, destination.c_str(), 0700) != 0 && errno != EEXIST)
         return errno;
     int destinationFd = open(destination.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
     if (destinationFd < 0)
@@ -418,7 +425,7 @@ bool STWFileManager::_moveItemAtURL(const fs::path& url, const fs::path& toURL, 
             return false;
         }
     }
-    if (rename(source.c_str(), destination.c_str()) == 0) {
+    if (disk::renameat(AT_FDCWD, source.c_str(), AT_FDCWD, destination.c_str()) == 0) {
         if (!durable)
             return true;
         std::string from = parentPath(source), to = parentPath(destination);

@@ -37,7 +37,7 @@ public:
         if (entry.type == DT_DIR)
             return true;
         // The entry type spares a stat: unlinking a directory answers EISDIR.
-        if (unlinkat(dirfd, entry.name.c_str(), 0) == 0)
+        if (disk::unlinkat(dirfd, entry.name.c_str(), 0) == 0)
             return false;
         int e = errno;
         if (e == EISDIR)
@@ -48,16 +48,16 @@ public:
     void openFailed(int dirfd, const std::string& directoryPath, const std::string& name, int e) override {
         if (e == ENOTDIR || e == ELOOP) {
             // Replaced by a link or a file since it was listed: remove that instead.
-            if (unlinkat(dirfd, name.c_str(), 0) == 0)
+            if (disk::unlinkat(dirfd, name.c_str(), 0) == 0)
                 return;
             e = errno;
-        } else if (e != ENOENT && unlinkat(dirfd, name.c_str(), AT_REMOVEDIR) == 0) {
+        } else if (e != ENOENT && disk::unlinkat(dirfd, name.c_str(), AT_REMOVEDIR) == 0) {
             return; // an empty directory we may not read can still go
         }
         itemFailed(dirfd, directoryPath, name, e);
     }
     void leaveDirectory(int dirfd, const std::string& directoryPath, const std::string& name, int) override {
-        if (unlinkat(dirfd, name.c_str(), AT_REMOVEDIR) != 0)
+        if (disk::unlinkat(dirfd, name.c_str(), AT_REMOVEDIR) != 0)
             itemFailed(dirfd, directoryPath, name, errno);
     }
     void readFailed(const std::string& path, int e) override { itemFailed(AT_FDCWD, "", path, e); }
@@ -87,7 +87,7 @@ private:
         }
         fd.reset();
         STW_LOG_NOTICE(STWLogCategory::FS, "Unset UF_IMMUTABLE on %s", path);
-        if (unlinkat(dirfd, name.c_str(), S_ISDIR(st.st_mode) ? AT_REMOVEDIR : 0) != 0) {
+        if (disk::unlinkat(dirfd, name.c_str(), S_ISDIR(st.st_mode) ? AT_REMOVEDIR : 0) != 0) {
             STW_LOG_ERROR(STWLogCategory::FS, "unlink of %s failed: %s", path, strerror(errno));
             return false;
         }
@@ -102,7 +102,7 @@ int removeTree(const std::string& path, RemovalContext& context) {
     if (lstat(path.c_str(), &st) != 0)
         return errno;
     if (!S_ISDIR(st.st_mode)) {
-        if (unlink(path.c_str()) != 0)
+        if (disk::unlinkat(AT_FDCWD, path.c_str(), 0) != 0)
             context.itemFailed(AT_FDCWD, "", path, errno);
         return 0;
     }
@@ -113,7 +113,7 @@ int removeTree(const std::string& path, RemovalContext& context) {
     }
     STWDirectoryWalker().walk(fd.get(), path, context);
     fd.reset();
-    if (rmdir(path.c_str()) != 0)
+    if (disk::unlinkat(AT_FDCWD, path.c_str(), AT_REMOVEDIR) != 0)
         context.itemFailed(AT_FDCWD, "", path, errno);
     return 0;
 }

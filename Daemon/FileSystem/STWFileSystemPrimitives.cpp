@@ -124,11 +124,15 @@ private:
 } // namespace
 
 int syncDescriptor(int fd, const std::string& path) {
+    if (int e = STWFaultInjection::check(STWFaultPoint::Sync))
+        return e;
     noteSync(path);
     return fsync(fd) == 0 ? 0 : errno;
 }
 
 int syncDirectoryAtPath(const std::string& path) {
+    if (int e = STWFaultInjection::check(STWFaultPoint::Sync))
+        return e;
     noteSync(path);
     return STWSyncDirectory(path);
 }
@@ -194,7 +198,7 @@ int writeProtectionClass(int fd, int32_t dataProtectionClass) {
     uint32_t value = static_cast<uint32_t>(dataProtectionClass);
     unsigned char bytes[4] = {static_cast<unsigned char>(value), static_cast<unsigned char>(value >> 8),
                               static_cast<unsigned char>(value >> 16), static_cast<unsigned char>(value >> 24)};
-    return fsetxattr(fd, kProtectionClassAttribute, bytes, sizeof bytes, 0) == 0 ? 0 : errno;
+    return disk::fsetxattr(fd, kProtectionClassAttribute, bytes, sizeof bytes, 0) == 0 ? 0 : errno;
 }
 
 int setUserImmutable(int fd, bool immutable) {
@@ -204,6 +208,8 @@ int setUserImmutable(int fd, bool immutable) {
     int wanted = immutable ? (flags | FS_IMMUTABLE_FL) : (flags & ~FS_IMMUTABLE_FL);
     if (wanted == flags)
         return 0;
+    if (int e = STWFaultInjection::check(STWFaultPoint::SetFlags))
+        return e;
     return ioctl(fd, FS_IOC_SETFLAGS, &wanted) == 0 ? 0 : errno;
 }
 
@@ -225,7 +231,7 @@ bool setOwnerAndClassOfDirectory(int fd, uid_t owner, int32_t dataProtectionClas
                                           strerror(e)));
         return false;
     }
-    if (owner != STWFileManagerOwnerUnchanged && fchown(fd, owner, owner) != 0) {
+    if (owner != STWFileManagerOwnerUnchanged && disk::fchown(fd, owner, owner) != 0) {
         e = errno;
         STWSetError(error, STWErrorCreate(STWPOSIXErrorDomain, e, function, __LINE__, nullptr, true,
                                           "Failed to chown(%d,%d) %s: %s", owner, owner, path, strerror(e)));
