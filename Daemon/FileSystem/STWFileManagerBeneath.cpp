@@ -1,7 +1,8 @@
-// The file layer below directories that someone else owns: opening beneath a directory
-// descriptor, making directories component by component, publishing a staged directory,
-// and replacing a file of the daemon's own. See "Below a directory someone else owns" in
-// STWFileManager.h.
+// Descriptor-relative operations below directories that someone else owns.
+//
+// Opening beneath a directory descriptor, making directories component by component,
+// publishing a staged directory, and replacing a file of the daemon's own. See "Below a
+// directory someone else owns" in STWFileManager.h.
 #include "Daemon/FileSystem/STWFileManager.h"
 
 #include "Daemon/FileSystem/STWFileSystemPrimitives.h"
@@ -29,16 +30,11 @@ constexpr int kSwapRetries = 8;
 
 bool sameItem(const struct stat& a, const struct stat& b) { return a.st_dev == b.st_dev && a.st_ino == b.st_ino; }
 
-std::string parentOf(const fs::path& path) {
-    fs::path parent = path.parent_path();
-    return parent.empty() ? std::string(".") : parent.native();
-}
-
 // Opens the directory `name` of `at`, making it first when missing. A link in its place is
 // removed (never followed) and the step tried again. 0 or the errno.
 int openOrMakeDirectory(int at, const std::string& name, mode_t mode, const std::string& path, STWFileDescriptor* out) {
     for (int attempt = 0; attempt < kSwapRetries; ++attempt) {
-        if (mkdirat(at, name.c_str(), mode) != 0 && errno != EEXIST)
+        if (disk::mkdirat(at, name.c_str(), mode) != 0 && errno != EEXIST)
             return errno;
         int fd = openat(at, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
         if (fd >= 0) {
@@ -62,7 +58,7 @@ int openOrMakeDirectory(int at, const std::string& name, mode_t mode, const std:
             return ENOTDIR;
         STW_LOG_NOTICE(STWLogCategory::FS, "Removing the symbolic link found in place of directory %s", path);
         // A directory swapped back in meanwhile answers EISDIR and stays.
-        if (unlinkat(at, name.c_str(), 0) != 0 && errno != ENOENT && errno != EISDIR)
+        if (disk::unlinkat(at, name.c_str(), 0) != 0 && errno != ENOENT && errno != EISDIR)
             return errno;
     }
     return ELOOP;
@@ -81,7 +77,9 @@ STWFileDescriptor STWFileManager::openBeneath(int dirfd, const std::string& rela
     how.resolve = RESOLVE_BENEATH | RESOLVE_NO_MAGICLINKS |
                   ((options & STWOpenBeneathNoSymlinks) ? RESOLVE_NO_SYMLINKS : 0);
     for (int attempt = 0;; ++attempt) {
-        long fd = syscall(SYS_openat2, dirfd, path.c_str(), &how, sizeof how);
+        long fd = (flags & O_CREAT) && disk::injected(STWFaultPoint::Create)
+                      ? -1
+                      : syscall(SYS_openat2, dirfd, path.c_str(), &how, sizeof how);
         if (fd >= 0)
             return STWFileDescriptor(static_cast<int>(fd));
         int e = errno;
@@ -118,7 +116,7 @@ STWFileDescriptor STWFileManager::_openBeneathByComponents(int dirfd, const fs::
             components.push_back(component);
     }
     if (components.empty()) {
-        int fd = openat(dirfd, ".", flags | O_CLOEXEC, mode);
+        int fd = disk::openat(dirfd, ".", flags | O_CLOEXEC, mode);
         return fd < 0 ? fail(errno, __LINE__) : STWFileDescriptor(fd);
     }
     STWFileDescriptor current;
@@ -137,7 +135,7 @@ STWFileDescriptor STWFileManager::_openBeneathByComponents(int dirfd, const fs::
         current.reset(fd);
         at = fd;
     }
-    int fd = openat(at, components.back().c_str(), flags | O_NOFOLLOW | O_CLOEXEC, mode);
+    int fd = disk::openat(at, components.back().c_str(), flags | O_NOFOLLOW | O_CLOEXEC, mode);
     return fd < 0 ? fail(errno, __LINE__) : STWFileDescriptor(fd);
 }
 
@@ -179,7 +177,7 @@ STWFileDescriptor STWFileManager::createDirectoryBeneath(int dirfd, const fs::pa
 STWFileDescriptor STWFileManager::createNewDirectoryAt(int dirfd, const std::string& name, mode_t mode, uid_t owner,
                                                        int32_t dataProtectionClass, const fs::path& path,
                                                        STWErrorRef* error) const {
-    if (mkdirat(dirfd, name.c_str(), mode) != 0) {
+    if (disk::mkdirat(dirfd, name.c_str(), mode) != 0) {
         int e = errno;
         STWSetError(error, STW_POSIX_ERROR(e, "mkdir of %@ failed: %s", path, strerror(e)));
         return {};
@@ -207,7 +205,7 @@ bool STWFileManager::moveDirectoryAt(int fromfd, const std::string& name, int to
         STWSetError(error, STW_POSIX_ERROR(e, "Failed to sync %@ before moving it to %@: %s", from, to, strerror(e)));
         return false;
     }
-    if (renameat2(fromfd, name.c_str(), tofd, toName.c_str(), RENAME_NOREPLACE) != 0) {
+    if (disk::renameat2(fromfd, name.c_str(), tofd, toName.c_str(), RENAME_NOREPLACE) != 0) {
         e = errno;
         STWSetError(error, STW_POSIX_ERROR(e, "rename of %@ to %@ failed: %s", from, to, strerror(e)));
         return false;
@@ -216,7 +214,7 @@ bool STWFileManager::moveDirectoryAt(int fromfd, const std::string& name, int to
     if (fstatat(tofd, toName.c_str(), &arrived, AT_SYMLINK_NOFOLLOW) != 0 || !sameItem(arrived, expected)) {
         // Someone swapped the entry between our opening it and the rename: what arrived is
         // theirs. Send it back where it came from.
-        if (renameat2(tofd, toName.c_str(), fromfd, name.c_str(), RENAME_NOREPLACE) != 0)
+        if (disk::renameat2(tofd, toName.c_str(), fromfd, name.c_str(), RENAME_NOREPLACE) != 0)
             STW_LOG_ERROR(STWLogCategory::FS, "Failed to move back what was swapped in for %@ from %@: %s", from, to,
                           strerror(errno));
         STWSetError(error, STW_POSIX_ERROR(ESTALE, "rename of %@ to %@ moved another item: %s", from, to,
@@ -225,9 +223,9 @@ bool STWFileManager::moveDirectoryAt(int fromfd, const std::string& name, int to
     }
     if (!durable)
         return true;
-    e = syncDescriptor(tofd, parentOf(to));
-    if (!e && parentOf(to) != parentOf(from))
-        e = syncDescriptor(fromfd, parentOf(from));
+    e = syncDescriptor(tofd, parentPath(to));
+    if (!e && parentPath(to) != parentPath(from))
+        e = syncDescriptor(fromfd, parentPath(from));
     if (e) {
         STWSetError(error, STW_POSIX_ERROR(e, "Failed to sync the directories of %@ after moving it from %@: %s", to,
                                            from, strerror(e)));
@@ -248,19 +246,22 @@ std::optional<STWFileManager::TemporaryFile> STWFileManager::writeTemporaryFileA
             break;
         }
         file.name = ".temp." + STWHexString(random, sizeof random);
-        file.fd.reset(openat(dirfd, file.name.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, mode));
+        int flags = O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC;
+        file.fd.reset(disk::openat(dirfd, file.name.c_str(), flags, mode));
         e = file.fd ? 0 : errno;
     }
     fs::path path = directory / file.name;
     if (!e)
-        e = fchmod(file.fd.get(), mode) == 0 ? 0 : errno; // past the umask
+        e = disk::fchmod(file.fd.get(), mode) == 0 ? 0 : errno; // past the umask
+    if (!e)
+        e = STWFaultInjection::check(STWFaultPoint::Write);
     if (!e)
         e = STWWriteAll(file.fd.get(), contents);
     if (!e)
         e = syncDescriptor(file.fd.get(), path);
     if (e) {
         if (file.fd)
-            unlinkat(dirfd, file.name.c_str(), 0);
+            disk::unlinkat(dirfd, file.name.c_str(), 0);
         STWSetError(error, STW_POSIX_ERROR(e, "Failed to write %@: %s", path, strerror(e)));
         return std::nullopt;
     }
@@ -277,9 +278,9 @@ bool STWFileManager::replaceFileAt(int dirfd, TemporaryFile& file, const std::st
         old.reset(openat(dirfd, name.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
         unflagged = old && isUserImmutable(old.get()) && setUserImmutable(old.get(), false) == 0;
     }
-    int e = renameat(dirfd, file.name.c_str(), dirfd, name.c_str()) == 0 ? 0 : errno;
+    int e = disk::renameat(dirfd, file.name.c_str(), dirfd, name.c_str()) == 0 ? 0 : errno;
     if (e) {
-        unlinkat(dirfd, file.name.c_str(), 0);
+        disk::unlinkat(dirfd, file.name.c_str(), 0);
         if (unflagged)
             setUserImmutable(old.get(), true);
         STWSetError(error, STW_POSIX_ERROR(e, "rename of %@ to %@ failed: %s", fs::path(path).replace_filename(file.name),
@@ -287,7 +288,7 @@ bool STWFileManager::replaceFileAt(int dirfd, TemporaryFile& file, const std::st
         return false;
     }
     struct stat st;
-    e = fstat(file.fd.get(), &st) != 0 ? errno : syncDescriptor(dirfd, parentOf(path));
+    e = fstat(file.fd.get(), &st) != 0 ? errno : syncDescriptor(dirfd, parentPath(path));
     if (e) {
         STWSetError(error, STW_POSIX_ERROR(e, "Failed to sync the directory of %@: %s", path, strerror(e)));
         return false;

@@ -1,0 +1,90 @@
+// Faults armed at the file layer's points fail the operation with their errno, fire at the
+// nth call only, and leave nothing half-made.
+#include "Daemon/FileSystem/STWFaultInjection.h"
+#include "tests/filesystem/STWFileSystemTestSupport.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <fcntl.h>
+#include <string>
+#include <vector>
+
+namespace fs = std::filesystem;
+using namespace stwtest;
+
+namespace {
+
+class FaultInjection : public FileSystemTest {
+protected:
+    void TearDown() override {
+        STWFaultInjection::disarm();
+        FileSystemTest::TearDown();
+    }
+    static int code(const STWErrorRef& error) { return error ? static_cast<int>(error->code()) : 0; }
+    static std::vector<std::string> names(const fs::path& directory) {
+        std::vector<std::string> names;
+        for (const auto& entry : fs::directory_iterator(directory))
+            names.push_back(entry.path().filename());
+        std::sort(names.begin(), names.end());
+        return names;
+    }
+    STWFileDescriptor openDirectory(const fs::path& path) { return fm()->openDirectoryAtURL(path); }
+};
+
+// A metadata write: a temporary file written and synced, then renamed over the old file.
+TEST_F(FaultInjection, FailedWriteOrReplaceKeepsTheOldFileAndNoTemporary) {
+    writeFile(scratch() / "file", "old");
+    STWFileDescriptor dirfd = openDirectory(scratch());
+    EXPECT_FALSE(STWFaultInjection::arm("rename", 1, EIO)) << "an unknown point is refused";
+    ASSERT_TRUE(STWFaultInjection::arm("fsync", 2, EIO));
+
+    auto first = fm()->writeTemporaryFileAt(dirfd.get(), "new", 0644, scratch());
+    ASSERT_TRUE(first) << "the first sync goes through";
+    STWErrorRef error;
+    EXPECT_FALSE(fm()->writeTemporaryFileAt(dirfd.get(), "other", 0644, scratch(), &error));
+    EXPECT_EQ(code(error), EIO);
+    EXPECT_EQ(names(scratch()), (std::vector<std::string>{first->name, "file"}));
+
+    ASSERT_TRUE(STWFaultInjection::arm("renameat2", 1, ENOSPC));
+    error = nullptr;
+    EXPECT_FALSE(
+        fm()->replaceFileAt(dirfd.get(), *first, "file", false, nullptr, scratch() / "file", &error));
+    EXPECT_EQ(code(error), ENOSPC);
+    EXPECT_EQ(names(scratch()), std::vector<std::string>{"file"});
+    EXPECT_EQ(readFile(scratch() / "file"), "old");
+
+    // Both faults are spent.
+    auto again = fm()->writeTemporaryFileAt(dirfd.get(), "new", 0644, scratch());
+    ASSERT_TRUE(again);
+    EXPECT_TRUE(fm()->replaceFileAt(dirfd.get(), *again, "file", false, nullptr, scratch() / "file"));
+    EXPECT_EQ(readFile(scratch() / "file"), "new");
+}
+
+// Publishing a staged container, armed as the daemon's environment arms it.
+TEST_F(FaultInjection, FailedPublishLeavesTheStagedDirectoryInPlace) {
+    fs::create_directories(scratch() / "staging/c/Library");
+    fs::create_directories(scratch() / "class");
+    writeFile(scratch() / "staging/c/Library/data", "d");
+    STWFileDescriptor staging = openDirectory(scratch() / "staging");
+    STWFileDescriptor classfd = openDirectory(scratch() / "class");
+    STWFileDescriptor container = openDirectory(scratch() / "staging/c");
+    EXPECT_FALSE(STWFaultInjection::armFromList("renameat2:1")) << "a malformed list is refused";
+    ASSERT_TRUE(STWFaultInjection::armFromList("fsync:1:28,renameat2:1:13"));
+
+    auto publish = [&](STWErrorRef* error) {
+        return fm()->moveDirectoryAt(staging.get(), "c", classfd.get(), "c", container.get(),
+                                     STWFileManagerMoveDurable, scratch() / "staging/c",
+                                     scratch() / "class/c", error);
+    };
+    for (int expected : {ENOSPC, EACCES}) {
+        STWErrorRef error;
+        EXPECT_FALSE(publish(&error));
+        EXPECT_EQ(code(error), expected);
+        EXPECT_EQ(readFile(scratch() / "staging/c/Library/data"), "d");
+        EXPECT_TRUE(names(scratch() / "class").empty());
+    }
+    EXPECT_TRUE(publish(nullptr));
+    EXPECT_EQ(readFile(scratch() / "class/c/Library/data"), "d");
+}
+
+} // namespace
