@@ -2,7 +2,6 @@
 #include "Daemon/FileSystem/STWFaultInjection.h"
 
 #include "common/STWLog.h"
-#include "platform/STWPlatformConfiguration.h"
 
 #include <algorithm>
 #include <array>
@@ -45,9 +44,6 @@ struct State {
     // Guards everything below. Taken only on the way through an armed point.
     std::mutex mutex;
     std::array<Fault, kPointCount> faults;
-    // STOWLY_FAULT as read at start, until the first call through a point decides on it:
-    // only then is the configuration in force known.
-    std::optional<std::string> environment;
 };
 
 State& state() {
@@ -110,17 +106,20 @@ void install(State& s, const std::vector<Entry>& entries) {
 } // namespace
 
 constinit std::atomic<bool> STWFaultInjection::_armed{false};
-const bool STWFaultInjection::_environmentRead = STWFaultInjection::_readEnvironment();
 
-bool STWFaultInjection::_readEnvironment() {
+void STWFaultInjection::armFromEnvironment(bool internalImage) {
     const char* list = getenv(environmentVariable);
     if (!list || !*list)
-        return false;
-    State& s = state();
-    std::lock_guard guard(s.mutex);
-    s.environment = list;
-    _armed.store(true, std::memory_order_release);
-    return true;
+        return;
+    if (!internalImage) {
+        STW_LOG_ERROR(STWLogCategory::FS, "Ignoring %s=%s: not an internal image", environmentVariable, list);
+        return;
+    }
+    if (!armFromList(list)) {
+        STW_LOG_ERROR(STWLogCategory::FS, "Ignoring %s=%s: malformed", environmentVariable, list);
+        return;
+    }
+    STW_LOG_NOTICE(STWLogCategory::FS, "Fault injection armed from %s=%s", environmentVariable, list);
 }
 
 bool STWFaultInjection::arm(std::string_view name, unsigned nth, int error) {
@@ -149,7 +148,6 @@ void STWFaultInjection::disarm() {
     State& s = state();
     std::lock_guard guard(s.mutex);
     s.faults = {};
-    s.environment.reset();
     _armed.store(false, std::memory_order_release);
 }
 
@@ -159,18 +157,6 @@ int STWFaultInjection::_fire(STWFaultPoint point) {
     int error = 0;
     {
         std::lock_guard guard(s.mutex);
-        if (s.environment) {
-            std::string list = std::move(*s.environment);
-            s.environment.reset();
-            if (!STWPlatformConfiguration::sharedInstance()->isInternalImage()) {
-                STW_LOG_ERROR(STWLogCategory::FS, "Ignoring %s=%s: not an internal image",
-                              environmentVariable, list);
-            } else if (auto entries = parseList(list)) {
-                STW_LOG_NOTICE(STWLogCategory::FS, "Fault injection armed from %s=%s", environmentVariable,
-                               list);
-                install(s, *entries);
-            }
-        }
         Fault& fault = s.faults[indexOf(point)];
         if (fault.nth != 0 && ++fault.calls == fault.nth) {
             call = fault.calls;

@@ -18,11 +18,12 @@
 //   "unlinkat"   unlink, unlinkat, rmdir
 //
 // Unit tests arm faults in their own process with arm(). A daemon started by the tests takes
-// them from the environment variable STOWLY_FAULT, read once at start: a comma-separated
-// list of POINT:N:ERRNO, so "renameat2:1:28,fsync:3:5" fails the first rename with ENOSPC
-// and the third sync with EIO. The list is honoured only where the configuration in force
-// at the first call through a point says InternalImage; elsewhere it is logged and
-// dropped. Every fault that fires is logged with its point, call and errno.
+// them from the environment variable STOWLY_FAULT once its start-up is done, just before it
+// serves requests (so calls are counted from there): a comma-separated list of
+// POINT:N:ERRNO, so "renameat2:1:28,fsync:3:5" fails the first rename with ENOSPC and the
+// third sync with EIO. The list is honoured only where the configuration says
+// InternalImage; elsewhere it is logged and dropped. Every fault that fires is logged with
+// its point, call and errno.
 //
 // Nothing armed, a point costs one load of an atomic flag. Safe from any thread; counting
 // and firing are serialized by one mutex that only armed points take.
@@ -63,13 +64,13 @@ public:
     // Arms a list in the form of STOWLY_FAULT; false, arming nothing, when any entry is
     // malformed.
     static bool armFromList(std::string_view list);
-    // Disarms every point, including a list from the environment not yet taken up.
+    // Disarms every point.
     static void disarm();
+    // Arms the list of STOWLY_FAULT, when there is one and `internalImage`.
+    static void armFromEnvironment(bool internalImage);
 
 private:
     static int _fire(STWFaultPoint point);
-    static bool _readEnvironment();
 
     static std::atomic<bool> _armed;
-    static const bool _environmentRead;
 };

@@ -220,7 +220,9 @@ public:
     // Renames `name` of `fromfd` to `toName` of `tofd`, never over an existing item, and
     // checks that what arrived is the directory open as `directoryfd`: if an item swapped
     // in for it arrived instead, that is moved back and the move fails with ESTALE. With
-    // STWFileManagerMoveDurable the tree is synced before and both directories after.
+    // STWFileManagerMoveDurable the tree is synced before and both directories after; a
+    // failed sync after the rename moves the directory back, so a failed move has always
+    // left the directory where it was.
     bool moveDirectoryAt(int fromfd, const std::string& name, int tofd, const std::string& toName, int directoryfd,
                          STWFileManagerMoveOptions options, const std::filesystem::path& from,
                          const std::filesystem::path& to, STWErrorRef* error = nullptr) const;

@@ -1,5 +1,6 @@
 #include "Daemon/Request/STWDaemon.h"
 
+#include "Daemon/FileSystem/STWFaultInjection.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Request/STWClientConnection.h"
 #include "Daemon/Request/STWRequestDispatcher.h"
@@ -219,6 +220,8 @@ int STWDaemon::main(int argc, char** argv) {
         STW_LOG_FN("main", STWLogLevel::Error, STWLogCategory::Tolvan, "unable to start tolvan service!");
 
     _runOnceInitialization();
+    // Faults a test asked for count from here, where requests are served.
+    STWFaultInjection::armFromEnvironment(configuration->isInternalImage());
     sd_notify(0, "READY=1");
     STW_LOG_NOTICE(STWLogCategory::Startup, "stowlyd is serving root %@", configuration->rootPrefix());
 

@@ -1,9 +1,10 @@
-// A daemon killed at each crash point of a creation: the next start finds the container
-// exactly once (once the rename published it) or not at all, and never half-made.
+// A creation stopped half-way: by a daemon killed at each crash point, or by a failing
+// system call at each step. What is found afterwards is the whole container or nothing.
 #include "tests/support/STWDaemonProcess.h"
 
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWError.h"
+#include "common/STWFormat.h"
 #include "platform/STWCrashPoint.h"
 
 #include <gtest/gtest.h>
@@ -18,8 +19,8 @@ namespace {
 
 const STWValue::Dictionary allowed{{"com.vorlane.private.Stowly.allowed", STWValue(true)}};
 
-STWValue::Dictionary keys(bool create) {
-    return {{"Identifier", STWValue("com.example.crash")},
+STWValue::Dictionary keys(bool create, const std::string& identifier = "com.example.crash") {
+    return {{"Identifier", STWValue(identifier)},
             {"ContainerClass", STWValue(2)},
             {"CreateIfNecessary", STWValue(create)}};
 }
@@ -70,5 +71,48 @@ TEST(STWCreationCrash, EveryCrashPointLeavesTheContainerWholeOrAbsent) {
         // Whatever the crash left, creating goes on from there.
         EXPECT_EQ(STWDictionaryUInt64(STWDaemonProcess::send(*client, 0, keys(true)), "ReplyError"), STWErrorSuccess);
         EXPECT_EQ(containersOf(classDirectory, "com.example.crash").size(), 1u);
+    }
+}
+
+// Every call of each kind that a creation makes fails in turn (ENOSPC): the request fails
+// and leaves no container, nothing in staging and, once death row is emptied, nothing
+// there; the first run in which no call of the kind fails makes the container whole.
+TEST(STWCreationCrash, AFailedCallAtAnyStepLeavesNothingBehind) {
+    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}}, {}, false);
+    fs::path containers = daemon.root() / "private/var/mobile/Containers";
+    fs::path deathRow = daemon.root() / "private/var/root/Library/Caches/com.vorlane.stowlyd/Deathrow";
+    auto visible = [](const fs::path& directory) {
+        size_t count = 0;
+        std::error_code ec;
+        for (fs::directory_iterator it(directory, ec), end; !ec && it != end; it.increment(ec))
+            count += it->path().filename().native()[0] != '.';
+        return count;
+    };
+    for (const char* point : {"mkdirat", "create", "write", "fsync", "renameat2", "fchown", "setxattr", "setflags"}) {
+        for (unsigned call = 1;; ++call) {
+            SCOPED_TRACE(std::string(point) + ":" + std::to_string(call));
+            ASSERT_LT(call, 40u) << "the creation never got past the point";
+            std::string identifier = STWFormat("com.example.%s.%u", point, call);
+            setenv("STOWLY_FAULT", STWFormat("%s:%u:28", point, call).c_str(), 1);
+            bool started = daemon.start();
+            unsetenv("STOWLY_FAULT");
+            ASSERT_TRUE(started);
+            auto client = daemon.connectAs("com.example.installer", allowed);
+            ASSERT_NE(client, nullptr);
+            size_t before = visible(containers / "Data/Application");
+            auto reply = STWDaemonProcess::send(*client, 0, keys(true, identifier));
+            bool created = STWDictionaryUInt64(reply, "ReplyError") == STWErrorSuccess;
+            // Death row empties in the background; a daemon that stops finishes that first.
+            ASSERT_TRUE(daemon.stop());
+            EXPECT_EQ(containersOf(containers / "Data/Application", identifier).size(), created ? 1u : 0u);
+            EXPECT_EQ(visible(containers / "Data/Application"), before + (created ? 1 : 0));
+            EXPECT_EQ(visible(containers / "Staging"), 0u);
+            EXPECT_EQ(visible(deathRow), 0u);
+            if (created) {
+                EXPECT_TRUE(fs::is_directory(containersOf(containers / "Data/Application", identifier)[0] /
+                                             "Library/Caches"));
+                break;
+            }
+        }
     }
 }
