@@ -167,7 +167,8 @@ private:
 // by a small multiple of the input size. No allocation happens during the walk.
 class Scanner {
 public:
-    Scanner(const unsigned char* bytes, size_t size) : _p(bytes), _n(size) {}
+    Scanner(const unsigned char* bytes, size_t size, size_t maxObjects)
+        : _p(bytes), _n(size), _maxObjects(maxObjects) {}
 
     bool scan(std::string* reason) {
         uint64_t pending[STWMessagePackMaxDepth];
@@ -260,7 +261,7 @@ public:
             if (skip > _n - _pos)
                 return fail(reason, "declared length beyond the end of the input");
             _pos += skip;
-            if (++objects > STWMessagePackMaxObjects)
+            if (++objects > _maxObjects)
                 return fail(reason, "too many objects");
             if (container) {
                 // Every item takes at least one byte.
@@ -301,6 +302,7 @@ private:
 
     const unsigned char* _p;
     size_t _n;
+    size_t _maxObjects;
     size_t _pos = 0;
 };
 
@@ -438,9 +440,9 @@ void STWMessagePackAppendDictionary(std::string& out, const STWValue::Dictionary
     Encoder(out).packDictionary(dictionary);
 }
 
-std::optional<STWValue> STWMessagePackDecode(std::string_view bytes, std::string* reason) {
+std::optional<STWValue> STWMessagePackDecode(std::string_view bytes, std::string* reason, size_t maxObjects) {
     const auto* p = reinterpret_cast<const unsigned char*>(bytes.data());
-    if (!Scanner(p, bytes.size()).scan(reason))
+    if (!Scanner(p, bytes.size(), maxObjects).scan(reason))
         return std::nullopt;
     try {
         // The scanner has checked all of this already; the limits are a second fence.

@@ -24,7 +24,9 @@
 // Containers nested deeper than this are refused.
 inline constexpr size_t STWMessagePackMaxDepth = 64;
 // Objects (values, keys and containers) in one decoded object, a bound on the memory a
-// hostile message can make the receiver spend beyond its own size.
+// hostile message can make the receiver spend beyond its own size. Each decoded object
+// costs some tens of bytes more than its encoding (a nil is one byte on the wire), so a
+// receiver that takes messages from many peers at once passes a lower limit of its own.
 inline constexpr size_t STWMessagePackMaxObjects = 1u << 20;
 
 // Encodes a value as MessagePack.
@@ -35,5 +37,8 @@ void STWMessagePackAppend(std::string& out, const STWValue& value);
 void STWMessagePackAppendDictionary(std::string& out, const STWValue::Dictionary& dictionary);
 
 // Decodes exactly one MessagePack object that fills `bytes`. nullopt on broken input,
-// trailing bytes, or limits exceeded; `reason` (optional) gets a short explanation.
-std::optional<STWValue> STWMessagePackDecode(std::string_view bytes, std::string* reason);
+// trailing bytes, or limits exceeded (more than `maxObjects` objects); `reason`
+// (optional) gets a short explanation. The limit is checked before anything is
+// allocated.
+std::optional<STWValue> STWMessagePackDecode(std::string_view bytes, std::string* reason,
+                                             size_t maxObjects = STWMessagePackMaxObjects);

@@ -1,23 +1,35 @@
 #include "platform/STWIPCFrame.h"
 
-#include "common/STWMessagePack.h"
+#include "common/STWFormat.h"
 
+#include <algorithm>
 #include <cerrno>
+#include <climits>
 #include <cstring>
+#include <poll.h>
 #include <sys/socket.h>
 
 namespace {
 
-// Most messages are small; this is what one recv asks for at least.
+using Clock = std::chrono::steady_clock;
+
+// The reader's own buffer while a frame arrives: most messages fit, and this is what one
+// recv asks for at least. Only larger frames take from the budget.
 constexpr size_t kReadChunk = 64 * 1024;
-// A buffer that once held a large frame is given back when it empties, so an idle
-// connection does not keep megabytes.
-constexpr size_t kRetainedBufferSize = 1024 * 1024;
 
 bool fail(std::string* reason, std::string why) {
     if (reason)
         *reason = std::move(why);
     return false;
+}
+
+uint32_t frameLength(const char* header) {
+    const auto* h = reinterpret_cast<const unsigned char*>(header);
+    return h[0] | h[1] << 8 | h[2] << 16 | uint32_t(h[3]) << 24;
+}
+
+double seconds(std::chrono::milliseconds duration) {
+    return duration.count() / 1000.0;
 }
 
 } // namespace
@@ -34,8 +46,8 @@ std::string STWFrameEncode(uint64_t kind, uint64_t id, const STWValue::Dictionar
     return frame;
 }
 
-std::optional<STWFrame> STWFrameDecode(std::string_view payload, std::string* reason) {
-    std::optional<STWValue> value = STWMessagePackDecode(payload, reason);
+std::optional<STWFrame> STWFrameDecode(std::string_view payload, std::string* reason, size_t maxObjects) {
+    std::optional<STWValue> value = STWMessagePackDecode(payload, reason, maxObjects);
     if (!value)
         return std::nullopt;
     STWValue::Array* array = value->mutableArray();
@@ -57,27 +69,39 @@ std::optional<STWFrame> STWFrameDecode(std::string_view payload, std::string* re
     return STWFrame{*kind, *id, std::move(*body)};
 }
 
-STWFrameReader::STWFrameReader(int fd) : _fd(fd) {}
+STWFrameReader::STWFrameReader(int fd, STWFrameReaderLimits limits) : _fd(fd), _limits(limits) {
+    if (_limits.firstFrameTimeout)
+        _firstFrameDeadline = Clock::now() + *_limits.firstFrameTimeout;
+}
+
+STWFrameReader::~STWFrameReader() {
+    if (_reserved > 0)
+        _limits.budget->release(_reserved);
+}
 
 STWFrameReadResult STWFrameReader::read(STWFrame& frame, std::string* reason) {
     for (;;) {
         size_t available = _end - _start;
         if (available >= STWFrameHeaderSize) {
-            const auto* header = reinterpret_cast<const unsigned char*>(_buffer.data() + _start);
-            uint32_t length = header[0] | header[1] << 8 | header[2] << 16 | uint32_t(header[3]) << 24;
+            uint32_t length = frameLength(_buffer.get() + _start);
             if (length > STWFrameMaxSize) {
                 fail(reason, "frame of " + std::to_string(length) + " bytes is over the limit");
                 errno = EMSGSIZE;
                 return STWFrameReadResult::Error;
             }
             if (available >= STWFrameHeaderSize + length) {
-                std::string_view payload(_buffer.data() + _start + STWFrameHeaderSize, length);
+                std::string_view payload(_buffer.get() + _start + STWFrameHeaderSize, length);
+                std::optional<STWFrame> decoded = STWFrameDecode(payload, reason, _limits.maxObjects);
                 _start += STWFrameHeaderSize + length;
-                std::optional<STWFrame> decoded = STWFrameDecode(payload, reason);
+                _firstFrameDeadline.reset();
+                _frameDeadline.reset();
                 if (_start == _end) {
+                    // Nothing is kept between frames: a connection that waits holds no
+                    // buffer, and that of a large frame goes back at once.
                     _start = _end = 0;
-                    if (_buffer.size() > kRetainedBufferSize)
-                        std::vector<char>().swap(_buffer);
+                    _resize(0, nullptr);
+                } else if (_limits.frameTimeout) {
+                    _frameDeadline = Clock::now() + *_limits.frameTimeout; // the next one has begun
                 }
                 if (!decoded) {
                     errno = EBADMSG;
@@ -104,17 +128,23 @@ STWFrameReadResult STWFrameReader::read(STWFrame& frame, std::string* reason) {
 // `received` is 0 only at the end of the stream. The buffered bytes may move to the front
 // first, so the caller cannot tell what came from the size of the buffer.
 bool STWFrameReader::_fill(size_t* received, std::string* reason) {
+    if (!_waitForData(reason))
+        return false;
     if (_start > 0) {
-        // Move the unconsumed tail to the front instead of growing.
-        memmove(_buffer.data(), _buffer.data() + _start, _end - _start);
+        memmove(_buffer.get(), _buffer.get() + _start, _end - _start);
         _end -= _start;
         _start = 0;
     }
-    if (_buffer.size() - _end < kReadChunk)
-        _buffer.resize(std::max(_buffer.size() * 2, _end + kReadChunk));
+    size_t needed = kReadChunk;
+    if (_end >= STWFrameHeaderSize)
+        needed = std::max(needed, STWFrameHeaderSize + frameLength(_buffer.get()));
+    if (_capacity < needed && !_resize(needed, reason))
+        return false;
     for (;;) {
-        ssize_t n = recv(_fd, _buffer.data() + _end, _buffer.size() - _end, 0);
+        ssize_t n = recv(_fd, _buffer.get() + _end, _capacity - _end, 0);
         if (n >= 0) {
+            if (_end == 0 && n > 0 && _limits.frameTimeout)
+                _frameDeadline = Clock::now() + *_limits.frameTimeout;
             *received = static_cast<size_t>(n);
             _end += *received;
             return true;
@@ -126,6 +156,65 @@ bool STWFrameReader::_fill(size_t* received, std::string* reason) {
         errno = saved;
         return false;
     }
+}
+
+// Returns once the socket has something to say (data, its end or an error: recv tells
+// which); fails with ETIMEDOUT when the deadline that applies passes first. Without a
+// deadline a reader that holds a buffer leaves the waiting to recv; one that holds none
+// waits here, so that a peer takes memory only once it sends.
+bool STWFrameReader::_waitForData(std::string* reason) {
+    std::optional<Clock::time_point> deadline = _frameDeadline;
+    bool first = _firstFrameDeadline && (!deadline || *_firstFrameDeadline < *deadline);
+    if (first)
+        deadline = _firstFrameDeadline;
+    if (!deadline && _buffer)
+        return true;
+    for (;;) {
+        int64_t left = -1;
+        if (deadline)
+            left = std::chrono::ceil<std::chrono::milliseconds>(*deadline - Clock::now()).count();
+        if (deadline && left <= 0) {
+            fail(reason,
+                 first ? STWFormat("no frame within %g seconds of connecting",
+                                   seconds(*_limits.firstFrameTimeout))
+                       : STWFormat("frame unfinished after %g seconds", seconds(*_limits.frameTimeout)));
+            errno = ETIMEDOUT;
+            return false;
+        }
+        pollfd p{_fd, POLLIN, 0};
+        int ready = poll(&p, 1, static_cast<int>(std::min<int64_t>(left, INT_MAX))); // -1: no deadline
+        if (ready > 0)
+            return true;
+        if (ready < 0 && errno != EINTR) {
+            int saved = errno;
+            fail(reason, std::string("poll: ") + strerror(saved));
+            errno = saved;
+            return false;
+        }
+    }
+}
+
+// Gives the buffer room for `capacity` bytes (0: frees it), keeping the unconsumed bytes,
+// which start at 0. What goes beyond one chunk is reserved from the budget first.
+bool STWFrameReader::_resize(size_t capacity, std::string* reason) {
+    size_t reserve = _limits.budget && capacity > kReadChunk ? capacity - kReadChunk : 0;
+    if (reserve > _reserved && !_limits.budget->reserve(reserve - _reserved)) {
+        fail(reason,
+             STWFormat("no room for a frame of %zu bytes (%zu of %zu bytes held by unfinished frames)",
+                       capacity - STWFrameHeaderSize, _limits.budget->reserved(), _limits.budget->limit()));
+        errno = ENOBUFS;
+        return false;
+    }
+    // Not value-initialised: only what recv writes is ever touched.
+    std::unique_ptr<char[]> buffer(capacity > 0 ? new char[capacity] : nullptr);
+    if (_end > 0)
+        memcpy(buffer.get(), _buffer.get(), _end);
+    _buffer = std::move(buffer);
+    _capacity = capacity;
+    if (reserve < _reserved)
+        _limits.budget->release(_reserved - reserve);
+    _reserved = reserve;
+    return true;
 }
 
 bool STWFrameWrite(int fd, std::string_view encodedFrame) {

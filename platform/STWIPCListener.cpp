@@ -3,19 +3,85 @@
 #include "common/STWLog.h"
 #include "platform/STWIPCFrame.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
+#include <optional>
 #include <poll.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
+#include <utility>
+
+namespace {
+
+// Lets one line a second through for an event that a flood of clients could repeat, and
+// counts the ones held back so that the next line can say how many there were.
+class LogThrottle {
+public:
+    // True when this one may be logged; `held` is then how many were not since the last.
+    bool admit(uint64_t* held) {
+        std::lock_guard guard(_lock);
+        auto now = std::chrono::steady_clock::now();
+        if (_lastLine && now - *_lastLine < std::chrono::seconds(1)) {
+            ++_held;
+            return false;
+        }
+        _lastLine = now;
+        *held = std::exchange(_held, 0);
+        return true;
+    }
+
+private:
+    std::mutex _lock;
+    std::optional<std::chrono::steady_clock::time_point> _lastLine;
+    uint64_t _held = 0;
+};
+
+LogThrottle refusalLog;
+LogThrottle closingLog;
+
+std::string heldBack(uint64_t held, const char* what) {
+    return held ? STWFormat(" (%llu more %s since the last report)", held, what) : std::string();
+}
+
+} // namespace
 
 STWIPCListener::STWIPCListener(Options options, ConnectionHandler onConnection, MessageHandler onMessage)
-    : _options(std::move(options)), _onConnection(std::move(onConnection)), _onMessage(std::move(onMessage)) {}
+    : _options(std::move(options)), _onConnection(std::move(onConnection)), _onMessage(std::move(onMessage)),
+      _frameBudget(_options.bounds.maxPendingFrameBytes) {
+    _resolveConnectionCaps();
+}
 
-STWIPCListener::~STWIPCListener() { stop(); }
+// Each connection holds two descriptors (its socket and a pidfd of the peer) and a
+// thread; a quarter of the descriptors (at least 64) stays with the daemon's databases,
+// logs, watches and file walks, and a thousand threads is far beyond what the device's
+// clients need at once. One user gets a quarter of the connections, so that clients of
+// other users are still served while one floods.
+void STWIPCListener::_resolveConnectionCaps() {
+    rlimit descriptors{};
+    rlim_t limit = getrlimit(RLIMIT_NOFILE, &descriptors) == 0 ? descriptors.rlim_cur : 1024;
+    rlim_t reserved = std::max<rlim_t>(64, limit / 4);
+    rlim_t affordable = std::clamp<rlim_t>(limit > reserved ? (limit - reserved) / 2 : 1, 1, 1024);
+    _maxConnections = _options.bounds.maxConnections.value_or(static_cast<size_t>(affordable));
+    _maxConnectionsPerUser =
+        std::min(_maxConnections,
+                 _options.bounds.maxConnectionsPerUser.value_or(std::max<size_t>(1, _maxConnections / 4)));
+    if (_maxConnections > affordable)
+        STW_LOG_ERROR(
+            STWLogCategory::Tolvan,
+            "MaxConnections %zu needs more descriptors than the limit of %llu leaves: accepting may fail",
+            _maxConnections, static_cast<unsigned long long>(limit));
+}
+
+STWIPCListener::~STWIPCListener() {
+    // The threads use this object: wait for them however long it takes.
+    while (!stop()) {
+    }
+}
 
 bool STWIPCListener::start(STWErrorRef* error) {
     if (_options.allowSocketActivation && sd_listen_fds(0) >= 1 &&
@@ -51,36 +117,56 @@ bool STWIPCListener::start(STWErrorRef* error) {
         _listenFD = fd;
         STW_LOG_NOTICE(STWLogCategory::Tolvan, "Listening on %@", path);
     }
+    const STWClientBounds& bounds = _options.bounds;
+    STW_LOG_NOTICE(
+        STWLogCategory::Tolvan,
+        "Serving up to %zu connections, %zu per user; a first frame within %g s, every frame within "
+        "%g s; %zu bytes for unfinished frames",
+        _maxConnections, _maxConnectionsPerUser, bounds.firstFrameTimeout.count() / 1000.0,
+        bounds.frameTimeout.count() / 1000.0, bounds.maxPendingFrameBytes);
     _acceptThread = std::thread([this] { _acceptLoop(); });
     return true;
 }
 
-void STWIPCListener::stop() {
-    if (_stopping.exchange(true))
-        return;
-    if (_acceptThread.joinable())
-        _acceptThread.join();
-    if (_listenFD >= 0 && !_socketActivated)
-        unlink(_options.socketPath.c_str());
-    if (_listenFD >= 0)
-        close(_listenFD);
-    _listenFD = -1;
-    std::set<std::shared_ptr<STWPeerConnection>> connections;
+bool STWIPCListener::stop(std::chrono::steady_clock::duration timeout) {
+    auto deadline = std::chrono::steady_clock::now() + timeout;
+    if (!_stopping.exchange(true)) {
+        if (_acceptThread.joinable())
+            _acceptThread.join();
+        if (_listenFD >= 0 && !_socketActivated)
+            unlink(_options.socketPath.c_str());
+        if (_listenFD >= 0)
+            close(_listenFD);
+        _listenFD = -1;
+    }
+    std::vector<std::shared_ptr<STWPeerConnection>> open;
     {
         std::lock_guard guard(_lock);
-        connections = _lock_connections;
+        for (const auto& [serial, connection] : _lock_connections)
+            if (!connection.finished)
+                open.push_back(connection.peer);
     }
-    for (const auto& peer : connections)
+    // Their readers see the end of the stream; a request being handled runs to its end,
+    // but its reply is not sent.
+    for (const auto& peer : open)
         peer->cancel();
-    // The connection threads refer to this listener: give those still finishing a request
-    // time to end before it goes away.
-    std::unique_lock guard(_lock);
-    _connectionsGone.wait_for(guard, std::chrono::seconds(10), [&] { return _lock_connections.empty(); });
+    bool ended;
+    {
+        std::unique_lock guard(_lock);
+        ended = _connectionsGone.wait_until(guard, deadline, [&] { return _lock_openConnections == 0; });
+        if (!ended)
+            for (const auto& [serial, connection] : _lock_connections)
+                if (!connection.finished)
+                    STW_LOG_ERROR(STWLogCategory::Tolvan,
+                                  "%@ is still being served after the listener stopped", connection.peer);
+    }
+    _reapFinishedConnections();
+    return ended;
 }
 
 size_t STWIPCListener::connectionCount() const {
     std::lock_guard guard(_lock);
-    return _lock_connections.size();
+    return _lock_openConnections;
 }
 
 std::chrono::steady_clock::time_point STWIPCListener::lastConnectionChange() const {
@@ -90,7 +176,8 @@ std::chrono::steady_clock::time_point STWIPCListener::lastConnectionChange() con
 
 void STWIPCListener::_acceptLoop() {
     while (!_stopping.load()) {
-        // Wake up now and then to notice stop().
+        _reapFinishedConnections();
+        // Wake up now and then to notice stop() and to join the threads of closed connections.
         pollfd p{_listenFD, POLLIN, 0};
         int ready = poll(&p, 1, 200);
         if (ready <= 0)
@@ -103,56 +190,130 @@ void STWIPCListener::_acceptLoop() {
                 usleep(100 * 1000);
             continue;
         }
-        STWErrorRef error;
-        auto peer = STWPeerConnection::adopt(fd, &error);
-        if (!peer)
+        if (!_admit(fd)) {
+            close(fd);
             continue;
-        _connectionChanged(peer, true);
-        std::thread([this, peer] { _serve(peer); }).detach();
+        }
+        STWErrorRef error;
+        if (auto peer = STWPeerConnection::adopt(fd, &error))
+            _startConnection(std::move(peer));
     }
 }
 
-void STWIPCListener::_connectionChanged(const std::shared_ptr<STWPeerConnection>& peer, bool added) {
+// Over a cap, a connection is closed before anything else is done for it: reading the
+// peer's credentials is all it costs.
+//
+// Root is held to the global cap only. Its peers are the system's own services, some of
+// which keep several connections open, and a root process that wanted the daemon gone
+// could simply kill it: a per-user cap would protect nothing and might starve them. The
+// global cap still holds, so descriptors never run out.
+bool STWIPCListener::_admit(int fd) {
+    struct ucred credentials {};
+    socklen_t length = sizeof credentials;
+    if (getsockopt(fd, SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0)
+        return false;
+    std::string refusal;
+    {
+        std::lock_guard guard(_lock);
+        auto user = _lock_openConnectionsPerUser.find(credentials.uid);
+        size_t ofUser = user == _lock_openConnectionsPerUser.end() ? 0 : user->second;
+        if (_lock_openConnections >= _maxConnections)
+            refusal = STWFormat("all %zu connections are in use", _maxConnections);
+        else if (credentials.uid != 0 && ofUser >= _maxConnectionsPerUser)
+            refusal = STWFormat("its user has all of its %zu connections open", _maxConnectionsPerUser);
+    }
+    if (refusal.empty())
+        return true;
+    uint64_t held = 0;
+    if (refusalLog.admit(&held))
+        STW_LOG_ERROR(STWLogCategory::Tolvan, "Refusing a connection from pid %d, uid %u: %@%@",
+                      credentials.pid, credentials.uid, refusal, heldBack(held, "refused"));
+    return false;
+}
+
+void STWIPCListener::_startConnection(std::shared_ptr<STWPeerConnection> peer) {
     std::lock_guard guard(_lock);
-    if (added)
-        _lock_connections.insert(peer);
-    else
-        _lock_connections.erase(peer);
+    Connection& connection = _lock_connections[peer->serial()];
+    connection.peer = peer;
+    ++_lock_openConnections;
+    ++_lock_openConnectionsPerUser[peer->uid()];
     _lock_lastConnectionChange = std::chrono::steady_clock::now();
-    if (_lock_connections.empty())
+    try {
+        // Started under the lock, so the thread cannot end before its entry holds it.
+        connection.thread = std::thread([this, peer] { _serve(peer); });
+    } catch (const std::system_error& e) {
+        STW_LOG_ERROR(STWLogCategory::Tolvan, "Closing %@: cannot start its thread: %s", peer, e.what());
+        peer->cancel();
+        _lock_connectionEnded(connection);
+    }
+}
+
+void STWIPCListener::_lock_connectionEnded(Connection& connection) {
+    connection.finished = true;
+    auto user = _lock_openConnectionsPerUser.find(connection.peer->uid());
+    if (--user->second == 0)
+        _lock_openConnectionsPerUser.erase(user);
+    --_lock_openConnections;
+    // The socket closes once the thread (and any completion still holding the peer) lets go.
+    connection.peer.reset();
+    _lock_lastConnectionChange = std::chrono::steady_clock::now();
+    if (_lock_openConnections == 0)
         _connectionsGone.notify_all();
+}
+
+void STWIPCListener::_reapFinishedConnections() {
+    std::vector<std::thread> finished;
+    {
+        std::lock_guard guard(_lock);
+        for (auto it = _lock_connections.begin(); it != _lock_connections.end();) {
+            if (it->second.finished) {
+                finished.push_back(std::move(it->second.thread));
+                it = _lock_connections.erase(it);
+            } else {
+                ++it;
+            }
+        }
+    }
+    for (std::thread& thread : finished)
+        if (thread.joinable())
+            thread.join();
 }
 
 void STWIPCListener::_serve(std::shared_ptr<STWPeerConnection> peer) {
     _onConnection(peer);
-    STWFrameReader reader(peer->fd());
-    bool sawRequest = false;
-    while (!peer->isCancelled()) {
-        STWFrame frame;
+    {
+        STWFrameReader reader(peer->fd(), {.firstFrameTimeout = _options.bounds.firstFrameTimeout,
+                                           .frameTimeout = _options.bounds.frameTimeout,
+                                           .budget = &_frameBudget,
+                                           .maxObjects = STWIPCRequestMaxObjects});
+        bool sawRequest = false;
         std::string reason;
-        STWFrameReadResult result = reader.read(frame, &reason);
-        if (result == STWFrameReadResult::EndOfStream)
-            break;
-        if (result == STWFrameReadResult::Error) {
-            if (!peer->isCancelled())
-                STW_LOG_ERROR(STWLogCategory::Tolvan, "Closing %@: %@", peer, reason);
-            break;
-        }
-        if (frame.kind == STWFrameKindHello) {
-            if (!_handleHello(peer, frame.id, frame.body, sawRequest))
+        while (!peer->isCancelled()) {
+            STWFrame frame;
+            STWFrameReadResult result = reader.read(frame, &reason);
+            if (result != STWFrameReadResult::Frame)
                 break;
-            continue;
+            if (frame.kind == STWFrameKindHello) {
+                if (!_handleHello(peer, frame.id, frame.body, sawRequest))
+                    break;
+                continue;
+            }
+            if (frame.kind != STWFrameKindRequest) {
+                // A request needs a reply context; anything else is not ours to answer.
+                reason = STWFormat("unexpected frame kind %llu", frame.kind);
+                break;
+            }
+            sawRequest = true;
+            _onMessage(peer, frame.id, std::move(frame.body));
         }
-        if (frame.kind != STWFrameKindRequest) {
-            // A request needs a reply context; anything else is not ours to answer.
-            STW_LOG_ERROR(STWLogCategory::Tolvan, "Closing %@: unexpected frame kind %llu", peer, frame.kind);
-            break;
-        }
-        sawRequest = true;
-        _onMessage(peer, frame.id, std::move(frame.body));
+        uint64_t held = 0;
+        if (!reason.empty() && !peer->isCancelled() && closingLog.admit(&held))
+            STW_LOG_ERROR(STWLogCategory::Tolvan, "Closing %@: %@%@", peer, reason,
+                          heldBack(held, "closed for bad input"));
     }
     peer->cancel();
-    _connectionChanged(peer, false);
+    std::lock_guard guard(_lock);
+    _lock_connectionEnded(_lock_connections.at(peer->serial()));
 }
 
 bool STWIPCListener::_handleHello(const std::shared_ptr<STWPeerConnection>& peer, uint64_t id,

@@ -3,21 +3,36 @@
 // its requests one at a time and in order; connections run concurrently. Bad input (an
 // oversized frame, broken MessagePack, a body that is not a map, an unknown frame kind)
 // is logged and closes that connection only.
+//
+// Anyone may connect, so every client is bounded: connections at once in all and per
+// user (over a cap a connection is closed as soon as it is accepted), time to the first
+// frame and inside each frame, bytes held for frames still arriving (one budget for all
+// connections) and values a request may decode to.
+//
+// Threads: the accept thread accepts, starts a thread per connection and joins the
+// threads of connections that have ended; connection threads read, dispatch and reply.
+// `_lock` guards the connection table and counts, which both touch.
 #pragma once
 
 #include "common/STWError.h"
 #include "common/STWValue.h"
+#include "platform/STWIPCFrameBudget.h"
 #include "platform/STWPeerConnection.h"
+#include "platform/STWPlatformConfiguration.h"
 
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
 #include <filesystem>
 #include <functional>
+#include <map>
 #include <memory>
 #include <mutex>
-#include <set>
 #include <thread>
+
+// Values one request frame may decode to. Requests are a handful of keys; this leaves
+// room for long lists while a decoded request stays within a megabyte or two.
+inline constexpr size_t STWIPCRequestMaxObjects = 1u << 14;
 
 class STWIPCListener {
 public:
@@ -34,16 +49,23 @@ public:
         bool developerMode = false;
         // Use a socket passed by the service manager when there is one.
         bool allowSocketActivation = true;
+        // Connection caps left unset are derived from the descriptor limit in force when
+        // the listener is made (see _resolveConnectionCaps).
+        STWClientBounds bounds;
     };
 
     STWIPCListener(Options options, ConnectionHandler onConnection, MessageHandler onMessage);
+    // Stops, and waits for every connection thread, however long that takes: an owner
+    // that cannot wait calls stop() itself and does not destroy a listener it failed.
     ~STWIPCListener();
 
     // Binds (or adopts) the socket and starts accepting on its own thread.
     bool start(STWErrorRef* error);
-    // Stops accepting and shuts down every open connection; returns when the accept
-    // thread has ended. Requests already being handled run to their end.
-    void stop();
+    // Stops accepting and shuts every connection down: no further request is read, and
+    // the replies of requests still running are not sent. Waits up to `timeout` for the
+    // connection threads to end and joins them; false (each one still running logged)
+    // when some did not end in time.
+    bool stop(std::chrono::steady_clock::duration timeout = std::chrono::seconds(10));
 
     bool isSocketActivated() const { return _socketActivated; }
     size_t connectionCount() const;
@@ -51,15 +73,28 @@ public:
     std::chrono::steady_clock::time_point lastConnectionChange() const;
 
 private:
+    struct Connection {
+        std::shared_ptr<STWPeerConnection> peer;
+        std::thread thread;
+        bool finished = false;
+    };
+
+    void _resolveConnectionCaps();
     void _acceptLoop();
+    bool _admit(int fd);
+    void _startConnection(std::shared_ptr<STWPeerConnection> peer);
+    void _reapFinishedConnections();
     void _serve(std::shared_ptr<STWPeerConnection> peer);
     bool _handleHello(const std::shared_ptr<STWPeerConnection>& peer, uint64_t id, const STWValue::Dictionary& body,
                       bool afterRequest);
-    void _connectionChanged(const std::shared_ptr<STWPeerConnection>& peer, bool added);
+    void _lock_connectionEnded(Connection& connection);
 
     const Options _options;
     const ConnectionHandler _onConnection;
     const MessageHandler _onMessage;
+    size_t _maxConnections = 0;
+    size_t _maxConnectionsPerUser = 0;
+    STWIPCFrameBudget _frameBudget;
     int _listenFD = -1;
     bool _socketActivated = false;
     std::atomic<bool> _stopping{false};
@@ -67,6 +102,9 @@ private:
 
     mutable std::mutex _lock;
     std::condition_variable _connectionsGone;
-    std::set<std::shared_ptr<STWPeerConnection>> _lock_connections;
+    // By serial; an entry stays until the accept thread (or stop()) joins its thread.
+    std::map<uint64_t, Connection> _lock_connections;
+    size_t _lock_openConnections = 0;
+    std::map<uid_t, size_t> _lock_openConnectionsPerUser;
     std::chrono::steady_clock::time_point _lock_lastConnectionChange = std::chrono::steady_clock::now();
 };

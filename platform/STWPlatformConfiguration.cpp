@@ -98,6 +98,24 @@ STWPlatformConfiguration::loadFromRoot(const std::filesystem::path& root, STWErr
                 badKey = std::string(key) + " must be a user id";
         }
     };
+    auto readCount = [&](const char* key, auto* out) {
+        if (const STWValue* v = STWDictionaryFind(configuration->_settings, key)) {
+            auto u = v->uint64Value();
+            if (u && *u > 0 && *u <= SIZE_MAX)
+                *out = static_cast<size_t>(*u);
+            else if (badKey.empty())
+                badKey = std::string(key) + " must be a positive integer";
+        }
+    };
+    auto readSeconds = [&](const char* key, std::chrono::milliseconds* out) {
+        if (const STWValue* v = STWDictionaryFind(configuration->_settings, key)) {
+            std::optional<double> seconds = v->realValue();
+            if (seconds && *seconds >= 0.001 && *seconds <= 1e6)
+                *out = std::chrono::milliseconds(static_cast<int64_t>(*seconds * 1000));
+            else if (badKey.empty())
+                badKey = std::string(key) + " must be a positive number of seconds";
+        }
+    };
     readBool("InternalImage", &configuration->_internalImage);
     readBool("MultiUser", &configuration->_multiUser);
     readBool("PersonasUnsupported", &configuration->_personasUnsupported);
@@ -105,6 +123,12 @@ STWPlatformConfiguration::loadFromRoot(const std::filesystem::path& root, STWErr
     readBool("DeveloperMode", &configuration->_developerMode);
     readUID("InstallationUID", &configuration->_installationUID);
     readUID("SystemContainerUID", &configuration->_systemContainerUID);
+    STWClientBounds& bounds = configuration->_clientBounds;
+    readCount("MaxConnections", &bounds.maxConnections);
+    readCount("MaxConnectionsPerUser", &bounds.maxConnectionsPerUser);
+    readCount("MaxPendingFrameBytes", &bounds.maxPendingFrameBytes);
+    readSeconds("FirstFrameTimeout", &bounds.firstFrameTimeout);
+    readSeconds("FrameTimeout", &bounds.frameTimeout);
     if (const STWValue* v = STWDictionaryFind(configuration->_settings, "MobileUserName")) {
         if (v->string() && !v->string()->empty())
             configuration->_mobileUserName = *v->string();

@@ -7,11 +7,25 @@
 #include "common/STWError.h"
 #include "common/STWValue.h"
 
+#include <chrono>
 #include <filesystem>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <sys/types.h>
+
+// What clients of the request socket may hold (see STWIPCListener), from stowlyd.plist:
+// "MaxConnections", "MaxConnectionsPerUser" (counts; unset, the daemon derives them from
+// its descriptor limit), "FirstFrameTimeout", "FrameTimeout" (seconds) and
+// "MaxPendingFrameBytes".
+struct STWClientBounds {
+    std::optional<size_t> maxConnections;
+    std::optional<size_t> maxConnectionsPerUser;
+    std::chrono::milliseconds firstFrameTimeout{60000};
+    std::chrono::milliseconds frameTimeout{10000};
+    size_t maxPendingFrameBytes = 64 * 1024 * 1024;
+};
 
 class STWPlatformConfiguration {
 public:
@@ -47,6 +61,7 @@ public:
     uid_t installationUID() const { return _installationUID; }
     uid_t systemContainerUID() const { return _systemContainerUID; }
     const std::string& mobileUserName() const { return _mobileUserName; }
+    const STWClientBounds& clientBounds() const { return _clientBounds; }
 
     // "BuildVersion", "ProductVersion" and "ReleaseType" of the running system, as far
     // as os-release gives them.
@@ -67,6 +82,7 @@ private:
     uid_t _installationUID = 33;
     uid_t _systemContainerUID = 0;
     std::string _mobileUserName = "mobile";
+    STWClientBounds _clientBounds;
     STWValue::Dictionary _features;
     STWValue::Dictionary _systemVersion;
     STWValue::Dictionary _settings;

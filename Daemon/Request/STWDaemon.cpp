@@ -1,6 +1,7 @@
 #include "Daemon/Request/STWDaemon.h"
 
 #include "Daemon/FileSystem/STWFaultInjection.h"
+#include "Daemon/Lifecycle/STWTestLocks.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Request/STWClientConnection.h"
 #include "Daemon/Request/STWRequestDispatcher.h"
@@ -18,8 +19,10 @@
 #include <csignal>
 #include <cstring>
 #include <fcntl.h>
+#include <malloc.h>
 #include <mutex>
 #include <semaphore.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
@@ -71,6 +74,35 @@ void firstBootCompletion() {
     if (uint32_t status = postNotification("reboot-cleanup-complete"))
         STW_LOG_ERROR(STWLogCategory::Startup, "Failed to post reboot-cleanup-complete: %u", status);
     signpost("FirstBootCleanup", false);
+}
+
+// The listener derives its connection caps from the descriptor limit: take all the
+// system allows.
+void raiseDescriptorLimit() {
+    rlimit limit{};
+    if (getrlimit(RLIMIT_NOFILE, &limit) != 0)
+        return;
+    rlim_t before = limit.rlim_cur;
+    limit.rlim_cur = limit.rlim_max;
+    if (before == limit.rlim_max)
+        STW_LOG_NOTICE(STWLogCategory::Startup, "Descriptor limit: %llu",
+                       static_cast<unsigned long long>(before));
+    else if (setrlimit(RLIMIT_NOFILE, &limit) != 0)
+        STW_LOG_ERROR(STWLogCategory::Startup, "Cannot raise the descriptor limit from %llu: %s",
+                      static_cast<unsigned long long>(before), strerror(errno));
+    else
+        STW_LOG_NOTICE(STWLogCategory::Startup, "Raised the descriptor limit from %llu to %llu",
+                       static_cast<unsigned long long>(before),
+                       static_cast<unsigned long long>(limit.rlim_max));
+}
+
+// glibc raises its mmap threshold to the size of every mapped block that is freed, up to
+// 32 MiB; after one large frame, the next ones come from the heap and their memory stays
+// with the process when they are freed. A fixed threshold keeps every block of 128 KiB
+// or more (frame buffers, large decoded values) mapped, so freeing it returns it.
+void fixMallocThresholds() {
+    if (mallopt(M_MMAP_THRESHOLD, 128 * 1024) != 1)
+        STW_LOG_ERROR(STWLogCategory::Startup, "Cannot fix the mmap threshold of malloc");
 }
 
 void cleanupCompletion() {
@@ -181,6 +213,8 @@ int STWDaemon::main(int argc, char** argv) {
     sigaddset(&signals, SIGINT);
     pthread_sigmask(SIG_BLOCK, &signals, nullptr);
     signal(SIGPIPE, SIG_IGN);
+    fixMallocThresholds();
+    raiseDescriptorLimit();
 
     STWErrorRef error;
     auto configuration = STWPlatformConfiguration::loadFromRoot(root, &error);
@@ -205,7 +239,8 @@ int STWDaemon::main(int argc, char** argv) {
     STWIPCListener listener(
         {.socketPath = configuration->runtimeDirectory() / "stowlyd.sock",
          .developerMode = configuration->isDeveloperMode(),
-         .allowSocketActivation = true},
+         .allowSocketActivation = true,
+         .bounds = configuration->clientBounds()},
         [](const std::shared_ptr<STWPeerConnection>&) {
             _runOnceInitialization();
             if (!initialisationFinished())
@@ -245,9 +280,21 @@ int STWDaemon::main(int argc, char** argv) {
         }
     }
     sd_notify(0, "STOPPING=1");
-    listener.stop();
-    // Work already posted (deletion passes, cleanups) gets a moment to finish.
-    STWTransaction::waitForIdle(std::chrono::seconds(10));
+    // Requests in flight and work already posted (deletion passes, cleanups) get one
+    // bound between them to finish.
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+    // A request parked behind a test lock would wait for a release no client can send now.
+    if (configuration->isInternalImage())
+        STWTestLocks::sharedInstance()->releaseAllLocks();
+    bool connectionsEnded = listener.stop(deadline - std::chrono::steady_clock::now());
+    if (!connectionsEnded || !STWTransaction::waitForIdle(deadline - std::chrono::steady_clock::now())) {
+        // Whatever still runs uses objects that returning from main would destroy: leave
+        // without running destructors. Everything on disk is crash-safe.
+        STW_LOG_ERROR(STWLogCategory::Startup, "Exiting with %s still running",
+                      connectionsEnded ? "posted work" : "connections");
+        STWLog::flush();
+        _exit(0);
+    }
     STWLog::flush();
     return 0;
 }

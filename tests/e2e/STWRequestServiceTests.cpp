@@ -4,16 +4,13 @@
 #include "common/STWError.h"
 #include "common/STWMessagePack.h"
 #include "platform/STWIPCFrame.h"
+#include "platform/STWIPCListener.h"
 
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <fcntl.h>
-#include <fstream>
-#include <poll.h>
 #include <set>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <thread>
 #include <unistd.h>
 
@@ -32,34 +29,6 @@ std::set<uint64_t> connectedCommands(STWClient& client) {
             commands.insert(c);
     }
     return commands;
-}
-
-int rawConnect(const std::filesystem::path& path) {
-    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    strcpy(address.sun_path, path.c_str());
-    if (connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
-        close(fd);
-        return -1;
-    }
-    return fd;
-}
-
-// True when the daemon closes `fd` (end of stream) within the time-out; replies it sent
-// before closing are skipped.
-bool closedByDaemon(int fd) {
-    char buffer[4096];
-    auto deadline = std::chrono::steady_clock::now() + STWDaemonProcess::timeout;
-    while (std::chrono::steady_clock::now() < deadline) {
-        pollfd p{fd, POLLIN, 0};
-        if (poll(&p, 1, 100) <= 0)
-            continue;
-        ssize_t n = recv(fd, buffer, sizeof buffer, 0);
-        if (n <= 0)
-            return true;
-    }
-    return false;
 }
 
 std::string lengthPrefixed(std::string_view payload) {
@@ -148,22 +117,26 @@ TEST_F(STWRequestServiceTest, MalformedInputClosesOnlyThatConnection) {
     std::vector<std::pair<const char*, std::string>> inputs = {
         {"oversized length", std::string("\xff\xff\xff\x7f", 4)},
         {"broken MessagePack", lengthPrefixed("\x93\x00\x01\xc1")},
-        {"body not a map", lengthPrefixed(STWMessagePackEncode(STWValue(
-                               STWValue::Array{STWValue(0), STWValue(1), STWValue("body")})))},
+        {"body not a map", lengthPrefixed(STWMessagePackEncode(
+                               STWValue(STWValue::Array{STWValue(0), STWValue(1), STWValue("body")})))},
+        {"more values than a request may have",
+         STWFrameEncode(STWFrameKindRequest, 1,
+                        {{"K", STWValue(STWValue::Array(STWIPCRequestMaxObjects, STWValue()))}})},
         {"unknown frame kind", STWFrameEncode(7, 1, {})},
         {"reply frame from a client", STWFrameEncode(STWFrameKindReply, 1, {})},
-        {"hello after a request", request + STWFrameEncode(STWFrameKindHello, 2, {{"CodeSigningIdentifier", STWValue("x")}})},
+        {"hello after a request",
+         request + STWFrameEncode(STWFrameKindHello, 2, {{"CodeSigningIdentifier", STWValue("x")}})},
     };
     for (const auto& [what, bytes] : inputs) {
-        int fd = rawConnect(daemon->socketPath());
+        int fd = daemon->connectRaw();
         ASSERT_GE(fd, 0);
         ASSERT_EQ(send(fd, bytes.data(), bytes.size(), MSG_NOSIGNAL), static_cast<ssize_t>(bytes.size())) << what;
-        EXPECT_TRUE(closedByDaemon(fd)) << what;
+        EXPECT_TRUE(STWDaemonProcess::closedByDaemon(fd)) << what;
         close(fd);
     }
     // A client that goes away in the middle of a frame, and one in the middle of waiting.
     for (size_t cut : {size_t{2}, request.size() - 1, request.size()}) {
-        int fd = rawConnect(daemon->socketPath());
+        int fd = daemon->connectRaw();
         ASSERT_GE(fd, 0);
         send(fd, request.data(), cut, MSG_NOSIGNAL);
         close(fd);

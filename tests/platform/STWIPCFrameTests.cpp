@@ -3,7 +3,9 @@
 
 #include <gtest/gtest.h>
 
+#include <array>
 #include <atomic>
+#include <cerrno>
 #include <csignal>
 #include <cstring>
 #include <pthread.h>
@@ -235,4 +237,39 @@ TEST_F(STWFrameSocketTest, WriteToAClosedPeerFailsWithoutSIGPIPE) {
     int error = errno;
     EXPECT_FALSE(written);
     EXPECT_EQ(error, EPIPE);
+}
+
+// Readers of a budget hold the bytes of their large frames only while they arrive: one
+// that stalls inside a frame holds them until it ends, and a second one finds no room.
+TEST(STWFrameReaderBudget, LargeFramesReserveTheirBytesUntilTheyAreDone) {
+    STWIPCFrameBudget budget(200000);
+    STWFrameReaderLimits limits;
+    limits.frameTimeout = std::chrono::milliseconds(100);
+    limits.budget = &budget;
+    std::string large = STWFrameEncode(STWFrameKindRequest, 1, {{"Blob", STWValue(STWData(200000, 1))}});
+    std::vector<std::array<int, 2>> pairs(3);
+    for (auto& pair : pairs)
+        ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair.data()), 0);
+    STWFrame frame;
+    std::string reason;
+    {
+        ASSERT_TRUE(STWFrameWrite(pairs[0][1], std::string_view(large).substr(0, 100000)));
+        ASSERT_TRUE(STWFrameWrite(pairs[1][1], std::string_view(large).substr(0, 100000)));
+        STWFrameReader stalled(pairs[0][0], limits), refused(pairs[1][0], limits);
+        EXPECT_EQ(stalled.read(frame, &reason), STWFrameReadResult::Error);
+        EXPECT_EQ(errno, ETIMEDOUT) << reason;
+        EXPECT_GT(budget.reserved(), 100000u);
+        EXPECT_EQ(refused.read(frame, &reason), STWFrameReadResult::Error);
+        EXPECT_EQ(errno, ENOBUFS) << reason;
+    }
+    EXPECT_EQ(budget.reserved(), 0u);
+    std::thread writer([&] { STWFrameWrite(pairs[2][1], large); });
+    STWFrameReader reader(pairs[2][0], limits);
+    EXPECT_EQ(reader.read(frame, &reason), STWFrameReadResult::Frame) << reason;
+    EXPECT_EQ(budget.reserved(), 0u);
+    writer.join();
+    for (auto& pair : pairs) {
+        close(pair[0]);
+        close(pair[1]);
+    }
 }

@@ -71,7 +71,9 @@ TEST_F(STWPlatformConfigurationTest, MalformedFilesAndWrongTypesAreRefusedWithTh
     for (const auto& [key, value, text] : std::vector<std::tuple<const char*, STWValue, const char*>>{
              {"InternalImage", STWValue("yes"), "InternalImage must be a boolean"},
              {"InstallationUID", STWValue(-1), "InstallationUID must be a user id"},
-             {"Features", STWValue(1), "Features must be a dictionary"}}) {
+             {"Features", STWValue(1), "Features must be a dictionary"},
+             {"MaxConnections", STWValue(0), "MaxConnections must be a positive integer"},
+             {"FrameTimeout", STWValue("10"), "FrameTimeout must be a positive number of seconds"}}) {
         writeSettings({{key, value}});
         error.reset();
         EXPECT_FALSE(STWPlatformConfiguration::loadFromRoot(root, &error)) << key;

@@ -7,12 +7,16 @@
 #include "platform/STWPlatformConfiguration.h"
 
 #include <csignal>
-#include <fcntl.h>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
+#include <fcntl.h>
 #include <fstream>
 #include <mutex>
+#include <poll.h>
 #include <semaphore.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 #include <thread>
 #include <unistd.h>
@@ -88,6 +92,11 @@ bool STWDaemonProcess::start() {
             if (fd < 0 || dup2(fd, STDERR_FILENO) < 0)
                 _exit(126);
         }
+        if (_descriptorLimit) {
+            rlimit limit{*_descriptorLimit, *_descriptorLimit};
+            if (setrlimit(RLIMIT_NOFILE, &limit) != 0)
+                _exit(126);
+        }
         execl(STOWLYD_PATH, "stowlyd", "--root", _root.c_str(), "--idle-timeout", "0", nullptr);
         _exit(127);
     }
@@ -110,7 +119,16 @@ bool STWDaemonProcess::stop() {
         status = *_exitStatus;
     } else {
         kill(_pid, SIGTERM);
-        while (waitpid(_pid, &status, 0) < 0 && errno == EINTR) {
+        auto deadline = std::chrono::steady_clock::now() + stopTimeout;
+        while (waitpid(_pid, &status, WNOHANG) == 0) {
+            if (std::chrono::steady_clock::now() >= deadline) {
+                kill(_pid, SIGKILL);
+                waitpid(_pid, &status, 0);
+                _pid = -1;
+                _fail("stowlyd did not stop within " + std::to_string(stopTimeout.count()) + " s of SIGTERM");
+                return false;
+            }
+            std::this_thread::sleep_for(std::chrono::milliseconds(20));
         }
     }
     _pid = -1;
@@ -150,6 +168,34 @@ std::unique_ptr<STWClient> STWDaemonProcess::connect() {
     if (!client)
         _fail("cannot connect to " + socketPath().string() + ": " + (error ? error->description() : ""));
     return client;
+}
+
+int STWDaemonProcess::connectRaw() const {
+    int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::string path = socketPath();
+    if (fd < 0 || path.size() >= sizeof address.sun_path)
+        return -1;
+    memcpy(address.sun_path, path.c_str(), path.size() + 1);
+    if (::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
+        close(fd);
+        return -1;
+    }
+    return fd;
+}
+
+bool STWDaemonProcess::closedByDaemon(int fd, std::chrono::milliseconds limit) {
+    char buffer[4096];
+    auto deadline = std::chrono::steady_clock::now() + limit;
+    while (std::chrono::steady_clock::now() < deadline) {
+        pollfd p{fd, POLLIN, 0};
+        if (poll(&p, 1, 100) <= 0)
+            continue;
+        if (recv(fd, buffer, sizeof buffer, 0) <= 0)
+            return true;
+    }
+    return false;
 }
 
 std::unique_ptr<STWClient> STWDaemonProcess::connectAs(const std::string& identifier,

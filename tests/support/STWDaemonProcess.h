@@ -18,6 +18,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <sys/resource.h>
 #include <sys/types.h>
 
 class STWDaemonProcess {
@@ -36,7 +37,8 @@ public:
 
     // Starts the daemon on the root and waits until its socket accepts connections.
     bool start();
-    // SIGTERM, then waits for the exit; true when the daemon exited with status 0.
+    // SIGTERM, then waits for the exit; true when the daemon exited with status 0 within
+    // stopTimeout. One that did not is killed (and counts as a failure).
     bool stop();
     // Waits for a daemon that is to end by itself (at a crash point, say) and answers its
     // wait status, or nullopt when it still runs after `timeout`; no failure is reported.
@@ -44,11 +46,20 @@ public:
     // Where the daemon's standard error (its system log off systemd) goes from the next
     // start on; by default it is ours.
     void setStandardErrorFile(std::filesystem::path file) { _standardErrorFile = std::move(file); }
+    // The descriptor limit (soft and hard) the daemon starts with from the next start on;
+    // by default it inherits ours.
+    void setDescriptorLimit(rlim_t limit) { _descriptorLimit = limit; }
 
     // A connection that declared `identifier` with `entitlements` (developer mode).
     std::unique_ptr<STWClient> connectAs(const std::string& identifier, STWValue::Dictionary entitlements,
                                          bool sandboxed = false, std::optional<std::string> persona = std::nullopt);
     std::unique_ptr<STWClient> connect();
+    // A bare socket connected to the daemon, for tests that speak bytes rather than
+    // frames; -1 on failure. The caller closes it.
+    int connectRaw() const;
+    // True when the daemon closes `fd` (end of stream) within `limit`; whatever it sent
+    // before closing is skipped.
+    static bool closedByDaemon(int fd, std::chrono::milliseconds limit = timeout);
 
     // Sends one command and answers its "ReplyError" (0 when no reply came).
     static uint64_t replyError(STWClient& client, uint64_t command, STWValue::Dictionary keys = {});
@@ -58,6 +69,8 @@ public:
     static void setFailureHandler(std::function<void(const std::string&)> handler);
 
     static constexpr std::chrono::seconds timeout{10};
+    // Above the daemon's own bound on stopping (10 s for connections and posted work).
+    static constexpr std::chrono::seconds stopTimeout{15};
 
 private:
     static void _fail(const std::string& message);
@@ -66,4 +79,5 @@ private:
     pid_t _pid = -1;
     std::optional<int> _exitStatus; // of a daemon that ended while we looked, before stop()
     std::optional<std::filesystem::path> _standardErrorFile;
+    std::optional<rlim_t> _descriptorLimit;
 };
