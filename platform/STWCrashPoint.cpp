@@ -1,4 +1,5 @@
 #include "platform/STWCrashPoint.h"
+#include "common/STWThreadSafety.h"
 
 #include "common/STWLog.h"
 
@@ -15,17 +16,17 @@ std::atomic<bool> armed{false};
 
 namespace {
 
-std::mutex stateLock;
-std::string armedName;        // guarded by stateLock
-uint64_t remainingPasses = 0; // guarded by stateLock
-std::function<void(std::string_view)> testHandler;
+STWMutex stateLock;
+std::string armedName STW_GUARDED_BY(stateLock);
+uint64_t remainingPasses STW_GUARDED_BY(stateLock) = 0;
+std::function<void(std::string_view)> testHandler STW_GUARDED_BY(stateLock);
 
 } // namespace
 
 void _reached(const char* name) {
     std::function<void(std::string_view)> handler;
     {
-        std::lock_guard guard(stateLock);
+        STWLockGuard guard(stateLock);
         handler = testHandler;
         if (!handler && (armedName != name || --remainingPasses > 0))
             return;
@@ -58,7 +59,7 @@ void armFromEnvironment(bool internalImage) {
         STW_LOG_ERROR(STWLogCategory::Unspecified, "Ignoring STOWLY_CRASH_AT=%s: no such crash point", value);
         return;
     }
-    std::lock_guard guard(stateLock);
+    STWLockGuard guard(stateLock);
     armedName = spec;
     remainingPasses = pass;
     armed = true;
@@ -66,7 +67,7 @@ void armFromEnvironment(bool internalImage) {
 }
 
 void setHandlerForTesting(std::function<void(std::string_view name)> handler) {
-    std::lock_guard guard(stateLock);
+    STWLockGuard guard(stateLock);
     testHandler = std::move(handler);
     armed = testHandler != nullptr || !armedName.empty();
 }

@@ -24,7 +24,7 @@ class LogThrottle {
 public:
     // True when this one may be logged; `held` is then how many were not since the last.
     bool admit(uint64_t* held) {
-        std::lock_guard guard(_lock);
+        STWLockGuard guard(_lock);
         auto now = std::chrono::steady_clock::now();
         if (_lastLine && now - *_lastLine < std::chrono::seconds(1)) {
             ++_held;
@@ -36,9 +36,9 @@ public:
     }
 
 private:
-    std::mutex _lock;
-    std::optional<std::chrono::steady_clock::time_point> _lastLine;
-    uint64_t _held = 0;
+    STWMutex _lock;
+    std::optional<std::chrono::steady_clock::time_point> _lastLine STW_GUARDED_BY(_lock);
+    uint64_t _held STW_GUARDED_BY(_lock) = 0;
 };
 
 LogThrottle refusalLog;
@@ -141,7 +141,7 @@ bool STWIPCListener::stop(std::chrono::steady_clock::duration timeout) {
     }
     std::vector<std::shared_ptr<STWPeerConnection>> open;
     {
-        std::lock_guard guard(_lock);
+        STWLockGuard guard(_lock);
         for (const auto& [serial, connection] : _lock_connections)
             if (!connection.finished)
                 open.push_back(connection.peer);
@@ -152,8 +152,11 @@ bool STWIPCListener::stop(std::chrono::steady_clock::duration timeout) {
         peer->cancel();
     bool ended;
     {
-        std::unique_lock guard(_lock);
-        ended = _connectionsGone.wait_until(guard, deadline, [&] { return _lock_openConnections == 0; });
+        STWUniqueLock guard(_lock);
+        ended = _connectionsGone.wait_until(guard.native(), deadline, [&] {
+            _lock.assertHeld();
+            return _lock_openConnections == 0;
+        });
         if (!ended)
             for (const auto& [serial, connection] : _lock_connections)
                 if (!connection.finished)
@@ -165,12 +168,12 @@ bool STWIPCListener::stop(std::chrono::steady_clock::duration timeout) {
 }
 
 size_t STWIPCListener::connectionCount() const {
-    std::lock_guard guard(_lock);
+    STWLockGuard guard(_lock);
     return _lock_openConnections;
 }
 
 std::chrono::steady_clock::time_point STWIPCListener::lastConnectionChange() const {
-    std::lock_guard guard(_lock);
+    STWLockGuard guard(_lock);
     return _lock_lastConnectionChange;
 }
 
@@ -214,7 +217,7 @@ bool STWIPCListener::_admit(int fd) {
         return false;
     std::string refusal;
     {
-        std::lock_guard guard(_lock);
+        STWLockGuard guard(_lock);
         auto user = _lock_openConnectionsPerUser.find(credentials.uid);
         size_t ofUser = user == _lock_openConnectionsPerUser.end() ? 0 : user->second;
         if (_lock_openConnections >= _maxConnections)
@@ -232,7 +235,7 @@ bool STWIPCListener::_admit(int fd) {
 }
 
 void STWIPCListener::_startConnection(std::shared_ptr<STWPeerConnection> peer) {
-    std::lock_guard guard(_lock);
+    STWLockGuard guard(_lock);
     Connection& connection = _lock_connections[peer->serial()];
     connection.peer = peer;
     ++_lock_openConnections;
@@ -264,7 +267,7 @@ void STWIPCListener::_lock_connectionEnded(Connection& connection) {
 void STWIPCListener::_reapFinishedConnections() {
     std::vector<std::thread> finished;
     {
-        std::lock_guard guard(_lock);
+        STWLockGuard guard(_lock);
         for (auto it = _lock_connections.begin(); it != _lock_connections.end();) {
             if (it->second.finished) {
                 finished.push_back(std::move(it->second.thread));
@@ -312,7 +315,7 @@ void STWIPCListener::_serve(std::shared_ptr<STWPeerConnection> peer) {
                           heldBack(held, "closed for bad input"));
     }
     peer->cancel();
-    std::lock_guard guard(_lock);
+    STWLockGuard guard(_lock);
     _lock_connectionEnded(_lock_connections.at(peer->serial()));
 }
 

@@ -15,6 +15,7 @@
 #pragma once
 
 #include "common/STWError.h"
+#include "common/STWThreadSafety.h"
 #include "common/STWValue.h"
 #include "platform/STWIPCFrameBudget.h"
 #include "platform/STWPeerConnection.h"
@@ -87,7 +88,7 @@ private:
     void _serve(std::shared_ptr<STWPeerConnection> peer);
     bool _handleHello(const std::shared_ptr<STWPeerConnection>& peer, uint64_t id, const STWValue::Dictionary& body,
                       bool afterRequest);
-    void _lock_connectionEnded(Connection& connection);
+    void _lock_connectionEnded(Connection& connection) STW_REQUIRES(_lock);
 
     const Options _options;
     const ConnectionHandler _onConnection;
@@ -100,11 +101,12 @@ private:
     std::atomic<bool> _stopping{false};
     std::thread _acceptThread;
 
-    mutable std::mutex _lock;
+    mutable STWMutex _lock;
     std::condition_variable _connectionsGone;
     // By serial; an entry stays until the accept thread (or stop()) joins its thread.
-    std::map<uint64_t, Connection> _lock_connections;
-    size_t _lock_openConnections = 0;
-    std::map<uid_t, size_t> _lock_openConnectionsPerUser;
-    std::chrono::steady_clock::time_point _lock_lastConnectionChange = std::chrono::steady_clock::now();
+    std::map<uint64_t, Connection> _lock_connections STW_GUARDED_BY(_lock);
+    size_t _lock_openConnections STW_GUARDED_BY(_lock) = 0;
+    std::map<uid_t, size_t> _lock_openConnectionsPerUser STW_GUARDED_BY(_lock);
+    std::chrono::steady_clock::time_point _lock_lastConnectionChange STW_GUARDED_BY(_lock) =
+        std::chrono::steady_clock::now();
 };

@@ -84,14 +84,14 @@ bool STWPeerConnection::isAlive() const {
 
 bool STWPeerConnection::sendFrame(uint64_t kind, uint64_t id, const STWValue::Dictionary& body) {
     std::string frame = STWFrameEncode(kind, id, body);
-    std::lock_guard guard(_sendLock);
+    STWLockGuard guard(_sendLock);
     if (_cancelled.load())
         return false;
     return STWFrameWrite(_fd, frame);
 }
 
 void STWPeerConnection::cancel() {
-    std::lock_guard guard(_sendLock);
+    STWLockGuard guard(_sendLock);
     if (!_cancelled.exchange(true))
         shutdown(_fd, SHUT_RDWR);
 }

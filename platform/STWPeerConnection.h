@@ -6,6 +6,7 @@
 #pragma once
 
 #include "common/STWError.h"
+#include "common/STWThreadSafety.h"
 #include "common/STWValue.h"
 #include "platform/STWAuditToken.h"
 #include "platform/STWClientRegistry.h"
@@ -64,6 +65,6 @@ private:
     STWAuditToken _auditToken;
     std::optional<std::string> _securityLabel;
     STWClientRegistryEntryRef _declaredIdentity;
-    std::mutex _sendLock;
+    STWMutex _sendLock; // one frame at a time on the socket
     std::atomic<bool> _cancelled{false};
 };

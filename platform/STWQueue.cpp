@@ -33,7 +33,7 @@ public:
     explicit WorkerPool(STWQueue::Priority priority) : _priority(priority) {}
 
     void submit(std::function<void()> task) {
-        std::lock_guard guard(_mutex);
+        STWLockGuard guard(_mutex);
         _tasks.push_back(std::move(task));
         if (_tasks.size() <= _idle) {
             _available.notify_one();
@@ -55,12 +55,14 @@ private:
         if (_priority != STWQueue::Priority::Default)
             setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()),
                         _priority == STWQueue::Priority::Background ? 19 : -5);
-        std::unique_lock lock(_mutex);
+        STWUniqueLock lock(_mutex);
         while (true) {
             if (_tasks.empty()) {
                 ++_idle;
-                bool woken =
-                    _available.wait_for(lock, std::chrono::seconds(10), [&] { return !_tasks.empty(); });
+                bool woken = _available.wait_for(lock.native(), std::chrono::seconds(10), [&] {
+                    _mutex.assertHeld();
+                    return !_tasks.empty();
+                });
                 --_idle;
                 if (!woken) {
                     --_threads;
@@ -77,11 +79,11 @@ private:
     }
 
     const STWQueue::Priority _priority;
-    std::mutex _mutex;
+    STWMutex _mutex;
     std::condition_variable _available;
-    std::deque<std::function<void()>> _tasks;
-    size_t _idle = 0;
-    size_t _threads = 0;
+    std::deque<std::function<void()>> _tasks STW_GUARDED_BY(_mutex);
+    size_t _idle STW_GUARDED_BY(_mutex) = 0;
+    size_t _threads STW_GUARDED_BY(_mutex) = 0;
 };
 
 WorkerPool& pool(STWQueue::Priority priority) {

@@ -128,7 +128,7 @@ int STWFileSandboxMappingStore::_openItemDirectory(const STWSandboxMappingItem& 
 STWFileSandboxMappingStore::DirectoryRef STWFileSandboxMappingStore::_itemDirectory(const STWSandboxMappingItem& item,
                                                                                     bool create, int* error) {
     std::string key = directoryKey(item);
-    std::lock_guard guard(_directoriesLock);
+    STWLockGuard guard(_directoriesLock);
     if (auto it = _directoriesLock_directories.find(key); it != _directoriesLock_directories.end())
         return it->second;
     int fd = _openItemDirectory(item, create);
@@ -143,7 +143,7 @@ STWFileSandboxMappingStore::DirectoryRef STWFileSandboxMappingStore::_itemDirect
 
 void STWFileSandboxMappingStore::_forgetItemDirectory(const STWSandboxMappingItem& item,
                                                       const DirectoryRef& directory) {
-    std::lock_guard guard(_directoriesLock);
+    STWLockGuard guard(_directoriesLock);
     auto it = _directoriesLock_directories.find(directoryKey(item));
     if (it != _directoriesLock_directories.end() && it->second == directory)
         _directoriesLock_directories.erase(it);

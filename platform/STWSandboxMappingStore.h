@@ -32,6 +32,7 @@
 #pragma once
 
 #include <cstdint>
+#include "common/STWThreadSafety.h"
 #include <filesystem>
 #include <memory>
 #include <mutex>
@@ -96,7 +97,7 @@ private:
 
     const std::filesystem::path _baseDirectory;
     const std::string _temporaryPrefix;
-    std::mutex _directoriesLock;
+    STWMutex _directoriesLock;
     // "UID/PERSONA/ITEMTYPE" to its open directory.
-    std::unordered_map<std::string, DirectoryRef> _directoriesLock_directories;
+    std::unordered_map<std::string, DirectoryRef> _directoriesLock_directories STW_GUARDED_BY(_directoriesLock);
 };

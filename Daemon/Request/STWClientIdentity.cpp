@@ -1,4 +1,5 @@
 #include "Daemon/Request/STWClientIdentity.h"
+#include "common/STWThreadSafety.h"
 
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
 #include "common/STWLog.h"
@@ -12,8 +13,8 @@ namespace {
 
 // The installer sends long bursts of requests; its identity is kept while its audit
 // token stays the same, which spares the entitlement copy and the sandbox check.
-std::mutex installerCacheLock;
-STWClientIdentityRef installerCache;
+STWMutex installerCacheLock;
+STWClientIdentityRef installerCache STW_GUARDED_BY(installerCacheLock);
 
 } // namespace
 
@@ -81,7 +82,7 @@ STWClientIdentityRef STWClientIdentity::clientIdentityWithTolvanConnection(const
     STWClientIdentityRef result;
     bool fromCache = false;
     if (installer) {
-        std::lock_guard guard(installerCacheLock);
+        STWLockGuard guard(installerCacheLock);
         if (installerCache && installerCache->auditToken() == token) {
             result = installerCache;
             fromCache = true;
@@ -104,7 +105,7 @@ STWClientIdentityRef STWClientIdentity::clientIdentityWithTolvanConnection(const
                                               std::move(entitlements), sandboxed, token);
         }
         if (installer) {
-            std::lock_guard guard(installerCacheLock);
+            STWLockGuard guard(installerCacheLock);
             installerCache = result;
         }
     }
@@ -114,7 +115,7 @@ STWClientIdentityRef STWClientIdentity::clientIdentityWithTolvanConnection(const
 }
 
 void STWClientIdentity::resetInstallerCacheForTesting() {
-    std::lock_guard guard(installerCacheLock);
+    STWLockGuard guard(installerCacheLock);
     installerCache = nullptr;
 }
 

@@ -1,4 +1,5 @@
 #include "Daemon/Request/STWCommandHandlers.h"
+#include "common/STWThreadSafety.h"
 
 #include "Daemon/Lifecycle/STWTestLocks.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
@@ -139,8 +140,8 @@ STW_COMMAND_HANDLER(setTestLock) {
         return;
     }
     // Which test locks this command holds, one bit per lock, across requests.
-    static std::mutex heldLock;
-    static uint32_t held = 0;
+    static STWMutex heldLock;
+    static uint32_t held STW_GUARDED_BY(heldLock) = 0;
     uint64_t lock = STWDictionaryUInt64(request, "TestLock").value_or(0);
     bool enable = STWDictionaryBool(request, "Enable");
     auto testLocks = STWTestLocks::sharedInstance();
@@ -155,7 +156,7 @@ STW_COMMAND_HANDLER(setTestLock) {
     uint32_t bit = 1u << lock;
     if (enable) {
         {
-            std::lock_guard guard(heldLock);
+            STWLockGuard guard(heldLock);
             if (held & bit)
                 return;
             held |= bit; // claimed before the acquire, which may wait
@@ -164,13 +165,13 @@ STW_COMMAND_HANDLER(setTestLock) {
         // Not under heldLock: acquiring lock 1 waits for the daemon-wide lock, and the
         // release that lets a parked request finish must still get in.
         if (!testLocks->acquireLock(lock)) {
-            std::lock_guard guard(heldLock);
+            STWLockGuard guard(heldLock);
             held &= ~bit;
             *error = STWErrorInvalidArgument;
         }
         return;
     }
-    std::lock_guard guard(heldLock);
+    STWLockGuard guard(heldLock);
     if (!(held & bit))
         return;
     // The two daemon-wide locks are one bit pair: releasing either clears both.
