@@ -96,10 +96,13 @@ STWFrameReadResult STWFrameReader::read(STWFrame& frame, std::string* reason) {
                 _firstFrameDeadline.reset();
                 _frameDeadline.reset();
                 if (_start == _end) {
-                    // Nothing is kept between frames: a connection that waits holds no
-                    // buffer, and that of a large frame goes back at once.
+                    // The buffer of a large frame goes back at once; one chunk stays for
+                    // the next request, so that a busy connection neither allocates nor
+                    // waits in poll() before each read. A connection that has sent
+                    // nothing yet holds none.
                     _start = _end = 0;
-                    _resize(0, nullptr);
+                    if (_capacity > kReadChunk)
+                        _resize(kReadChunk, nullptr);
                 } else if (_limits.frameTimeout) {
                     _frameDeadline = Clock::now() + *_limits.frameTimeout; // the next one has begun
                 }
