@@ -9,6 +9,7 @@
 
 #include <cerrno>
 #include <cstring>
+#include <utility>
 
 std::filesystem::path STWFilePersonaService::personaFile() {
     return STWPlatformConfiguration::sharedInstance()->configurationDirectory() / "personas.plist";
@@ -60,7 +61,44 @@ std::vector<STWPersonaRecord> STWFilePersonaService::recordsFromPlist(const STWV
     return records;
 }
 
+STWFilePersonaService::STWFilePersonaService() = default;
+
+namespace {
+bool isPersonaFile(const std::string& name) { return name == "personas.plist"; }
+} // namespace
+
+void STWFilePersonaService::_watchOnce() {
+    {
+        STWLockGuard guard(_kept->lock);
+        if (std::exchange(_kept->watched, true))
+            return;
+    }
+    std::filesystem::path directory = personaFile().parent_path();
+    std::error_code ec;
+    std::filesystem::create_directories(directory, ec);
+    STWFileWatcher::sharedInstance().addWatch(directory, [kept = _kept](const std::string& name) {
+        if (isPersonaFile(name))
+            kept->drop();
+    });
+}
+
 std::vector<STWPersonaRecord> STWFilePersonaService::personaList() {
+    _watchOnce();
+    uint64_t generation;
+    {
+        STWLockGuard guard(_kept->lock);
+        if (_kept->records)
+            return *_kept->records;
+        generation = _kept->generation;
+    }
+    std::vector<STWPersonaRecord> records = _readList();
+    STWLockGuard guard(_kept->lock);
+    if (_kept->generation == generation)
+        _kept->records = records;
+    return records;
+}
+
+std::vector<STWPersonaRecord> STWFilePersonaService::_readList() {
     std::string bytes;
     int e = STWReadFileContents(personaFile(), &bytes);
     if (e == ENOENT) {
@@ -90,9 +128,12 @@ int STWFilePersonaService::registerForPersonaListUpdates(const std::string& obse
     std::filesystem::path directory = personaFile().parent_path();
     std::error_code ec;
     std::filesystem::create_directories(directory, ec);
-    int token = STWFileWatcher::sharedInstance().addWatch(directory, [onUpdate](const std::string& name) {
-        if (name == "personas.plist")
-            onUpdate();
+    // The kept list goes first: an observer that asks at once must see the new one.
+    int token = STWFileWatcher::sharedInstance().addWatch(directory, [onUpdate, kept = _kept](const std::string& name) {
+        if (!isPersonaFile(name))
+            return;
+        kept->drop();
+        onUpdate();
     });
     if (token < 0) {
         completion(STW_POSIX_ERROR_NOLOG(errno, "Could not watch %@ for %@", directory, observerName));

@@ -2,12 +2,17 @@
 // "PersonaUniqueString" (string), "PersonaID" (integer), "Type" ("personal",
 // "enterprise", "universal" or "system"), "BundleIdentifiers" (array of strings),
 // "HomeLayoutPath" (absolute path, enterprise personas) and "KernelType" (integer).
-// Without the file there is one personal persona for the mobile user. Changes of the
-// file are noticed with inotify and reported as persona-list updates.
+// Without the file there is one personal persona for the mobile user. The list is read
+// once and kept; a change of the file (noticed with inotify) drops what was kept before it
+// is reported as a persona-list update, so no request reads the file.
 #pragma once
 
 #include "common/STWValue.h"
+#include "common/STWThreadSafety.h"
 #include "platform/STWPersonaService.h"
+
+#include <memory>
+#include <optional>
 
 
 class STWFilePersonaService : public STWPersonaService {
@@ -20,7 +25,28 @@ public:
                                       std::function<void(STWErrorRef)> completion) override;
     void unregisterForPersonaListUpdates(int token) override;
 
+    STWFilePersonaService();
+
     static std::filesystem::path personaFile();
     // Parses the file's dictionary entries; invalid entries are logged and skipped.
     static std::vector<STWPersonaRecord> recordsFromPlist(const STWValue& root);
+
+private:
+    // Shared with the watches, which may outlive a service that tests replace.
+    struct Kept {
+        STWMutex lock;
+        std::optional<std::vector<STWPersonaRecord>> records STW_GUARDED_BY(lock);
+        // Counts the changes, so that a list read while the file changed is not kept.
+        uint64_t generation STW_GUARDED_BY(lock) = 0;
+        bool watched STW_GUARDED_BY(lock) = false;
+        void drop() {
+            STWLockGuard guard(lock);
+            records.reset();
+            ++generation;
+        }
+    };
+    static std::vector<STWPersonaRecord> _readList();
+    // Drops the kept list when the file changes (also without an observer).
+    void _watchOnce();
+    std::shared_ptr<Kept> _kept = std::make_shared<Kept>();
 };

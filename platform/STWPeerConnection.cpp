@@ -99,3 +99,13 @@ void STWPeerConnection::cancel() {
 std::string STWPeerConnection::description() const {
     return STWFormat("<connection %llu: pid %d, uid %u, gid %u>", _serial, _pid, _uid, _gid);
 }
+
+std::shared_ptr<const void> STWPeerConnection::context() const {
+    STWLockGuard guard(_contextLock);
+    return _context;
+}
+
+void STWPeerConnection::setContext(std::shared_ptr<const void> context) {
+    STWLockGuard guard(_contextLock);
+    _context = std::move(context);
+}

@@ -44,6 +44,12 @@ public:
     const STWClientRegistryEntryRef& declaredIdentity() const { return _declaredIdentity; }
     void setDeclaredIdentity(STWClientRegistryEntryRef identity) { _declaredIdentity = std::move(identity); }
 
+    // What the daemon derives once per connection from who is on the other end (the
+    // caller's client identity): the credentials and the pidfd never change, so the
+    // first request builds it and the others reuse it.
+    std::shared_ptr<const void> context() const;
+    void setContext(std::shared_ptr<const void> context);
+
     // Sends one frame; false when the peer is gone.
     bool sendFrame(uint64_t kind, uint64_t id, const STWValue::Dictionary& body);
     // Shuts the socket down: the reading side sees the end of the stream and no more
@@ -66,5 +72,7 @@ private:
     std::optional<std::string> _securityLabel;
     STWClientRegistryEntryRef _declaredIdentity;
     STWMutex _sendLock; // one frame at a time on the socket
+    mutable STWMutex _contextLock;
+    std::shared_ptr<const void> _context STW_GUARDED_BY(_contextLock);
     std::atomic<bool> _cancelled{false};
 };

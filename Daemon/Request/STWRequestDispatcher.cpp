@@ -124,10 +124,20 @@ void STWRequestDispatcher::processTolvanEvent(const std::shared_ptr<STWPeerConne
                                               const STWValue::Dictionary& request) {
     auto reply = std::make_shared<STWReply>(peer, requestID);
     uint64_t command = STWDictionaryUInt64(request, "Command").value_or(0);
-    // Only commands that exist need to know who is asking.
+    // Only commands that exist need to know who is asking; that is worked out once per
+    // connection (a caller that is nobody stays nobody).
+    struct Caller {
+        STWClientIdentityRef identity;
+    };
     STWClientIdentityRef clientIdentity;
-    if (command < STWCommandCount)
-        clientIdentity = STWClientIdentity::clientIdentityWithTolvanConnection(*peer);
+    if (command < STWCommandCount) {
+        auto caller = std::static_pointer_cast<const Caller>(peer->context());
+        if (!caller) {
+            caller = std::make_shared<const Caller>(Caller{STWClientIdentity::clientIdentityWithTolvanConnection(*peer)});
+            peer->setContext(caller);
+        }
+        clientIdentity = caller->identity;
+    }
     uint64_t error = STWErrorSuccess;
     if (dispatch(request, reply, clientIdentity, &error))
         reply->sendWithError(error);

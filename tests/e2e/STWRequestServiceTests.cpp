@@ -159,17 +159,20 @@ TEST_F(STWRequestServiceTest, RegistryIdentifiesProgramsByTheirPinnedExecutable)
                                {"Executable", STWValue(self)},
                                {"Entitlements", STWValue(allowed)}};
     auto file = daemon->root() / "etc/stowly/clients.d/e2e.plist";
-    // The registry follows its directory: poll until the daemon sees each change.
+    // The registry follows its directory: poll until the daemon sees each change. Who a
+    // caller is is settled when it connects, so every probe is a new connection.
     auto waitFor = [&](uint64_t expected) {
         uint64_t code = 0;
         for (int i = 0; i < 250 && code != expected; i++) {
             std::this_thread::sleep_for(std::chrono::milliseconds(20));
-            code = STWDaemonProcess::replyError(*anonymous, 2);
+            code = STWDaemonProcess::replyError(*daemon->connect(), 2);
         }
         return code;
     };
     ASSERT_TRUE(STW_writeToURL(entry, file, STWWriteAtomic, nullptr));
     EXPECT_EQ(waitFor(STWErrorUnsupportedCommand), STWErrorUnsupportedCommand);
+    // A connection made before is still who it was when it connected.
+    EXPECT_EQ(STWDaemonProcess::replyError(*anonymous, 2), STWErrorNotEntitled);
     // The same entry pinned to another digest identifies nobody.
     entry["SHA256"] = STWValue(std::string(64, '0'));
     ASSERT_TRUE(STW_writeToURL(entry, file, STWWriteAtomic, nullptr));
