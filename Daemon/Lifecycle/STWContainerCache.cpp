@@ -147,7 +147,7 @@ void STWContainerCache::RebuildMappingPushes::_send() {
                 return;
             try {
                 if (!_cache._setSandboxContainerMappingForUserIdentity(record->userIdentity(), record->identifier(),
-                                                                       _contentClass, record->url()))
+                                                                       _contentClass, record->url(), true))
                     STW_LOG_ERROR(STWLogCategory::Cache,
                                   "Failed to set container mapping during create/lookup operation of %@, %llu",
                                   record->identifier(), _contentClass);
@@ -590,7 +590,8 @@ bool STWContainerCache::setSandboxContainerMappingForUserIdentity(const STWUserI
 bool STWContainerCache::_setSandboxContainerMappingForUserIdentity(const STWUserIdentityRef& userIdentity,
                                                                    const std::string& identifier,
                                                                    STWContainerClass containerClass,
-                                                                   const std::optional<fs::path>& url) {
+                                                                   const std::optional<fs::path>& url,
+                                                                   bool keepIfCurrent) {
     if (STWContainerClassIsBundle(containerClass))
         return true;
     std::optional<uint32_t> itemType = STWContainerClassSandboxItemType(containerClass);
@@ -615,6 +616,10 @@ bool STWContainerCache::_setSandboxContainerMappingForUserIdentity(const STWUser
     const char* path = url ? url->c_str() : nullptr;
     auto store = STWSandboxMappingStore::sharedInstance();
 
+    // After a restart the store mostly holds what a rebuild pushes already: one read
+    // instead of a removal and a new link.
+    if (keepIfCurrent && url && store->userStateItem(item) == *url)
+        return true;
     if (int e = store->setUserStateItem(item, std::nullopt)) {
         STW_LOG_ERROR(STWLogCategory::Sandbox,
                       "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, class: %llu, path: %s : %d",

@@ -172,9 +172,11 @@ private:
     bool _removeContainerForUserIdentity(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass,
                                          const std::string& identifier, bool transient,
                                          const STWMetadataRef& onlyRecord, STWErrorRef* error);
+    // With `keepIfCurrent` a mapping that is already `url` is left as it is (rebuilds).
     bool _setSandboxContainerMappingForUserIdentity(const STWUserIdentityRef& userIdentity,
                                                     const std::string& identifier, STWContainerClass containerClass,
-                                                    const std::optional<std::filesystem::path>& url);
+                                                    const std::optional<std::filesystem::path>& url,
+                                                    bool keepIfCurrent = false);
     // The stale-record check shared by the single and the bulk look-up: nullptr and the
     // (logged) error when the record has no usable path or its metadata file is gone (then
     // the record is dropped).
