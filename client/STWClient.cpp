@@ -3,7 +3,7 @@
 #include "common/STWException.h"
 
 #include "common/STWLog.h"
-#include "platform/STWIPCFrame.h"
+#include "common/STWIPCFrame.h"
 
 #include <algorithm>
 #include <cerrno>

@@ -1,7 +1,7 @@
 #include "platform/STWIPCListener.h"
 
 #include "common/STWLog.h"
-#include "platform/STWIPCFrame.h"
+#include "common/STWIPCFrame.h"
 
 #include <algorithm>
 #include <cerrno>

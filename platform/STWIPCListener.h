@@ -17,7 +17,7 @@
 #include "common/STWError.h"
 #include "common/STWThreadSafety.h"
 #include "common/STWValue.h"
-#include "platform/STWIPCFrameBudget.h"
+#include "common/STWIPCFrameBudget.h"
 #include "platform/STWPeerConnection.h"
 #include "platform/STWPlatformConfiguration.h"
 

@@ -1,7 +1,7 @@
 #include "platform/STWPeerConnection.h"
 
 #include "common/STWFormat.h"
-#include "platform/STWIPCFrame.h"
+#include "common/STWIPCFrame.h"
 
 #include <cerrno>
 #include <csignal>

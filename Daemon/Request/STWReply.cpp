@@ -1,6 +1,6 @@
 #include "Daemon/Request/STWReply.h"
 
-#include "platform/STWIPCFrame.h"
+#include "common/STWIPCFrame.h"
 #include "platform/STWPeerConnection.h"
 
 bool STWReply::sendWithError(uint64_t error) {

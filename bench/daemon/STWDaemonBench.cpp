@@ -24,7 +24,7 @@
 #include "common/STWFileIO.h"
 #include "common/STWLog.h"
 #include "common/STWPropertyList.h"
-#include "platform/STWIPCFrame.h"
+#include "common/STWIPCFrame.h"
 #include "platform/STWPlatformConfiguration.h"
 #include "tests/support/STWDaemonProcess.h"
 

@@ -3,7 +3,7 @@
 // Whatever decodes must encode again and decode back to the same value. The input is
 // copied to memory of exactly its size so that any read past it is caught.
 #include "common/STWMessagePack.h"
-#include "platform/STWIPCFrame.h"
+#include "common/STWIPCFrame.h"
 
 #include <cmath>
 #include <cstdio>

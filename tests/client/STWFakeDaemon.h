@@ -3,7 +3,7 @@
 // scripts speak raw frames, so they can answer out of order, late, never or wrongly.
 #pragma once
 
-#include "platform/STWIPCFrame.h"
+#include "common/STWIPCFrame.h"
 
 #include <filesystem>
 #include <functional>

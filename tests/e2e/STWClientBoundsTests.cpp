@@ -5,7 +5,7 @@
 
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWError.h"
-#include "platform/STWIPCFrame.h"
+#include "common/STWIPCFrame.h"
 
 #include <gtest/gtest.h>
 

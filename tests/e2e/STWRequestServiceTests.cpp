@@ -3,7 +3,7 @@
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWError.h"
 #include "common/STWMessagePack.h"
-#include "platform/STWIPCFrame.h"
+#include "common/STWIPCFrame.h"
 #include "platform/STWIPCListener.h"
 
 #include <gtest/gtest.h>

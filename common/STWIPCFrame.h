@@ -9,7 +9,7 @@
 
 #include "common/STWMessagePack.h"
 #include "common/STWValue.h"
-#include "platform/STWIPCFrameBudget.h"
+#include "common/STWIPCFrameBudget.h"
 
 #include <chrono>
 #include <cstddef>

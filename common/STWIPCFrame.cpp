@@ -1,4 +1,4 @@
-#include "platform/STWIPCFrame.h"
+#include "common/STWIPCFrame.h"
 
 #include "common/STWFormat.h"
 

@@ -1,4 +1,4 @@
-#include "platform/STWIPCFrameBudget.h"
+#include "common/STWIPCFrameBudget.h"
 
 #include "common/STWLog.h"
 

@@ -1,5 +1,5 @@
 #include "common/STWMessagePack.h"
-#include "platform/STWIPCFrame.h"
+#include "common/STWIPCFrame.h"
 
 #include <gtest/gtest.h>
 
