@@ -1,8 +1,11 @@
 #include "platform/STWUserDatabase.h"
 
+#include "common/STWLog.h"
 #include "platform/STWPlatformConfiguration.h"
 
+#include <climits>
 #include <cstdio>
+#include <cstdlib>
 #include <functional>
 #include <grp.h>
 #include <pwd.h>
@@ -88,4 +91,17 @@ std::optional<gid_t> STWUserDatabase::groupIDWithName(std::string_view name) {
     if (getgrnam_r(key.c_str(), &entry, buffer.data(), buffer.size(), &result) != 0 || !result)
         return std::nullopt;
     return result->gr_gid;
+}
+
+std::filesystem::path STWUserDatabase::homeDirectoryURLForPOSIXUID(uid_t uid) {
+    char real[PATH_MAX] = {};
+    auto user = userWithUID(uid);
+    if (!user)
+        STW_LOG_ERROR(STWLogCategory::FS, "Failed to getpwuid for uid: %u", uid);
+    else if (user->homeDirectory.is_absolute() && realpath(user->homeDirectory.c_str(), real))
+        return real;
+    STW_LOG_ERROR(STWLogCategory::FS, "Failed to get home dir using getpwuid for uid: %u", uid);
+    // Real too, so that the paths made from either compare equal.
+    std::filesystem::path mobile = STWPlatformConfiguration::sharedInstance()->resolve("/private/var/mobile");
+    return realpath(mobile.c_str(), real) ? std::filesystem::path(real) : mobile;
 }

@@ -22,20 +22,6 @@ STWFileManager* STWFileManager::defaultManager() {
     return manager;
 }
 
-fs::path STWFileManager::homeDirectoryURLForPOSIXUID(uid_t uid) {
-    auto configuration = STWPlatformConfiguration::sharedInstance();
-    auto user = STWUserDatabase::userWithUID(uid);
-    if (!user) {
-        STW_LOG_ERROR(STWLogCategory::FS, "Failed to getpwuid for uid: %u", uid);
-    } else if (user->homeDirectory.is_absolute()) {
-        char real[PATH_MAX] = {};
-        if (realpath(user->homeDirectory.c_str(), real))
-            return pathString(real);
-    }
-    STW_LOG_ERROR(STWLogCategory::FS, "Failed to get home dir using getpwuid for uid: %u", uid);
-    return configuration->resolve("/private/var/mobile");
-}
-
 namespace {
 
 // The make-path routine: 0, EEXIST when the directory was there, or the errno.

@@ -64,10 +64,6 @@ public:
 
     static STWFileManager* defaultManager();
 
-    // The home directory of `uid` from the users database (ROOT/etc/passwd under a private
-    // root prefix, else the system's), resolved under the root prefix; the mobile user's
-    // home when there is none.
-    static std::filesystem::path homeDirectoryURLForPOSIXUID(uid_t uid);
 
     // Removes the item and, for a directory, everything below it; symbolic links are removed,
     // never followed. A missing item is removed successfully. A user-immutable item is

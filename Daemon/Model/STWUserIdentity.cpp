@@ -1,4 +1,5 @@
 #include "Daemon/Model/STWUserIdentity.h"
+#include "platform/STWUserDatabase.h"
 
 #include "Daemon/FileSystem/STWFileManager.h"
 #include "Daemon/Model/STWUserIdentityCache.h"
@@ -78,12 +79,12 @@ STWUserIdentityRef STWUserIdentity::initWithUID(uid_t uid, gid_t gid, const std:
 }
 
 STWUserIdentityRef STWUserIdentity::init() {
-    return initWithUID(501, 501, STWFileManager::homeDirectoryURLForPOSIXUID(501), std::nullopt, STWPersonaTypePersonal,
+    return initWithUID(501, 501, STWUserDatabase::homeDirectoryURLForPOSIXUID(501), std::nullopt, STWPersonaTypePersonal,
                        501);
 }
 
 STWUserIdentityRef STWUserIdentity::copyWithUID(uid_t uid, gid_t gid) const {
-    std::filesystem::path home = isEnterprise() ? _homeDirectoryURL : STWFileManager::homeDirectoryURLForPOSIXUID(uid);
+    std::filesystem::path home = isEnterprise() ? _homeDirectoryURL : STWUserDatabase::homeDirectoryURLForPOSIXUID(uid);
     return initWithUID(uid, gid, home, _personaUniqueString, _personaType, _kernelPersonaID);
 }
 

@@ -1,4 +1,5 @@
 #include "Daemon/Model/STWUserIdentityCache.h"
+#include "platform/STWUserDatabase.h"
 
 #include "Daemon/FileSystem/STWFileManager.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
@@ -73,7 +74,7 @@ STWUserIdentityRef STWUserIdentityCache::defaultUserIdentity() {
         uid_t uid;
         gid_t gid;
         mobileIDs(uid, gid);
-        return STWUserIdentity::initWithUID(uid, gid, STWFileManager::homeDirectoryURLForPOSIXUID(uid), std::nullopt,
+        return STWUserIdentity::initWithUID(uid, gid, STWUserDatabase::homeDirectoryURLForPOSIXUID(uid), std::nullopt,
                                             STWPersonaTypePersonal, uid);
     }();
     return identity;
@@ -436,7 +437,7 @@ STWUserIdentityRef STWUserIdentityCache::userIdentityWithPersonaAttributes(const
     uint32_t kernelPersonaID = attributes ? attributes->personaID : uid;
     std::filesystem::path home = attributes && attributes->isEnterprise() && attributes->homeLayoutPath
                                      ? *attributes->homeLayoutPath
-                                     : STWFileManager::homeDirectoryURLForPOSIXUID(uid);
+                                     : STWUserDatabase::homeDirectoryURLForPOSIXUID(uid);
     uint32_t type = STWPersonaTypeUnspecific;
     if (!forceUnspecific && attributes) {
         if (attributes->isPersonal())

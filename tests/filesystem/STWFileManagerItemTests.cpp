@@ -1,4 +1,5 @@
 #include "platform/STWKeybag.h"
+#include "platform/STWUserDatabase.h"
 #include "common/STWFileIO.h"
 #include "platform/STWPlatformConfiguration.h"
 #include "tests/filesystem/STWFileSystemTestSupport.h"
@@ -275,10 +276,10 @@ TEST_F(Items, DiskUsageCountsAllocatedBytesLikeDu) {
 
 TEST_F(Items, HomeDirectoriesResolveUnderTheRoot) {
     fs::path mobile = STWTestRoot::shared().resolve("/private/var/mobile");
-    EXPECT_EQ(STWFileManager::homeDirectoryURLForPOSIXUID(501), fs::canonical(mobile));
+    EXPECT_EQ(STWUserDatabase::homeDirectoryURLForPOSIXUID(501), fs::canonical(mobile));
     // A user without an entry, or whose home is missing, gets the mobile user's home.
-    EXPECT_EQ(STWFileManager::homeDirectoryURLForPOSIXUID(4242), mobile);
-    EXPECT_EQ(STWFileManager::homeDirectoryURLForPOSIXUID(502), mobile);
+    EXPECT_EQ(STWUserDatabase::homeDirectoryURLForPOSIXUID(4242), mobile);
+    EXPECT_EQ(STWUserDatabase::homeDirectoryURLForPOSIXUID(502), mobile);
 }
 
 } // namespace
