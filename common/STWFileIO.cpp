@@ -1,5 +1,8 @@
 #include "common/STWFileIO.h"
 
+#include "common/STWFileDescriptor.h"
+#include "common/STWSystemCall.h"
+
 #include <cerrno>
 #include <cstdlib>
 #include <fcntl.h>
@@ -10,12 +13,9 @@ int STWWriteAll(int fd, std::string_view contents) {
     const char* p = contents.data();
     size_t left = contents.size();
     while (left > 0) {
-        ssize_t n = write(fd, p, left);
-        if (n < 0) {
-            if (errno == EINTR)
-                continue;
+        ssize_t n = STWRetryOnEINTR([&] { return write(fd, p, left); });
+        if (n < 0)
             return errno;
-        }
         p += n;
         left -= static_cast<size_t>(n);
     }
@@ -33,19 +33,15 @@ int closeChecked(int fd) {
 int STWReadFileContents(const std::filesystem::path& path, std::string* contents, unsigned options,
                         size_t maxSize) {
     int flags = O_RDONLY | O_CLOEXEC | ((options & STWReadNoFollow) ? O_NOFOLLOW : 0);
-    int fd = open(path.c_str(), flags);
-    if (fd < 0)
+    STWFileDescriptor fd(open(path.c_str(), flags));
+    if (!fd)
         return errno;
     struct stat st;
-    int e = 0;
-    if (fstat(fd, &st) != 0)
-        e = errno;
-    else if (!S_ISREG(st.st_mode))
-        e = S_ISDIR(st.st_mode) ? EISDIR : EINVAL;
-    else
-        e = STWReadDescriptorContents(fd, static_cast<size_t>(st.st_size), contents, maxSize);
-    close(fd);
-    return e;
+    if (fstat(fd.get(), &st) != 0)
+        return errno;
+    if (!S_ISREG(st.st_mode))
+        return S_ISDIR(st.st_mode) ? EISDIR : EINVAL;
+    return STWReadDescriptorContents(fd.get(), static_cast<size_t>(st.st_size), contents, maxSize);
 }
 
 int STWReadDescriptorContents(int fd, size_t expectedSize, std::string* contents, size_t maxSize) {
@@ -65,12 +61,9 @@ int STWReadDescriptorContents(int fd, size_t expectedSize, std::string* contents
             }
             data.resize(std::min(maxSize, data.size() + 4096));
         }
-        ssize_t n = read(fd, data.data() + used, data.size() - used);
-        if (n < 0) {
-            if (errno == EINTR)
-                continue;
+        ssize_t n = STWRetryOnEINTR([&] { return read(fd, data.data() + used, data.size() - used); });
+        if (n < 0)
             return errno;
-        }
         if (n == 0)
             break;
         used += static_cast<size_t>(n);

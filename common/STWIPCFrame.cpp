@@ -1,5 +1,7 @@
 #include "common/STWIPCFrame.h"
 
+#include "common/STWSystemCall.h"
+
 #include "common/STWFormat.h"
 
 #include <algorithm>
@@ -224,12 +226,9 @@ bool STWFrameWrite(int fd, std::string_view encodedFrame) {
     const char* p = encodedFrame.data();
     size_t left = encodedFrame.size();
     while (left > 0) {
-        ssize_t n = send(fd, p, left, MSG_NOSIGNAL);
-        if (n < 0) {
-            if (errno == EINTR)
-                continue;
+        ssize_t n = STWRetryOnEINTR([&] { return send(fd, p, left, MSG_NOSIGNAL); });
+        if (n < 0)
             return false;
-        }
         p += n;
         left -= static_cast<size_t>(n);
     }

@@ -1,4 +1,5 @@
 #include "common/STWValue.h"
+#include "common/STWSystemCall.h"
 
 #include "common/STWFormat.h"
 
@@ -12,10 +13,6 @@
 #include <unistd.h>
 
 namespace {
-
-size_t combine(size_t seed, size_t v) {
-    return seed ^ (v + 0x9e3779b97f4a7c15ULL + (seed << 6) + (seed >> 2));
-}
 
 void appendQuoted(std::string& out, const std::string& s) {
     out += '"';
@@ -93,7 +90,7 @@ size_t std::hash<STWUUID>::operator()(const STWUUID& u) const noexcept {
     uint64_t a, b;
     memcpy(&a, u.bytes.data(), 8);
     memcpy(&b, u.bytes.data() + 8, 8);
-    return combine(std::hash<uint64_t>()(a), std::hash<uint64_t>()(b));
+    return STWHashCombine(std::hash<uint64_t>()(a), std::hash<uint64_t>()(b));
 }
 
 STWDate STWDate::now() {
@@ -243,33 +240,33 @@ size_t STWValue::hash() const {
     case 0:
         return seed;
     case 1:
-        return combine(seed, std::get<bool>(_v));
+        return STWHashCombine(seed, std::get<bool>(_v));
     case 2:
-        return combine(seed, std::hash<uint64_t>()(std::get<uint64_t>(_v)));
+        return STWHashCombine(seed, std::hash<uint64_t>()(std::get<uint64_t>(_v)));
     case 3:
-        return combine(seed, std::hash<int64_t>()(std::get<int64_t>(_v)));
+        return STWHashCombine(seed, std::hash<int64_t>()(std::get<int64_t>(_v)));
     case 4:
-        return combine(seed, std::hash<double>()(std::get<double>(_v)));
+        return STWHashCombine(seed, std::hash<double>()(std::get<double>(_v)));
     case 5:
-        return combine(seed, std::hash<std::string>()(std::get<std::string>(_v)));
+        return STWHashCombine(seed, std::hash<std::string>()(std::get<std::string>(_v)));
     case 6: {
         const STWData& d = std::get<STWData>(_v);
-        return combine(seed, std::hash<std::string_view>()(
+        return STWHashCombine(seed, std::hash<std::string_view>()(
                                  std::string_view(reinterpret_cast<const char*>(d.data()), d.size())));
     }
     case 7: {
         const STWDate& d = std::get<STWDate>(_v);
-        return combine(combine(seed, std::hash<int64_t>()(d.seconds)), d.nanoseconds);
+        return STWHashCombine(STWHashCombine(seed, std::hash<int64_t>()(d.seconds)), d.nanoseconds);
     }
     case 8:
-        return combine(seed, std::hash<STWUUID>()(std::get<STWUUID>(_v)));
+        return STWHashCombine(seed, std::hash<STWUUID>()(std::get<STWUUID>(_v)));
     case 9:
         for (const STWValue& v : *array())
-            seed = combine(seed, v.hash());
+            seed = STWHashCombine(seed, v.hash());
         return seed;
     default:
         for (const auto& [k, v] : *dictionary())
-            seed = combine(combine(seed, std::hash<std::string>()(k)), v.hash());
+            seed = STWHashCombine(STWHashCombine(seed, std::hash<std::string>()(k)), v.hash());
         return seed;
     }
 }

@@ -1,5 +1,8 @@
 #include "platform/STWClientRegistry.h"
 
+#include "common/STWFileDescriptor.h"
+#include "common/STWSystemCall.h"
+
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWLog.h"
 #include "platform/STWFileWatcher.h"
@@ -147,22 +150,17 @@ STWClientRegistryEntryRef STWClientRegistry::entryForPeer(const STWPeerConnectio
     std::string procExe = "/proc/" + std::to_string(peer.pid()) + "/exe";
     char target[PATH_MAX];
     ssize_t length = readlink(procExe.c_str(), target, sizeof target - 1);
-    int fd = length >= 0 ? open(procExe.c_str(), O_RDONLY | O_CLOEXEC) : -1;
-    if (length < 0 || fd < 0) {
+    STWFileDescriptor fd(length >= 0 ? open(procExe.c_str(), O_RDONLY | O_CLOEXEC) : -1);
+    if (length < 0 || !fd) {
         STWSetError(error, STW_POSIX_ERROR_NOLOG(errno, "Cannot read the executable of pid %d", peer.pid()));
-        if (fd >= 0)
-            close(fd);
         return nullptr;
     }
     target[length] = '\0';
     if (!peer.isAlive()) {
-        close(fd);
         STWSetError(error, STW_POSIX_ERROR_NOLOG(ESRCH, "Process %d exited", peer.pid()));
         return nullptr;
     }
-    auto entry = entryForExecutable(target, fd, error);
-    close(fd);
-    return entry;
+    return entryForExecutable(target, fd.get(), error);
 }
 
 STWClientRegistryEntryRef STWClientRegistry::entryForExecutable(const std::filesystem::path& path,
@@ -213,9 +211,7 @@ std::optional<std::string> STWClientRegistry::_digestOfExecutable(int fd, STWErr
     char buffer[65536];
     off_t offset = 0;
     while (true) {
-        ssize_t n = pread(fd, buffer, sizeof buffer, offset);
-        if (n < 0 && errno == EINTR)
-            continue;
+        ssize_t n = STWRetryOnEINTR([&] { return pread(fd, buffer, sizeof buffer, offset); });
         if (n < 0) {
             STWSetError(error, STW_POSIX_ERROR_NOLOG(errno, "Cannot read an executable"));
             return std::nullopt;

@@ -1,12 +1,9 @@
 #include "Daemon/CodeSigning/STWCodeSigningEntry.h"
+#include "common/STWSystemCall.h"
 
 #include "common/STWFormat.h"
 
 namespace {
-
-size_t combine(size_t seed, size_t value) {
-    return seed ^ (value + 0x9e3779b97f4a7c15ULL + (seed << 6) + (seed >> 2));
-}
 
 // An absent value hashes as 0, so "no child list" and "no dictionary" drop out of the XOR.
 size_t hashChildren(const std::optional<std::vector<std::string>>& children) {
@@ -14,7 +11,7 @@ size_t hashChildren(const std::optional<std::vector<std::string>>& children) {
         return 0;
     size_t seed = std::hash<size_t>()(children->size());
     for (const std::string& child : *children)
-        seed = combine(seed, std::hash<std::string>()(child));
+        seed = STWHashCombine(seed, std::hash<std::string>()(child));
     return seed;
 }
 
@@ -23,7 +20,7 @@ size_t hashDictionary(const std::optional<STWValue::Dictionary>& dictionary) {
         return 0;
     size_t seed = std::hash<size_t>()(dictionary->size());
     for (const auto& [key, value] : *dictionary)
-        seed = combine(combine(seed, std::hash<std::string>()(key)), value.hash());
+        seed = STWHashCombine(STWHashCombine(seed, std::hash<std::string>()(key)), value.hash());
     return seed;
 }
 

@@ -1,5 +1,7 @@
 #include "Daemon/FileSystem/STWDirectoryWalker.h"
 
+#include "common/STWSystemCall.h"
+
 #include <cerrno>
 #include <cstring>
 #include <dirent.h>
@@ -25,12 +27,9 @@ int STWDirectoryWalker::_readEntries(int fd, std::vector<Entry>* entries) {
     // The whole directory is read before anything in it changes, so removing entries
     // never makes the read skip or repeat one.
     for (;;) {
-        ssize_t n = getdents64(fd, _buffer.data(), _buffer.size());
-        if (n < 0) {
-            if (errno == EINTR)
-                continue;
+        ssize_t n = STWRetryOnEINTR([&] { return getdents64(fd, _buffer.data(), _buffer.size()); });
+        if (n < 0)
             return errno;
-        }
         if (n == 0)
             return 0;
         for (ssize_t offset = 0; offset < n;) {

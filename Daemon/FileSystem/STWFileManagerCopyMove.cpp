@@ -4,7 +4,9 @@
 
 #include "Daemon/FileSystem/STWDirectoryWalker.h"
 #include "Daemon/FileSystem/STWFileSystemPrimitives.h"
+#include "common/STWFileIO.h"
 #include "common/STWLog.h"
+#include "common/STWSystemCall.h"
 
 #include <acl/libacl.h>
 #include <cerrno>
@@ -162,23 +164,11 @@ int copyData(int sourceFd, int destinationFd) {
     }
     std::vector<char> buffer(128 * 1024);
     for (;;) {
-        ssize_t n = read(sourceFd, buffer.data(), buffer.size());
-        if (n < 0) {
-            if (errno == EINTR)
-                continue;
-            return errno;
-        }
-        if (n == 0)
-            return 0;
-        for (ssize_t written = 0; written < n;) {
-            ssize_t w = write(destinationFd, buffer.data() + written, static_cast<size_t>(n - written));
-            if (w < 0) {
-                if (errno == EINTR)
-                    continue;
-                return errno;
-            }
-            written += w;
-        }
+        ssize_t n = STWRetryOnEINTR([&] { return read(sourceFd, buffer.data(), buffer.size()); });
+        if (n <= 0)
+            return n < 0 ? errno : 0;
+        if (int e = STWWriteAll(destinationFd, std::string_view(buffer.data(), static_cast<size_t>(n))))
+            return e;
     }
 }
 

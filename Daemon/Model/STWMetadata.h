@@ -12,7 +12,7 @@
 // tell that the file it found is still the one it read.
 #pragma once
 
-#include "Daemon/FileSystem/STWFileDescriptor.h"
+#include "common/STWFileDescriptor.h"
 #include "Daemon/Model/STWConcreteContainerIdentity.h"
 #include "common/STWError.h"
 #include "common/STWValue.h"

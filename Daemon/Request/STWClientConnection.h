@@ -4,7 +4,7 @@
 // runs on privileged connections.
 #pragma once
 
-#include "Daemon/FileSystem/STWFileDescriptor.h"
+#include "common/STWFileDescriptor.h"
 #include "Daemon/Lifecycle/STWCommandQueue.h"
 #include "Daemon/Model/STWConcreteContainerIdentity.h"
 #include "Daemon/Model/STWContainerClass.h"
