@@ -35,7 +35,7 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
         STWContainerClass c = identity->containerClass();
         STWWhitelistRef whitelist = STWWhitelist::sharedWhitelist();
         bool whitelisted = whitelist->isLookupWhitelistedFromCodeSignIdentifier(client.value_or(""), c, id);
-        bool isGroup = c == STWContainerClassSharedAppGroup || c == STWContainerClassSharedSystemGroup;
+        bool isGroup = STWContainerClassIsGroup(c);
         bool allowed = (client && *client == id) || allowOtherIdLookup() || (isGroup && allowGroupIdLookup()) ||
                        unrestricted() || isEntitledForLookupWithClass(c, id) || whitelisted;
         if (!allowed) {

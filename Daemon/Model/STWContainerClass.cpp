@@ -37,6 +37,10 @@ bool STWContainerClassIsChildData(STWContainerClass c) { return inSet(c, bit(4) 
 
 bool STWContainerClassIsGroup(STWContainerClass c) { return inSet(c, bit(7) | bit(13)); }
 
+bool STWContainerClassTakesContainerExtension(STWContainerClass c) {
+    return inSet(c, bit(2) | bit(4) | bit(6) | bit(10));
+}
+
 bool STWContainerClassRegistersOnlyForEntitledUsers(STWContainerClass c) {
     return inSet(c, bit(2) | bit(4) | bit(6) | bit(9) | bit(10) | bit(11));
 }

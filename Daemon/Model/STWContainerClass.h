@@ -37,6 +37,8 @@ bool STWContainerClassIsGlobal(STWContainerClass c);               // bundle and
 bool STWContainerClassIsPerUser(STWContainerClass c);              // {2, 4, 6, 7, 9, 10, 11}
 bool STWContainerClassIsChildData(STWContainerClass c);            // {4, 6}
 bool STWContainerClassIsGroup(STWContainerClass c);                // {7, 13}
+// Data classes whose enterprise containers are handed out with a container extension.
+bool STWContainerClassTakesContainerExtension(STWContainerClass c); // {2, 4, 6, 10}
 // Data classes whose sandbox mapping is pushed only for the user identities entitled to
 // the bundle: {2, 4, 6, 9, 10, 11}.
 bool STWContainerClassRegistersOnlyForEntitledUsers(STWContainerClass c);

@@ -152,9 +152,9 @@ void STWRequestDecoder::issueSandboxExtension(STWValue::Dictionary& into, const 
     STWContainerClass containerClass = container.containerClass();
     const char* extensionClass = nullptr;
     if (enterprise) {
-        if (containerClass == 2 || containerClass == 4 || containerClass == 6 || containerClass == 10)
+        if (STWContainerClassTakesContainerExtension(containerClass))
             extensionClass = STWSandboxExtension::containerClass;
-        else if (containerClass == 7)
+        else if (containerClass == STWContainerClassSharedAppGroup)
             extensionClass = STWSandboxExtension::applicationGroupClass;
     }
     const std::string path = container.url().native();
