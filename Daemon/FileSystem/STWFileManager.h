@@ -194,6 +194,13 @@ public:
 
     // Opens the directory itself, never a link in its place (O_DIRECTORY|O_NOFOLLOW).
     STWFileDescriptor openDirectoryAtURL(const std::filesystem::path& url, STWErrorRef* error = nullptr) const;
+    // The same for a directory below `trustedAncestor` (a user's home, whose parent only
+    // root may change): the ancestor as its path says, every component below it without
+    // following a link. An empty ancestor, or one that `url` is not below, is the form
+    // above.
+    STWFileDescriptor openDirectoryAtURL(const std::filesystem::path& url,
+                                         const std::filesystem::path& trustedAncestor,
+                                         STWErrorRef* error = nullptr) const;
 
     // Makes the directory `relativePath` below `dirfd` one component at a time and answers
     // its descriptor. A symbolic link found where a directory belongs is removed and a

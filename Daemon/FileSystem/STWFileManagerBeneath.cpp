@@ -148,6 +148,26 @@ STWFileDescriptor STWFileManager::openDirectoryAtURL(const fs::path& url, STWErr
     return fd;
 }
 
+STWFileDescriptor STWFileManager::openDirectoryAtURL(const fs::path& url, const fs::path& trustedAncestor,
+                                                     STWErrorRef* error) const {
+    fs::path relative = trustedAncestor.empty() ? fs::path() : url.lexically_relative(trustedAncestor);
+    if (relative.empty() || *relative.begin() == "..")
+        return openDirectoryAtURL(url, error);
+    STWFileDescriptor ancestor(open(trustedAncestor.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (!ancestor) {
+        int e = errno;
+        STWSetError(error, STW_POSIX_ERROR(e, "opendir of %@ failed: %s", trustedAncestor, strerror(e)));
+        return {};
+    }
+    STWErrorRef openError;
+    STWFileDescriptor fd =
+        openBeneath(ancestor.get(), relative.native(), O_RDONLY | O_DIRECTORY, 0, STWOpenBeneathNoSymlinks, &openError);
+    if (!fd)
+        STWSetError(error, STW_POSIX_ERROR(openError ? static_cast<int>(openError->code()) : EIO,
+                                           "opendir of %@ failed: %@", url, openError));
+    return fd;
+}
+
 STWFileDescriptor STWFileManager::createDirectoryBeneath(int dirfd, const fs::path& relativePath, mode_t mode,
                                                          uid_t owner, int32_t dataProtectionClass,
                                                          const fs::path& path, STWErrorRef* error) const {

@@ -118,7 +118,9 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
             failure = std::move(failedError);
         };
         STWErrorRef stepError;
-        STWFileDescriptor stagingfd = fileManager->openDirectoryAtURL(stagingDirectory, &stepError);
+        // Below the user's home everything is the user's: no link is followed there.
+        std::filesystem::path trustedAncestor = STWTrustedAncestorForClass(userIdentity, c);
+        STWFileDescriptor stagingfd = fileManager->openDirectoryAtURL(stagingDirectory, trustedAncestor, &stepError);
         STWFileDescriptor containerfd;
         if (stagingfd)
             containerfd = _createTopLevelContainerDirectory(stagingfd.get(), name, staging, c,
@@ -159,7 +161,7 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
             final = (classDirectory ? *classDirectory : std::filesystem::path()) / finalName;
             STWFileDescriptor classfd;
             if (classDirectory)
-                classfd = fileManager->openDirectoryAtURL(*classDirectory, &stepError);
+                classfd = fileManager->openDirectoryAtURL(*classDirectory, trustedAncestor, &stepError);
             if (!classfd || !fileManager->moveDirectoryAt(stagingfd.get(), name, classfd.get(), finalName,
                                                           containerfd.get(), STWFileManagerMoveDurable, staging, final,
                                                           &stepError)) {
@@ -194,7 +196,8 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
             // would leave one more.
             STWErrorRef cleanupError;
             if (!_moveItemAtURLToDeathRow(final, true, true, &cleanupError))
-                STW_ERROR(STWErrorRemoveStagingFailed, cleanupError, "Failed to remove staging dir: %@", final);
+                STW_LOG_ERROR(STWLogCategory::Lifecycle, "Failed to send %@ to death row after the cache refused it: %@",
+                              final, cleanupError);
             *code = STWErrorCacheAddFailed;
             return nullptr;
         }

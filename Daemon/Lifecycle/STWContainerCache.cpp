@@ -201,7 +201,8 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
     // directory's owner planted anywhere on the way is never followed.
     STWFileDescriptor classDirectory;
     if (entries)
-        classDirectory = STWFileManager::defaultManager()->openDirectoryAtURL(*directory, error);
+        classDirectory = STWFileManager::defaultManager()->openDirectoryAtURL(
+            *directory, STWTrustedAncestorForClass(userIdentity, contentClass), error);
     if (!entries || !classDirectory) {
         signpost("RebuildingCache", false, contentClass);
         return nullptr;

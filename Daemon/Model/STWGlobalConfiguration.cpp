@@ -21,10 +21,31 @@ uid_t systemContainerUID() { return STWPlatformConfiguration::sharedInstance()->
 } // namespace
 
 void STWCreateLayoutDirectory(const std::filesystem::path& path, uint16_t mode, uid_t owner, int32_t protectionClass,
-                              const char* failureMessage) {
+                              const char* failureMessage, const std::filesystem::path& trustedAncestor) {
+    auto fileManager = STWFileManager::defaultManager();
     STWErrorRef error;
-    if (!STWFileManager::defaultManager()->createDirectoryAtURL(path, true, mode, owner, protectionClass, &error))
+    std::filesystem::path relative =
+        trustedAncestor.empty() ? std::filesystem::path() : path.lexically_relative(trustedAncestor);
+    bool created;
+    if (relative.empty() || *relative.begin() == "..") {
+        created = fileManager->createDirectoryAtURL(path, true, mode, owner, protectionClass, &error);
+    } else {
+        // The ancestor itself is made as the path says, as any layout directory is.
+        STWFileDescriptor ancestor;
+        if (fileManager->createDirectoryAtURL(trustedAncestor, true, mode, &error))
+            ancestor = fileManager->openDirectoryAtURL(trustedAncestor, &error);
+        created = ancestor &&
+                  fileManager->createDirectoryBeneath(ancestor.get(), relative, mode, owner, protectionClass, path, &error);
+    }
+    if (!created)
         STW_LOG_ERROR(STWLogCategory::Unspecified, failureMessage, path, error);
+}
+
+std::filesystem::path STWTrustedAncestorForClass(const STWUserIdentityRef& userIdentity,
+                                                 STWContainerClass containerClass) {
+    if (!userIdentity || !STWContainerClassIsPerUser(containerClass))
+        return {};
+    return userIdentity->homeDirectoryURL();
 }
 
 std::shared_ptr<STWGlobalConfiguration> STWGlobalConfiguration::sharedInstance() {

@@ -77,6 +77,12 @@ private:
 
 // Creates `path` with intermediate directories and the given attributes, logging
 // `failureMessage` (with the path and the error) when that fails. Shared by the global and
-// the per-user layout.
+// the per-user layout. Below a `trustedAncestor` (a user's home, whose contents the user
+// owns) nothing is followed: a link in place of a directory is removed.
 void STWCreateLayoutDirectory(const std::filesystem::path& path, uint16_t mode, uid_t owner, int32_t protectionClass,
-                              const char* failureMessage);
+                              const char* failureMessage, const std::filesystem::path& trustedAncestor = {});
+
+// The directory below which the layout of a class is the user's to change: the user's
+// home for per-user classes, nothing (empty) for the global ones.
+std::filesystem::path STWTrustedAncestorForClass(const STWUserIdentityRef& userIdentity,
+                                                 STWContainerClass containerClass);

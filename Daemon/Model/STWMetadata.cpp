@@ -114,7 +114,8 @@ bool STWMetadata::isRecordOfFile(const struct stat& file) const {
 STWFileDescriptor STWMetadata::openContainerDirectory(STWErrorRef* error) const {
     auto fileManager = STWFileManager::defaultManager();
     std::filesystem::path container = url();
-    STWFileDescriptor classDirectory = fileManager->openDirectoryAtURL(container.parent_path(), error);
+    STWFileDescriptor classDirectory = fileManager->openDirectoryAtURL(
+        container.parent_path(), STWTrustedAncestorForClass(_userIdentity, _containerClass), error);
     if (!classDirectory)
         return {};
     STWFileDescriptor fd = fileManager->openBeneath(classDirectory.get(), container.filename(), O_RDONLY | O_DIRECTORY,

@@ -17,7 +17,7 @@ std::filesystem::path STWPerUserConfiguration::_created(std::optional<std::files
     std::lock_guard guard(_lock);
     if (!slot)
         slot = compute();
-    STWCreateLayoutDirectory(*slot, 0755, _userIdentity->posixUID(), -1, failureMessage);
+    STWCreateLayoutDirectory(*slot, 0755, _userIdentity->posixUID(), -1, failureMessage, _userHomeDirectory);
     return *slot;
 }
 
@@ -69,7 +69,8 @@ std::optional<std::filesystem::path> STWPerUserConfiguration::containerDirectory
     std::lock_guard guard(_lock);
     std::filesystem::path path = (transient ? transientDirectory() : userBaseDirectory()) /
                                  STWContainerClassDirectoryName(contentClass);
-    STWCreateLayoutDirectory(path, 0755, _userIdentity->posixUID(), -1, "Failed to create container dir at \"%@\": %@");
+    STWCreateLayoutDirectory(path, 0755, _userIdentity->posixUID(), -1, "Failed to create container dir at \"%@\": %@",
+                             _userHomeDirectory);
     return path;
 }
 

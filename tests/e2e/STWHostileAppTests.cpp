@@ -185,7 +185,7 @@ TEST_F(STWHostileAppTest, StagingEntriesReplacedByLinksAreNeverPublished) {
             }
         }
     });
-    for (int i = 1; i < 200; ++i)
+    for (int i = 1; i < 60; ++i)
         STWDaemonProcess::send(*installer, 0, keys("com.example.stager." + std::to_string(i), 2));
     done = true;
     app.join();
@@ -193,6 +193,22 @@ TEST_F(STWHostileAppTest, StagingEntriesReplacedByLinksAreNeverPublished) {
     EXPECT_EQ(snapshot(canary), before);
     for (const auto& entry : fs::directory_iterator(classDirectory))
         EXPECT_FALSE(fs::is_symlink(entry.symlink_status())) << entry.path();
+}
+
+// The user owns the directory above its class and staging directories, so an app can put
+// links there in place of "Data" and "Staging": creation then neither publishes nor builds
+// anything where they point.
+TEST_F(STWHostileAppTest, LinksAboveTheClassDirectoryLeadNowhere) {
+    fs::path base = create("com.example.first").parent_path().parent_path().parent_path(); // Containers
+    fs::create_directories(canary / "Application");
+    auto before = snapshot(canary);
+    fs::rename(base / "Data", base / "Data.away");
+    fs::rename(base / "Staging", base / "Staging.away");
+    fs::create_directory_symlink(canary, base / "Data");
+    fs::create_directory_symlink(canary, base / "Staging");
+    for (int i = 0; i < 3; ++i)
+        STWDaemonProcess::send(*installer, 0, keys("com.example.redirected" + std::to_string(i), 2));
+    EXPECT_EQ(snapshot(canary), before);
 }
 
 // Apps copy a victim's metadata into directories of their own; after a restart the victim's
