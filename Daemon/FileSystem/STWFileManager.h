@@ -18,8 +18,8 @@
 // check, open it with openBeneath() relative to the container's directory descriptor.
 #pragma once
 
-#include "Daemon/FileSystem/STWFileDescriptor.h"
 #include "common/STWError.h"
+#include "common/STWFileDescriptor.h"
 
 #include <cstdint>
 #include <filesystem>

@@ -12,9 +12,9 @@
 // tell that the file it found is still the one it read.
 #pragma once
 
-#include "Daemon/FileSystem/STWFileDescriptor.h"
 #include "Daemon/Model/STWConcreteContainerIdentity.h"
 #include "common/STWError.h"
+#include "common/STWFileDescriptor.h"
 #include "common/STWValue.h"
 
 #include <filesystem>

@@ -4,7 +4,6 @@
 // runs on privileged connections.
 #pragma once
 
-#include "Daemon/FileSystem/STWFileDescriptor.h"
 #include "Daemon/Lifecycle/STWCommandQueue.h"
 #include "Daemon/Model/STWConcreteContainerIdentity.h"
 #include "Daemon/Model/STWContainerClass.h"
@@ -12,6 +11,7 @@
 #include "Daemon/Model/STWMetadata.h"
 #include "Daemon/Model/STWUserIdentityCache.h"
 #include "Daemon/Request/STWClientIdentity.h"
+#include "common/STWFileDescriptor.h"
 #include "common/STWThreadSafety.h"
 #include "common/STWValue.h"
 #include "platform/STWQueue.h"
