@@ -91,7 +91,7 @@ int STWFilePersonaService::registerForPersonaListUpdates(const std::string& obse
     std::error_code ec;
     std::filesystem::create_directories(directory, ec);
     int token = STWFileWatcher::sharedInstance().addWatch(directory, [onUpdate](const std::string& name) {
-        if (name == "personas.plist")
+        if (name == "personas.plist" || name.empty()) // empty: changes were lost, read it again
             onUpdate();
     });
     if (token < 0) {
