@@ -5,9 +5,11 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
 #include <optional>
+#include <string_view>
 #include <sys/eventfd.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
@@ -84,11 +86,37 @@ STWIPCListener::~STWIPCListener() {
     }
 }
 
-// The socket passed by the service manager, or -1 when there is none.
+// The request socket among those the service manager passed: the one named
+// "stowlyd.sock" (FileDescriptorName= in stowlyd.socket; a unit without it names its
+// sockets after itself, "stowlyd.socket"), else the only one without a name. The others
+// (the upcall socket) are left for their own servers. -1 when there is none.
 int STWIPCListener::_socketFromServiceManager() {
-    if (sd_listen_fds(0) >= 1 && sd_is_socket_unix(SD_LISTEN_FDS_START, SOCK_STREAM, 1, nullptr, 0) > 0)
-        return SD_LISTEN_FDS_START;
-    return -1;
+    char** names = nullptr;
+    int count = sd_listen_fds_with_names(0, &names);
+    int named = -1, unnamed = -1, unnamedCount = 0;
+    for (int i = 0; i < count; i++) {
+        std::string_view name = names && names[i] ? names[i] : "";
+        if (name == "stowlyd.sock" || name == "stowlyd.socket")
+            named = SD_LISTEN_FDS_START + i;
+        else if (name.empty() || name == "unknown") { // "unknown": passed without names
+            unnamed = SD_LISTEN_FDS_START + i;
+            unnamedCount++;
+        }
+    }
+    for (int i = 0; names && i < count; i++)
+        free(names[i]);
+    free(names);
+    int fd = named >= 0 ? named : unnamedCount == 1 ? unnamed : -1;
+    if (count > 0 && fd < 0)
+        STW_LOG_ERROR(STWLogCategory::Tolvan,
+                      "None of the %d sockets passed by the service manager is the request socket", count);
+    if (fd >= 0 && sd_is_socket_unix(fd, SOCK_STREAM, 1, nullptr, 0) <= 0) {
+        STW_LOG_ERROR(
+            STWLogCategory::Tolvan,
+            "The request socket passed by the service manager is not a listening Unix stream socket");
+        fd = -1;
+    }
+    return fd;
 }
 
 bool STWIPCListener::start(STWEventLoop& loop, STWErrorRef* error) {
