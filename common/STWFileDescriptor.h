@@ -1,7 +1,8 @@
 // An owned file descriptor that is closed when it goes out of scope.
 //
 // The file layer hands these out from its descriptor-relative operations (openBeneath)
-// so that callers working inside containers cannot leak a descriptor on an early return.
+// so that callers working inside containers cannot leak a descriptor on an early return;
+// the platform layer keeps its sockets, eventfds and inotify instance in them.
 #pragma once
 
 #include <unistd.h>

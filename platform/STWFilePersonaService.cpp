@@ -64,7 +64,8 @@ std::vector<STWPersonaRecord> STWFilePersonaService::recordsFromPlist(const STWV
 STWFilePersonaService::STWFilePersonaService() = default;
 
 namespace {
-bool isPersonaFile(const std::string& name) { return name == "personas.plist"; }
+// An empty name: changes were lost (the watch's queue overflowed), so it may be ours.
+bool isPersonaFile(const std::string& name) { return name == "personas.plist" || name.empty(); }
 } // namespace
 
 void STWFilePersonaService::_watchOnce() {

@@ -5,9 +5,12 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
+#include <fcntl.h>
 #include <optional>
-#include <poll.h>
+#include <string_view>
+#include <sys/eventfd.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -83,10 +86,47 @@ STWIPCListener::~STWIPCListener() {
     }
 }
 
-bool STWIPCListener::start(STWErrorRef* error) {
-    if (_options.allowSocketActivation && sd_listen_fds(0) >= 1 &&
-        sd_is_socket_unix(SD_LISTEN_FDS_START, SOCK_STREAM, 1, nullptr, 0) > 0) {
-        _listenFD = SD_LISTEN_FDS_START;
+// The request socket among those the service manager passed: the one named
+// "stowlyd.sock" (FileDescriptorName= in stowlyd.socket; a unit without it names its
+// sockets after itself, "stowlyd.socket"), else the only one without a name. The others
+// (the upcall socket) are left for their own servers. -1 when there is none.
+int STWIPCListener::_socketFromServiceManager() {
+    char** names = nullptr;
+    int count = sd_listen_fds_with_names(0, &names);
+    int named = -1, unnamed = -1, unnamedCount = 0;
+    for (int i = 0; i < count; i++) {
+        std::string_view name = names && names[i] ? names[i] : "";
+        if (name == "stowlyd.sock" || name == "stowlyd.socket")
+            named = SD_LISTEN_FDS_START + i;
+        else if (name.empty() || name == "unknown") { // "unknown": passed without names
+            unnamed = SD_LISTEN_FDS_START + i;
+            unnamedCount++;
+        }
+    }
+    for (int i = 0; names && i < count; i++)
+        free(names[i]);
+    free(names);
+    int fd = named >= 0 ? named : unnamedCount == 1 ? unnamed : -1;
+    if (count > 0 && fd < 0)
+        STW_LOG_ERROR(STWLogCategory::Tolvan,
+                      "None of the %d sockets passed by the service manager is the request socket", count);
+    if (fd >= 0 && sd_is_socket_unix(fd, SOCK_STREAM, 1, nullptr, 0) <= 0) {
+        STW_LOG_ERROR(
+            STWLogCategory::Tolvan,
+            "The request socket passed by the service manager is not a listening Unix stream socket");
+        fd = -1;
+    }
+    return fd;
+}
+
+bool STWIPCListener::start(STWEventLoop& loop, STWErrorRef* error) {
+    if (int fd = _options.allowSocketActivation ? _socketFromServiceManager() : -1; fd >= 0) {
+        // Accepting must never block the loop.
+        if (fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) | O_NONBLOCK) != 0) {
+            STWSetError(error, STW_POSIX_ERROR(errno, "Cannot make the passed socket non-blocking"));
+            return false;
+        }
+        _listenFD.reset(fd);
         _socketActivated = true;
         STW_LOG_NOTICE(STWLogCategory::Tolvan, "Serving the socket passed by the service manager");
     } else {
@@ -100,22 +140,30 @@ bool STWIPCListener::start(STWErrorRef* error) {
         memcpy(address.sun_path, path.c_str(), path.native().size() + 1);
         std::error_code ec;
         std::filesystem::create_directories(path.parent_path(), ec);
-        int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-        if (fd < 0) {
+        STWFileDescriptor socketFD(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+        if (!socketFD) {
             STWSetError(error, STW_POSIX_ERROR(errno, "socket() failed"));
             return false;
         }
         // A socket file left by an earlier run is stale: only one daemon serves a root.
         unlink(path.c_str());
-        if (bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
-            chmod(path.c_str(), 0666) != 0 || listen(fd, SOMAXCONN) != 0) {
-            int saved = errno;
-            close(fd);
-            STWSetError(error, STW_POSIX_ERROR(saved, "Cannot listen on %@", path));
+        if (bind(socketFD.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
+            chmod(path.c_str(), 0666) != 0 || listen(socketFD.get(), SOMAXCONN) != 0) {
+            STWSetError(error, STW_POSIX_ERROR(errno, "Cannot listen on %@", path));
             return false;
         }
-        _listenFD = fd;
+        _listenFD = std::move(socketFD);
         STW_LOG_NOTICE(STWLogCategory::Tolvan, "Listening on %@", path);
+    }
+    _endedFD.reset(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+    if (_endedFD) {
+        _acceptSource = loop.watchReadable(_listenFD.get(), [this] { _acceptPending(); });
+        _acceptRetry = loop.timer([this] { _acceptSource.setEnabled(true); });
+        _endedSource = loop.watchReadable(_endedFD.get(), [this] { _connectionsEnded(); });
+    }
+    if (!_acceptSource || !_acceptRetry || !_endedSource) {
+        STWSetError(error, STW_POSIX_ERROR(errno, "Cannot accept on the event loop"));
+        return false;
     }
     const STWClientBounds& bounds = _options.bounds;
     STW_LOG_NOTICE(
@@ -124,20 +172,17 @@ bool STWIPCListener::start(STWErrorRef* error) {
         "%g s; %zu bytes for unfinished frames",
         _maxConnections, _maxConnectionsPerUser, bounds.firstFrameTimeout.count() / 1000.0,
         bounds.frameTimeout.count() / 1000.0, bounds.maxPendingFrameBytes);
-    _acceptThread = std::thread([this] { _acceptLoop(); });
     return true;
 }
 
 bool STWIPCListener::stop(std::chrono::steady_clock::duration timeout) {
     auto deadline = std::chrono::steady_clock::now() + timeout;
     if (!_stopping.exchange(true)) {
-        if (_acceptThread.joinable())
-            _acceptThread.join();
-        if (_listenFD >= 0 && !_socketActivated)
+        _acceptSource.reset();
+        _acceptRetry.reset();
+        if (_listenFD && !_socketActivated)
             unlink(_options.socketPath.c_str());
-        if (_listenFD >= 0)
-            close(_listenFD);
-        _listenFD = -1;
+        _listenFD.reset();
     }
     std::vector<std::shared_ptr<STWPeerConnection>> open;
     {
@@ -177,21 +222,22 @@ std::chrono::steady_clock::time_point STWIPCListener::lastConnectionChange() con
     return _lock_lastConnectionChange;
 }
 
-void STWIPCListener::_acceptLoop() {
-    while (!_stopping.load()) {
-        _reapFinishedConnections();
-        // Wake up now and then to notice stop() and to join the threads of closed connections.
-        pollfd p{_listenFD, POLLIN, 0};
-        int ready = poll(&p, 1, 200);
-        if (ready <= 0)
-            continue;
-        int fd = accept4(_listenFD, nullptr, nullptr, SOCK_CLOEXEC);
+void STWIPCListener::_acceptPending() {
+    // A few at a time, so that the loop's other sources are served during a flood; the
+    // socket stays readable for the rest.
+    for (int i = 0; i < 16; i++) {
+        int fd = accept4(_listenFD.get(), nullptr, nullptr, SOCK_CLOEXEC);
         if (fd < 0) {
-            if (errno != EINTR && errno != EAGAIN && errno != ECONNABORTED)
-                STW_LOG_ERROR(STWLogCategory::Tolvan, "accept failed: %s", strerror(errno));
-            if (errno == EMFILE || errno == ENFILE)
-                usleep(100 * 1000);
-            continue;
+            if (errno == EINTR || errno == ECONNABORTED)
+                continue;
+            if (errno == EAGAIN)
+                return;
+            // Out of descriptors, say: the socket stays readable, so rather than spin, wait
+            // a moment for some to come free.
+            STW_LOG_ERROR(STWLogCategory::Tolvan, "accept failed: %s", strerror(errno));
+            _acceptSource.setEnabled(false);
+            _acceptRetry.armAt(std::chrono::steady_clock::now() + std::chrono::milliseconds(100));
+            return;
         }
         if (!_admit(fd)) {
             close(fd);
@@ -201,6 +247,15 @@ void STWIPCListener::_acceptLoop() {
         if (auto peer = STWPeerConnection::adopt(fd, &error))
             _startConnection(std::move(peer));
     }
+}
+
+void STWIPCListener::_connectionsEnded() {
+    uint64_t count;
+    while (read(_endedFD.get(), &count, sizeof count) < 0 && errno == EINTR) {
+    }
+    _reapFinishedConnections();
+    if (_options.connectionsClosed)
+        _options.connectionsClosed();
 }
 
 // Over a cap, a connection is closed before anything else is done for it: reading the
@@ -262,6 +317,10 @@ void STWIPCListener::_lock_connectionEnded(Connection& connection) {
     _lock_lastConnectionChange = std::chrono::steady_clock::now();
     if (_lock_openConnections == 0)
         _connectionsGone.notify_all();
+    uint64_t one = 1;
+    if (write(_endedFD.get(), &one, sizeof one) != sizeof one)
+        STW_LOG_ERROR(STWLogCategory::Tolvan, "Cannot report a closed connection to the event loop: %s",
+                      strerror(errno));
 }
 
 void STWIPCListener::_reapFinishedConnections() {

@@ -9,15 +9,18 @@
 // frame and inside each frame, bytes held for frames still arriving (one budget for all
 // connections) and values a request may decode to.
 //
-// Threads: the accept thread accepts, starts a thread per connection and joins the
-// threads of connections that have ended; connection threads read, dispatch and reply.
-// `_lock` guards the connection table and counts, which both touch.
+// Threads: the event loop accepts, starts a thread per connection and joins the threads
+// of connections that have ended (each one wakes the loop through an eventfd as it ends);
+// connection threads read, dispatch and reply. `_lock` guards the connection table and
+// counts, which both touch; nothing holds it across I/O.
 #pragma once
 
 #include "common/STWError.h"
+#include "common/STWFileDescriptor.h"
 #include "common/STWThreadSafety.h"
 #include "common/STWValue.h"
 #include "common/STWIPCFrameBudget.h"
+#include "platform/STWEventLoop.h"
 #include "platform/STWPeerConnection.h"
 #include "platform/STWPlatformConfiguration.h"
 
@@ -53,6 +56,8 @@ public:
         // Connection caps left unset are derived from the descriptor limit in force when
         // the listener is made (see _resolveConnectionCaps).
         STWClientBounds bounds;
+        // Runs on the loop after the threads of connections that closed were joined.
+        std::function<void()> connectionsClosed;
     };
 
     STWIPCListener(Options options, ConnectionHandler onConnection, MessageHandler onMessage);
@@ -60,12 +65,13 @@ public:
     // that cannot wait calls stop() itself and does not destroy a listener it failed.
     ~STWIPCListener();
 
-    // Binds (or adopts) the socket and starts accepting on its own thread.
-    bool start(STWErrorRef* error);
+    // Binds (or adopts) the socket and accepts on `loop` from when it runs. Called where
+    // the loop runs, before it does.
+    bool start(STWEventLoop& loop, STWErrorRef* error);
     // Stops accepting and shuts every connection down: no further request is read, and
     // the replies of requests still running are not sent. Waits up to `timeout` for the
     // connection threads to end and joins them; false (each one still running logged)
-    // when some did not end in time.
+    // when some did not end in time. On the loop's thread, or once the loop has stopped.
     bool stop(std::chrono::steady_clock::duration timeout = std::chrono::seconds(10));
 
     bool isSocketActivated() const { return _socketActivated; }
@@ -81,7 +87,9 @@ private:
     };
 
     void _resolveConnectionCaps();
-    void _acceptLoop();
+    int _socketFromServiceManager();
+    void _acceptPending();
+    void _connectionsEnded();
     bool _admit(int fd);
     void _startConnection(std::shared_ptr<STWPeerConnection> peer);
     void _reapFinishedConnections();
@@ -96,14 +104,19 @@ private:
     size_t _maxConnections = 0;
     size_t _maxConnectionsPerUser = 0;
     STWIPCFrameBudget _frameBudget;
-    int _listenFD = -1;
+    STWFileDescriptor _listenFD;
     bool _socketActivated = false;
     std::atomic<bool> _stopping{false};
-    std::thread _acceptThread;
+    // Written by a connection's thread as it ends, so that the loop joins it.
+    STWFileDescriptor _endedFD;
+    // Made in start(), used and destroyed where the loop runs.
+    STWEventLoop::Source _acceptSource;
+    STWEventLoop::Source _acceptRetry; // accepting again after a failure, such as no descriptors left
+    STWEventLoop::Source _endedSource;
 
     mutable STWMutex _lock;
     std::condition_variable _connectionsGone;
-    // By serial; an entry stays until the accept thread (or stop()) joins its thread.
+    // By serial; an entry stays until the loop (or stop()) joins its thread.
     std::map<uint64_t, Connection> _lock_connections STW_GUARDED_BY(_lock);
     size_t _lock_openConnections STW_GUARDED_BY(_lock) = 0;
     std::map<uid_t, size_t> _lock_openConnectionsPerUser STW_GUARDED_BY(_lock);

@@ -44,7 +44,7 @@ void STWKeybag::setLockStateOverrideForTesting(std::optional<bool> locked) {
 bool STWKeybag::registerForLockStateNotifications(std::function<void()> callback) {
     auto directory = STWPlatformConfiguration::sharedInstance()->runtimeDirectory();
     int token = STWFileWatcher::sharedInstance().addWatch(directory, [callback](const std::string& name) {
-        if (name == "keybag")
+        if (name == "keybag" || name.empty()) // empty: changes were lost, read it again
             callback();
     });
     return token >= 0;

@@ -17,7 +17,7 @@ public:
     static bool isDeviceLocked();
     static STWKeybagLockState lockState() { return isDeviceLocked() ? STWKeybagLocked : STWKeybagUnlocked; }
 
-    // Calls `callback` (on the file watcher's thread) whenever the state file changes.
+    // Calls `callback` on the event loop whenever the state file may have changed.
     // Returns false with errno set when the runtime directory cannot be watched.
     static bool registerForLockStateNotifications(std::function<void()> callback);
 

@@ -1,9 +1,14 @@
 #include "platform/STWTransaction.h"
 
+#include "common/STWFileDescriptor.h"
 #include "common/STWLog.h"
 
+#include <cerrno>
 #include <condition_variable>
+#include <cstring>
 #include <mutex>
+#include <sys/eventfd.h>
+#include <unistd.h>
 
 namespace {
 
@@ -12,6 +17,7 @@ struct State {
     std::condition_variable changed;
     uint64_t count = 0;
     std::chrono::steady_clock::time_point lastChange = std::chrono::steady_clock::now();
+    const STWFileDescriptor idleFD{eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)};
 };
 
 State& state() {
@@ -30,13 +36,20 @@ void STWTransaction::begin() {
 
 void STWTransaction::end() {
     State& s = state();
-    std::lock_guard guard(s.mutex);
-    if (s.count == 0)
-        STW_FATAL("transaction ended that was never begun");
-    --s.count;
-    s.lastChange = std::chrono::steady_clock::now();
-    if (s.count == 0)
+    {
+        std::lock_guard guard(s.mutex);
+        if (s.count == 0)
+            STW_FATAL("transaction ended that was never begun");
+        --s.count;
+        s.lastChange = std::chrono::steady_clock::now();
+        if (s.count != 0)
+            return;
         s.changed.notify_all();
+    }
+    uint64_t one = 1;
+    if (s.idleFD && write(s.idleFD.get(), &one, sizeof one) != sizeof one)
+        STW_LOG_ERROR(STWLogCategory::Unspecified, "Cannot report the end of the last transaction: %s",
+                      strerror(errno));
 }
 
 uint64_t STWTransaction::count() {
@@ -50,6 +63,8 @@ std::chrono::steady_clock::time_point STWTransaction::lastChange() {
     std::lock_guard guard(s.mutex);
     return s.lastChange;
 }
+
+int STWTransaction::idleEventFD() { return state().idleFD.get(); }
 
 bool STWTransaction::waitForIdle(std::chrono::steady_clock::duration timeout) {
     State& s = state();

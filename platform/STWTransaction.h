@@ -16,6 +16,9 @@ public:
     static std::chrono::steady_clock::time_point lastChange();
     // Blocks until the count is 0 or `timeout` passes; true when it reached 0.
     static bool waitForIdle(std::chrono::steady_clock::duration timeout);
+    // An eventfd that becomes readable whenever the count drops to 0, for the event loop to
+    // time idle exit without polling; its one reader resets it. Lives as long as the process.
+    static int idleEventFD();
 
     // Holds a transaction for its lifetime.
     class Scope {

@@ -7,7 +7,9 @@
 #include "Daemon/Request/STWRequestDispatcher.h"
 #include "common/STWLog.h"
 #include "platform/STWCrashPoint.h"
+#include "platform/STWEventLoop.h"
 #include "platform/STWIPCListener.h"
+#include "platform/STWIdleExitTimer.h"
 #include "platform/STWKeybag.h"
 #include "platform/STWPlatformConfiguration.h"
 #include "platform/STWSandboxExtension.h"
@@ -26,20 +28,16 @@
 #include <sys/stat.h>
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
+#include <vector>
 
 namespace {
 
 std::once_flag onceInitializationToken;
 std::once_flag upcallServerToken;
 std::atomic<bool> initialisationFinishedFlag{false};
-// Touched only by the lock-state callback, which runs on the main queue.
-int lockState = 3;
+// Written only by the lock-state callback, on the main thread; read by anyone.
+std::atomic<int> lockState{3};
 bool firstBoot = false;
-
-const std::shared_ptr<STWQueue>& mainQueue() {
-    static const std::shared_ptr<STWQueue> queue = STWQueue::create("com.vorlane.stowlyd.main");
-    return queue;
-}
 
 // The kernel upcall server is not part of this build: start-up records that and goes on.
 bool STWKernServerStart() {
@@ -127,20 +125,18 @@ const std::shared_ptr<STWQueue>& STWDaemon::lockStateQueue() {
 
 bool STWDaemon::initialisationFinished() { return initialisationFinishedFlag.load(); }
 
-int STWDaemon::storedLockState() { return lockState; }
+int STWDaemon::storedLockState() { return lockState.load(); }
 
 void STWDaemon::keybag_notification_callback() {
     int state = STWKeybag::lockState();
     STW_LOG_DEBUG(STWLogCategory::Unspecified, "LockState=%d", state);
     if (state == STWKeybagLocked) {
-        if (lockState != STWKeybagLocked)
+        if (lockState.exchange(STWKeybagLocked) != STWKeybagLocked)
             lockStateQueue()->suspend();
-        lockState = STWKeybagLocked;
     } else if (state == STWKeybagUnlocked) {
         // The stored state starts "unknown", so the first unlocked report resumes nothing.
-        if (lockState == STWKeybagLocked)
+        if (lockState.exchange(STWKeybagUnlocked) == STWKeybagLocked)
             lockStateQueue()->resume();
-        lockState = STWKeybagUnlocked;
     }
 }
 
@@ -178,9 +174,11 @@ void STWDaemon::_onceInitialization() {
     if (!upcallServerStarted)
         STW_FATAL("Failed to initialize kernel upcall interface.");
 
-    if (!STWKeybag::registerForLockStateNotifications([] { mainQueue()->async(keybag_notification_callback); }))
+    // Notifications come on the event loop, which this thread runs once start-up is done:
+    // the state read here and every change after it are applied by the one thread, in order.
+    if (!STWKeybag::registerForLockStateNotifications(keybag_notification_callback))
         STW_LOG_ERROR(STWLogCategory::Startup, "Failed to register for %s: %d", "keybag lock status", errno);
-    mainQueue()->sync(keybag_notification_callback);
+    keybag_notification_callback();
 
     if (firstBoot) {
         signpost("FirstBootCleanup", true);
@@ -205,8 +203,8 @@ int STWDaemon::main(int argc, char** argv) {
                    "Exit after this many idle seconds (0: never; default 60 under socket activation, else never)");
     CLI11_PARSE(app, argc, argv);
 
-    // Signals are taken synchronously by the main thread; every thread started from here
-    // on inherits the mask.
+    // Signals are taken by the event loop (a signalfd), so no thread may take them the usual
+    // way; every thread started from here on inherits the mask.
     sigset_t signals;
     sigemptyset(&signals);
     sigaddset(&signals, SIGTERM);
@@ -236,11 +234,20 @@ int STWDaemon::main(int argc, char** argv) {
                       configuration->rootPrefix());
 
     STWTransaction::begin(); // ended by the once-initialisation
+    // The main thread runs the event loop once start-up is done; until then connections
+    // wait in the socket's backlog.
+    STWEventLoop& loop = STWEventLoop::main();
+    std::optional<STWIdleExitTimer> idleExit;
     STWIPCListener listener(
         {.socketPath = configuration->runtimeDirectory() / "stowlyd.sock",
          .developerMode = configuration->isDeveloperMode(),
          .allowSocketActivation = true,
-         .bounds = configuration->clientBounds()},
+         .bounds = configuration->clientBounds(),
+         .connectionsClosed =
+             [&idleExit] {
+                 if (idleExit)
+                     idleExit->review();
+             }},
         [](const std::shared_ptr<STWPeerConnection>&) {
             _runOnceInitialization();
             if (!initialisationFinished())
@@ -250,7 +257,7 @@ int STWDaemon::main(int argc, char** argv) {
             STWTransaction::Scope transaction;
             STWRequestDispatcher::processTolvanEvent(peer, requestID, request);
         });
-    bool listening = listener.start(&error);
+    bool listening = listener.start(loop, &error);
     if (!listening)
         STW_LOG_FN("main", STWLogLevel::Error, STWLogCategory::Tolvan, "unable to start tolvan service!");
 
@@ -262,23 +269,24 @@ int STWDaemon::main(int argc, char** argv) {
 
     if (idleTimeout < 0)
         idleTimeout = listener.isSocketActivated() ? 60 : 0;
-    auto idleLimit = std::chrono::duration_cast<std::chrono::steady_clock::duration>(
-        std::chrono::duration<double>(idleTimeout));
-    while (true) {
-        timespec tick{0, 250 * 1000 * 1000};
-        int signalNumber = sigtimedwait(&signals, nullptr, &tick);
-        if (signalNumber == SIGTERM || signalNumber == SIGINT) {
-            STW_LOG_NOTICE(STWLogCategory::Startup, "Stopping on signal %d", signalNumber);
-            break;
-        }
-        if (idleTimeout > 0 && listener.connectionCount() == 0 && STWTransaction::count() == 0) {
-            auto lastActivity = std::max(listener.lastConnectionChange(), STWTransaction::lastChange());
-            if (std::chrono::steady_clock::now() - lastActivity >= idleLimit) {
-                STW_LOG_NOTICE(STWLogCategory::Startup, "Exiting after %.0f idle seconds", idleTimeout);
-                break;
-            }
-        }
+    if (idleTimeout > 0)
+        idleExit.emplace(loop,
+                         std::chrono::duration_cast<std::chrono::steady_clock::duration>(
+                             std::chrono::duration<double>(idleTimeout)),
+                         listener);
+    std::vector<STWEventLoop::Source> signalSources;
+    for (int signalNumber : {SIGTERM, SIGINT}) {
+        signalSources.push_back(loop.watchSignal(signalNumber, [&loop, signalNumber] {
+            STW_LOG_FN("main", STWLogLevel::Notice, STWLogCategory::Startup, "Stopping on signal %d",
+                       signalNumber);
+            loop.exit(0);
+        }));
+        if (!signalSources.back())
+            STW_FATAL("Cannot take signal %d on the event loop: %s", signalNumber, strerror(errno));
     }
+    // A loop that failed (it says why) ends the daemon too, as a failure.
+    int status = loop.run() < 0 ? 1 : 0;
+
     sd_notify(0, "STOPPING=1");
     // Requests in flight and work already posted (deletion passes, cleanups) get one
     // bound between them to finish.
@@ -293,8 +301,8 @@ int STWDaemon::main(int argc, char** argv) {
         STW_LOG_ERROR(STWLogCategory::Startup, "Exiting with %s still running",
                       connectionsEnded ? "posted work" : "connections");
         STWLog::flush();
-        _exit(0);
+        _exit(status);
     }
     STWLog::flush();
-    return 0;
+    return status;
 }

@@ -1,16 +1,22 @@
-#include "client/STWClient.h"
 #include "Daemon/FileSystem/STWFileManager.h"
+#include "client/STWClient.h"
 #include "platform/STWPlatformConfiguration.h"
+#include "tests/support/STWDaemonProcess.h"
 
 #include <gtest/gtest.h>
 
 #include <chrono>
 #include <csignal>
+#include <cstring>
+#include <fcntl.h>
 #include <fstream>
 #include <semaphore.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 #include <thread>
 #include <unistd.h>
+#include <vector>
 
 using namespace std::chrono_literals;
 
@@ -28,28 +34,59 @@ int waitForExit(pid_t pid, std::chrono::milliseconds limit) {
     return -1;
 }
 
+// A listening Unix socket of `type` bound at `path`, as the service manager passes them.
+int listeningSocket(const std::filesystem::path& path, int type) {
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
+    int fd = socket(AF_UNIX, type | SOCK_CLOEXEC, 0);
+    if (fd >= 0 &&
+        (bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 || listen(fd, 16) != 0)) {
+        close(fd);
+        return -1;
+    }
+    return fd;
+}
+
 } // namespace
 
-// With an idle time (60 s by default under socket activation) the daemon leaves when
-// nothing is left to do: no connection and no open transaction for that long. An open
-// connection keeps it.
+// Started by the service manager, the daemon serves the socket named "stowlyd.sock" among
+// those passed to it (here after the upcall socket). With an idle time (60 s by default
+// then) it leaves when nothing is left to do: no connection and no open transaction for
+// that long. An open connection keeps it.
 TEST(STWIdleExit, LeavesOnlyWhenNoConnectionIsLeft) {
     char templ[] = "/tmp/stowly-idle-XXXXXX";
     ASSERT_NE(mkdtemp(templ), nullptr);
     std::filesystem::path root = templ;
     std::filesystem::create_directories(root / "etc/stowly");
     std::ofstream(root / "etc/passwd") << "mobile:x:501:501:Mobile:/private/var/mobile:/bin/sh\n";
+    int upcall = listeningSocket(root / "upcall.sock", SOCK_SEQPACKET);
+    int request = listeningSocket(root / "activated.sock", SOCK_STREAM);
+    ASSERT_GE(upcall, 0);
+    ASSERT_GE(request, 0);
+    std::vector<std::string> environment{"LISTEN_FDS=2", "LISTEN_FDNAMES=upcall:stowlyd.sock"};
+    for (char** variable = environ; *variable; variable++)
+        environment.emplace_back(*variable);
+    char listenPID[32] = "LISTEN_PID=";
+    std::vector<char*> envp{listenPID};
+    for (std::string& variable : environment)
+        envp.push_back(variable.data());
+    envp.push_back(nullptr);
     pid_t pid = fork();
     if (pid == 0) {
-        execl(STOWLYD_PATH, "stowlyd", "--root", root.c_str(), "--idle-timeout", "1", nullptr);
+        // Passed sockets start at descriptor 3, in the order of their names.
+        int first = fcntl(upcall, F_DUPFD, 10), second = fcntl(request, F_DUPFD, 10);
+        if (first < 0 || second < 0 || dup2(first, 3) != 3 || dup2(second, 4) != 4)
+            _exit(126);
+        snprintf(listenPID, sizeof listenPID, "LISTEN_PID=%d", getpid());
+        execle(STOWLYD_PATH, "stowlyd", "--root", root.c_str(), "--idle-timeout", "1", nullptr, envp.data());
         _exit(127);
     }
-    std::unique_ptr<STWClient> client;
-    for (int i = 0; i < 250 && !client; i++) {
-        std::this_thread::sleep_for(20ms);
-        client = STWClient::connect(STWClient::socketPathForRoot(root), nullptr);
-    }
+    close(upcall);
+    close(request);
+    auto client = STWClient::connect(root / "activated.sock", nullptr);
     ASSERT_NE(client, nullptr);
+    EXPECT_NE(STWDaemonProcess::replyError(*client, 0), 0u) << "no answer on the passed request socket";
     EXPECT_EQ(waitForExit(pid, 2500ms), -1) << "left while a client was connected";
     client.reset();
     EXPECT_EQ(waitForExit(pid, 10s), 0);

@@ -1,5 +1,6 @@
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
 #include "platform/STWFilePersonaService.h"
+#include "tests/support/STWEventLoopThread.h"
 #include "tests/support/STWTestRoot.h"
 
 #include <gtest/gtest.h>
@@ -137,11 +138,12 @@ TEST_F(STWUserIdentityCacheTest, StoredFormsOfBothVersions) {
 
 TEST_F(STWUserIdentityCacheTest, APersonaChangeIsNoticedAndApplied) {
     ASSERT_FALSE(cache->userIdentityForCurrentUserWithPersonaUniqueString(std::string("ENT-NEW")));
+    STWEventLoopThread loop;
     STWTestRoot::shared().writePersonas({
         persona("PERSONAL", 1000, "personal"),
         persona("ENT-NEW", 1010, "enterprise", {STWValue("com.new")}),
     });
-    // The change arrives through the file watcher and the flush queue.
+    // The change arrives through the file watcher, on the event loop, and the flush queue.
     STWUserIdentityRef found;
     for (int i = 0; i < 500 && !found; ++i) {
         std::this_thread::sleep_for(std::chrono::milliseconds(10));
@@ -196,6 +198,7 @@ TEST_F(STWUserIdentityCacheTest, ExhaustedRetriesStopTheDaemon) {
 
 TEST_F(STWUserIdentityCacheTest, AnUnregisteredCacheKeepsWhatItHas) {
     ASSERT_TRUE(cache->userIdentityForCurrentUserWithPersonaUniqueString(std::string("ENT-1")));
+    STWEventLoopThread loop;
     cache->unregister();
     EXPECT_FALSE(cache->isRegistered());
     STWTestRoot::shared().writePersonas({persona("PERSONAL", 1000, "personal")});

@@ -1,5 +1,6 @@
 #include "common/STWDictionaryUtilities.h"
 #include "platform/STWClientRegistry.h"
+#include "tests/support/STWEventLoopThread.h"
 
 #include <gtest/gtest.h>
 
@@ -84,6 +85,7 @@ TEST_F(STWClientRegistryTest, BadFilesAreSkippedAndChangesAreNoticed) {
     STWClientRegistry registry(dir / "clients.d");
     registry.reload();
     registry.watch();
+    STWEventLoopThread loop;
     EXPECT_EQ(lookup(registry), nullptr);
 
     writeEntry("tool.plist", entryFor(executable));
