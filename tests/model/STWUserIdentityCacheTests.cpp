@@ -168,6 +168,7 @@ TEST_F(STWUserIdentityCacheTest, RepopulatingFromIdentitiesInventsTheUnspecificO
 }
 
 TEST_F(STWUserIdentityCacheTest, AListWithoutAPersonalPersonaIsRetriedUntilItHasOne) {
+    STWEventLoopThread loop; // the persona service hears of the fix through its watch
     STWUserIdentityCache::setResyncRetryInterval(std::chrono::milliseconds(20));
     STWTestRoot::shared().writePersonas({persona("ENT-ONLY", 1020, "enterprise", {STWValue("com.only")})});
     cache->flush();
