@@ -3,8 +3,8 @@
 #include "Daemon/Request/STWClientConnection.h"
 
 #include "Daemon/FileSystem/STWFileManager.h"
+#include "Daemon/Lifecycle/STWDaemonQueues.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
-#include "Daemon/Request/STWDaemon.h"
 #include "common/STWLog.h"
 #include "platform/STWCrashPoint.h"
 #include "platform/STWPlatformConfiguration.h"
@@ -62,7 +62,7 @@ bool STWClientConnection::_removeItemOrMoveToTempAtURL(const std::filesystem::pa
 
 void STWClientConnection::deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion) {
     // The queue holds a transaction for the pass until it ran, so idle exit waits for it.
-    STWDaemon::deathRowQueue()->async([completion = std::move(completion)] {
+    STWDaemonQueues::deathRow()->async([completion = std::move(completion)] {
         auto fileManager = STWFileManager::defaultManager();
         auto deathRow = STWGlobalConfiguration::sharedInstance()->deathrowDirectory();
         uint64_t result = STWErrorSuccess;

@@ -1,6 +1,7 @@
 #include "Daemon/Request/STWDaemon.h"
 
 #include "Daemon/FileSystem/STWFaultInjection.h"
+#include "Daemon/Lifecycle/STWDaemonQueues.h"
 #include "Daemon/Lifecycle/STWTestLocks.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Request/STWClientConnection.h"
@@ -111,17 +112,6 @@ void cleanupCompletion() {
 
 } // namespace
 
-const std::shared_ptr<STWQueue>& STWDaemon::deathRowQueue() {
-    static const std::shared_ptr<STWQueue> queue = STWQueue::create(
-        "com.vorlane.stowlyd.deathrow", {.priority = STWQueue::Priority::Background, .holdsTransactions = true});
-    return queue;
-}
-
-const std::shared_ptr<STWQueue>& STWDaemon::lockStateQueue() {
-    static const std::shared_ptr<STWQueue> queue =
-        STWQueue::create("com.vorlane.stowlyd.lockstate", {.priority = STWQueue::Priority::Default, .holdsTransactions = true});
-    return queue;
-}
 
 bool STWDaemon::initialisationFinished() { return initialisationFinishedFlag.load(); }
 
@@ -132,11 +122,11 @@ void STWDaemon::keybag_notification_callback() {
     STW_LOG_DEBUG(STWLogCategory::Unspecified, "LockState=%d", state);
     if (state == STWKeybagLocked) {
         if (lockState.exchange(STWKeybagLocked) != STWKeybagLocked)
-            lockStateQueue()->suspend();
+            STWDaemonQueues::lockState()->suspend();
     } else if (state == STWKeybagUnlocked) {
         // The stored state starts "unknown", so the first unlocked report resumes nothing.
         if (lockState.exchange(STWKeybagUnlocked) == STWKeybagLocked)
-            lockStateQueue()->resume();
+            STWDaemonQueues::lockState()->resume();
     }
 }
 
@@ -150,7 +140,7 @@ void STWDaemon::_onceInitialization() {
     STW_LOG_FN("stowlyd_init", STWLogLevel::Debug, STWLogCategory::Startup, "stowlyd built at %s %s started", __DATE__,
                __TIME__);
 
-    if (!deathRowQueue() || !lockStateQueue())
+    if (!STWDaemonQueues::deathRow() || !STWDaemonQueues::lockState())
         STW_FATAL("Can't create dispatch queues.");
     const auto& connection = STWClientConnection::sharedClientConnection();
 

@@ -17,11 +17,6 @@ public:
     // `stowlyd [--root DIR] [--idle-timeout SECONDS]`.
     static int main(int argc, char** argv);
 
-    // "com.vorlane.stowlyd.deathrow": deletion passes over death row.
-    static const std::shared_ptr<STWQueue>& deathRowQueue();
-    // "com.vorlane.stowlyd.lockstate": suspended while the device is locked, so only ever
-    // submitted to asynchronously (a synchronous submission would wait for an unlock).
-    static const std::shared_ptr<STWQueue>& lockStateQueue();
     static bool initialisationFinished();
 
     // Follows the device's lock state: suspends the lock-state queue when the device

@@ -1,3 +1,4 @@
+#include "Daemon/Lifecycle/STWDaemonQueues.h"
 #include "Daemon/Request/STWDaemon.h"
 #include "common/STWFileIO.h"
 #include "platform/STWFilePersonaService.h"
@@ -19,7 +20,7 @@
 // locked, however often the same state is reported.
 TEST(STWLockState, SuspendAndResumeAlternateWithTheDeviceState) {
     STWTestRoot::shared();
-    auto queue = STWDaemon::lockStateQueue();
+    auto queue = STWDaemonQueues::lockState();
     EXPECT_EQ(STWDaemon::storedLockState(), 3);
 
     STWKeybag::setLockStateOverrideForTesting(false);
@@ -80,7 +81,7 @@ TEST(STWLockState, ALockLostInAnInotifyOverflowIsStillNoticed) {
             std::this_thread::sleep_for(std::chrono::milliseconds(10));
     }
     EXPECT_EQ(STWDaemon::storedLockState(), STWKeybagLocked);
-    EXPECT_TRUE(STWDaemon::lockStateQueue()->isSuspended());
+    EXPECT_TRUE(STWDaemonQueues::lockState()->isSuspended());
     EXPECT_GT(personaUpdates.load(), 0);
     personas.unregisterForPersonaListUpdates(token);
 }
