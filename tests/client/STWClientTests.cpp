@@ -16,16 +16,24 @@ namespace {
 constexpr auto kLong = 30s;
 
 using Dictionary = STWValue::Dictionary;
+const Dictionary kCommand{{"Command", STWValue(1)}};
 
-std::optional<STWFrame> readFrame(STWFrameReader& reader) {
-    return STWFakeDaemon::readFrame(reader);
+// Serves the next connection: `answer` gets every frame the client sends, and the client
+// must end the stream cleanly, between frames.
+void answerEach(STWFakeDaemon& daemon, std::function<void(int fd, const STWFrame&)> answer) {
+    daemon.serve([answer = std::move(answer)](int fd) {
+        STWFrameReader reader(fd);
+        STWFrame frame;
+        std::string reason;
+        STWFrameReadResult result;
+        while ((result = reader.read(frame, &reason)) == STWFrameReadResult::Frame)
+            answer(fd, frame);
+        EXPECT_EQ(result, STWFrameReadResult::EndOfStream) << reason;
+    });
 }
 
-// Blocks until the client closes its end.
-void waitForClose(STWFrameReader& reader) {
-    STWFrame frame;
-    while (reader.read(frame, nullptr) == STWFrameReadResult::Frame) {
-    }
+void replyError(int fd, const STWFrame& frame, uint64_t code = 1) {
+    STWFakeDaemon::reply(fd, frame.id, {{"ReplyError", STWValue(code)}});
 }
 
 std::unique_ptr<STWClient> connectTo(const STWFakeDaemon& daemon) {
@@ -43,14 +51,19 @@ int64_t posixCode(const STWErrorRef& error) {
     return error->code();
 }
 
-} // namespace
-
-TEST(STWClient, SocketPaths) {
-    EXPECT_EQ(STWClient::defaultSocketPath(), "/run/stowly/stowlyd.sock");
-    EXPECT_EQ(STWClient::socketPathForRoot("/tmp/r"), "/tmp/r/run/stowly/stowlyd.sock");
+// Runs `body` on `count` threads at once and waits for them.
+void onThreads(int count, const std::function<void(int)>& body) {
+    std::vector<std::thread> threads;
+    for (int i = 0; i < count; ++i)
+        threads.emplace_back(body, i);
+    for (std::thread& t : threads)
+        t.join();
 }
 
-TEST(STWClient, ConnectFailures) {
+} // namespace
+
+TEST(STWClient, SocketPathsAndConnectFailures) {
+    EXPECT_EQ(STWClient::defaultSocketPath(), "/run/stowly/stowlyd.sock");
     STWFakeDaemon daemon;
     STWErrorRef error;
     EXPECT_FALSE(STWClient::connect(daemon.root() / "missing.sock", &error));
@@ -66,98 +79,68 @@ TEST(STWClient, ConnectFailures) {
 TEST(STWClient, RepliesOutOfOrderReachTheirCallers) {
     STWFakeDaemon daemon;
     constexpr int kCallers = 4;
-    daemon.serve([](int fd) {
-        STWFrameReader reader(fd);
-        std::vector<STWFrame> requests;
-        for (int i = 0; i < kCallers; ++i) {
-            auto frame = readFrame(reader);
-            if (!frame)
-                return;
-            EXPECT_EQ(frame->kind, STWFrameKindRequest);
-            requests.push_back(std::move(*frame));
-        }
+    answerEach(daemon, [requests = std::vector<STWFrame>()](int fd, const STWFrame& frame) mutable {
+        EXPECT_EQ(frame.kind, STWFrameKindRequest);
+        requests.push_back(frame);
+        if (requests.size() < size_t(kCallers))
+            return;
         // Answer the last first, and name the id of a request nobody made in between.
         STWFakeDaemon::reply(fd, 999999, {{"ReplyError", STWValue(1)}});
         for (auto it = requests.rbegin(); it != requests.rend(); ++it)
             STWFakeDaemon::reply(fd, it->id, {{"ReplyError", STWValue(1)}, {"Echo", it->body.at("N")}});
-        waitForClose(reader);
     });
     auto client = connectTo(daemon);
     ASSERT_TRUE(client);
-    std::vector<std::thread> callers;
-    for (int n = 0; n < kCallers; ++n) {
-        callers.emplace_back([&, n] {
-            STWErrorRef error;
-            auto reply = client->sendMessage({{"Command", STWValue(1)}, {"N", STWValue(n)}}, kLong, &error);
-            ASSERT_TRUE(reply) << error->description();
-            EXPECT_EQ(reply->at("Echo"), STWValue(n));
-        });
-    }
-    for (std::thread& t : callers)
-        t.join();
+    onThreads(kCallers, [&](int n) {
+        STWErrorRef error;
+        auto reply = client->sendMessage({{"Command", STWValue(1)}, {"N", STWValue(n)}}, kLong, &error);
+        ASSERT_TRUE(reply) << error->description();
+        EXPECT_EQ(reply->at("Echo"), STWValue(n));
+    });
 }
 
 TEST(STWClient, ConcurrentSendersNeverMixFrames) {
     STWFakeDaemon daemon;
-    daemon.serve([](int fd) {
-        STWFrameReader reader(fd);
-        STWFrame frame;
-        std::string reason;
-        STWFrameReadResult result;
-        while ((result = reader.read(frame, &reason)) == STWFrameReadResult::Frame) {
-            Dictionary body = frame.body;
-            body["Size"] = STWValue(frame.body.at("Blob").data()->size());
-            body.erase("Blob");
-            STWFakeDaemon::reply(fd, frame.id, body);
-        }
-        EXPECT_EQ(result, STWFrameReadResult::EndOfStream) << reason;
+    answerEach(daemon, [](int fd, const STWFrame& frame) {
+        Dictionary body = frame.body;
+        body["Size"] = STWValue(frame.body.at("Blob").data()->size());
+        body.erase("Blob");
+        STWFakeDaemon::reply(fd, frame.id, body);
     });
     auto client = connectTo(daemon);
     ASSERT_TRUE(client);
-    constexpr int kThreads = 8, kMessages = 60;
-    std::vector<std::thread> senders;
-    for (int t = 0; t < kThreads; ++t) {
-        senders.emplace_back([&, t] {
-            for (int m = 0; m < kMessages; ++m) {
-                // Some messages are larger than a socket buffer, so their sends go out in
-                // pieces while other threads want to send too.
-                size_t size = (t * kMessages + m) % 7 == 0 ? 300000 : size_t(m);
-                Dictionary message{
-                    {"T", STWValue(t)}, {"M", STWValue(m)}, {"Blob", STWValue(STWData(size, 1))}};
-                STWErrorRef error;
-                auto reply = client->sendMessage(message, kLong, &error);
-                ASSERT_TRUE(reply) << error->description();
-                EXPECT_EQ(*reply,
-                          (Dictionary{{"T", STWValue(t)}, {"M", STWValue(m)}, {"Size", STWValue(size)}}));
-            }
-        });
-    }
-    for (std::thread& t : senders)
-        t.join();
-    client.reset();
+    constexpr int kMessages = 60;
+    onThreads(8, [&](int t) {
+        for (int m = 0; m < kMessages; ++m) {
+            // Some messages are larger than a socket buffer, so their sends go out in
+            // pieces while other threads want to send too.
+            size_t size = (t * kMessages + m) % 7 == 0 ? 300000 : size_t(m);
+            STWErrorRef error;
+            auto reply = client->sendMessage(
+                {{"T", STWValue(t)}, {"M", STWValue(m)}, {"Blob", STWValue(STWData(size, 1))}}, kLong,
+                &error);
+            ASSERT_TRUE(reply) << error->description();
+            EXPECT_EQ(*reply, (Dictionary{{"T", STWValue(t)}, {"M", STWValue(m)}, {"Size", STWValue(size)}}));
+        }
+    });
 }
 
 TEST(STWClient, TimeOutAbandonsTheRequest) {
     STWFakeDaemon daemon;
     std::promise<void> timedOut;
-    daemon.serve([&](int fd) {
-        STWFrameReader reader(fd);
-        auto first = readFrame(reader);
-        if (!first)
-            return;
-        timedOut.get_future().wait();
-        // The late reply must not be taken for the answer to the next request.
-        STWFakeDaemon::reply(fd, first->id, {{"Answer", STWValue("late")}});
-        auto second = readFrame(reader);
-        if (!second)
-            return;
-        STWFakeDaemon::reply(fd, second->id, {{"Answer", STWValue("second")}});
-        waitForClose(reader);
+    answerEach(daemon, [&](int fd, const STWFrame& frame) {
+        if (frame.body.at("Command") == STWValue(1)) {
+            // The late reply must not be taken for the answer to the next request.
+            timedOut.get_future().wait();
+            STWFakeDaemon::reply(fd, frame.id, {{"Answer", STWValue("late")}});
+        } else {
+            STWFakeDaemon::reply(fd, frame.id, {{"Answer", STWValue("second")}});
+        }
     });
     auto client = connectTo(daemon);
     ASSERT_TRUE(client);
     STWErrorRef error;
-    EXPECT_FALSE(client->sendMessage({{"Command", STWValue(1)}}, 100ms, &error));
+    EXPECT_FALSE(client->sendMessage(kCommand, 100ms, &error));
     EXPECT_EQ(posixCode(error), ETIMEDOUT);
     timedOut.set_value();
     auto reply = client->sendMessage({{"Command", STWValue(2)}}, kLong, &error);
@@ -171,41 +154,42 @@ TEST(STWClient, DaemonClosingFailsEveryWaiterAtOnce) {
     daemon.serve([](int fd) {
         STWFrameReader reader(fd);
         for (int i = 0; i < kWaiters; ++i)
-            if (!readFrame(reader))
+            if (!STWFakeDaemon::readFrame(reader))
                 return;
         // Closing without a word: every caller must learn now, not at its time-out.
     });
     auto client = connectTo(daemon);
     ASSERT_TRUE(client);
-    std::vector<std::thread> waiters;
-    for (int i = 0; i < kWaiters; ++i) {
-        waiters.emplace_back([&] {
-            STWErrorRef error;
-            EXPECT_FALSE(client->sendMessage({{"Command", STWValue(1)}}, kLong, &error));
-            EXPECT_EQ(posixCode(error), ECONNRESET);
-        });
-    }
-    for (std::thread& t : waiters)
-        t.join();
-    // And the connection stays failed.
+    // The waiters, then a caller after them: the connection stays failed.
+    onThreads(kWaiters, [&](int) {
+        STWErrorRef error;
+        EXPECT_FALSE(client->sendMessage(kCommand, kLong, &error));
+        EXPECT_EQ(posixCode(error), ECONNRESET);
+    });
     STWErrorRef error;
-    EXPECT_FALSE(client->sendMessage({{"Command", STWValue(1)}}, kLong, &error));
+    EXPECT_FALSE(client->sendMessage(kCommand, kLong, &error));
     EXPECT_EQ(posixCode(error), ECONNRESET);
 }
 
-TEST(STWClient, GarbageFromTheDaemonFailsTheConnection) {
+TEST(STWClient, TheFrameLimitHoldsBothWays) {
     STWFakeDaemon daemon;
-    daemon.serve([](int fd) {
-        STWFrameReader reader(fd);
-        if (!readFrame(reader))
-            return;
-        STWFrameWrite(fd, std::string("\xff\xff\xff\xff", 4)); // a length far over the limit
-        waitForClose(reader);
-    });
+    // A message over the limit is refused before anything is sent; the connection goes on.
+    answerEach(daemon, [](int fd, const STWFrame& frame) { replyError(fd, frame); });
+    STWErrorRef error;
+    {
+        auto client = connectTo(daemon);
+        ASSERT_TRUE(client);
+        EXPECT_FALSE(client->sendMessage({{"Blob", STWValue(STWData(STWFrameMaxSize, 0))}}, kLong, &error));
+        EXPECT_EQ(posixCode(error), EMSGSIZE);
+        EXPECT_TRUE(client->sendMessage(kCommand, kLong, &error));
+    }
+    daemon.join();
+    // A length over the limit from the daemon fails the connection.
+    answerEach(daemon,
+               [](int fd, const STWFrame&) { STWFrameWrite(fd, std::string("\xff\xff\xff\xff", 4)); });
     auto client = connectTo(daemon);
     ASSERT_TRUE(client);
-    STWErrorRef error;
-    EXPECT_FALSE(client->sendMessage({{"Command", STWValue(1)}}, kLong, &error));
+    EXPECT_FALSE(client->sendMessage(kCommand, kLong, &error));
     EXPECT_EQ(posixCode(error), EMSGSIZE);
 }
 
@@ -215,19 +199,10 @@ TEST(STWClient, Hello) {
                         {"Entitlements", STWValue(Dictionary{{"com.example.entitled", STWValue(true)}})},
                         {"Sandboxed", STWValue(false)}};
     // Accepted: requests go on over the same connection.
-    daemon.serve([&](int fd) {
-        STWFrameReader reader(fd);
-        auto hello = readFrame(reader);
-        if (!hello)
-            return;
-        EXPECT_EQ(hello->kind, STWFrameKindHello);
-        EXPECT_EQ(hello->body, identity);
-        STWFakeDaemon::reply(fd, hello->id, {{"ReplyError", STWValue(1)}});
-        auto request = readFrame(reader);
-        if (!request)
-            return;
-        STWFakeDaemon::reply(fd, request->id, {{"ReplyError", STWValue(1)}});
-        waitForClose(reader);
+    answerEach(daemon, [&](int fd, const STWFrame& frame) {
+        EXPECT_EQ(frame.body,
+                  (frame.kind == STWFrameKindHello ? identity : Dictionary{{"Command", STWValue(3)}}));
+        replyError(fd, frame);
     });
     STWErrorRef error;
     {
@@ -239,49 +214,29 @@ TEST(STWClient, Hello) {
     daemon.join();
 
     // Refused: the daemon answers 55 and hangs up.
-    daemon.serve([](int fd) {
-        STWFrameReader reader(fd);
-        if (auto hello = readFrame(reader))
-            STWFakeDaemon::reply(fd, hello->id, {{"ReplyError", STWValue(55)}});
-        shutdown(fd, SHUT_WR);
-        waitForClose(reader);
+    answerEach(daemon, [](int fd, const STWFrame& frame) {
+        if (frame.kind == STWFrameKindHello) {
+            replyError(fd, frame, 55);
+            shutdown(fd, SHUT_WR);
+        }
     });
-    auto refused = connectTo(daemon);
-    ASSERT_TRUE(refused);
-    EXPECT_EQ(refused->hello(identity, kLong, &error), 55u);
-    EXPECT_FALSE(refused->sendMessage({{"Command", STWValue(3)}}, kLong, &error));
-    EXPECT_EQ(posixCode(error), ECONNRESET);
-}
+    {
+        auto refused = connectTo(daemon);
+        ASSERT_TRUE(refused);
+        EXPECT_EQ(refused->hello(identity, kLong, &error), 55u);
+        EXPECT_FALSE(refused->sendMessage({{"Command", STWValue(3)}}, kLong, &error));
+        EXPECT_EQ(posixCode(error), ECONNRESET);
+    }
+    daemon.join();
 
-TEST(STWClient, HelloReplyWithoutReplyErrorIsAnError) {
-    STWFakeDaemon daemon;
-    daemon.serve([](int fd) {
-        STWFrameReader reader(fd);
-        if (auto hello = readFrame(reader))
-            STWFakeDaemon::reply(fd, hello->id, {{"ReplyError", STWValue("1")}});
-        waitForClose(reader);
+    // A reply without a numeric ReplyError is no answer.
+    answerEach(daemon, [](int fd, const STWFrame& frame) {
+        STWFakeDaemon::reply(fd, frame.id, {{"ReplyError", STWValue("1")}});
     });
     auto client = connectTo(daemon);
     ASSERT_TRUE(client);
-    STWErrorRef error;
     EXPECT_FALSE(client->hello({}, kLong, &error));
     EXPECT_EQ(posixCode(error), EBADMSG);
-}
-
-TEST(STWClient, OversizedMessageIsRefusedAndTheConnectionGoesOn) {
-    STWFakeDaemon daemon;
-    daemon.serve([](int fd) {
-        STWFrameReader reader(fd);
-        if (auto request = readFrame(reader))
-            STWFakeDaemon::reply(fd, request->id, {{"ReplyError", STWValue(1)}});
-        waitForClose(reader);
-    });
-    auto client = connectTo(daemon);
-    ASSERT_TRUE(client);
-    STWErrorRef error;
-    EXPECT_FALSE(client->sendMessage({{"Blob", STWValue(STWData(STWFrameMaxSize, 0))}}, kLong, &error));
-    EXPECT_EQ(posixCode(error), EMSGSIZE);
-    EXPECT_TRUE(client->sendMessage({{"Command", STWValue(1)}}, kLong, &error));
 }
 
 TEST(STWClient, SendBlockedOnADaemonThatDoesNotReadTimesOut) {
@@ -295,7 +250,7 @@ TEST(STWClient, SendBlockedOnADaemonThatDoesNotReadTimesOut) {
     EXPECT_FALSE(client->sendMessage({{"Blob", STWValue(STWData(8 << 20, 0))}}, 200ms, &error));
     EXPECT_EQ(posixCode(error), ETIMEDOUT);
     // Half a frame went out, so the stream is unusable from here on.
-    EXPECT_FALSE(client->sendMessage({{"Command", STWValue(1)}}, kLong, &error));
+    EXPECT_FALSE(client->sendMessage(kCommand, kLong, &error));
     EXPECT_EQ(posixCode(error), ETIMEDOUT);
     done.set_value();
 }
@@ -303,18 +258,12 @@ TEST(STWClient, SendBlockedOnADaemonThatDoesNotReadTimesOut) {
 TEST(STWClient, DestroyingTheClientReleasesItsWaiters) {
     STWFakeDaemon daemon;
     std::promise<void> received;
-    daemon.serve([&](int fd) {
-        STWFrameReader reader(fd);
-        if (readFrame(reader))
-            received.set_value();
-        waitForClose(reader);
-    });
+    answerEach(daemon, [&](int, const STWFrame&) { received.set_value(); });
     auto client = connectTo(daemon);
     ASSERT_TRUE(client);
-    STWClient* raw = client.get();
-    std::thread waiter([raw] {
+    std::thread waiter([raw = client.get()] {
         STWErrorRef error;
-        EXPECT_FALSE(raw->sendMessage({{"Command", STWValue(1)}}, kLong, &error));
+        EXPECT_FALSE(raw->sendMessage(kCommand, kLong, &error));
         EXPECT_EQ(posixCode(error), ECANCELED);
     });
     received.get_future().wait();

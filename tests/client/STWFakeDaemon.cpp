@@ -27,6 +27,9 @@ STWFakeDaemon::STWFakeDaemon() {
 }
 
 STWFakeDaemon::~STWFakeDaemon() {
+    // A script still waiting for a connection that never came fails instead of hanging.
+    if (_listener >= 0)
+        shutdown(_listener, SHUT_RDWR);
     join();
     stopListening();
     std::filesystem::remove_all(_root);

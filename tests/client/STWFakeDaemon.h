@@ -14,7 +14,7 @@
 class STWFakeDaemon {
 public:
     STWFakeDaemon();
-    ~STWFakeDaemon(); // waits for the scripts, then removes the root
+    ~STWFakeDaemon(); // stops accepting, waits for the scripts, then removes the root
 
     const std::filesystem::path& root() const { return _root; }
     std::filesystem::path socketPath() const;

@@ -1,9 +1,8 @@
-#include "common/STWMessagePack.h"
 #include "common/STWIPCFrame.h"
+#include "common/STWMessagePack.h"
 
 #include <gtest/gtest.h>
 
-#include <array>
 #include <atomic>
 #include <cerrno>
 #include <csignal>
@@ -19,57 +18,42 @@ std::string payloadOf(const STWValue& value) {
     return STWMessagePackEncode(value);
 }
 
-std::string withLength(const std::string& payload) {
-    std::string frame(4, '\0');
-    for (int i = 0; i < 4; ++i)
-        frame[i] = static_cast<char>(payload.size() >> (8 * i));
-    return frame + payload;
-}
-
-class STWFrameSocketTest : public ::testing::Test {
-protected:
-    void SetUp() override { ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0); }
-    void TearDown() override {
-        closeWriter();
-        close(fds[0]);
+// A connected stream pair: the reader's end and the writer's.
+struct SocketPair {
+    SocketPair() { EXPECT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0); }
+    ~SocketPair() {
+        closeEnd(0);
+        closeEnd(1);
     }
-    void closeWriter() {
-        if (fds[1] >= 0)
-            close(fds[1]);
-        fds[1] = -1;
+    void closeEnd(int end) {
+        if (fds[end] >= 0)
+            close(fds[end]);
+        fds[end] = -1;
     }
-    void writeRaw(const std::string& s) { ASSERT_TRUE(STWFrameWrite(fds[1], s)) << strerror(errno); }
+    void write(std::string_view bytes) { ASSERT_TRUE(STWFrameWrite(fds[1], bytes)) << strerror(errno); }
 
     int fds[2] = {-1, -1};
 };
 
 } // namespace
 
-TEST(STWIPCFrame, EncodeAndDecode) {
-    STWValue::Dictionary body{{"Command", STWValue(7)}, {"Identifier", STWValue("com.example.app")}};
-    std::string frame = STWFrameEncode(STWFrameKindReply, UINT64_MAX, body);
-    uint32_t length = 0;
-    memcpy(&length, frame.data(), 4); // little-endian host
-    ASSERT_EQ(length, frame.size() - 4);
-    std::string reason;
-    auto decoded = STWFrameDecode(std::string_view(frame).substr(4), &reason);
-    ASSERT_TRUE(decoded) << reason;
-    EXPECT_EQ(decoded->kind, STWFrameKindReply);
-    EXPECT_EQ(decoded->id, UINT64_MAX);
-    EXPECT_EQ(decoded->body, body);
-    // The frame array is what a generic encoder would write for the same value.
-    EXPECT_EQ(frame.substr(4),
-              payloadOf(STWValue(STWValue::Array{STWValue(1), STWValue(UINT64_MAX), STWValue(body)})));
-    // A kind this side does not know is handed on for the receiver to judge.
-    auto unknown = STWFrameDecode(
-        payloadOf(STWValue(STWValue::Array{STWValue(9), STWValue(1), STWValue(STWValue::Dictionary{})})),
-        nullptr);
-    ASSERT_TRUE(unknown);
-    EXPECT_EQ(unknown->kind, 9u);
-}
-
-TEST(STWIPCFrame, DecodeRefusesFramesOfTheWrongShape) {
+TEST(STWIPCFrame, EncodesAGenericArrayAndDecodesOnlyThatShape) {
     using A = STWValue::Array;
+    STWValue::Dictionary body{{"Command", STWValue(7)}, {"Identifier", STWValue("com.example.app")}};
+    // A little-endian length, then what a generic encoder would write for [kind, id, body].
+    std::string payload = payloadOf(STWValue(A{STWValue(1), STWValue(UINT64_MAX), STWValue(body)}));
+    uint32_t length = static_cast<uint32_t>(payload.size());
+    EXPECT_EQ(STWFrameEncode(STWFrameKindReply, UINT64_MAX, body),
+              std::string(reinterpret_cast<const char*>(&length), 4) + payload); // little-endian host
+    // A kind this side does not know is handed on for the receiver to judge.
+    std::string reason;
+    auto unknown =
+        STWFrameDecode(payloadOf(STWValue(A{STWValue(9), STWValue(UINT64_MAX), STWValue(body)})), &reason);
+    ASSERT_TRUE(unknown) << reason;
+    EXPECT_EQ(unknown->kind, 9u);
+    EXPECT_EQ(unknown->id, UINT64_MAX);
+    EXPECT_EQ(unknown->body, body);
+
     STWValue map(STWValue::Dictionary{});
     const std::pair<const char*, std::string> cases[] = {
         {"not an array", payloadOf(map)},
@@ -83,14 +67,15 @@ TEST(STWIPCFrame, DecodeRefusesFramesOfTheWrongShape) {
         {"broken MessagePack", std::string("\x93\x00\x01\x81\x01\xc0", 6)},
         {"empty payload", ""},
     };
-    for (const auto& [what, payload] : cases) {
-        std::string reason;
-        EXPECT_FALSE(STWFrameDecode(payload, &reason)) << what;
+    for (const auto& [what, bytes] : cases) {
+        reason.clear();
+        EXPECT_FALSE(STWFrameDecode(bytes, &reason)) << what;
         EXPECT_FALSE(reason.empty()) << what;
     }
 }
 
-TEST_F(STWFrameSocketTest, ReadsFramesPackedTogetherAndSplitApart) {
+TEST(STWFrameReader, ReadsFramesPackedTogetherAndSplitApart) {
+    SocketPair pair;
     std::string stream;
     for (uint64_t id = 1; id <= 50; ++id)
         stream += STWFrameEncode(STWFrameKindRequest, id, {{"N", STWValue(id)}});
@@ -100,12 +85,12 @@ TEST_F(STWFrameSocketTest, ReadsFramesPackedTogetherAndSplitApart) {
     // The writer trickles the stream in uneven pieces, some cutting through the length.
     std::thread writer([&] {
         for (size_t at = 0, step = 1; at < stream.size(); at += step, step = step * 3 % 1021 + 1) {
-            if (!STWFrameWrite(fds[1], std::string_view(stream).substr(at, step)))
+            if (!STWFrameWrite(pair.fds[1], std::string_view(stream).substr(at, step)))
                 return;
         }
-        closeWriter();
+        pair.closeEnd(1);
     });
-    STWFrameReader reader(fds[0]);
+    STWFrameReader reader(pair.fds[0]);
     for (uint64_t id = 1; id <= 51; ++id) {
         STWFrame frame;
         std::string reason;
@@ -118,66 +103,72 @@ TEST_F(STWFrameSocketTest, ReadsFramesPackedTogetherAndSplitApart) {
     writer.join();
 }
 
-TEST_F(STWFrameSocketTest, ReadOfAsManyBytesAsWereConsumedIsNotTheEnd) {
+TEST(STWFrameReader, ReadOfAsManyBytesAsWereConsumedIsNotTheEnd) {
     // The first frame and the head of the second arrive together; the rest of the second
     // is exactly as long as the first. Once the reader has moved the head to the front of
     // its buffer, that last read leaves the buffer as full as before it.
+    SocketPair pair;
     std::string first = STWFrameEncode(STWFrameKindRequest, 1, {{"N", STWValue(1)}});
     std::string second = STWFrameEncode(STWFrameKindRequest, 2, {{"Blob", STWValue(STWData(100, 7))}});
     ASSERT_GT(second.size(), first.size());
     size_t head = second.size() - first.size();
-    writeRaw(first + second.substr(0, head));
-    STWFrameReader reader(fds[0]);
+    pair.write(first + second.substr(0, head));
+    STWFrameReader reader(pair.fds[0]);
     STWFrame frame;
     std::string reason;
     ASSERT_EQ(reader.read(frame, &reason), STWFrameReadResult::Frame) << reason;
-    writeRaw(second.substr(head));
+    pair.write(second.substr(head));
     ASSERT_EQ(reader.read(frame, &reason), STWFrameReadResult::Frame) << reason;
     EXPECT_EQ(frame.id, 2u);
 }
 
-TEST_F(STWFrameSocketTest, EndOfStreamInsideAFrameIsAnError) {
-    std::string frame = STWFrameEncode(STWFrameKindRequest, 1, {{"K", STWValue("value")}});
-    for (size_t cut : {size_t(2), frame.size() - 1}) {
-        int pair[2];
-        ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, pair), 0);
-        ASSERT_TRUE(STWFrameWrite(pair[1], frame));
-        ASSERT_TRUE(STWFrameWrite(pair[1], std::string_view(frame).substr(0, cut)));
-        close(pair[1]);
-        STWFrameReader reader(pair[0]);
-        STWFrame read;
+// After a good frame, each broken stream is an Error with its errno. The first two are
+// judged with the writer still open: a reader that waited for (or allocated) the payload
+// it was promised would block here.
+TEST(STWFrameReader, BrokenStreamsFailWithTheirErrno) {
+    std::string good = STWFrameEncode(STWFrameKindRequest, 1, {{"K", STWValue("value")}});
+    uint32_t over = STWFrameMaxSize + 1;
+    std::string broken("\x08\x00\x00\x00\x93\x00\x01\xdd\xff\xff\xff\xff", 12); // array32 of 4 billion
+    const struct {
+        const char* what;
+        std::string bytes;
+        bool closed;
+        int error;
+        const char* reason;
+    } cases[] = {
+        {"oversized length", std::string(reinterpret_cast<const char*>(&over), 4), false, EMSGSIZE,
+         "over the limit"},
+        {"broken payload", broken, false, EBADMSG, "beyond the end"},
+        {"end inside the length", good.substr(0, 2), true, ECONNRESET, "inside a frame"},
+        {"end inside the payload", good.substr(0, good.size() - 1), true, ECONNRESET, "inside a frame"},
+    };
+    for (const auto& c : cases) {
+        SocketPair pair;
+        pair.write(good + c.bytes);
+        if (c.closed)
+            pair.closeEnd(1);
+        STWFrameReader reader(pair.fds[0]);
+        STWFrame frame;
         std::string reason;
-        EXPECT_EQ(reader.read(read, &reason), STWFrameReadResult::Frame) << reason;
-        EXPECT_EQ(reader.read(read, &reason), STWFrameReadResult::Error) << "cut at " << cut;
-        EXPECT_NE(reason.find("inside a frame"), std::string::npos) << reason;
-        close(pair[0]);
+        EXPECT_EQ(reader.read(frame, &reason), STWFrameReadResult::Frame) << c.what << ": " << reason;
+        STWFrameReadResult result = reader.read(frame, &reason);
+        int error = errno;
+        EXPECT_EQ(result, STWFrameReadResult::Error) << c.what;
+        EXPECT_EQ(error, c.error) << c.what;
+        EXPECT_NE(reason.find(c.reason), std::string::npos) << c.what << ": " << reason;
     }
 }
 
-TEST_F(STWFrameSocketTest, OversizedLengthIsRefusedWithoutWaitingForThePayload) {
-    // Only the length arrives and the writer stays open: a reader that tried to read or
-    // allocate the payload first would block here.
-    uint32_t length = STWFrameMaxSize + 1;
-    writeRaw(std::string(reinterpret_cast<const char*>(&length), 4));
-    STWFrameReader reader(fds[0]);
-    STWFrame frame;
-    std::string reason;
-    STWFrameReadResult result = reader.read(frame, &reason);
-    int error = errno;
-    EXPECT_EQ(result, STWFrameReadResult::Error);
-    EXPECT_EQ(error, EMSGSIZE);
-    EXPECT_NE(reason.find("over the limit"), std::string::npos) << reason;
-}
-
-TEST_F(STWFrameSocketTest, FrameOfExactlyTheLimitIsRead) {
+TEST(STWFrameReader, FrameOfExactlyTheLimitIsRead) {
     // Fill the payload to the limit: array header, kind, id, map of one data entry.
+    SocketPair pair;
     std::string empty = STWFrameEncode(STWFrameKindRequest, 3, {{"D", STWValue(STWData{})}});
     size_t overhead = empty.size() - 4 + 3; // the bin8 header grows into a bin32 one
     STWValue::Dictionary body{{"D", STWValue(STWData(STWFrameMaxSize - overhead, 1))}};
     std::string frame = STWFrameEncode(STWFrameKindRequest, 3, body);
     ASSERT_EQ(frame.size() - 4, STWFrameMaxSize);
-    std::thread writer([&] { STWFrameWrite(fds[1], frame); });
-    STWFrameReader reader(fds[0]);
+    std::thread writer([&] { STWFrameWrite(pair.fds[1], frame); });
+    STWFrameReader reader(pair.fds[0]);
     STWFrame read;
     std::string reason;
     EXPECT_EQ(reader.read(read, &reason), STWFrameReadResult::Frame) << reason;
@@ -185,40 +176,30 @@ TEST_F(STWFrameSocketTest, FrameOfExactlyTheLimitIsRead) {
     writer.join();
 }
 
-TEST_F(STWFrameSocketTest, BrokenPayloadIsAnError) {
-    writeRaw(withLength(std::string("\x93\x00\x01\xdd\xff\xff\xff\xff", 8)));
-    STWFrameReader reader(fds[0]);
-    STWFrame frame;
-    STWFrameReadResult result = reader.read(frame, nullptr);
-    int error = errno;
-    EXPECT_EQ(result, STWFrameReadResult::Error);
-    EXPECT_EQ(error, EBADMSG);
-}
-
-TEST_F(STWFrameSocketTest, WriteSurvivesSignalsAndAFullSocket) {
+TEST(STWFrameWrite, SurvivesSignalsAndAFullSocket) {
     // A small send buffer and a slow reader force partial sends; signals without
     // SA_RESTART interrupt the blocked ones.
+    SocketPair pair;
     struct sigaction action {};
     action.sa_handler = [](int) {};
     struct sigaction old {};
     ASSERT_EQ(sigaction(SIGUSR1, &action, &old), 0);
     int small = 4096;
-    setsockopt(fds[1], SOL_SOCKET, SO_SNDBUF, &small, sizeof small);
+    setsockopt(pair.fds[1], SOL_SOCKET, SO_SNDBUF, &small, sizeof small);
 
     std::string frame = STWFrameEncode(STWFrameKindReply, 1, {{"Blob", STWValue(STWData(2000000, 0x5a))}});
     std::atomic<bool> written{false};
     bool ok = false;
     std::thread writer([&] {
-        ok = STWFrameWrite(fds[1], frame);
+        ok = STWFrameWrite(pair.fds[1], frame);
         written = true;
     });
-    pthread_t writerThread = writer.native_handle();
     std::string received;
     char buffer[8192];
     while (received.size() < frame.size()) {
         if (!written)
-            pthread_kill(writerThread, SIGUSR1);
-        ssize_t n = recv(fds[0], buffer, sizeof buffer, 0);
+            pthread_kill(writer.native_handle(), SIGUSR1);
+        ssize_t n = recv(pair.fds[0], buffer, sizeof buffer, 0);
         ASSERT_GT(n, 0);
         received.append(buffer, static_cast<size_t>(n));
     }
@@ -226,16 +207,13 @@ TEST_F(STWFrameSocketTest, WriteSurvivesSignalsAndAFullSocket) {
     sigaction(SIGUSR1, &old, nullptr);
     EXPECT_TRUE(ok);
     EXPECT_EQ(received, frame);
-}
 
-TEST_F(STWFrameSocketTest, WriteToAClosedPeerFailsWithoutSIGPIPE) {
-    close(fds[0]);
-    fds[0] = socket(AF_UNIX, SOCK_STREAM, 0); // keep TearDown's close harmless
     // Without MSG_NOSIGNAL the default SIGPIPE action would end the test process here.
+    pair.closeEnd(0);
     errno = 0;
-    bool written = STWFrameWrite(fds[1], STWFrameEncode(STWFrameKindReply, 1, {}));
+    ok = STWFrameWrite(pair.fds[1], frame);
     int error = errno;
-    EXPECT_FALSE(written);
+    EXPECT_FALSE(ok);
     EXPECT_EQ(error, EPIPE);
 }
 
@@ -247,15 +225,13 @@ TEST(STWFrameReaderBudget, LargeFramesReserveTheirBytesUntilTheyAreDone) {
     limits.frameTimeout = std::chrono::milliseconds(100);
     limits.budget = &budget;
     std::string large = STWFrameEncode(STWFrameKindRequest, 1, {{"Blob", STWValue(STWData(200000, 1))}});
-    std::vector<std::array<int, 2>> pairs(3);
-    for (auto& pair : pairs)
-        ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair.data()), 0);
+    SocketPair pairs[3];
     STWFrame frame;
     std::string reason;
     {
-        ASSERT_TRUE(STWFrameWrite(pairs[0][1], std::string_view(large).substr(0, 100000)));
-        ASSERT_TRUE(STWFrameWrite(pairs[1][1], std::string_view(large).substr(0, 100000)));
-        STWFrameReader stalled(pairs[0][0], limits), refused(pairs[1][0], limits);
+        pairs[0].write(std::string_view(large).substr(0, 100000));
+        pairs[1].write(std::string_view(large).substr(0, 100000));
+        STWFrameReader stalled(pairs[0].fds[0], limits), refused(pairs[1].fds[0], limits);
         EXPECT_EQ(stalled.read(frame, &reason), STWFrameReadResult::Error);
         EXPECT_EQ(errno, ETIMEDOUT) << reason;
         EXPECT_GT(budget.reserved(), 100000u);
@@ -263,13 +239,9 @@ TEST(STWFrameReaderBudget, LargeFramesReserveTheirBytesUntilTheyAreDone) {
         EXPECT_EQ(errno, ENOBUFS) << reason;
     }
     EXPECT_EQ(budget.reserved(), 0u);
-    std::thread writer([&] { STWFrameWrite(pairs[2][1], large); });
-    STWFrameReader reader(pairs[2][0], limits);
+    std::thread writer([&] { STWFrameWrite(pairs[2].fds[1], large); });
+    STWFrameReader reader(pairs[2].fds[0], limits);
     EXPECT_EQ(reader.read(frame, &reason), STWFrameReadResult::Frame) << reason;
     EXPECT_EQ(budget.reserved(), 0u);
     writer.join();
-    for (auto& pair : pairs) {
-        close(pair[0]);
-        close(pair[1]);
-    }
 }

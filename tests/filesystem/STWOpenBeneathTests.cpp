@@ -90,39 +90,36 @@ INSTANTIATE_TEST_SUITE_P(, OpenBeneath, ::testing::Values(false, true),
 
 
 // A staged directory swapped for a link after it was made: the publishing rename notices
-// that something else arrived, sends it back and fails; nothing stays published.
+// that something else arrived, sends it back and fails; nothing stays published. And a
+// second publication under the same name never replaces the first.
 using PublishStaged = FileSystemTest;
-TEST_F(PublishStaged, AnImpostorIsSentBackAndNothingIsPublished) {
-    fs::create_directories(scratch() / "staging");
-    fs::create_directories(scratch() / "live");
-    fs::create_directories(scratch() / "elsewhere");
-    STWFileDescriptor staging = fm()->openDirectoryAtURL(scratch() / "staging");
-    STWFileDescriptor live = fm()->openDirectoryAtURL(scratch() / "live");
+TEST_F(PublishStaged, AnImpostorIsSentBackAndNothingIsReplaced) {
+    fs::path s = scratch();
+    for (const char* directory : {"staging", "live", "elsewhere"})
+        fs::create_directories(s / directory);
+    STWFileDescriptor staging = fm()->openDirectoryAtURL(s / "staging"), live = fm()->openDirectoryAtURL(s / "live");
     ASSERT_TRUE(staging && live);
+    auto publish = [&](const std::string& name, int directoryfd, STWErrorRef* error) {
+        return fm()->moveDirectoryAt(staging.get(), name, live.get(), "final", directoryfd, STWFileManagerMoveDurable,
+                                     s / "staging" / name, s / "live/final", error);
+    };
     STWFileDescriptor made = fm()->createNewDirectoryAt(staging.get(), "new", 0755, STWFileManagerOwnerUnchanged,
-                                                        STWFileManagerClassUnchanged, scratch() / "staging/new");
+                                                        STWFileManagerClassUnchanged, s / "staging/new");
     ASSERT_TRUE(made);
-    fs::rename(scratch() / "staging/new", scratch() / "staging/moved");
-    fs::create_directory_symlink(scratch() / "elsewhere", scratch() / "staging/new");
+    fs::rename(s / "staging/new", s / "staging/moved");
+    fs::create_directory_symlink(s / "elsewhere", s / "staging/new");
     STWErrorRef error;
-    EXPECT_FALSE(fm()->moveDirectoryAt(staging.get(), "new", live.get(), "final", made.get(), STWFileManagerMoveDurable,
-                                       scratch() / "staging/new", scratch() / "live/final", &error));
-    ASSERT_TRUE(error);
-    EXPECT_TRUE(error->isPOSIX(ESTALE));
-    EXPECT_TRUE(fs::is_empty(scratch() / "live"));
-    EXPECT_TRUE(fs::is_symlink(scratch() / "staging/new"));
+    EXPECT_FALSE(publish("new", made.get(), &error));
+    EXPECT_TRUE(error && error->isPOSIX(ESTALE));
+    EXPECT_TRUE(fs::is_empty(s / "live"));
+    EXPECT_TRUE(fs::is_symlink(s / "staging/new"));
 
-    // The real one goes, and a second publication under the same name never replaces it.
-    fs::remove(scratch() / "staging/new");
-    fs::rename(scratch() / "staging/moved", scratch() / "staging/new");
-    ASSERT_TRUE(fm()->moveDirectoryAt(staging.get(), "new", live.get(), "final", made.get(), STWFileManagerMoveDefault,
-                                      scratch() / "staging/new", scratch() / "live/final"));
-    fs::create_directory(scratch() / "staging/again");
-    STWFileDescriptor again = fm()->openDirectoryAtURL(scratch() / "staging/again");
+    fs::remove(s / "staging/new");
+    fs::rename(s / "staging/moved", s / "staging/new");
+    ASSERT_TRUE(publish("new", made.get(), nullptr));
+    fs::create_directory(s / "staging/again");
     error.reset();
-    EXPECT_FALSE(fm()->moveDirectoryAt(staging.get(), "again", live.get(), "final", again.get(),
-                                       STWFileManagerMoveDefault, scratch() / "staging/again",
-                                       scratch() / "live/final", &error));
+    EXPECT_FALSE(publish("again", fm()->openDirectoryAtURL(s / "staging/again").get(), &error));
     EXPECT_TRUE(error && error->isPOSIX(EEXIST));
 }
 

@@ -15,31 +15,32 @@ namespace {
 class Attempt {
 public:
     explicit Attempt(std::function<void()> work) : _future(std::async(std::launch::async, std::move(work))) {}
-    bool done(std::chrono::milliseconds wait = 100ms) { return _future.wait_for(wait) == std::future_status::ready; }
+    bool done(std::chrono::milliseconds wait = 100ms) {
+        return _future.wait_for(wait) == std::future_status::ready;
+    }
     void finish() { _future.get(); }
 
 private:
     std::future<void> _future;
 };
 
+// Takes and drops the lock of `id` on another thread.
+Attempt lockAndUnlock(std::string id, bool write) {
+    return Attempt([id, write] {
+        write ? lock_identifier_for_writing(id) : lock_identifier_for_reading(id);
+        unlock_identifier(id);
+    });
+}
+
 } // namespace
 
 TEST(STWLocks, ReadersShareAndOtherIdentifiersNeverWait) {
     lock_identifier_for_reading("A");
-    Attempt secondReader([] {
-        lock_identifier_for_reading("A");
-        unlock_identifier("A");
-    });
+    Attempt secondReader = lockAndUnlock("A", false);
     EXPECT_TRUE(secondReader.done(2000ms));
-    Attempt otherWriter([] {
-        lock_identifier_for_writing("B");
-        unlock_identifier("B");
-    });
+    Attempt otherWriter = lockAndUnlock("B", true);
     EXPECT_TRUE(otherWriter.done(2000ms));
-    Attempt sameWriter([] {
-        lock_identifier_for_writing("A");
-        unlock_identifier("A");
-    });
+    Attempt sameWriter = lockAndUnlock("A", true);
     EXPECT_FALSE(sameWriter.done());
     unlock_identifier("A");
     EXPECT_TRUE(sameWriter.done(2000ms));
@@ -79,15 +80,9 @@ TEST(STWLocks, GlobalReadersAdmitIdentifierReadersButNotWriters) {
     lock_all_identifiers_for_reading();
     lock_all_identifiers_for_reading();
     EXPECT_EQ(STWLocksCurrentState().allReaderWriterState, 2u);
-    Attempt reader([] {
-        lock_identifier_for_reading("A");
-        unlock_identifier("A");
-    });
+    Attempt reader = lockAndUnlock("A", false);
     EXPECT_TRUE(reader.done(2000ms));
-    Attempt writer([] {
-        lock_identifier_for_writing("A");
-        unlock_identifier("A");
-    });
+    Attempt writer = lockAndUnlock("A", true);
     unlock_all_identifiers();
     EXPECT_FALSE(writer.done());
     unlock_all_identifiers();
