@@ -164,6 +164,16 @@ std::optional<double> STWValue::realValue() const {
     return std::nullopt;
 }
 
+std::optional<int64_t> STWValue::truncatedInt64Value() const {
+    if (auto i = int64Value())
+        return i;
+    auto d = std::get_if<double>(&_v);
+    // 2^63 is exact in a double; every double below it (and from -2^63 up) fits.
+    if (!d || !(*d >= -9223372036854775808.0 && *d < 9223372036854775808.0))
+        return std::nullopt;
+    return static_cast<int64_t>(*d);
+}
+
 const std::string* STWValue::string() const {
     return std::get_if<std::string>(&_v);
 }

@@ -86,6 +86,9 @@ public:
     std::optional<uint64_t> uint64Value() const;
     std::optional<int64_t> int64Value() const;
     std::optional<double> realValue() const; // any number
+    // Any number read as an integer: a real truncated toward zero; nullopt for what is no
+    // number or lies outside int64 (where a plain cast would be undefined).
+    std::optional<int64_t> truncatedInt64Value() const;
     const std::string* string() const;
     const STWData* data() const;
     const STWDate* date() const;

@@ -285,7 +285,7 @@ int32_t STWClientConnection::_dataProtectionClassForContainerMetadata(const STWM
     if (metadata.info()) {
         const STWValue* value = STWDictionaryFind(*metadata.info(), "com.vorlane.Setwright.ContentProtectionClass");
         if (value && value->isNumber())
-            return static_cast<int32_t>(value->int64Value().value_or(static_cast<int64_t>(value->realValue().value_or(0))));
+            return static_cast<int32_t>(value->truncatedInt64Value().value_or(0));
     }
     // The class intended from the identifier's entitlements comes from the code-signing
     // mapping, which is not part of this build: new containers get class 0 until then.

@@ -276,7 +276,7 @@ std::shared_ptr<STWMetadata> STWMetadata::_readAndValidateMetadata(int dirfd, co
                                      describe(classValue), fileURL));
         return nullptr;
     }
-    int64_t classNumber = classValue->int64Value().value_or(static_cast<int64_t>(classValue->realValue().value_or(0)));
+    int64_t classNumber = classValue->truncatedInt64Value().value_or(0);
     if (classNumber < 1 || classNumber > 13) {
         STWSetError(error, STW_ERROR(STWErrorInvalidContent, nullptr, "Invalid metadata Content Class: %ld at %@",
                                      classNumber, fileURL));
