@@ -38,7 +38,12 @@ int openChildDirectory(int parent, const std::string& name, bool create) {
 }
 
 std::string directoryKey(const STWSandboxMappingItem& item) {
-    return STWFormat("%u/%u/%llu", item.uid, item.kernelPersonaID, static_cast<unsigned long long>(item.itemType));
+    std::string key = std::to_string(item.uid);
+    key += '/';
+    key += std::to_string(item.kernelPersonaID);
+    key += '/';
+    key += std::to_string(item.itemType);
+    return key;
 }
 
 } // namespace
@@ -84,7 +89,9 @@ std::string STWSandboxMappingStore::nameForIdentifier(std::string_view identifie
         return std::string(identifier);
     unsigned char digest[SHA256_DIGEST_LENGTH];
     SHA256(reinterpret_cast<const unsigned char*>(identifier.data()), identifier.size(), digest);
-    return "%" + STWHexString(digest, sizeof digest);
+    std::string name = "%";
+    name += STWHexString(digest, sizeof digest);
+    return name;
 }
 
 STWFileSandboxMappingStore::STWFileSandboxMappingStore(std::filesystem::path baseDirectory)
@@ -209,4 +216,15 @@ std::optional<std::filesystem::path> STWFileSandboxMappingStore::userStateItem(c
     if (length < 0 || static_cast<size_t>(length) >= sizeof(buffer))
         return std::nullopt;
     return std::filesystem::path(std::string(buffer, static_cast<size_t>(length)));
+}
+
+bool STWFileSandboxMappingStore::userStateItemIs(const STWSandboxMappingItem& item, std::string_view path) {
+    int error = 0;
+    DirectoryRef directory = _itemDirectory(item, false, &error);
+    if (!directory || path.size() >= PATH_MAX)
+        return false;
+    // One byte more than the path, so that a longer target is not taken for it.
+    char buffer[PATH_MAX];
+    ssize_t length = readlinkat(directory->fd(), nameForIdentifier(item.identifier).c_str(), buffer, path.size() + 1);
+    return length >= 0 && std::string_view(buffer, static_cast<size_t>(length)) == path;
 }

@@ -66,6 +66,11 @@ public:
 
     // The path the item maps to, or nullopt when there is none (or it cannot be read).
     virtual std::optional<std::filesystem::path> userStateItem(const STWSandboxMappingItem& item) = 0;
+    // Whether the item maps to exactly `path` (a rebuild asks this of every container).
+    virtual bool userStateItemIs(const STWSandboxMappingItem& item, std::string_view path) {
+        auto current = userStateItem(item);
+        return current && current->native() == path;
+    }
 
     // The file name under which the identifier's link is stored.
     static std::string nameForIdentifier(std::string_view identifier);
@@ -81,6 +86,7 @@ public:
 
     int setUserStateItem(const STWSandboxMappingItem& item, const std::optional<std::filesystem::path>& path) override;
     std::optional<std::filesystem::path> userStateItem(const STWSandboxMappingItem& item) override;
+    bool userStateItemIs(const STWSandboxMappingItem& item, std::string_view path) override;
 
 private:
     class Directory;

@@ -619,7 +619,7 @@ bool STWContainerCache::_setSandboxContainerMappingForUserIdentity(const STWUser
 
     // After a restart the store mostly holds what a rebuild pushes already: one read
     // instead of a removal and a new link.
-    if (keepIfCurrent && url && store->userStateItem(item) == *url)
+    if (keepIfCurrent && url && store->userStateItemIs(item, url->native()))
         return true;
     if (int e = store->setUserStateItem(item, std::nullopt)) {
         STW_LOG_ERROR(STWLogCategory::Sandbox,
