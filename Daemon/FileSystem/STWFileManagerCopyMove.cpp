@@ -355,18 +355,20 @@ int copyTree(const std::string& source, const std::string& destination) {
     return copyMetadata(sourceFd.get(), destinationFd, st, true);
 }
 
-// For the "if exists" forms of copy and move: whether `source` is there (a missing source
-// is nothing to do), or nullopt with `error` set when it cannot be examined.
-std::optional<bool> sourceExists(const std::string& source, const char* function, STWErrorRef* error) {
+// For the "if exists" forms of copy and move: nullopt when the operation should go on,
+// else what it answers: true for a missing source (nothing to do), false with `error` set
+// when the source cannot be examined.
+std::optional<bool> answerWithoutSource(const std::string& source, bool failIfSrcMissing, const char* function,
+                                        STWErrorRef* error) {
     struct stat st;
-    if (lstat(source.c_str(), &st) == 0)
-        return true;
+    if (failIfSrcMissing || lstat(source.c_str(), &st) == 0)
+        return std::nullopt;
     int e = errno;
     if (e == ENOENT)
-        return false;
+        return true;
     STWSetError(error, STWErrorCreate(STWPOSIXErrorDomain, e, function, __LINE__, nullptr, true,
                                       "stat of %@ failed: %s", source, strerror(e)));
-    return std::nullopt;
+    return false;
 }
 
 } // namespace
@@ -375,11 +377,8 @@ bool STWFileManager::_copyItemAtURL(const fs::path& url, const fs::path& toURL, 
                                     STWErrorRef* error) const {
     std::string source = pathString(url);
     std::string destination = pathString(toURL);
-    if (!failIfSrcMissing) {
-        std::optional<bool> exists = sourceExists(source, __func__, error);
-        if (!exists || !*exists)
-            return exists.has_value();
-    }
+    if (auto answer = answerWithoutSource(source, failIfSrcMissing, __func__, error))
+        return *answer;
     if (int e = copyTree(source, destination)) {
         STWSetError(error,
                     STW_POSIX_ERROR(e, "copyfile of %@ to %@ failed: %s", source, destination, strerror(e)));
@@ -400,11 +399,8 @@ bool STWFileManager::_moveItemAtURL(const fs::path& url, const fs::path& toURL, 
                                     STWFileManagerMoveOptions options, STWErrorRef* error) const {
     std::string source = pathString(url);
     std::string destination = pathString(toURL);
-    if (!failIfSrcMissing) {
-        std::optional<bool> exists = sourceExists(source, __func__, error);
-        if (!exists || !*exists)
-            return exists.has_value();
-    }
+    if (auto answer = answerWithoutSource(source, failIfSrcMissing, __func__, error))
+        return *answer;
     bool durable = options & STWFileManagerMoveDurable;
     // What is moved must be on disk before the rename that makes it visible can be.
     if (durable) {
