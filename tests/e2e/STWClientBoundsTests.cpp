@@ -184,27 +184,3 @@ TEST(STWClientBounds, SilentClientsAreDroppedAfterTheirDeadline) {
     close(silent);
     close(stalled);
 }
-
-// SIGTERM releases the test locks, so a request parked behind one ends and the daemon
-// exits cleanly rather than tearing down what that request still uses.
-TEST(STWClientBounds, TerminationWithARequestParkedOnATestLockIsClean) {
-    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}});
-    auto control =
-        daemon.connectAs("com.example.tester", {{"com.vorlane.private.Stowly.testability", STWValue(true)}});
-    ASSERT_NE(control, nullptr);
-    ASSERT_EQ(
-        STWDaemonProcess::replyError(*control, 31, {{"TestLock", STWValue(1)}, {"Enable", STWValue(true)}}),
-        STWErrorSuccess);
-    std::thread creator([&] {
-        auto client = daemon.connectAs("com.example.installer",
-                                       {{"com.vorlane.private.Stowly.allowed", STWValue(true)}});
-        if (client)
-            STWDaemonProcess::replyError(*client, 0,
-                                         {{"Identifier", STWValue("com.example.parked")},
-                                          {"ContainerClass", STWValue(2)},
-                                          {"CreateIfNecessary", STWValue(true)}});
-    });
-    std::this_thread::sleep_for(500ms); // the create reaches the lock
-    EXPECT_TRUE(daemon.stop());
-    creator.join();
-}

@@ -250,7 +250,8 @@ TEST_F(STWContainerCommandsTest, DataContainersAreMappedForTheSandboxAndBundlesA
 }
 
 // On internal builds a test client can hold the daemon-wide write lock; creation waits
-// for it, and releasing the lock lets the waiting request through.
+// for it, and releasing the lock lets the waiting request through. SIGTERM releases the
+// test locks too, so a daemon with a request parked behind one still exits cleanly.
 TEST(STWTestLockCommand, DaemonWideWriteLockParksCreationUntilReleased) {
     STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}});
     STWValue::Dictionary tester{{"com.vorlane.private.Stowly.testability", STWValue(true)}};
@@ -271,6 +272,16 @@ TEST(STWTestLockCommand, DaemonWideWriteLockParksCreationUntilReleased) {
     EXPECT_EQ(result.load(), STWErrorSuccess);
     EXPECT_EQ(STWDaemonProcess::replyError(*control, 31, {{"TestLock", STWValue(7)}, {"Enable", STWValue(true)}}),
               STWErrorInvalidArgument);
+
+    ASSERT_EQ(STWDaemonProcess::replyError(*control, 31, {{"TestLock", STWValue(1)}, {"Enable", STWValue(true)}}),
+              STWErrorSuccess);
+    std::thread parked([&] {
+        if (auto client = daemon.connectAs("com.example.installer", allowed))
+            STWDaemonProcess::replyError(*client, 0, createKeys("com.example.parked.again", 2));
+    });
+    std::this_thread::sleep_for(std::chrono::milliseconds(300));
+    EXPECT_TRUE(daemon.stop());
+    parked.join();
 }
 
 // The empty string is an identifier like any other, before and after a restart, and
