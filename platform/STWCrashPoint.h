@@ -28,9 +28,25 @@ inline constexpr std::array<std::string_view, 3> creation = {createAfterStaging,
                                                              createBeforeCacheAdd};
 // A move to death row: its fresh "temp." directory made, the item not yet renamed into it.
 inline constexpr const char* deathRowAfterTemporaryDirectory = "deathrow.after-temporary-directory";
+// A death-row pass: the first item removed, the others not yet.
+inline constexpr const char* deathRowAfterFirstItem = "deathrow.after-first-item";
+// Deletion: a container renamed into death row, still in the cache.
+inline constexpr const char* deleteAfterStaging = "delete.after-staging";
 
-inline constexpr std::array<std::string_view, 4> all = {createAfterStaging, createAfterRename, createBeforeCacheAdd,
-                                                        deathRowAfterTemporaryDirectory};
+// Replace: the journal written; the old container parked in staging; the new one moved to
+// its destination; the cache updated, staging and journal not yet sent to death row.
+inline constexpr const char* replaceAfterJournal = "replace.after-journal";
+inline constexpr const char* replaceAfterPark = "replace.after-park";
+inline constexpr const char* replaceAfterMove = "replace.after-move";
+inline constexpr const char* replaceBeforeCleanup = "replace.before-cleanup";
+
+inline constexpr std::array<std::string_view, 4> replace = {replaceAfterJournal, replaceAfterPark, replaceAfterMove,
+                                                            replaceBeforeCleanup};
+
+inline constexpr std::array<std::string_view, 10> all = {
+    createAfterStaging, createAfterRename,   createBeforeCacheAdd, deathRowAfterTemporaryDirectory,
+    deathRowAfterFirstItem, deleteAfterStaging, replaceAfterJournal, replaceAfterPark,
+    replaceAfterMove,   replaceBeforeCleanup};
 
 extern std::atomic<bool> armed;
 void _reached(const char* name);

@@ -202,6 +202,24 @@ public:
                                          const std::filesystem::path& trustedAncestor,
                                          STWErrorRef* error = nullptr) const;
 
+    // The same for a path that comes without an owner to tell its trusted ancestor (a
+    // journal's, say): the ancestor is the deepest directory that only root can change
+    // (every directory from "/" down to it owned by root and writable by nobody else unless
+    // sticky; a link of root's counts when what it leads to qualifies).
+    STWFileDescriptor openDirectoryAtURLWithoutForeignLinks(const std::filesystem::path& url,
+                                                            STWErrorRef* error = nullptr) const;
+    // Moves the item at `from` to `to`, never over an existing item, both directories opened
+    // as above; what arrives is checked to be what was there (see moveDirectoryAt). ENOENT
+    // when nothing is at `from`.
+    bool moveItemAtURLWithoutForeignLinks(const std::filesystem::path& from, const std::filesystem::path& to,
+                                          STWFileManagerMoveOptions options, STWErrorRef* error = nullptr) const;
+    // Removes the directory open as `directoryfd`, the entry `name` of `parentfd`: what it
+    // holds through its descriptor, then the entry itself while it is still that directory
+    // (ESTALE when something else took its place; that is left alone). A directory that is
+    // gone already counts as removed.
+    bool removeDirectoryAt(int parentfd, const std::string& name, int directoryfd, const std::filesystem::path& path,
+                           STWErrorRef* error = nullptr) const;
+
     // Makes the directory `relativePath` below `dirfd` one component at a time and answers
     // its descriptor. A symbolic link found where a directory belongs is removed and a
     // directory made in its place; any other kind of item fails with ENOTDIR. Directories it

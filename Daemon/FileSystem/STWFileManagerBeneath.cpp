@@ -340,3 +340,75 @@ bool STWFileManager::setUserImmutableOfItemAtURL(const fs::path& url, bool immut
     }
     return true;
 }
+
+namespace {
+
+// The deepest directory of `url` that only root can change, "/" at least. A link of root's
+// in such a directory counts when its whole target does (checked on the resolved path, which
+// holds no link, so one level of recursion).
+fs::path trustedAncestorOf(const fs::path& url, int depth = 0) {
+    fs::path trusted = "/";
+    uid_t root = geteuid();
+    for (const auto& component : url.lexically_normal().relative_path()) {
+        if (component.empty())
+            continue;
+        fs::path next = trusted / component;
+        struct stat st;
+        if (lstat(next.c_str(), &st) != 0 || st.st_uid != root)
+            break;
+        if (S_ISLNK(st.st_mode)) {
+            char* real = depth == 0 ? realpath(next.c_str(), nullptr) : nullptr;
+            bool qualifies = real && trustedAncestorOf(real, depth + 1) == fs::path(real);
+            free(real);
+            if (!qualifies)
+                break;
+        } else if (!S_ISDIR(st.st_mode) || ((st.st_mode & (S_IWGRP | S_IWOTH)) && !(st.st_mode & S_ISVTX))) {
+            break;
+        }
+        trusted = next;
+    }
+    return trusted;
+}
+
+} // namespace
+
+STWFileDescriptor STWFileManager::openDirectoryAtURLWithoutForeignLinks(const fs::path& url,
+                                                                        STWErrorRef* error) const {
+    fs::path path(pathString(url));
+    fs::path ancestor = trustedAncestorOf(path);
+    if (ancestor != path)
+        return openDirectoryAtURL(path, ancestor, error);
+    // Only root can change any part of it: opened as its path says, root's links and all.
+    STWFileDescriptor fd(open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (!fd) {
+        int e = errno;
+        STWSetError(error, STW_POSIX_ERROR(e, "opendir of %@ failed: %s", path, strerror(e)));
+    }
+    return fd;
+}
+
+bool STWFileManager::moveItemAtURLWithoutForeignLinks(const fs::path& from, const fs::path& to,
+                                                      STWFileManagerMoveOptions options, STWErrorRef* error) const {
+    fs::path source(pathString(from)), destination(pathString(to));
+    STWFileDescriptor fromParent = openDirectoryAtURLWithoutForeignLinks(source.parent_path(), error);
+    if (!fromParent)
+        return false;
+    std::string name = source.filename();
+    struct stat st;
+    STWFileDescriptor item;
+    if (fstatat(fromParent.get(), name.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0) {
+        // Only files and directories are opened for reading (the durable move syncs them);
+        // anything else, a FIFO or a link, is held without being opened.
+        int flags = S_ISDIR(st.st_mode) || S_ISREG(st.st_mode) ? O_RDONLY | O_NONBLOCK | O_NOCTTY : O_PATH;
+        item.reset(openat(fromParent.get(), name.c_str(), flags | O_NOFOLLOW | O_CLOEXEC));
+    }
+    if (!item) {
+        int e = errno;
+        STWSetError(error, STW_POSIX_ERROR(e, "Could not open %@ to move it to %@: %s", source, destination,
+                                           strerror(e)));
+        return false;
+    }
+    STWFileDescriptor toParent = openDirectoryAtURLWithoutForeignLinks(destination.parent_path(), error);
+    return toParent && moveDirectoryAt(fromParent.get(), name, toParent.get(), destination.filename(), item.get(),
+                                       options, source, destination, error);
+}

@@ -138,3 +138,25 @@ bool STWFileManager::removeItemAtURL(const fs::path& url, STWErrorRef* error) co
     STWSetError(error, STW_POSIX_ERROR(e, "removefile of %@ failed: %s", path, strerror(e)));
     return false;
 }
+
+bool STWFileManager::removeDirectoryAt(int parentfd, const std::string& name, int directoryfd, const fs::path& path,
+                                       STWErrorRef* error) const {
+    std::string pathText = pathString(path);
+    RemovalContext context;
+    STWDirectoryWalker().walk(directoryfd, pathText, context);
+    struct stat expected, current;
+    int e = 0;
+    if (fstat(directoryfd, &expected) != 0 || fstatat(parentfd, name.c_str(), &current, AT_SYMLINK_NOFOLLOW) != 0)
+        e = errno;
+    else if (current.st_dev != expected.st_dev || current.st_ino != expected.st_ino)
+        e = ESTALE; // moved away and replaced meanwhile: what is there now is not ours to remove
+    else if (disk::unlinkat(parentfd, name.c_str(), AT_REMOVEDIR) != 0)
+        context.itemFailed(parentfd, parentPath(path), name, errno);
+    if (!e && context.recordedError != ENOENT)
+        e = context.recordedError;
+    if (e && e != ENOENT) { // gone already is removed
+        STWSetError(error, STW_POSIX_ERROR(e, "removefile of %@ failed: %s", pathText, strerror(e)));
+        return false;
+    }
+    return true;
+}

@@ -3,16 +3,19 @@
 
 #include "common/STWLog.h"
 
-// Boot-time setup and cleanup of the container store (restored system containers,
-// interrupted replace operations, pending protection changes, leftovers swept to death
-// row) are not part of this build yet. These entry points keep the start-up order in
-// place; they do no work and claim none.
+// Boot-time setup and cleanup of the container store: of their steps, this build has the
+// recovery of interrupted replace operations. Restored system containers, pending
+// protection changes and the sweep of leftovers to death row are not part of it yet; the
+// entry points keep the start-up order in place and claim no work they do not do.
 void STWClientConnection::rebootStowlySetup() {
     STW_LOG_DEBUG(STWLogCategory::Startup, "First-boot setup has no steps in this build");
 }
 
 void STWClientConnection::stowlySetup() {
-    STW_LOG_DEBUG(STWLogCategory::Startup, "Every-start setup has no steps in this build");
+    // Before the first request: a replace cut short by a stop puts its old container back.
+    STWErrorRef error;
+    if (!_recoverFromReplaceOperationsWithError(&error))
+        STW_LOG_ERROR(STWLogCategory::Startup, "Failed to recover from replace operations: %@", error);
 }
 
 void STWClientConnection::rebootStowlyCleanupWithCompletion(std::function<void()> completion) {

@@ -111,7 +111,7 @@ bool STWMetadata::isRecordOfFile(const struct stat& file) const {
     return _fileInode != 0 && file.st_dev == _fileDevice && file.st_ino == _fileInode;
 }
 
-STWFileDescriptor STWMetadata::openContainerDirectory(STWErrorRef* error) const {
+STWFileDescriptor STWMetadata::openContainerDirectory(STWErrorRef* error, STWFileDescriptor* classDirectoryOut) const {
     auto fileManager = STWFileManager::defaultManager();
     std::filesystem::path container = url();
     STWFileDescriptor classDirectory = fileManager->openDirectoryAtURL(
@@ -127,6 +127,8 @@ STWFileDescriptor STWMetadata::openContainerDirectory(STWErrorRef* error) const 
         STWSetError(error, STW_POSIX_ERROR(ESTALE, "%@ no longer holds the metadata of %@", container, _identifier));
         return {};
     }
+    if (classDirectoryOut)
+        *classDirectoryOut = std::move(classDirectory);
     return fd;
 }
 

@@ -73,8 +73,9 @@ public:
     bool writeMetadataToContainerDirectory(int containerfd, STWErrorRef* error);
     // The container directory that holds this record's file, opened beneath the class
     // directory without following links; ESTALE when the file there is not the one the
-    // record was read from (the app replaced its container).
-    STWFileDescriptor openContainerDirectory(STWErrorRef* error) const;
+    // record was read from (the app replaced its container). `classDirectory`, when given,
+    // gets the descriptor of the directory that holds it.
+    STWFileDescriptor openContainerDirectory(STWErrorRef* error, STWFileDescriptor* classDirectory = nullptr) const;
 
     static std::shared_ptr<STWMetadata> readAndValidateMetadataAtUrl(const std::filesystem::path& containerURL,
                                                                      const STWUserIdentityRef& forUserIdentity,

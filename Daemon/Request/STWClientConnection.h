@@ -17,6 +17,7 @@
 #include "platform/STWQueue.h"
 
 #include <atomic>
+#include <filesystem>
 #include <functional>
 #include <map>
 #include <memory>
@@ -90,6 +91,37 @@ public:
     // Empties death row on the death-row queue; the completion gets 1 or the last error's code.
     static void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
 
+    // Deletion (Lifecycle/STWClientConnection+Deletion.cpp). A container to delete is looked
+    // up now and moved into death row by a stage-for-delete command when the request
+    // completes. A wipe replaces a per-user container with a new empty one that keeps its
+    // path and UUID; only unrestricted callers wipe any, others only class 4 containers of
+    // identifiers they are entitled to wipe (55).
+    bool deleteContainerWithContainerIdentity(const STWContainerIdentityRef& identity, bool transient,
+                                              uint64_t* error);
+    void deleteDataContainerContentWithContainerIdentity(const STWContainerIdentityRef& identity, uint64_t* error);
+
+    // Replace (Lifecycle/STWClientConnection+Replace.cpp): puts the container of
+    // `newIdentity` in the place of the container of `oldIdentity` (nullptr: no old
+    // container; the new one becomes live under its own UUID), optionally keeping the old
+    // UUID and path. A journal written before the first rename lets the next start undo a
+    // replace that a crash cut short. The code in `error` on failure.
+    bool replaceContainerIdentity(const STWConcreteContainerIdentityRef& oldIdentity,
+                                  const STWConcreteContainerIdentityRef& newIdentity, bool preserveOldUUID,
+                                  bool startDeletionThread, uint64_t* error);
+    // The four paths of one replace, as its journal holds them.
+    struct ReplaceFileInfo {
+        std::filesystem::path oldURL, newURL, stagingURL, destURL;
+    };
+    static bool _writeToDiskReplaceAt(const std::filesystem::path& url, const ReplaceFileInfo& info,
+                                      STWErrorRef* error);
+    // nullopt with `error` for an unreadable or invalid journal; nullopt without one for a
+    // file that is not a dictionary.
+    static std::optional<ReplaceFileInfo> _readAndValidateReplaceFileAtUrl(const std::filesystem::path& url,
+                                                                           STWErrorRef* error);
+    // Undoes every replace whose journal a stop left behind: the old container goes back from
+    // staging when neither it nor the new one is in place; the journal goes to death row.
+    bool _recoverFromReplaceOperationsWithError(STWErrorRef* error);
+
     // Start-up work of the daemon's own connection: first-boot and every-start setup,
     // and the cleanups whose completions run later on the background queue.
     void rebootStowlySetup();
@@ -117,6 +149,10 @@ public:
     const std::shared_ptr<STWUserIdentityCache>& userIdentityCache() const { return _userIdentityCache; }
 
 private:
+    // The code-signing mapping drops what it knows of a replaced app and its children. The
+    // mapping is not part of this build: nothing to drop yet.
+    static bool _invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
+                                                                      STWErrorRef* error);
     // The code of an error for a client: its own in the daemon's domain, else 34.
     static uint64_t _codeOfError(const STWErrorRef& error);
     static void _reportException(const char* function);

@@ -1,7 +1,9 @@
 #include "Daemon/Request/STWCommandHandlers.h"
 #include "common/STWThreadSafety.h"
 
+#include "Daemon/Lifecycle/STWCommandStageForDelete.h"
 #include "Daemon/Lifecycle/STWTestLocks.h"
+#include "Daemon/Model/STWUserIdentitySharedCache.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Request/STWClientConnection.h"
 #include "Daemon/Request/STWRequestDecoder.h"
@@ -31,15 +33,9 @@ void _operationNotInThisBuild(const char* command, uint64_t* error) {
         _operationNotInThisBuild(#name, error);                                                              \
     }
 
-STW_COMMAND_NOT_IN_THIS_BUILD(replaceContainer)
-STW_COMMAND_NOT_IN_THIS_BUILD(stageContainerForDelete)
-STW_COMMAND_NOT_IN_THIS_BUILD(deleteContainersOnDeathRow)
 STW_COMMAND_NOT_IN_THIS_BUILD(setInfoValue)
 STW_COMMAND_NOT_IN_THIS_BUILD(infoValueForKey)
 STW_COMMAND_NOT_IN_THIS_BUILD(regenerateDirectoryUUID)
-STW_COMMAND_NOT_IN_THIS_BUILD(deleteContainer)
-STW_COMMAND_NOT_IN_THIS_BUILD(wipeContainer)
-STW_COMMAND_NOT_IN_THIS_BUILD(deleteContainerContent)
 STW_COMMAND_NOT_IN_THIS_BUILD(createOrLookupGroupContainers)
 STW_COMMAND_NOT_IN_THIS_BUILD(groupContainerIdentifiers)
 STW_COMMAND_NOT_IN_THIS_BUILD(systemContainerPath)
@@ -110,6 +106,125 @@ STW_COMMAND_HANDLER(recreateDefaultStructure) {
     auto identity = STWRequestDecoder::concreteIdentityFromKeys(request, connection, {}, error);
     if (identity)
         connection.recreateDefaultStructureWithContainerIdentity(identity, error);
+}
+
+STW_COMMAND_HANDLER(replaceContainer) {
+    (void)reply;
+    // Without "OldIdentifier", or without a UUID for it, there is no old container: the new
+    // one becomes live under its own UUID.
+    STWConcreteContainerIdentityRef oldIdentity;
+    if (STWDictionaryFind(request, "OldIdentifier")) {
+        oldIdentity = STWRequestDecoder::concreteIdentityFromKeys(
+            request, connection, {"OldIdentifier", "OldContainerClass", "OldContainerUUID", "OldPersonaUniqueString"},
+            error);
+        if (!oldIdentity)
+            return;
+        const STWValue* uuid = STWDictionaryFind(request, "OldContainerUUID");
+        if (!uuid || !uuid->uuid())
+            oldIdentity = nullptr;
+    }
+    auto newIdentity = STWRequestDecoder::concreteIdentityFromKeys(
+        request, connection, {"NewIdentifier", "NewContainerClass", "NewContainerUUID", "NewPersonaUniqueString"},
+        error);
+    if (newIdentity)
+        connection.replaceContainerIdentity(oldIdentity, newIdentity, false, false, error);
+}
+
+STW_COMMAND_HANDLER(stageContainerForDelete) {
+    (void)reply;
+    static const STWValue::Array none;
+    auto arrayOf = [&](const char* key) -> const STWValue::Array& {
+        const STWValue* value = STWDictionaryFind(request, key);
+        return value && value->array() ? *value->array() : none;
+    };
+    const STWValue::Array& classes = arrayOf("ContainerClassesArray");
+    const STWValue::Array& uuids = arrayOf("UUIDsArray");
+    const STWValue::Array& identifiers = arrayOf("IdentifiersArray");
+    const STWValue::Array& personas = arrayOf("PersonaUniqueStringsArray");
+    if (classes.size() != uuids.size() || identifiers.size() != classes.size() || personas.size() != classes.size()) {
+        STW_LOG_FN("stageContainerForDelete", STWLogLevel::Error, STWLogCategory::Tolvan,
+                   "Can't act on an invalid input: UUIDString count: %ld, class count: %ld, ID count: %lu, persona "
+                   "string count: %lu",
+                   uuids.size(), classes.size(), identifiers.size(), personas.size());
+        *error = STWErrorInvalidArgument;
+        return;
+    }
+    std::vector<STWContainerIdentityRef> identities;
+    for (size_t i = 0; i < classes.size(); ++i) {
+        STWContainerClass containerClass = classes[i].uint64Value().value_or(0);
+        STWUserIdentityRef userIdentity;
+        if (STWUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
+            const std::string* persona = personas[i].string();
+            userIdentity = STWRequestDecoder::userIdentityForPersonaUniqueString(
+                connection, persona ? std::optional<std::string>(*persona) : std::nullopt, error);
+        } else {
+            userIdentity = STWUserIdentitySharedCache::sharedInstance()->userIdentityForCurrentContext();
+        }
+        if (!userIdentity)
+            return; // nothing is queued
+        uint64_t code = STWErrorSuccess;
+        const STWUUID* uuid = uuids[i].uuid();
+        auto identity = uuid ? STWConcreteContainerIdentity::containerIdentityWithUUID(*uuid, userIdentity,
+                                                                                       identifiers[i], containerClass,
+                                                                                       &code)
+                             : nullptr;
+        if (identity)
+            identities.push_back(std::move(identity));
+        else
+            *error = uuid ? code : uint64_t{STWErrorInvalidClass};
+    }
+    connection.commandQueue()->insertCommand(
+        STWCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(std::move(identities), true, nullptr));
+}
+
+STW_COMMAND_HANDLER(deleteContainersOnDeathRow) {
+    (void)request;
+    (void)connection;
+    (void)error;
+    // The reply waits for the pass.
+    STWClientConnection::deleteContainersOnDeathRowWithCompletion(
+        [reply](uint64_t code) { reply->sendWithError(code); });
+}
+
+STW_COMMAND_HANDLER(deleteContainer) {
+    (void)reply;
+    auto identity = STWRequestDecoder::classValidatedIdentity(request, connection, false, error);
+    if (identity)
+        connection.deleteContainerWithContainerIdentity(identity, STWDictionaryBool(request, "Transient"), error);
+}
+
+namespace {
+
+// Commands 11 and 12: the container of "Identifier" in `containerClass`, wiped.
+void _wipe(const STWValue::Dictionary& request, STWClientConnection& connection, STWContainerClass containerClass,
+           uint64_t* error) {
+    const std::string* identifier = STWDictionaryString(request, "Identifier");
+    if (!identifier) {
+        STW_LOG_ERROR(STWLogCategory::Lifecycle, "Can't wipe container with nil identifier: %@", nullptr);
+        *error = STWErrorNoIdentifier;
+        return;
+    }
+    auto userIdentity =
+        STWRequestDecoder::userIdentityForContainerIdentifier(connection, containerClass, *identifier, error);
+    if (!userIdentity)
+        return;
+    auto identity =
+        STWContainerIdentity::containerIdentityWithUserIdentity(userIdentity, *identifier, containerClass, error);
+    if (identity)
+        connection.deleteDataContainerContentWithContainerIdentity(identity, error);
+}
+
+} // namespace
+
+STW_COMMAND_HANDLER(wipeContainer) {
+    (void)reply;
+    _wipe(request, connection, STWContainerClassDataQuilletPlugin, error);
+}
+
+STW_COMMAND_HANDLER(deleteContainerContent) {
+    (void)reply;
+    connection.setUnrestricted(true);
+    _wipe(request, connection, STWDictionaryUInt64(request, "ContainerClass").value_or(0), error);
 }
 
 STW_COMMAND_HANDLER(recreateDefaultStructure2) { recreateDefaultStructure(request, reply, connection, error); }

@@ -14,6 +14,7 @@
 void STWCTLCommands::addAll(CLI::App& app) {
     _addRaw(app);
     _addContainerCommands(app);
+    _addDeletionCommands(app);
     _addDevice(app);
     app.require_subcommand(1);
 }
@@ -120,6 +121,91 @@ void STWCTLCommands::_addContainerCommands(CLI::App& app) {
             return session.send(m);
         });
     }
+}
+
+// Containers leaving and changing places: delete, stage-delete, wipe, replace and
+// empty-death-row.
+void STWCTLCommands::_addDeletionCommands(CLI::App& app) {
+    struct Arguments {
+        std::string identifier;
+        uint64_t containerClass = 2;
+        std::string uuid, oldUUID;
+        std::string persona;
+        bool transient = false;
+    };
+    auto arguments = std::make_shared<Arguments>();
+    auto addIdentity = [&](CLI::App* command) {
+        command->add_option("IDENTIFIER", arguments->identifier, "Container identifier")->required();
+        command->add_option("-c,--class", arguments->containerClass, "Container class (1 to 13)")
+            ->capture_default_str();
+    };
+    auto parseUUID = [](const std::string& text, STWCTLSession& session, std::optional<STWUUID>* uuid) {
+        *uuid = STWUUID::fromString(text);
+        return *uuid ? 0 : session.usageError("\"" + text + "\" is not a UUID");
+    };
+
+    CLI::App* remove = app.add_subcommand("delete", "Delete a container (through death row)");
+    addIdentity(remove);
+    remove->add_flag("--transient", arguments->transient, "A transient container");
+    _onRun(remove, [arguments](STWCTLSession& session) {
+        return session.send({{"Command", STWValue(10)},
+                             {"Identifier", STWValue(arguments->identifier)},
+                             {"ContainerClass", STWValue(arguments->containerClass)},
+                             {"Transient", STWValue(arguments->transient)}});
+    });
+
+    CLI::App* stage = app.add_subcommand("stage-delete", "Move one container, named by its UUID, to death row");
+    addIdentity(stage);
+    stage->add_option("--uuid", arguments->uuid, "The container's UUID")->required();
+    stage->add_option("--persona", arguments->persona, "Persona unique string of the container's user");
+    _onRun(stage, [arguments, parseUUID](STWCTLSession& session) {
+        std::optional<STWUUID> uuid;
+        if (int status = parseUUID(arguments->uuid, session, &uuid))
+            return status;
+        return session.send({{"Command", STWValue(3)},
+                             {"ContainerClassesArray", STWValue(STWValue::Array{STWValue(arguments->containerClass)})},
+                             {"UUIDsArray", STWValue(STWValue::Array{STWValue(*uuid)})},
+                             {"IdentifiersArray", STWValue(STWValue::Array{STWValue(arguments->identifier)})},
+                             {"PersonaUniqueStringsArray", STWValue(STWValue::Array{STWValue(arguments->persona)})}});
+    });
+
+    CLI::App* wipe = app.add_subcommand("wipe", "Empty a data container, keeping its path and UUID");
+    addIdentity(wipe);
+    _onRun(wipe, [arguments](STWCTLSession& session) {
+        return session.send({{"Command", STWValue(12)},
+                             {"Identifier", STWValue(arguments->identifier)},
+                             {"ContainerClass", STWValue(arguments->containerClass)}});
+    });
+
+    CLI::App* replace = app.add_subcommand("replace", "Put a (transient) container in the place of another");
+    addIdentity(replace);
+    replace->add_option("--uuid", arguments->uuid, "UUID of the container that takes the place")->required();
+    replace->add_option("--old-uuid", arguments->oldUUID, "UUID of the container it replaces (none: promote)");
+    replace->add_option("--persona", arguments->persona, "Persona unique string of the containers' user");
+    _onRun(replace, [arguments, parseUUID](STWCTLSession& session) {
+        std::optional<STWUUID> uuid, oldUUID;
+        if (int status = parseUUID(arguments->uuid, session, &uuid))
+            return status;
+        STWValue::Dictionary m{{"Command", STWValue(2)},
+                               {"NewIdentifier", STWValue(arguments->identifier)},
+                               {"NewContainerClass", STWValue(arguments->containerClass)},
+                               {"NewContainerUUID", STWValue(*uuid)}};
+        if (!arguments->oldUUID.empty()) {
+            if (int status = parseUUID(arguments->oldUUID, session, &oldUUID))
+                return status;
+            m["OldIdentifier"] = STWValue(arguments->identifier);
+            m["OldContainerClass"] = STWValue(arguments->containerClass);
+            m["OldContainerUUID"] = STWValue(*oldUUID);
+        }
+        if (!arguments->persona.empty()) {
+            m["NewPersonaUniqueString"] = STWValue(arguments->persona);
+            m["OldPersonaUniqueString"] = STWValue(arguments->persona);
+        }
+        return session.send(m);
+    });
+
+    CLI::App* empty = app.add_subcommand("empty-death-row", "Remove everything in death row (waits for it)");
+    _onRun(empty, [](STWCTLSession& session) { return session.send({{"Command", STWValue(4)}}); });
 }
 
 // device lock|unlock: the keybag state the daemon watches under its root.

@@ -80,7 +80,7 @@ TEST(STWCreationCrash, EveryCrashPointLeavesTheContainerWholeOrAbsent) {
 TEST(STWCreationCrash, AFailedCallAtAnyStepLeavesNothingBehind) {
     STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}}, {}, false);
     fs::path containers = daemon.root() / "private/var/mobile/Containers";
-    fs::path deathRow = daemon.root() / "private/var/root/Library/Caches/com.vorlane.stowlyd/Deathrow";
+    fs::path deathRow = daemon.root() / "private/var/root/Library/Caches/com.vorlane.stowlyd/Dead";
     auto visible = [](const fs::path& directory) {
         size_t count = 0;
         std::error_code ec;

@@ -86,7 +86,8 @@ TEST_F(STWRequestServiceTest, ConcurrentConnectionsEachGetTheirOwnReplies) {
     std::vector<std::thread> threads;
     for (int i = 0; i < kConnections; i++) {
         threads.emplace_back([&, i] {
-            // Even connections may replace containers (unsupported here), odd ones may not.
+            // Even connections may replace containers (and are told that they named none), odd
+            // ones may not.
             bool entitled = i % 2 == 0;
             auto client = daemon->connectAs("com.example.c" + std::to_string(i),
                                             entitled ? allowed : STWValue::Dictionary{});
@@ -98,7 +99,7 @@ TEST_F(STWRequestServiceTest, ConcurrentConnectionsEachGetTheirOwnReplies) {
                 uint64_t code = STWDaemonProcess::replyError(*client, 2, {{"Round", STWValue(round)}});
                 if (code == 0)
                     missing++;
-                else if (code != (entitled ? STWErrorUnsupportedCommand : STWErrorNotEntitled))
+                else if (code != (entitled ? STWErrorNoIdentifier : STWErrorNotEntitled))
                     wrong++;
             }
         });
@@ -142,7 +143,7 @@ TEST_F(STWRequestServiceTest, MalformedInputClosesOnlyThatConnection) {
         close(fd);
     }
     EXPECT_TRUE(daemon->isRunning());
-    EXPECT_EQ(STWDaemonProcess::replyError(*bystander, 2), STWErrorUnsupportedCommand);
+    EXPECT_EQ(STWDaemonProcess::replyError(*bystander, 2), STWErrorNoIdentifier);
 }
 
 TEST_F(STWRequestServiceTest, RegistryIdentifiesProgramsByTheirPinnedExecutable) {
@@ -170,7 +171,7 @@ TEST_F(STWRequestServiceTest, RegistryIdentifiesProgramsByTheirPinnedExecutable)
         return code;
     };
     ASSERT_TRUE(STW_writeToURL(entry, file, STWWriteAtomic, nullptr));
-    EXPECT_EQ(waitFor(STWErrorUnsupportedCommand), STWErrorUnsupportedCommand);
+    EXPECT_EQ(waitFor(STWErrorNoIdentifier), STWErrorNoIdentifier);
     // A connection made before is still who it was when it connected.
     EXPECT_EQ(STWDaemonProcess::replyError(*anonymous, 2), STWErrorNotEntitled);
     // The same entry pinned to another digest identifies nobody.

@@ -123,4 +123,38 @@ TEST_F(PublishStaged, AnImpostorIsSentBackAndNothingIsReplaced) {
     EXPECT_TRUE(error && error->isPOSIX(EEXIST));
 }
 
+// Paths that come with no owner: a link is followed only where no one but root could have
+// placed it. A removal in place takes what the directory held when it was opened and leaves
+// whatever took its name since.
+using ForeignLinks = FileSystemTest;
+TEST_F(ForeignLinks, OnlyRootsLinksAreFollowedAndRemovalKeepsToItsDirectory) {
+    if (geteuid() != 0)
+        GTEST_SKIP() << "needs root to give a directory to another user";
+    fs::path s = scratch();
+    fs::create_directories(s / "target/item");
+    fs::create_directories(s / "user/item");
+    fs::create_directories(s / "outside/victim");
+    fs::create_directory_symlink(s / "target", s / "rootlink");
+    fs::create_directory_symlink(s / "outside", s / "user/link");
+    ASSERT_EQ(chown((s / "user").c_str(), 501, 501), 0);
+    EXPECT_TRUE(fm()->moveItemAtURLWithoutForeignLinks(s / "rootlink/item", s / "moved", STWFileManagerMoveDefault));
+    STWErrorRef error;
+    EXPECT_FALSE(fm()->moveItemAtURLWithoutForeignLinks(s / "user/link/victim", s / "taken", STWFileManagerMoveDefault,
+                                                        &error));
+    EXPECT_TRUE(error && error->isPOSIX(ELOOP));
+    EXPECT_TRUE(fs::is_directory(s / "outside/victim"));
+    EXPECT_TRUE(fm()->moveItemAtURLWithoutForeignLinks(s / "user/item", s / "user/kept", STWFileManagerMoveDefault));
+
+    writeFile(s / "user/kept/file", "f");
+    STWFileDescriptor parent = fm()->openDirectoryAtURL(s / "user"), kept = fm()->openDirectoryAtURL(s / "user/kept");
+    fs::rename(s / "user/kept", s / "user/away");
+    fs::create_directory(s / "user/kept");
+    writeFile(s / "user/kept/theirs", "t");
+    error.reset();
+    EXPECT_FALSE(fm()->removeDirectoryAt(parent.get(), "kept", kept.get(), s / "user/kept", &error));
+    EXPECT_TRUE(error && error->isPOSIX(ESTALE));
+    EXPECT_TRUE(fs::is_empty(s / "user/away"));
+    EXPECT_TRUE(fs::exists(s / "user/kept/theirs"));
+}
+
 } // namespace

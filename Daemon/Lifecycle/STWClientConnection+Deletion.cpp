@@ -1,0 +1,169 @@
+// Deletion: a container leaves its class directory by one rename into death row (a
+// stage-for-delete command run when the request completes), and the death-row queue
+// empties death row later. A wipe replaces a data container with a fresh one of the same
+// path and UUID.
+#include "Daemon/Request/STWClientConnection.h"
+
+#include "Daemon/FileSystem/STWFileManager.h"
+#include "Daemon/Lifecycle/STWCommandStageForDelete.h"
+#include "Daemon/Lifecycle/STWDaemonQueues.h"
+#include "Daemon/Model/STWGlobalConfiguration.h"
+#include "common/STWLog.h"
+#include "platform/STWCrashPoint.h"
+#include "platform/STWPlatformConfiguration.h"
+
+#include <algorithm>
+
+bool STWClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& url, bool isDir,
+                                                   bool startDeletionThread, STWErrorRef* error) {
+    (void)isDir; // the move takes whatever is there, and checks that it took that
+    auto fileManager = STWFileManager::defaultManager();
+    auto deathRow = STWGlobalConfiguration::sharedInstance()->deathrowDirectory();
+    // A deletion pass running meanwhile may remove the fresh, still empty "temp." directory
+    // before the item is renamed into it; the rename's ENOENT then means that, not a missing
+    // item, and the move is tried again in a new one.
+    for (int attempt = 0;; ++attempt) {
+        STWErrorRef stepError;
+        auto unique = fileManager->createTemporaryDirectoryInDirectoryURL(deathRow, "temp.", &stepError);
+        if (!unique) {
+            STWSetError(error, STW_ERROR(STWErrorItemOperationFailed, stepError,
+                                         "Failed to create unique directory at: %@", deathRow));
+            return false;
+        }
+        STW_CRASH_POINT(STWCrashPoint::deathRowAfterTemporaryDirectory);
+        std::filesystem::path destination = *unique / url.filename();
+        // The item may sit in a directory an app owns: nothing on the way is followed.
+        if (fileManager->moveItemAtURLWithoutForeignLinks(url, destination, STWFileManagerMoveDefault, &stepError))
+            break;
+        bool missing = stepError && stepError->isPOSIX(ENOENT);
+        if (missing && fileManager->itemDoesNotExistAtURL(url))
+            return true; // nothing to move; the empty directory goes with the next pass
+        if (!missing || attempt == 8) {
+            STWSetError(error, STW_ERROR(STWErrorItemOperationFailed, stepError, "Failed to move item at: %@ to: %@",
+                                         url, destination));
+            return false;
+        }
+    }
+    if (startDeletionThread)
+        deleteContainersOnDeathRowWithCompletion(nullptr);
+    return true;
+}
+
+bool STWClientConnection::_removeItemOrMoveToTempAtURL(const std::filesystem::path& url, STWErrorRef* error) {
+    auto fileManager = STWFileManager::defaultManager();
+    STWErrorRef removeError;
+    if (fileManager->removeItemAtURL(url, &removeError) || (removeError && removeError->isPOSIX(ENOENT)))
+        return true;
+    STW_LOG_DEBUG(STWLogCategory::Lifecycle, "Couldn't remove, so moving item to /tmp: %@ : %@", url, removeError);
+    std::filesystem::path destination =
+        STWPlatformConfiguration::sharedInstance()->resolve("/tmp") / url.filename();
+    STWErrorRef moveError;
+    if (!fileManager->moveItemAtURL(url, destination, &moveError)) {
+        STWSetError(error, STW_ERROR(STWErrorMoveDirectoryFailed, moveError, "Failed to move dir: %@ to: %@", url,
+                                     destination));
+        return false;
+    }
+    return true;
+}
+
+void STWClientConnection::deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion) {
+    // The queue holds a transaction for the pass until it ran, so idle exit waits for it.
+    STWDaemonQueues::deathRow()->async([completion = std::move(completion)] {
+        auto fileManager = STWFileManager::defaultManager();
+        auto deathRow = STWGlobalConfiguration::sharedInstance()->deathrowDirectory();
+        uint64_t result = STWErrorSuccess;
+        STWErrorRef listError;
+        auto items = fileManager->urlsForItemsInDirectoryAtURL(deathRow, &listError);
+        if (!items && !(listError && listError->isPOSIX(ENOENT))) {
+            STW_ERROR(STWErrorDeleteFailed, listError, "Failed to get items for deletion: %@ : %@", deathRow,
+                      listError);
+            result = STWErrorDeleteFailed;
+        }
+        bool first = true;
+        for (const auto& item : items ? *items : std::vector<std::filesystem::path>{}) {
+            STWErrorRef itemError;
+            if (!_removeItemOrMoveToTempAtURL(item, &itemError)) {
+                STW_ERROR(STWErrorDestroyFailed, itemError, "Failed to destroy item at: %@", item);
+                result = STWErrorDestroyFailed;
+            }
+            if (std::exchange(first, false))
+                STW_CRASH_POINT(STWCrashPoint::deathRowAfterFirstItem);
+        }
+        if (completion)
+            completion(result);
+    });
+}
+
+bool STWClientConnection::deleteContainerWithContainerIdentity(const STWContainerIdentityRef& identity, bool transient,
+                                                               uint64_t* error) {
+    return _catchingExceptions<bool>(__func__, error, false, [&]() -> bool {
+        uint64_t lookupError = STWErrorSuccess;
+        auto container = createOrLookupContainerWithContainerIdentity(identity, false, transient, true, &lookupError);
+        if (!container) {
+            STW_LOG_ERROR(STWLogCategory::Lifecycle,
+                          "Failed to lookup existing container to delete-identity: %@, transient: %d", identity,
+                          transient ? 1 : 0);
+            *error = lookupError;
+            return false;
+        }
+        // The move happens when the request completes, after its own work.
+        _commandQueue->insertCommand(STWCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+            {container->containerIdentity()}, true, nullptr));
+        return true;
+    });
+}
+
+void STWClientConnection::deleteDataContainerContentWithContainerIdentity(const STWContainerIdentityRef& identity,
+                                                                          uint64_t* error) {
+    _catchingExceptions<bool>(__func__, error, false, [&]() -> bool {
+        const std::string& identifier = identity->identifier();
+        STWContainerClass containerClass = identity->containerClass();
+        if (!STWContainerClassIsPerUser(containerClass)) {
+            STW_LOG_ERROR(STWLogCategory::Lifecycle,
+                          "Can't wipe container non-data container of type: %llu, identifier: %@", containerClass,
+                          identifier);
+            *error = STWErrorInvalidClass;
+            return false;
+        }
+        if (!unrestricted()) {
+            if (containerClass != STWContainerClassDataQuilletPlugin) {
+                STW_LOG_ERROR(STWLogCategory::Lifecycle, "Can't wipe container with of type: %llu, identifier: %@",
+                              containerClass, identifier);
+                *error = STWErrorInvalidClass;
+                return false;
+            }
+            auto entitled = entitledWipeIdentifiers();
+            bool listed = entitled && std::any_of(entitled->begin(), entitled->end(), [&](const STWValue& value) {
+                              return value.string() && *value.string() == identifier;
+                          });
+            if (!listed) {
+                STW_LOG_ERROR(STWLogCategory::Lifecycle, "Not entitled to wipe container with identifier: %@",
+                              identifier);
+                *error = STWErrorNotEntitled;
+                return false;
+            }
+        }
+        setAllowOtherIdLookup(true);
+        uint64_t code = STWErrorSuccess;
+        auto existing = createOrLookupContainerWithContainerIdentity(identity, false, false, true, &code);
+        if (!existing) {
+            STW_LOG_ERROR(STWLogCategory::Lifecycle, "Failed to lookup existing container to wipe-identifier: %@",
+                          identifier);
+            *error = code;
+            return false;
+        }
+        auto fresh = createOrLookupContainerWithContainerIdentity(identity, true, true, true, &code);
+        if (!fresh) {
+            STW_LOG_ERROR(STWLogCategory::Lifecycle, "Failed to create transient container for wipe-identifier: %@",
+                          identifier);
+            *error = code;
+            return false;
+        }
+        if (!replaceContainerIdentity(existing->containerIdentity(), fresh->containerIdentity(), true, true, &code)) {
+            STW_LOG_ERROR(STWLogCategory::Lifecycle, "Failed replace operation during delete all content");
+            *error = code;
+            return false;
+        }
+        return true;
+    });
+}
