@@ -155,7 +155,9 @@ TEST_F(STWUserIdentityCacheTest, APersonaChangeIsNoticedAndApplied) {
     EXPECT_FALSE(cache->userIdentityForCurrentUserWithPersonaUniqueString(std::string("ENT-1")));
 }
 
-TEST_F(STWUserIdentityCacheTest, RepopulatingFromIdentitiesInventsTheUnspecificOne) {
+// Repopulated from identities, the cache invents the unspecific one; with no persona but the
+// default one it still visits that identity, once.
+TEST_F(STWUserIdentityCacheTest, RepopulatingFromIdentities) {
     auto home = STWTestRoot::shared().resolve("/private/var/mobile");
     auto personal = STWUserIdentity::initWithUID(501, 501, home, "X", STWPersonaTypePersonal, 7);
     auto enterprise = STWUserIdentity::initWithUID(501, 501, home, "E", STWPersonaTypeEnterprise, 8);
@@ -165,6 +167,14 @@ TEST_F(STWUserIdentityCacheTest, RepopulatingFromIdentitiesInventsTheUnspecificO
     EXPECT_TRUE(unspecific->isNoSpecificPersona());
     EXPECT_EQ(unspecific->kernelPersonaID(), 7u);
     EXPECT_EQ(cache->userIdentityWithPersonaID(8)->identifier(), "E");
+
+    cache->flushAndRepopulateWithUserIdentities(
+        {STWUserIdentity::initWithUID(501, 501, home, std::nullopt, STWPersonaTypePersonal, 501)});
+    std::vector<STWUserIdentityRef> visited;
+    cache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
+        [&](const STWUserIdentityRef& identity) { visited.push_back(identity); });
+    ASSERT_EQ(visited.size(), 1u);
+    EXPECT_EQ(visited[0], STWUserIdentityCache::defaultUserIdentity());
 }
 
 TEST_F(STWUserIdentityCacheTest, AListWithoutAPersonalPersonaIsRetriedUntilItHasOne) {
@@ -207,17 +217,6 @@ TEST_F(STWUserIdentityCacheTest, AnUnregisteredCacheKeepsWhatItHas) {
     std::this_thread::sleep_for(std::chrono::milliseconds(300));
     EXPECT_FALSE(cache->cacheInvalid());
     EXPECT_TRUE(cache->userIdentityForCurrentUserWithPersonaUniqueString(std::string("ENT-1")));
-}
-
-TEST_F(STWUserIdentityCacheTest, AnEmptyPersonaMapStillVisitsTheDefaultIdentityOnce) {
-    auto home = STWTestRoot::shared().resolve("/private/var/mobile");
-    cache->flushAndRepopulateWithUserIdentities(
-        {STWUserIdentity::initWithUID(501, 501, home, std::nullopt, STWPersonaTypePersonal, 501)});
-    std::vector<STWUserIdentityRef> visited;
-    cache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
-        [&](const STWUserIdentityRef& identity) { visited.push_back(identity); });
-    ASSERT_EQ(visited.size(), 1u);
-    EXPECT_EQ(visited[0], STWUserIdentityCache::defaultUserIdentity());
 }
 
 } // namespace
