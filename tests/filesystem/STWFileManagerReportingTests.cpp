@@ -9,7 +9,6 @@
 #include <cstring>
 #include <functional>
 #include <sys/stat.h>
-#include <unistd.h>
 
 namespace fs = std::filesystem;
 using namespace stwtest;

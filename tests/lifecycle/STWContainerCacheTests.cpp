@@ -175,7 +175,6 @@ TEST_F(STWContainerCacheTest, AClassDirectoryThatCannotBeListedFailsWith43AndCac
     std::ofstream(tolvan) << "not a directory";
     EXPECT_FALSE(lookup("com.example.service", &error, false, 9));
     ASSERT_TRUE(error->is(43));
-    EXPECT_EQ(error->message(), "Cache: [501]-Data/TolvanService: Failed to rebuild");
     EXPECT_TRUE(error->underlyingError() && error->underlyingError()->isPOSIX(ENOTDIR));
     fs::remove(tolvan);
     fs::rename(tolvan.string() + ".aside", tolvan);
