@@ -91,7 +91,8 @@ TEST_F(STWPropertyListFileTest, AtomicWritesReplaceTheFileOrLeaveItAndNoTemporar
     EXPECT_FALSE(wrote);
     EXPECT_TRUE(error && error->isPOSIX(EFBIG)) << (error ? error->description() : "");
 
-    EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir), std::filesystem::directory_iterator()), 1);
+    EXPECT_EQ(std::distance(std::filesystem::directory_iterator(dir), std::filesystem::directory_iterator()),
+              1);
     auto back = STW_dictionaryWithContentsOfURL(file, STWReadDefault, &error);
     ASSERT_TRUE(back);
     EXPECT_EQ(*back, second);

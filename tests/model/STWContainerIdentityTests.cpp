@@ -42,14 +42,15 @@ TEST_F(STWContainerIdentityTest, ClassBoundariesAndMissingPartsGiveTheirCodes) {
     EXPECT_EQ(withUser(personal, STWValue(7), 2), 11u);
     EXPECT_EQ(withUser(nullptr, "a.b", 2), 11u);
     // The concrete identity checks the base fields; every UUID is one, the all-zero one too.
-    EXPECT_EQ(codeOf([&](uint64_t* e) {
-                  return STWConcreteContainerIdentity::containerIdentityWithUUID(STWUUID{}, personal, STWValue(), 2, e);
-              }),
-              18u);
+    auto concrete = [&](uint64_t* e) {
+        return STWConcreteContainerIdentity::containerIdentityWithUUID(STWUUID{}, personal, STWValue(), 2, e);
+    };
+    EXPECT_EQ(codeOf(concrete), 18u);
 
     // Without a user identity only the global classes can be named; they get the default user.
     auto withoutUser = [](STWContainerClass c) {
-        return codeOf([&](uint64_t* e) { return STWContainerIdentity::containerIdentityWithIdentifier("a.b", c, e); });
+        return codeOf(
+            [&](uint64_t* e) { return STWContainerIdentity::containerIdentityWithIdentifier("a.b", c, e); });
     };
     EXPECT_EQ(withoutUser(12), 1u);
     EXPECT_EQ(withoutUser(2), 11u);

@@ -17,8 +17,8 @@ int packbuff_round_trip_from_c(void) {
                                           SB_PACKBUFF_DEALLOC_NONE);
     if (in && sb_packbuff_get_item_value_type(in, &tag))
         home = sb_packbuff_unpack_string(in, &length, &error);
-    int result = home && tag == 100 && error == 0 && length == 17 && strcmp(home, "/private/var/root") == 0 ? 0 : 1;
+    int read = home && tag == 100 && error == 0 && length == 17 && strcmp(home, "/private/var/root") == 0;
     sb_packbuff_free(in);
     sb_packbuff_free(out);
-    return result;
+    return read ? 0 : 1;
 }

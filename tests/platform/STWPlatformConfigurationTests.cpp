@@ -37,8 +37,9 @@ TEST_F(STWPlatformConfigurationTest, MissingFileMeansDefaultsAndTheSystemVersion
 
     writeSettings({{"MultiUser", STWValue(true)},
                    {"Features", STWValue(STWValue::Dictionary{{"fast_container_sizing", STWValue(true)}})}});
-    std::ofstream(root / "etc/os-release") << "NAME=\"Stowly OS\"\nBUILD_ID=21A100\nVERSION_ID=\"17.\\\"1\\\"\"\n"
-                                              "# comment\n=novalue\nbroken\nRELEASE_TYPE='Internal'\n";
+    std::ofstream(root / "etc/os-release")
+        << "NAME=\"Stowly OS\"\nBUILD_ID=21A100\nVERSION_ID=\"17.\\\"1\\\"\"\n"
+           "# comment\n=novalue\nbroken\nRELEASE_TYPE='Internal'\n";
     auto set = STWPlatformConfiguration::loadFromRoot(root, &error);
     ASSERT_TRUE(set);
     EXPECT_TRUE(set->isMultiUser() && set->isFeatureEnabled("fast_container_sizing"));
