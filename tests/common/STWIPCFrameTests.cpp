@@ -54,6 +54,7 @@ TEST(STWIPCFrame, EncodesAGenericArrayAndDecodesOnlyThatShape) {
     EXPECT_EQ(unknown->id, UINT64_MAX);
     EXPECT_EQ(unknown->body, body);
 
+    // A body of another type and broken MessagePack close the connection in the end-to-end tests.
     STWValue map(STWValue::Dictionary{});
     const std::pair<const char*, std::string> cases[] = {
         {"not an array", payloadOf(map)},
@@ -62,9 +63,7 @@ TEST(STWIPCFrame, EncodesAGenericArrayAndDecodesOnlyThatShape) {
         {"negative kind", payloadOf(STWValue(A{STWValue(-1), STWValue(1), map}))},
         {"string id", payloadOf(STWValue(A{STWValue(0), STWValue("1"), map}))},
         {"real id", payloadOf(STWValue(A{STWValue(0), STWValue(1.0), map}))},
-        {"body an array", payloadOf(STWValue(A{STWValue(0), STWValue(1), STWValue(A{})}))},
         {"body nil", payloadOf(STWValue(A{STWValue(0), STWValue(1), STWValue()}))},
-        {"broken MessagePack", std::string("\x93\x00\x01\x81\x01\xc0", 6)},
         {"empty payload", ""},
     };
     for (const auto& [what, bytes] : cases) {

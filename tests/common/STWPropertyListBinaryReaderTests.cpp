@@ -4,7 +4,6 @@
 
 #include <gtest/gtest.h>
 
-#include <cstring>
 #include <random>
 
 inline void PrintTo(const STWValue& value, std::ostream* os) {

@@ -1,4 +1,5 @@
 #include "tests/support/STWDaemonProcess.h"
+#include "tests/support/STWTestRoot.h"
 
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWError.h"
@@ -17,13 +18,6 @@
 namespace {
 
 const STWValue::Dictionary allowed{{"com.vorlane.private.Stowly.allowed", STWValue(true)}};
-
-STWValue persona(const char* unique, uint32_t id, const char* type, STWValue::Array bundles) {
-    return STWValue(STWValue::Dictionary{{"PersonaUniqueString", STWValue(unique)},
-                                         {"PersonaID", STWValue(id)},
-                                         {"Type", STWValue(type)},
-                                         {"BundleIdentifiers", STWValue(std::move(bundles))}});
-}
 
 STWValue::Dictionary createKeys(const std::string& identifier, uint64_t containerClass, bool create = true,
                                 bool transient = false) {
@@ -54,8 +48,9 @@ class STWContainerCommandsTest : public ::testing::Test {
 protected:
     static void SetUpTestSuite() {
         daemon = new STWDaemonProcess({{"DeveloperMode", STWValue(true)}},
-                                      {persona("PERSONAL-1", 1000, "personal", {}),
-                                       persona("ENTERPRISE-1", 1001, "enterprise", {STWValue("com.example.work")})});
+                                      {STWTestRoot::persona("PERSONAL-1", 1000, "personal"),
+                                       STWTestRoot::persona("ENTERPRISE-1", 1001, "enterprise",
+                                                            {STWValue("com.example.work")})});
     }
     static void TearDownTestSuite() {
         delete daemon;

@@ -1,6 +1,4 @@
-#include "Daemon/FileSystem/STWFileManager.h"
 #include "client/STWClient.h"
-#include "platform/STWPlatformConfiguration.h"
 #include "tests/support/STWDaemonProcess.h"
 
 #include <gtest/gtest.h>
@@ -9,8 +7,6 @@
 #include <csignal>
 #include <cstring>
 #include <fcntl.h>
-#include <fstream>
-#include <semaphore.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <sys/wait.h>
@@ -55,11 +51,8 @@ int listeningSocket(const std::filesystem::path& path, int type) {
 // then) it leaves when nothing is left to do: no connection and no open transaction for
 // that long. An open connection keeps it.
 TEST(STWIdleExit, LeavesOnlyWhenNoConnectionIsLeft) {
-    char templ[] = "/tmp/stowly-idle-XXXXXX";
-    ASSERT_NE(mkdtemp(templ), nullptr);
-    std::filesystem::path root = templ;
-    std::filesystem::create_directories(root / "etc/stowly");
-    std::ofstream(root / "etc/passwd") << "mobile:x:501:501:Mobile:/private/var/mobile:/bin/sh\n";
+    STWDaemonProcess prepared({}, {}, false); // only its root, cleaned up at the end
+    const std::filesystem::path& root = prepared.root();
     int upcall = listeningSocket(root / "upcall.sock", SOCK_SEQPACKET);
     int request = listeningSocket(root / "activated.sock", SOCK_STREAM);
     ASSERT_GE(upcall, 0);
@@ -92,6 +85,4 @@ TEST(STWIdleExit, LeavesOnlyWhenNoConnectionIsLeft) {
     EXPECT_EQ(waitForExit(pid, 10s), 0);
     kill(pid, SIGKILL);
     waitpid(pid, nullptr, WNOHANG);
-    sem_unlink(STWPlatformConfiguration(root).firstBootSemaphoreName().c_str());
-    STWFileManager::defaultManager()->removeItemAtURL(root);
 }

@@ -1,11 +1,11 @@
 // Faults armed at the file layer's points fail the operation with their errno, fire at the
-// nth call only, and leave nothing half-made.
+// nth call only, and leave nothing half-made. A creation failed at each call of each point
+// is in the end-to-end crash tests.
 #include "Daemon/FileSystem/STWFaultInjection.h"
 #include "tests/filesystem/STWFileSystemTestSupport.h"
 
 #include <algorithm>
 #include <cerrno>
-#include <fcntl.h>
 #include <string>
 #include <vector>
 
@@ -36,6 +36,7 @@ TEST_F(FaultInjection, FailedWriteOrReplaceKeepsTheOldFileAndNoTemporary) {
     writeFile(scratch() / "file", "old");
     STWFileDescriptor dirfd = openDirectory(scratch());
     EXPECT_FALSE(STWFaultInjection::arm("rename", 1, EIO)) << "an unknown point is refused";
+    EXPECT_FALSE(STWFaultInjection::armFromList("renameat2:1")) << "a malformed list is refused";
     ASSERT_TRUE(STWFaultInjection::arm("fsync", 2, EIO));
 
     auto first = fm()->writeTemporaryFileAt(dirfd.get(), "new", 0644, scratch());
@@ -58,33 +59,6 @@ TEST_F(FaultInjection, FailedWriteOrReplaceKeepsTheOldFileAndNoTemporary) {
     ASSERT_TRUE(again);
     EXPECT_TRUE(fm()->replaceFileAt(dirfd.get(), *again, "file", false, nullptr, scratch() / "file"));
     EXPECT_EQ(readFile(scratch() / "file"), "new");
-}
-
-// Publishing a staged container, armed as the daemon's environment arms it.
-TEST_F(FaultInjection, FailedPublishLeavesTheStagedDirectoryInPlace) {
-    fs::create_directories(scratch() / "staging/c/Library");
-    fs::create_directories(scratch() / "class");
-    writeFile(scratch() / "staging/c/Library/data", "d");
-    STWFileDescriptor staging = openDirectory(scratch() / "staging");
-    STWFileDescriptor classfd = openDirectory(scratch() / "class");
-    STWFileDescriptor container = openDirectory(scratch() / "staging/c");
-    EXPECT_FALSE(STWFaultInjection::armFromList("renameat2:1")) << "a malformed list is refused";
-    ASSERT_TRUE(STWFaultInjection::armFromList("fsync:1:28,renameat2:1:13"));
-
-    auto publish = [&](STWErrorRef* error) {
-        return fm()->moveDirectoryAt(staging.get(), "c", classfd.get(), "c", container.get(),
-                                     STWFileManagerMoveDurable, scratch() / "staging/c",
-                                     scratch() / "class/c", error);
-    };
-    for (int expected : {ENOSPC, EACCES}) {
-        STWErrorRef error;
-        EXPECT_FALSE(publish(&error));
-        EXPECT_EQ(code(error), expected);
-        EXPECT_EQ(readFile(scratch() / "staging/c/Library/data"), "d");
-        EXPECT_TRUE(names(scratch() / "class").empty());
-    }
-    EXPECT_TRUE(publish(nullptr));
-    EXPECT_EQ(readFile(scratch() / "class/c/Library/data"), "d");
 }
 
 } // namespace

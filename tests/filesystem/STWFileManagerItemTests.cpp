@@ -1,7 +1,4 @@
 #include "platform/STWKeybag.h"
-#include "platform/STWUserDatabase.h"
-#include "common/STWFileIO.h"
-#include "platform/STWPlatformConfiguration.h"
 #include "tests/filesystem/STWFileSystemTestSupport.h"
 #include "tests/support/STWTestRoot.h"
 
@@ -107,15 +104,6 @@ TEST_F(Items, ClassPredicateDecidesAndLinksAreNeverFollowed) {
 }
 
 TEST_F(Items, ClassOneIsOutOfReachWhileLocked) {
-    fs::path keybag = STWPlatformConfiguration::sharedInstance()->runtimeDirectory() / "keybag";
-    fs::create_directories(keybag.parent_path());
-    ASSERT_EQ(STWWriteFile(keybag, "locked\n", 0644, false), 0);
-    EXPECT_TRUE(STWKeybag::isDeviceLocked());
-    ASSERT_EQ(STWWriteFile(keybag, "unlocked", 0644, false), 0);
-    EXPECT_FALSE(STWKeybag::isDeviceLocked());
-    fs::remove(keybag);
-    EXPECT_FALSE(STWKeybag::isDeviceLocked()) << "no keybag file means unlocked";
-
     fs::path complete = scratch() / "complete", other = scratch() / "other";
     writeFile(complete, "c");
     writeFile(other, "o");
@@ -177,17 +165,6 @@ TEST_F(Items, OwnerAndClassAreNeverGivenToALinkTarget) {
     ASSERT_EQ(stat(target.c_str(), &after), 0);
     EXPECT_EQ(after.st_uid, before.st_uid);
     EXPECT_EQ(classOf(target), 0);
-}
-
-TEST_F(Items, TemporaryDirectoriesAreUniqueAndPrefixed) {
-    auto first = fm()->createTemporaryDirectoryInDirectoryURL(scratch());
-    auto second = fm()->createTemporaryDirectoryInDirectoryURL(scratch(), "com.example.Assets.");
-    ASSERT_TRUE(first && second);
-    EXPECT_NE(*first, *second);
-    EXPECT_TRUE(fs::is_directory(*first));
-    EXPECT_TRUE(first->filename().native().starts_with("temp."));
-    EXPECT_TRUE(second->filename().native().starts_with("com.example.Assets."));
-    EXPECT_EQ(second->parent_path(), scratch());
 }
 
 TEST_F(Items, TraversalStopsOnVisitorAndEntryErrors) {
@@ -272,14 +249,6 @@ TEST_F(Items, DiskUsageCountsAllocatedBytesLikeDu) {
 
     EXPECT_EQ(fm()->diskUsageForURL(scratch() / "missing"), 0u);
     EXPECT_EQ(fm()->diskUsageForURL(""), 0u);
-}
-
-TEST_F(Items, HomeDirectoriesResolveUnderTheRoot) {
-    fs::path mobile = STWTestRoot::shared().resolve("/private/var/mobile");
-    EXPECT_EQ(STWUserDatabase::homeDirectoryURLForPOSIXUID(501), fs::canonical(mobile));
-    // A user without an entry, or whose home is missing, gets the mobile user's home.
-    EXPECT_EQ(STWUserDatabase::homeDirectoryURLForPOSIXUID(4242), mobile);
-    EXPECT_EQ(STWUserDatabase::homeDirectoryURLForPOSIXUID(502), mobile);
 }
 
 } // namespace

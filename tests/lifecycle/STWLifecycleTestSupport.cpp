@@ -10,15 +10,6 @@
 
 namespace {
 
-STWValue persona(const char* unique, uint32_t id, const char* type, STWValue::Array bundles = {},
-                 const char* home = nullptr) {
-    STWValue::Dictionary d{{"PersonaUniqueString", STWValue(unique)}, {"PersonaID", STWValue(id)},
-                           {"Type", STWValue(type)}, {"BundleIdentifiers", STWValue(bundles)}};
-    if (home)
-        d["HomeLayoutPath"] = STWValue(home);
-    return STWValue(d);
-}
-
 std::string itemKey(const STWSandboxMappingItem& item) {
     return STWFormat("%u/%u/%llu/%@", item.uid, item.kernelPersonaID, static_cast<unsigned long long>(item.itemType),
                      item.identifier);
@@ -29,10 +20,10 @@ std::string itemKey(const STWSandboxMappingItem& item) {
 void STWLifecycleTestSetUpRoot() {
     STWTestRoot& root = STWTestRoot::shared();
     root.writePersonas({
-        persona("PERSONAL", 1000, "personal"),
-        persona("ENT-1", 1001, "enterprise", {STWValue("com.work.mail"), STWValue("com.shared.app")},
-                "/private/var/ent1"),
-        persona("UNIVERSAL", 1003, "universal", {STWValue("com.shared.app")}),
+        STWTestRoot::persona("PERSONAL", 1000, "personal"),
+        STWTestRoot::persona("ENT-1", 1001, "enterprise",
+                             {STWValue("com.work.mail"), STWValue("com.shared.app")}, "/private/var/ent1"),
+        STWTestRoot::persona("UNIVERSAL", 1003, "universal", {STWValue("com.shared.app")}),
     });
     for (const char* path : {"/private/var/mobile/Containers", "/private/var/ent1", "/private/var/containers",
                              "/private/var/root/Library/Caches/com.vorlane.stowlyd/Temp", "/run/stowly/sandbox",

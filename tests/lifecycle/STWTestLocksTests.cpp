@@ -1,27 +1,12 @@
 #include "Daemon/Lifecycle/STWTestLocks.h"
 #include "Daemon/STWLocks.h"
+#include "tests/support/STWLockAttempt.h"
 
 #include <gtest/gtest.h>
-
-#include <chrono>
-#include <functional>
-#include <future>
 
 using namespace std::chrono_literals;
 
 namespace {
-
-// Runs `work` on another thread; `done()` tells whether it finished within a short wait.
-class Attempt {
-public:
-    explicit Attempt(std::function<void()> work) : _future(std::async(std::launch::async, std::move(work))) {}
-    bool done(std::chrono::milliseconds wait = 150ms) {
-        return _future.wait_for(wait) == std::future_status::ready;
-    }
-
-private:
-    std::future<void> _future;
-};
 
 class STWTestLocksTest : public ::testing::Test {
 protected:
@@ -37,20 +22,8 @@ protected:
         EXPECT_EQ(state.identifierReaderCount, 0u);
         EXPECT_EQ(state.identifierWriterCount, 0u);
     }
-    Attempt waiter(uint64_t lock) {
-        return Attempt([this, lock] { EXPECT_TRUE(locks->waitOnLock(lock)); });
-    }
-    static Attempt identifierWriter(const std::string& identifier) {
-        return Attempt([identifier] {
-            lock_identifier_for_writing(identifier);
-            unlock_identifier(identifier);
-        });
-    }
-    static Attempt identifierReader(const std::string& identifier) {
-        return Attempt([identifier] {
-            lock_identifier_for_reading(identifier);
-            unlock_identifier(identifier);
-        });
+    STWLockAttempt waiter(uint64_t lock) {
+        return STWLockAttempt([this, lock] { EXPECT_TRUE(locks->waitOnLock(lock)); });
     }
 
     std::shared_ptr<STWTestLocks> locks;
@@ -59,7 +32,7 @@ protected:
 TEST_F(STWTestLocksTest, ParkPointHoldsWaitersUntilItsLastReleaseAndCanBeTakenAgain) {
     ASSERT_TRUE(locks->acquireLock(2));
     ASSERT_TRUE(locks->acquireLock(2));
-    Attempt first = waiter(2), second = waiter(2), otherPoint = waiter(3);
+    STWLockAttempt first = waiter(2), second = waiter(2), otherPoint = waiter(3);
     EXPECT_TRUE(otherPoint.done(2000ms));
     EXPECT_FALSE(first.done());
 
@@ -73,7 +46,7 @@ TEST_F(STWTestLocksTest, ParkPointHoldsWaitersUntilItsLastReleaseAndCanBeTakenAg
 
     // A second round: the semaphore and the barrier must not carry anything over.
     ASSERT_TRUE(locks->acquireLock(2));
-    Attempt again = waiter(2);
+    STWLockAttempt again = waiter(2);
     EXPECT_FALSE(again.done());
     ASSERT_TRUE(locks->releaseLock(2));
     EXPECT_TRUE(again.done(2000ms));
@@ -86,7 +59,7 @@ TEST_F(STWTestLocksTest, ReleaseAndReacquireBeforeTheBarrierRanStillParksLaterWa
         ASSERT_TRUE(locks->releaseLock(4));
     }
     ASSERT_TRUE(locks->acquireLock(4));
-    Attempt parked = waiter(4);
+    STWLockAttempt parked = waiter(4);
     EXPECT_FALSE(parked.done(300ms));
     ASSERT_TRUE(locks->releaseLock(4));
     EXPECT_TRUE(parked.done(2000ms));
@@ -95,15 +68,15 @@ TEST_F(STWTestLocksTest, ReleaseAndReacquireBeforeTheBarrierRanStillParksLaterWa
 TEST_F(STWTestLocksTest, WaitersParkOnlyWhileEnabledAndDisablingReleasesEverything) {
     locks->setEnabled(false);
     ASSERT_TRUE(locks->acquireLock(2));
-    Attempt unparked = waiter(2);
+    STWLockAttempt unparked = waiter(2);
     EXPECT_TRUE(unparked.done(2000ms));
 
     locks->setEnabled(true);
     EXPECT_TRUE(locks->enabled());
     ASSERT_TRUE(locks->acquireLock(0));
-    Attempt parked = waiter(2);
+    STWLockAttempt parked = waiter(2);
     EXPECT_FALSE(parked.done());
-    Attempt writer = identifierWriter("disable");
+    STWLockAttempt writer = STWLockAttempt::lockAndUnlock("disable", true);
     EXPECT_FALSE(writer.done(0ms));
 
     locks->setEnabled(false);
@@ -112,13 +85,19 @@ TEST_F(STWTestLocksTest, WaitersParkOnlyWhileEnabledAndDisablingReleasesEverythi
     EXPECT_EQ(locks->countForLock(0) + locks->countForLock(2), 0);
 }
 
-TEST_F(STWTestLocksTest, WriteLockHoldsOffDaemonWideReadersAndIdentifierLockersUntilReleased) {
+// Lock 1 waits for the identifiers' holders, then holds off every locker until released.
+TEST_F(STWTestLocksTest, WriteLockWaitsForHoldersThenHoldsOffEveryLockerUntilReleased) {
+    lock_identifier_for_reading("held");
     // Taken on one thread, released on another: the hold belongs to the lock's count.
-    std::async(std::launch::async, [this] { ASSERT_TRUE(locks->acquireLock(1)); }).get();
+    STWLockAttempt acquire([this] { EXPECT_TRUE(locks->acquireLock(1)); });
+    EXPECT_FALSE(acquire.done());
+    unlock_identifier("held");
+    ASSERT_TRUE(acquire.done(2000ms));
     EXPECT_EQ(STWLocksCurrentState().allReaderWriterState, 0xFFFFFFFFu);
 
-    Attempt writer = identifierWriter("container-A"), reader = identifierReader("container-B");
-    Attempt global([] {
+    STWLockAttempt writer = STWLockAttempt::lockAndUnlock("container-A", true);
+    STWLockAttempt reader = STWLockAttempt::lockAndUnlock("container-B", false);
+    STWLockAttempt global([] {
         lock_all_identifiers_for_reading();
         unlock_all_identifiers();
     });
@@ -133,11 +112,11 @@ TEST_F(STWTestLocksTest, ReadLockAdmitsReadersHoldsOffIdentifierWritersAndRefuse
     ASSERT_TRUE(locks->acquireLock(0));
     ASSERT_TRUE(locks->acquireLock(0)); // only counts
     EXPECT_EQ(STWLocksCurrentState().allReaderWriterState, 1u);
-    EXPECT_TRUE(identifierReader("container-A").done(2000ms));
-    Attempt writer = identifierWriter("container-A");
+    EXPECT_TRUE(STWLockAttempt::lockAndUnlock("container-A", false).done(2000ms));
+    STWLockAttempt writer = STWLockAttempt::lockAndUnlock("container-A", true);
     EXPECT_FALSE(writer.done());
     // Lock 1 would wait for lock 0 for ever on the state queue; it is refused instead.
-    Attempt write([this] { EXPECT_FALSE(locks->acquireLock(1)); });
+    STWLockAttempt write([this] { EXPECT_FALSE(locks->acquireLock(1)); });
     EXPECT_TRUE(write.done(2000ms));
     EXPECT_EQ(locks->countForLock(1), 0);
 
@@ -145,16 +124,6 @@ TEST_F(STWTestLocksTest, ReadLockAdmitsReadersHoldsOffIdentifierWritersAndRefuse
     EXPECT_FALSE(writer.done());
     ASSERT_TRUE(locks->releaseLock(0));
     EXPECT_TRUE(writer.done(2000ms));
-}
-
-TEST_F(STWTestLocksTest, AcquiringTheWriteLockWaitsForIdentifierHolders) {
-    lock_identifier_for_reading("held");
-    Attempt acquire([this] { EXPECT_TRUE(locks->acquireLock(1)); });
-    EXPECT_FALSE(acquire.done());
-    unlock_identifier("held");
-    EXPECT_TRUE(acquire.done(2000ms));
-    EXPECT_EQ(locks->countForLock(1), 1);
-    ASSERT_TRUE(locks->releaseLock(1));
 }
 
 TEST_F(STWTestLocksTest, UnbalancedReleasesAndUnknownLocksAreRefused) {
@@ -173,7 +142,7 @@ TEST_F(STWTestLocksTest, UnbalancedReleasesAndUnknownLocksAreRefused) {
 
     ASSERT_TRUE(locks->acquireLock(1));
     // Refused at once, not parked behind the write lock.
-    Attempt refused([this] {
+    STWLockAttempt refused([this] {
         EXPECT_FALSE(locks->waitOnLock(0));
         EXPECT_FALSE(locks->waitOnLock(1));
     });
@@ -186,7 +155,8 @@ TEST_F(STWTestLocksTest, UnbalancedReleasesAndUnknownLocksAreRefused) {
 TEST_F(STWTestLocksTest, ReleaseAllLocksReleasesEveryHeldLockAtOnce) {
     for (uint64_t lock : {0, 0, 2, 5, 5, 5})
         ASSERT_TRUE(locks->acquireLock(lock));
-    Attempt parkedAt2 = waiter(2), parkedAt5 = waiter(5), writer = identifierWriter("container-A");
+    STWLockAttempt parkedAt2 = waiter(2), parkedAt5 = waiter(5);
+    STWLockAttempt writer = STWLockAttempt::lockAndUnlock("container-A", true);
     EXPECT_FALSE(parkedAt2.done());
     EXPECT_FALSE(parkedAt5.done(0ms) || writer.done(0ms));
 
@@ -204,9 +174,9 @@ TEST_F(STWTestLocksTest, ReleaseAllLocksReleasesEveryHeldLockAtOnce) {
 // gets in, its own release included; the lock it then gets is let go at once.
 TEST_F(STWTestLocksTest, WaitingForTheDaemonWideLockBlocksNoOtherRequest) {
     lock_all_identifiers_for_reading(); // a request that holds the daemon-wide lock
-    Attempt taker([&] { EXPECT_TRUE(locks->acquireLock(STWTestLocks::daemonWideWriteLock)); });
+    STWLockAttempt taker([&] { EXPECT_TRUE(locks->acquireLock(STWTestLocks::daemonWideWriteLock)); });
     EXPECT_FALSE(taker.done());
-    Attempt others([&] {
+    STWLockAttempt others([&] {
         EXPECT_TRUE(locks->acquireLock(3));
         EXPECT_TRUE(locks->releaseLock(3));
         EXPECT_TRUE(locks->releaseLock(STWTestLocks::daemonWideWriteLock));

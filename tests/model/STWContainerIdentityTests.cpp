@@ -31,33 +31,29 @@ uint64_t codeOf(Make make) {
     return error;
 }
 
+// Classes 0 and 14 and a missing identifier are answered over the socket in the end-to-end
+// tests; here the other ways a factory refuses.
 TEST_F(STWContainerIdentityTest, ClassBoundariesAndMissingPartsGiveTheirCodes) {
     auto withUser = [&](const STWUserIdentityRef& user, STWValue identifier, STWContainerClass c) {
         return codeOf([&](uint64_t* e) { return STWContainerIdentity::containerIdentityWithUserIdentity(user, identifier, c, e); });
     };
-    for (STWContainerClass c : {0ull, 14ull, 15ull, 1ull << 63})
-        EXPECT_EQ(withUser(personal, "a.b", c), 11u) << c;
-    for (STWContainerClass c = 1; c <= 13; ++c)
-        EXPECT_EQ(withUser(personal, "a.b", c), 1u) << c;
-    EXPECT_EQ(withUser(personal, STWValue(), 2), 18u);
+    EXPECT_EQ(withUser(personal, "a.b", 1ull << 63), 11u);
+    EXPECT_EQ(withUser(personal, "a.b", 13), 1u);
     EXPECT_EQ(withUser(personal, STWValue(7), 2), 11u);
     EXPECT_EQ(withUser(nullptr, "a.b", 2), 11u);
     // The concrete identity checks the base fields; every UUID is one, the all-zero one too.
-    auto concrete = [&](STWValue identifier) {
-        return codeOf([&](uint64_t* e) {
-            return STWConcreteContainerIdentity::containerIdentityWithUUID(STWUUID{}, personal, identifier, 2, e);
-        });
+    auto concrete = [&](uint64_t* e) {
+        return STWConcreteContainerIdentity::containerIdentityWithUUID(STWUUID{}, personal, STWValue(), 2, e);
     };
-    EXPECT_EQ(concrete(STWValue()), 18u);
-    EXPECT_EQ(concrete("a.b"), 1u);
+    EXPECT_EQ(codeOf(concrete), 18u);
 
     // Without a user identity only the global classes can be named; they get the default user.
-    for (STWContainerClass c = 0; c <= 15; ++c) {
-        bool global = c == 1 || c == 3 || c == 5 || c == 8 || c == 12 || c == 13;
-        EXPECT_EQ(codeOf([&](uint64_t* e) { return STWContainerIdentity::containerIdentityWithIdentifier("a.b", c, e); }),
-                  global ? 1u : 11u)
-            << c;
-    }
+    auto withoutUser = [](STWContainerClass c) {
+        return codeOf(
+            [&](uint64_t* e) { return STWContainerIdentity::containerIdentityWithIdentifier("a.b", c, e); });
+    };
+    EXPECT_EQ(withoutUser(12), 1u);
+    EXPECT_EQ(withoutUser(2), 11u);
     EXPECT_EQ(*STWContainerIdentity::containerIdentityWithIdentifier("a.b", 12, nullptr)->userIdentity(),
               *STWUserIdentityCache::defaultUserIdentity());
 }

@@ -11,27 +11,18 @@
 
 namespace {
 
-STWValue persona(const char* unique, uint32_t id, const char* type, STWValue::Array bundles = {},
-                 const char* home = nullptr) {
-    STWValue::Dictionary d{{"PersonaID", STWValue(id)}, {"Type", STWValue(type)}, {"BundleIdentifiers", STWValue(bundles)}};
-    if (unique)
-        d["PersonaUniqueString"] = STWValue(unique);
-    if (home)
-        d["HomeLayoutPath"] = STWValue(home);
-    return STWValue(d);
-}
-
 class STWUserIdentityCacheTest : public ::testing::Test {
 protected:
     void SetUp() override {
         STWTestRoot::shared();
         STWUserIdentityCache::setResyncRetryInterval(std::chrono::milliseconds(1));
         STWTestRoot::shared().writePersonas({
-            persona("PERSONAL", 1000, "personal", {STWValue("com.personal.only")}),
-            persona("ENT-1", 1001, "enterprise", {STWValue("com.work.mail"), STWValue("com.both")}, "/private/var/ent1"),
-            persona("ENT-2", 1002, "enterprise", {STWValue("com.both")}),
-            persona("UNIVERSAL", 1003, "universal", {STWValue("com.vorlane.shared")}),
-            persona(nullptr, 1004, "enterprise", {STWValue("com.broken")}),
+            STWTestRoot::persona("PERSONAL", 1000, "personal", {STWValue("com.personal.only")}),
+            STWTestRoot::persona("ENT-1", 1001, "enterprise",
+                                 {STWValue("com.work.mail"), STWValue("com.both")}, "/private/var/ent1"),
+            STWTestRoot::persona("ENT-2", 1002, "enterprise", {STWValue("com.both")}),
+            STWTestRoot::persona("UNIVERSAL", 1003, "universal", {STWValue("com.vorlane.shared")}),
+            STWTestRoot::persona(nullptr, 1004, "enterprise", {STWValue("com.broken")}),
         });
         cache = STWUserIdentityCache::create();
     }
@@ -140,8 +131,8 @@ TEST_F(STWUserIdentityCacheTest, APersonaChangeIsNoticedAndApplied) {
     ASSERT_FALSE(cache->userIdentityForCurrentUserWithPersonaUniqueString(std::string("ENT-NEW")));
     STWEventLoopThread loop;
     STWTestRoot::shared().writePersonas({
-        persona("PERSONAL", 1000, "personal"),
-        persona("ENT-NEW", 1010, "enterprise", {STWValue("com.new")}),
+        STWTestRoot::persona("PERSONAL", 1000, "personal"),
+        STWTestRoot::persona("ENT-NEW", 1010, "enterprise", {STWValue("com.new")}),
     });
     // The change arrives through the file watcher, on the event loop, and the flush queue.
     STWUserIdentityRef found;
@@ -155,7 +146,9 @@ TEST_F(STWUserIdentityCacheTest, APersonaChangeIsNoticedAndApplied) {
     EXPECT_FALSE(cache->userIdentityForCurrentUserWithPersonaUniqueString(std::string("ENT-1")));
 }
 
-TEST_F(STWUserIdentityCacheTest, RepopulatingFromIdentitiesInventsTheUnspecificOne) {
+// Repopulated from identities, the cache invents the unspecific one; with no persona but the
+// default one it still visits that identity, once.
+TEST_F(STWUserIdentityCacheTest, RepopulatingFromIdentities) {
     auto home = STWTestRoot::shared().resolve("/private/var/mobile");
     auto personal = STWUserIdentity::initWithUID(501, 501, home, "X", STWPersonaTypePersonal, 7);
     auto enterprise = STWUserIdentity::initWithUID(501, 501, home, "E", STWPersonaTypeEnterprise, 8);
@@ -165,19 +158,28 @@ TEST_F(STWUserIdentityCacheTest, RepopulatingFromIdentitiesInventsTheUnspecificO
     EXPECT_TRUE(unspecific->isNoSpecificPersona());
     EXPECT_EQ(unspecific->kernelPersonaID(), 7u);
     EXPECT_EQ(cache->userIdentityWithPersonaID(8)->identifier(), "E");
+
+    cache->flushAndRepopulateWithUserIdentities(
+        {STWUserIdentity::initWithUID(501, 501, home, std::nullopt, STWPersonaTypePersonal, 501)});
+    std::vector<STWUserIdentityRef> visited;
+    cache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
+        [&](const STWUserIdentityRef& identity) { visited.push_back(identity); });
+    ASSERT_EQ(visited.size(), 1u);
+    EXPECT_EQ(visited[0], STWUserIdentityCache::defaultUserIdentity());
 }
 
 TEST_F(STWUserIdentityCacheTest, AListWithoutAPersonalPersonaIsRetriedUntilItHasOne) {
     STWEventLoopThread loop; // the persona service hears of the fix through its watch
     STWUserIdentityCache::setResyncRetryInterval(std::chrono::milliseconds(20));
-    STWTestRoot::shared().writePersonas({persona("ENT-ONLY", 1020, "enterprise", {STWValue("com.only")})});
+    STWTestRoot::shared().writePersonas(
+        {STWTestRoot::persona("ENT-ONLY", 1020, "enterprise", {STWValue("com.only")})});
     cache->flush();
     // The rebuild keeps failing, holding the lock, until the list is fixed behind its back.
     auto fixer = std::async(std::launch::async, [] {
         std::this_thread::sleep_for(std::chrono::milliseconds(150));
         STWTestRoot::shared().writePersonas({
-            persona("PERSONAL", 1000, "personal"),
-            persona("ENT-ONLY", 1020, "enterprise", {STWValue("com.only")}),
+            STWTestRoot::persona("PERSONAL", 1000, "personal"),
+            STWTestRoot::persona("ENT-ONLY", 1020, "enterprise", {STWValue("com.only")}),
         });
     });
     auto identities = cache->userIdentitiesForBundleIdentifier("com.only");
@@ -202,22 +204,11 @@ TEST_F(STWUserIdentityCacheTest, AnUnregisteredCacheKeepsWhatItHas) {
     STWEventLoopThread loop;
     cache->unregister();
     EXPECT_FALSE(cache->isRegistered());
-    STWTestRoot::shared().writePersonas({persona("PERSONAL", 1000, "personal")});
+    STWTestRoot::shared().writePersonas({STWTestRoot::persona("PERSONAL", 1000, "personal")});
     // A registered cache applies such a change within a few milliseconds (see above).
     std::this_thread::sleep_for(std::chrono::milliseconds(300));
     EXPECT_FALSE(cache->cacheInvalid());
     EXPECT_TRUE(cache->userIdentityForCurrentUserWithPersonaUniqueString(std::string("ENT-1")));
-}
-
-TEST_F(STWUserIdentityCacheTest, AnEmptyPersonaMapStillVisitsTheDefaultIdentityOnce) {
-    auto home = STWTestRoot::shared().resolve("/private/var/mobile");
-    cache->flushAndRepopulateWithUserIdentities(
-        {STWUserIdentity::initWithUID(501, 501, home, std::nullopt, STWPersonaTypePersonal, 501)});
-    std::vector<STWUserIdentityRef> visited;
-    cache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
-        [&](const STWUserIdentityRef& identity) { visited.push_back(identity); });
-    ASSERT_EQ(visited.size(), 1u);
-    EXPECT_EQ(visited[0], STWUserIdentityCache::defaultUserIdentity());
 }
 
 } // namespace

@@ -7,11 +7,9 @@
 
 #include <gtest/gtest.h>
 
-#include <csignal>
 #include <fstream>
 #include <future>
 #include <stdexcept>
-#include <sys/resource.h>
 
 namespace fs = std::filesystem;
 
@@ -48,35 +46,6 @@ protected:
 };
 
 } // namespace
-
-// A container whose metadata cannot be written never shows up: not in its class
-// directory, not in staging, and death row is emptied of it.
-TEST_F(STWCreateOrLookup, FailedMetadataWriteLeavesNothingBehind) {
-    uint64_t error;
-    auto existing = create("com.example.good", &error);
-    ASSERT_NE(existing, nullptr) << error;
-    EXPECT_FALSE(existing->existed());
-
-    // No regular file may grow past 0 bytes: directories still appear, the metadata file
-    // cannot be written.
-    signal(SIGXFSZ, SIG_IGN);
-    rlimit original{};
-    getrlimit(RLIMIT_FSIZE, &original);
-    rlimit none{0, original.rlim_max};
-    ASSERT_EQ(setrlimit(RLIMIT_FSIZE, &none), 0);
-    auto result = create("com.example.doomed", &error);
-    setrlimit(RLIMIT_FSIZE, &original);
-
-    EXPECT_EQ(result, nullptr);
-    EXPECT_EQ(error, STWErrorWriteFileFailed);
-    drainDeathRow();
-    EXPECT_EQ(visibleEntries(existing->url().parent_path()), std::vector<fs::path>{existing->url()});
-    EXPECT_TRUE(
-        visibleEntries(STWGlobalConfiguration::sharedInstance()->stagingDirectoryURLForUserIdentity(user, 2))
-            .empty());
-    // The same identity can be created once the disk takes writes again.
-    EXPECT_NE(create("com.example.doomed", &error), nullptr) << error;
-}
 
 // An exception in the middle of a create (here thrown at a crash point) is code 40 and
 // leaves no lock held: the next create of the same identity goes through.

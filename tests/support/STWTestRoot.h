@@ -20,6 +20,17 @@ public:
     void writeSettings(const STWValue::Dictionary& settings);
     // Writes etc/stowly/personas.plist (an array of persona dictionaries).
     void writePersonas(const STWValue::Array& personas);
+    // One persona dictionary of such a list; a null `unique` leaves its unique string out.
+    static STWValue persona(const char* unique, uint32_t id, const char* type, STWValue::Array bundles = {},
+                            const char* home = nullptr) {
+        STWValue::Dictionary d{{"PersonaID", STWValue(id)}, {"Type", STWValue(type)},
+                               {"BundleIdentifiers", STWValue(std::move(bundles))}};
+        if (unique)
+            d["PersonaUniqueString"] = STWValue(unique);
+        if (home)
+            d["HomeLayoutPath"] = STWValue(home);
+        return STWValue(std::move(d));
+    }
 
 private:
     // A new root, or the one at `existing`.
