@@ -117,7 +117,7 @@ public:
     const std::shared_ptr<STWUserIdentityCache>& userIdentityCache() const { return _userIdentityCache; }
 
 private:
-    // The code of an error for a client: its own in the daemon's domain, else 34.
+    // The code of an error for a client: its own in the daemon's domain, else 41 (logged).
     static uint64_t _codeOfError(const STWErrorRef& error);
     static void _reportException(const char* function);
     // Runs `body`, turning an exception into code 40 (an internal image stops instead, so
