@@ -73,8 +73,8 @@ STWError::STWError(std::string_view domain, int64_t code, std::string message, s
 std::string STWError::description() const {
     std::string text = STWFormat("Error Domain=%s Code=%lld \"%s\" {FunctionName=%s, SourceFileLine=%llu",
                                  _domain, _code, _message, _functionName, _sourceFileLine);
-    if (_domain == STWPOSIXErrorDomain && _code > 0)
-        text += STWFormat(", Reason=%s", strerror(static_cast<int>(_code)));
+    if (posixCode() > 0)
+        text += STWFormat(", Reason=%s", strerror(posixCode()));
     if (_underlyingError)
         text += ", UnderlyingError=" + _underlyingError->description();
     return text + "}";

@@ -4,6 +4,18 @@
 // and shared; they are only made through STWErrorCreate (the STW_ERROR macros), which
 // formats the message, records the failing function and line, and logs the error unless
 // told not to.
+//
+// How failure travels. Clients get daemon codes: the request handlers and the
+// client-connection operations write them through `uint64_t* error`, as do the model's
+// identity constructors, which check what a client sent. Everything below them (the
+// container cache, the model, the file layer, the platform services) reports an error
+// object through `STWErrorRef* error`, in the domain of whoever decided the failure: a
+// daemon code in STWErrorDomain, an errno in STWPOSIXErrorDomain. Only a thin wrapper of a
+// system call answers in the call's own form instead (-1 or nullptr with errno set, or the
+// errno value itself), one form per module, said in its header. A code is read only in its
+// own domain: whoever answers an error of another domain with a daemon code uses the
+// operation's own documented code and keeps the error as its underlying error, and an
+// errno is taken from an error object only through posixCode().
 #pragma once
 
 #include "common/STWFormat.h"
@@ -97,6 +109,8 @@ public:
     const STWErrorRef& underlyingError() const { return _underlyingError; }
 
     bool isPOSIX(int errnoValue) const { return _domain == STWPOSIXErrorDomain && _code == errnoValue; }
+    // The errno of a POSIX-domain error; 0 for any other domain, whose code is no errno.
+    int posixCode() const { return _domain == STWPOSIXErrorDomain ? static_cast<int>(_code) : 0; }
     bool is(uint64_t stowlyCode) const {
         return _domain == STWErrorDomain && static_cast<uint64_t>(_code) == stowlyCode;
     }

@@ -1,9 +1,10 @@
 #include "platform/STWContainerLibrary.h"
 
 #include "common/STWDictionaryUtilities.h"
-#include "common/STWError.h"
 #include "common/STWLog.h"
 #include "platform/STWPlatformConfiguration.h"
+
+#include <cerrno>
 
 namespace {
 
@@ -20,10 +21,11 @@ bool isSafeRelativePath(const std::string& path) {
 
 } // namespace
 
-std::optional<std::vector<std::string>> STWContainerLibrary::subdirectoriesForContainerClass(uint64_t containerClass,
-                                                                                             uint64_t* error) {
+std::optional<std::vector<std::string>>
+STWContainerLibrary::subdirectoriesForContainerClass(uint64_t containerClass, STWErrorRef* error) {
     if (containerClass < 1 || containerClass > 13) {
-        *error = STWErrorUnexpectedClass;
+        STWSetError(error, STW_POSIX_ERROR_NOLOG(EINVAL, "No subdirectories for container class %llu",
+                                                 containerClass));
         return std::nullopt;
     }
     const auto& settings = STWPlatformConfiguration::sharedInstance()->settings();

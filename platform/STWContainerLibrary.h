@@ -4,6 +4,8 @@
 // number (as a string, "2") to an array of relative paths.
 #pragma once
 
+#include "common/STWError.h"
+
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -12,7 +14,8 @@
 class STWContainerLibrary {
 public:
     // The subdirectories of `containerClass` in creation order (parents before children),
-    // or nullopt with `error` set (to 20, an unknown class) when the platform has no list.
+    // or nullopt with `error` set to EINVAL (not logged) for a class the platform has no
+    // list for, its only failure.
     static std::optional<std::vector<std::string>> subdirectoriesForContainerClass(uint64_t containerClass,
-                                                                                     uint64_t* error);
+                                                                                   STWErrorRef* error);
 };

@@ -169,13 +169,17 @@ int STWEventLoop::run() {
         // One event per call: an exit() by its handler is seen before the next one.
         int r = sd_event_run(_event, UINT64_MAX);
         if (r < 0 && r != -EINTR) {
-            STW_LOG_ERROR(STWLogCategory::Unspecified, "The event loop failed: %s", strerror(-r));
-            failure = r;
+            failure = -r;
+            STW_LOG_ERROR(STWLogCategory::Unspecified, "The event loop failed: %s", strerror(failure));
             break;
         }
     }
     _runner = std::thread::id();
-    return failure ? failure : _exitCode;
+    if (failure) {
+        errno = failure;
+        return -1;
+    }
+    return _exitCode;
 }
 
 void STWEventLoop::exit(int code) {

@@ -10,6 +10,9 @@
 // while the loop is not running (sd-event is not thread-safe). Any thread hands work to the
 // loop with post(). Work on the loop never waits for a client, for the device to unlock or
 // on a lock that someone holds across I/O: while it waits, nobody is accepted.
+//
+// Failures answer as a system call does, with errno set; sd-event's negative errno values
+// do not leave this class.
 #pragma once
 
 #include "common/STWFileDescriptor.h"
@@ -73,10 +76,10 @@ public:
     // posted while the loop is not running waits for it to run.
     void post(std::function<void()> work) STW_EXCLUDES(_lock);
 
-    // Dispatches events until exit(); answers the code given to exit(), or a negative errno
-    // value when waiting for events failed. The loop can run again afterwards.
+    // Dispatches events until exit(); answers the code given to exit() (0 or more), or -1
+    // when waiting for events failed. The loop can run again afterwards.
     int run();
-    // Makes run() return `code` once the current handler is done. Loop thread only.
+    // Makes run() return `code` (0 or more) once the current handler is done. Loop thread only.
     void exit(int code);
     // True on the thread inside run().
     bool isCurrent() const { return _runner.load() == std::this_thread::get_id(); }

@@ -5,6 +5,7 @@
 #include "platform/STWPlatformConfiguration.h"
 
 #include <cerrno>
+#include <cstring>
 #include <mutex>
 #include <openssl/crypto.h>
 #include <openssl/hmac.h>
@@ -23,17 +24,20 @@ std::filesystem::path STWSandboxExtension::keyFile() {
     return STWPlatformConfiguration::sharedInstance()->runtimeDirectory() / "extension.key";
 }
 
-int STWSandboxExtension::createKey(const std::filesystem::path& file) {
+bool STWSandboxExtension::createKey(const std::filesystem::path& file, STWErrorRef* error) {
     unsigned char bytes[kKeySize];
-    if (RAND_bytes(bytes, sizeof bytes) != 1)
-        return EIO;
-    std::string key(reinterpret_cast<const char*>(bytes), sizeof bytes);
-    int e = STWWriteFileAtomically(file, key, 0600, true);
-    if (e == 0) {
-        std::lock_guard guard(keyLock);
-        cachedKey = key;
+    if (RAND_bytes(bytes, sizeof bytes) != 1) {
+        STWSetError(error, STW_POSIX_ERROR_NOLOG(EIO, "No random bytes for the key %@", file));
+        return false;
     }
-    return e;
+    std::string key(reinterpret_cast<const char*>(bytes), sizeof bytes);
+    if (int e = STWWriteFileAtomically(file, key, 0600, true)) {
+        STWSetError(error, STW_POSIX_ERROR_NOLOG(e, "Cannot write the key %@: %s", file, strerror(e)));
+        return false;
+    }
+    std::lock_guard guard(keyLock);
+    cachedKey = key;
+    return true;
 }
 
 std::string STWSandboxExtension::tokenWithKey(const std::string& key, std::string_view extensionClass,
@@ -54,7 +58,8 @@ std::string STWSandboxExtension::tokenWithKey(const std::string& key, std::strin
 
 std::optional<std::string> STWSandboxExtension::issueFileExtension(std::string_view extensionClass,
                                                                    std::string_view path,
-                                                                   const STWAuditToken& auditToken) {
+                                                                   const STWAuditToken& auditToken,
+                                                                   STWErrorRef* error) {
     std::string key;
     {
         std::lock_guard guard(keyLock);
@@ -64,7 +69,8 @@ std::optional<std::string> STWSandboxExtension::issueFileExtension(std::string_v
             if (e == 0 && contents.size() != kKeySize)
                 e = EINVAL;
             if (e) {
-                errno = e;
+                STWSetError(error,
+                            STW_POSIX_ERROR_NOLOG(e, "Cannot read the key %@: %s", keyFile(), strerror(e)));
                 return std::nullopt;
             }
             cachedKey = contents;

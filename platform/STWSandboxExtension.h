@@ -3,9 +3,10 @@
 //     class, NUL, path, NUL, the eight audit-token words (little-endian)
 // keyed by a secret made at the daemon's start in ROOT/run/stowly/extension.key (32
 // random bytes, mode 0600). Whoever enforces access holds the same key and checks a token
-// with verify().
+// with verify(). Failures are POSIX-domain errors, left to the caller to log.
 #pragma once
 
+#include "common/STWError.h"
 #include "platform/STWAuditToken.h"
 
 #include <filesystem>
@@ -19,13 +20,14 @@ public:
     static constexpr const char* applicationGroupClass = "com.vorlane.sandbox.application-group";
 
     // Makes a new key file (replacing any old one, so tokens of an earlier run stop
-    // verifying). Returns 0 or an errno value.
-    static int createKey(const std::filesystem::path& keyFile);
+    // verifying).
+    static bool createKey(const std::filesystem::path& keyFile, STWErrorRef* error);
     static std::filesystem::path keyFile();
 
-    // A token for `path`, or nullopt with errno set when the key cannot be read.
-    static std::optional<std::string> issueFileExtension(std::string_view extensionClass, std::string_view path,
-                                                         const STWAuditToken& auditToken);
+    // A token for `path`, or nullopt when the key cannot be read.
+    static std::optional<std::string> issueFileExtension(std::string_view extensionClass,
+                                                         std::string_view path,
+                                                         const STWAuditToken& auditToken, STWErrorRef* error);
     static bool verify(std::string_view token, std::string_view extensionClass, std::string_view path,
                        const STWAuditToken& auditToken, const std::string& key);
     static std::string tokenWithKey(const std::string& key, std::string_view extensionClass, std::string_view path,

@@ -6,6 +6,7 @@
 #include <atomic>
 #include <cerrno>
 #include <climits>
+#include <cstring>
 #include <fcntl.h>
 #include <openssl/sha.h>
 #include <mutex>
@@ -19,20 +20,19 @@ std::shared_ptr<STWSandboxMappingStore> shared;
 
 constexpr int directoryFlags = O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC;
 
-// Opens the directory `name` inside `parent`, creating it first when asked. A symbolic link
-// in its place fails (ELOOP, or ENOTDIR for a link to a file) instead of being followed.
+// Opens the directory `name` inside `parent`, creating it first when asked; answers as
+// openat() does. A symbolic link in its place fails (ELOOP, or ENOTDIR for a link to a
+// file) instead of being followed.
 int openChildDirectory(int parent, const std::string& name, bool create) {
     int fd = openat(parent, name.c_str(), directoryFlags);
     if (fd >= 0 || errno != ENOENT || !create)
-        return fd >= 0 ? fd : -errno;
+        return fd;
     bool created = mkdirat(parent, name.c_str(), 0755) == 0;
     if (!created && errno != EEXIST)
-        return -errno;
+        return -1;
     fd = openat(parent, name.c_str(), directoryFlags);
-    if (fd < 0)
-        return -errno;
     // Readers of the store are not root; the umask must not hide the tree from them.
-    if (created)
+    if (fd >= 0 && created)
         fchmod(fd, 0755);
     return fd;
 }
@@ -105,8 +105,18 @@ std::string STWFileSandboxMappingStore::_temporaryName() {
     return _temporaryPrefix + std::to_string(counter.fetch_add(1));
 }
 
-// Walks from the base to the item's ITEMTYPE directory. Answers the descriptor or -errno.
-int STWFileSandboxMappingStore::_openItemDirectory(const STWSandboxMappingItem& item, bool create) {
+// Walks from the base to the item's ITEMTYPE directory.
+int STWFileSandboxMappingStore::_openItemDirectory(const STWSandboxMappingItem& item, bool create,
+                                                   STWErrorRef* error) {
+    // Readers pass no error: a missing directory is their usual answer, not worth a message.
+    const char* function = __func__;
+    auto fail = [&](int e, uint64_t line) {
+        if (error)
+            *error = STWErrorCreate(STWPOSIXErrorDomain, e, function, line, nullptr, false,
+                                    "Cannot open the directory of %@ in %@: %s", item, _baseDirectory,
+                                    strerror(e));
+        return -1;
+    };
     // The base directory is ours (from the configuration), so its parents may be links;
     // only the store's own tree is walked without following them.
     if (create) {
@@ -115,34 +125,34 @@ int STWFileSandboxMappingStore::_openItemDirectory(const STWSandboxMappingItem& 
     }
     Directory parent(open(_baseDirectory.parent_path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (parent.fd() < 0)
-        return -errno;
+        return fail(errno, __LINE__);
     int current = openChildDirectory(parent.fd(), _baseDirectory.filename().string(), create);
     if (current < 0)
-        return current;
+        return fail(errno, __LINE__);
 
     const std::string components[] = {STWFormat("%u", item.uid), STWFormat("%u", item.kernelPersonaID),
                                       STWFormat("%llu", static_cast<unsigned long long>(item.itemType))};
     for (const std::string& component : components) {
         int next = openChildDirectory(current, component, create);
+        int e = errno;
         close(current);
         if (next < 0)
-            return next;
+            return fail(e, __LINE__);
         current = next;
     }
     return current;
 }
 
-STWFileSandboxMappingStore::DirectoryRef STWFileSandboxMappingStore::_itemDirectory(const STWSandboxMappingItem& item,
-                                                                                    bool create, int* error) {
+STWFileSandboxMappingStore::DirectoryRef
+STWFileSandboxMappingStore::_itemDirectory(const STWSandboxMappingItem& item, bool create,
+                                           STWErrorRef* error) {
     std::string key = directoryKey(item);
     STWLockGuard guard(_directoriesLock);
     if (auto it = _directoriesLock_directories.find(key); it != _directoriesLock_directories.end())
         return it->second;
-    int fd = _openItemDirectory(item, create);
-    if (fd < 0) {
-        *error = -fd;
+    int fd = _openItemDirectory(item, create, error);
+    if (fd < 0)
         return nullptr;
-    }
     auto directory = std::make_shared<const Directory>(fd);
     _directoriesLock_directories.emplace(std::move(key), directory);
     return directory;
@@ -156,22 +166,30 @@ void STWFileSandboxMappingStore::_forgetItemDirectory(const STWSandboxMappingIte
         _directoriesLock_directories.erase(it);
 }
 
-int STWFileSandboxMappingStore::setUserStateItem(const STWSandboxMappingItem& item,
-                                                 const std::optional<std::filesystem::path>& path) {
-    if (path && (path->empty() || path->native().find('\0') != std::string::npos))
-        return EINVAL;
-    int error = 0;
-    DirectoryRef directory = _itemDirectory(item, path.has_value(), &error);
+bool STWFileSandboxMappingStore::setUserStateItem(const STWSandboxMappingItem& item,
+                                                  const std::optional<std::filesystem::path>& path,
+                                                  STWErrorRef* error) {
+    if (path && (path->empty() || path->native().find('\0') != std::string::npos)) {
+        STWSetError(error, STW_POSIX_ERROR_NOLOG(EINVAL, "Cannot map %@ to the path %@", item, *path));
+        return false;
+    }
+    STWErrorRef directoryError;
+    DirectoryRef directory = _itemDirectory(item, path.has_value(), &directoryError);
     if (!directory) {
         // Nothing to withdraw when the directories are not there.
-        return !path && error == ENOENT ? 0 : error;
+        if (!path && directoryError->isPOSIX(ENOENT))
+            return true;
+        STWSetError(error, directoryError);
+        return false;
     }
 
     if (!path) {
         // In a directory removed since it was opened, the link is gone with it.
         if (unlinkat(directory->fd(), nameForIdentifier(item.identifier).c_str(), 0) == 0 || errno == ENOENT)
-            return 0;
-        return errno;
+            return true;
+        int e = errno;
+        STWSetError(error, STW_POSIX_ERROR_NOLOG(e, "Cannot withdraw %@: %s", item, strerror(e)));
+        return false;
     }
 
     // With no mapping there (the usual case: pushes withdraw first), the link is made under
@@ -185,30 +203,33 @@ int STWFileSandboxMappingStore::setUserStateItem(const STWSandboxMappingItem& it
             if (e == ENOENT && attempt == 0) {
                 // The kept directory has been removed: walk to the current one.
                 _forgetItemDirectory(item, directory);
-                if (!(directory = _itemDirectory(item, true, &error)))
-                    return error;
+                if (!(directory = _itemDirectory(item, true, error)))
+                    return false;
                 continue;
             }
             if (e == EEXIST && attempt < 100) {
                 name = _temporaryName();
                 continue;
             }
-            return e;
+            STWSetError(error,
+                        STW_POSIX_ERROR_NOLOG(e, "Cannot link %@ to %@: %s", item, *path, strerror(e)));
+            return false;
         }
         if (name == target)
-            return 0;
+            return true;
         if (renameat(directory->fd(), name.c_str(), directory->fd(), target.c_str()) != 0) {
             int e = errno;
             unlinkat(directory->fd(), name.c_str(), 0);
-            return e;
+            STWSetError(error,
+                        STW_POSIX_ERROR_NOLOG(e, "Cannot replace the link of %@: %s", item, strerror(e)));
+            return false;
         }
-        return 0;
+        return true;
     }
 }
 
 std::optional<std::filesystem::path> STWFileSandboxMappingStore::userStateItem(const STWSandboxMappingItem& item) {
-    int error = 0;
-    DirectoryRef directory = _itemDirectory(item, false, &error);
+    DirectoryRef directory = _itemDirectory(item, false, nullptr);
     if (!directory)
         return std::nullopt;
     char buffer[PATH_MAX];
@@ -219,8 +240,7 @@ std::optional<std::filesystem::path> STWFileSandboxMappingStore::userStateItem(c
 }
 
 bool STWFileSandboxMappingStore::userStateItemIs(const STWSandboxMappingItem& item, std::string_view path) {
-    int error = 0;
-    DirectoryRef directory = _itemDirectory(item, false, &error);
+    DirectoryRef directory = _itemDirectory(item, false, nullptr);
     if (!directory || path.size() >= PATH_MAX)
         return false;
     // One byte more than the path, so that a longer target is not taken for it.

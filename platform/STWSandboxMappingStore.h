@@ -29,10 +29,15 @@
 //
 // STWSandboxMappingStore is the interface; sharedInstance() is the Linux store of the
 // configured root prefix unless a test installed another with setSharedInstance().
+//
+// Failures are POSIX-domain errors carrying the errno of the failing call; the store does
+// not log them, its caller (the container cache) does, with the mapping it was pushing.
 #pragma once
 
-#include <cstdint>
+#include "common/STWError.h"
 #include "common/STWThreadSafety.h"
+
+#include <cstdint>
 #include <filesystem>
 #include <memory>
 #include <mutex>
@@ -61,8 +66,9 @@ public:
     static void setSharedInstance(std::shared_ptr<STWSandboxMappingStore> store);
 
     // Sets the item to `path`, or withdraws it when `path` is nullopt (withdrawing an item
-    // that is not there succeeds). Answers 0 or an errno value.
-    virtual int setUserStateItem(const STWSandboxMappingItem& item, const std::optional<std::filesystem::path>& path) = 0;
+    // that is not there succeeds).
+    virtual bool setUserStateItem(const STWSandboxMappingItem& item,
+                                  const std::optional<std::filesystem::path>& path, STWErrorRef* error) = 0;
 
     // The path the item maps to, or nullopt when there is none (or it cannot be read).
     virtual std::optional<std::filesystem::path> userStateItem(const STWSandboxMappingItem& item) = 0;
@@ -84,7 +90,8 @@ public:
 
     const std::filesystem::path& baseDirectory() const { return _baseDirectory; }
 
-    int setUserStateItem(const STWSandboxMappingItem& item, const std::optional<std::filesystem::path>& path) override;
+    bool setUserStateItem(const STWSandboxMappingItem& item, const std::optional<std::filesystem::path>& path,
+                          STWErrorRef* error) override;
     std::optional<std::filesystem::path> userStateItem(const STWSandboxMappingItem& item) override;
     bool userStateItemIs(const STWSandboxMappingItem& item, std::string_view path) override;
 
@@ -94,11 +101,11 @@ private:
 
     // The ITEMTYPE directory of the item: a kept one, or one opened (creating what is
     // missing with mode 0755 when `create`) refusing symbolic links on the way, then kept.
-    // nullptr with `*error` set to the errno value when it cannot be opened.
-    DirectoryRef _itemDirectory(const STWSandboxMappingItem& item, bool create, int* error);
+    DirectoryRef _itemDirectory(const STWSandboxMappingItem& item, bool create, STWErrorRef* error);
     // Stops keeping `directory` for the item (unless another has replaced it already).
     void _forgetItemDirectory(const STWSandboxMappingItem& item, const DirectoryRef& directory);
-    int _openItemDirectory(const STWSandboxMappingItem& item, bool create);
+    // The walk from the base: the descriptor, or -1 with `error` (when given) set.
+    int _openItemDirectory(const STWSandboxMappingItem& item, bool create, STWErrorRef* error);
     std::string _temporaryName();
 
     const std::filesystem::path _baseDirectory;

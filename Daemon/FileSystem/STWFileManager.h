@@ -8,9 +8,10 @@
 // decides whether a path a client sent really lies inside a container.
 //
 // Paths are absolute and carry no trailing separator; a "directory URL" is just the path.
-// Every failure is a POSIX-domain error whose code is the errno of the failing call, so
-// callers can hand it to clients unchanged. The manager has no state; every operation may
-// be called from any thread.
+// Every failure is a POSIX-domain error whose code is the errno of the failing call; a
+// caller tests it with isPOSIX() and answers a client with its own code, keeping the error
+// as the underlying one. The manager has no state; every operation may be called from any
+// thread.
 //
 // Symbolic links: removal, copy, the tree walks and the protection-class operations never
 // follow a link found inside the tree they work on. A path that a client sent is checked

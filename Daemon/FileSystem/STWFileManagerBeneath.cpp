@@ -162,9 +162,14 @@ STWFileDescriptor STWFileManager::openDirectoryAtURL(const fs::path& url, const 
     STWErrorRef openError;
     STWFileDescriptor fd =
         openBeneath(ancestor.get(), relative.native(), O_RDONLY | O_DIRECTORY, 0, STWOpenBeneathNoSymlinks, &openError);
-    if (!fd)
-        STWSetError(error, STW_POSIX_ERROR(openError ? static_cast<int>(openError->code()) : EIO,
-                                           "opendir of %@ failed: %@", url, openError));
+    if (!fd) {
+        // openBeneath() fails with an errno; an error of any other domain would go on as it
+        // is rather than have its code taken for one.
+        int e = openError->posixCode();
+        STWSetError(error, e ? STWErrorCreate(STWPOSIXErrorDomain, e, __func__, __LINE__, openError, true,
+                                              "opendir of %@ failed: %s", url, strerror(e))
+                             : openError);
+    }
     return fd;
 }
 

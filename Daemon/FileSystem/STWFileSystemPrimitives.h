@@ -3,6 +3,11 @@
 // the user-immutable inode flag, owner and class of a directory through its descriptor,
 // trace intervals, and the system calls that change the disk, each behind its fault-injection
 // point. Internal to the file layer; everyone else goes through STWFileManager.
+//
+// The helpers answer 0 or the errno value (setOwnerAndClassOfDirectory, which serves the
+// public operations directly, an error object); the disk:: calls below stand in for the
+// system calls and answer exactly as they do. STWFileManager turns either into a
+// POSIX-domain error carrying the errno.
 #pragma once
 
 #include "Daemon/FileSystem/STWFaultInjection.h"

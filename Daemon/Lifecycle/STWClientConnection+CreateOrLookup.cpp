@@ -300,11 +300,13 @@ bool STWClientConnection::_createSubDirectories(int containerfd, const std::file
                   : STWContainerClassIsSystem(c) ? static_cast<uid_t>(-2)
                                                  : metadata.userIdentity()->posixUIDForContainerClass(c);
     int32_t protectionClass = _dataProtectionClassForContainerMetadata(metadata);
-    uint64_t listError = STWErrorSuccess;
+    STWErrorRef listError;
     auto paths = STWContainerLibrary::subdirectoriesForContainerClass(c, &listError);
     if (!paths) {
-        STWSetError(error, STW_ERROR(listError, nullptr, "Failed to get subdirectory names for %llu : %llu", c,
-                                     listError));
+        // The library's one failure is a class it has no list for.
+        uint64_t code = STWErrorUnexpectedClass;
+        STWSetError(error,
+                    STW_ERROR(code, listError, "Failed to get subdirectory names for %llu : %llu", c, code));
         return false;
     }
     STW_LOG_DEBUG(STWLogCategory::Lifecycle, "Creating subdirectories for [%llu:%@] at [%@]", c, metadata.identifier(),

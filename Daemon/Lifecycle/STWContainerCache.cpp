@@ -621,19 +621,21 @@ bool STWContainerCache::_setSandboxContainerMappingForUserIdentity(const STWUser
     // instead of a removal and a new link.
     if (keepIfCurrent && url && store->userStateItemIs(item, url->native()))
         return true;
-    if (int e = store->setUserStateItem(item, std::nullopt)) {
+    // The store leaves its errors to be logged here, after the line that names the mapping.
+    STWErrorRef storeError;
+    if (!store->setUserStateItem(item, std::nullopt, &storeError)) {
         STW_LOG_ERROR(STWLogCategory::Sandbox,
                       "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, class: %llu, path: %s : %d",
-                      item.uid, item.itemType, identifier, containerClass, path, e);
+                      item.uid, item.itemType, identifier, containerClass, path, storeError->posixCode());
+        STW_LOG_ERROR(STWLogCategory::Sandbox, "%@", storeError);
         return false;
     }
-    if (url) {
-        if (int e = store->setUserStateItem(item, *url)) {
-            STW_LOG_ERROR(STWLogCategory::Sandbox,
-                          "Failed to set mapping for user: %u, itemType: %llu, identifier %s, class: %llu, path: %s : %d",
-                          item.uid, item.itemType, identifier, containerClass, path, e);
-            return false;
-        }
+    if (url && !store->setUserStateItem(item, *url, &storeError)) {
+        STW_LOG_ERROR(STWLogCategory::Sandbox,
+                      "Failed to set mapping for user: %u, itemType: %llu, identifier %s, class: %llu, path: %s : %d",
+                      item.uid, item.itemType, identifier, containerClass, path, storeError->posixCode());
+        STW_LOG_ERROR(STWLogCategory::Sandbox, "%@", storeError);
+        return false;
     }
     // Debug, not notice: a rebuild pushes one mapping per container.
     STW_LOG_DEBUG(STWLogCategory::Sandbox,

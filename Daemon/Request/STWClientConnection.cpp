@@ -91,8 +91,12 @@ void STWClientConnection::setEntitledWipeIdentifiers(std::optional<STWValue::Arr
 }
 
 uint64_t STWClientConnection::_codeOfError(const STWErrorRef& error) {
-    return error && error->domain() == STWErrorDomain ? static_cast<uint64_t>(error->code())
-                                                      : uint64_t{STWErrorItemOperationFailed};
+    if (error && error->domain() == STWErrorDomain)
+        return static_cast<uint64_t>(error->code());
+    // Operations wrap the errors of other domains in their own code before they get here;
+    // one that did not still reaches the log whole, under the code it is answered with.
+    STW_ERROR(STWErrorItemOperationFailed, error, "Failed to operate on an item");
+    return STWErrorItemOperationFailed;
 }
 
 void STWClientConnection::_reportException(const char* function) {

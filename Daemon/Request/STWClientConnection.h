@@ -153,7 +153,7 @@ private:
     // mapping is not part of this build: nothing to drop yet.
     static bool _invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
                                                                       STWErrorRef* error);
-    // The code of an error for a client: its own in the daemon's domain, else 34.
+    // The code of an error for a client: its own in the daemon's domain, else 41 (logged).
     static uint64_t _codeOfError(const STWErrorRef& error);
     static void _reportException(const char* function);
     // Runs `body`, turning an exception into code 40 (an internal image stops instead, so

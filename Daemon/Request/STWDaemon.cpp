@@ -216,8 +216,9 @@ int STWDaemon::main(int argc, char** argv) {
     std::filesystem::create_directories(configuration->runtimeDirectory(), ec);
     chmod(configuration->runtimeDirectory().c_str(), 0755);
     // A fresh key per start: tokens of an earlier run stop verifying.
-    if (int e = STWSandboxExtension::createKey(STWSandboxExtension::keyFile()))
-        STW_LOG_ERROR(STWLogCategory::Sandbox, "Cannot create the sandbox extension key: %s", strerror(e));
+    STWErrorRef keyError;
+    if (!STWSandboxExtension::createKey(STWSandboxExtension::keyFile(), &keyError))
+        STW_LOG_ERROR(STWLogCategory::Sandbox, "Cannot create the sandbox extension key: %@", keyError);
     if (configuration->isDeveloperMode())
         STW_LOG_FAULT(STWLogCategory::Startup,
                       "Developer mode is on: clients may declare any identity (root prefix %@)",

@@ -6,9 +6,6 @@
 #include "platform/STWPlatformConfiguration.h"
 #include "platform/STWSandboxExtension.h"
 
-#include <cerrno>
-#include <cstring>
-
 namespace {
 
 STWUserIdentityRef callerUserIdentity(const STWClientConnection& connection) {
@@ -167,10 +164,12 @@ void STWRequestDecoder::issueSandboxExtension(STWValue::Dictionary& into, const 
     STW_LOG_DEFAULT(STWLogCategory::Sandbox,
                     "%@ is sandboxed and container (type: %llu) is enterprise: %d. Issuing token for path: %s", client,
                     containerClass, enterprise ? 1 : 0, path);
-    auto token = STWSandboxExtension::issueFileExtension(extensionClass, path, client->auditToken());
+    STWErrorRef tokenError;
+    auto token =
+        STWSandboxExtension::issueFileExtension(extensionClass, path, client->auditToken(), &tokenError);
     if (!token) {
-        STW_LOG_ERROR(STWLogCategory::Sandbox, "Failed to issue sandbox extension for %@ at %s: %s", client, path,
-                      strerror(errno));
+        STW_LOG_ERROR(STWLogCategory::Sandbox, "Failed to issue sandbox extension for %@ at %s: %@", client,
+                      path, tokenError);
         return;
     }
     into[key] = STWValue(*token);

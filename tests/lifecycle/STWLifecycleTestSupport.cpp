@@ -58,8 +58,9 @@ STWTestContainer STWMakeTestContainer(const STWUserIdentityRef& userIdentity, co
     return {url, metadata};
 }
 
-int STWRecordingSandboxMappingStore::setUserStateItem(const STWSandboxMappingItem& item,
-                                                      const std::optional<std::filesystem::path>& path) {
+bool STWRecordingSandboxMappingStore::setUserStateItem(const STWSandboxMappingItem& item,
+                                                       const std::optional<std::filesystem::path>& path,
+                                                       STWErrorRef*) {
     if (throwOnSet)
         throw std::runtime_error("sandbox state store went away");
     std::lock_guard guard(_mutex);
@@ -69,7 +70,7 @@ int STWRecordingSandboxMappingStore::setUserStateItem(const STWSandboxMappingIte
     } else {
         _mappings.erase(itemKey(item));
     }
-    return 0;
+    return true;
 }
 
 std::optional<std::filesystem::path> STWRecordingSandboxMappingStore::userStateItem(const STWSandboxMappingItem& item) {

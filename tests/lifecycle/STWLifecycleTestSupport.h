@@ -33,7 +33,8 @@ STWTestContainer STWMakeTestContainer(const STWUserIdentityRef& userIdentity, co
 
 class STWRecordingSandboxMappingStore : public STWSandboxMappingStore {
 public:
-    int setUserStateItem(const STWSandboxMappingItem& item, const std::optional<std::filesystem::path>& path) override;
+    bool setUserStateItem(const STWSandboxMappingItem& item, const std::optional<std::filesystem::path>& path,
+                          STWErrorRef* error) override;
     std::optional<std::filesystem::path> userStateItem(const STWSandboxMappingItem& item) override;
 
     // "UID/PERSONA/ITEMTYPE/IDENTIFIER" -> path, as the file store would lay it out.

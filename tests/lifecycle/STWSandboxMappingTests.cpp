@@ -5,6 +5,7 @@
 
 #include <gtest/gtest.h>
 
+#include <cerrno>
 #include <fstream>
 #include <set>
 #include <thread>
@@ -86,7 +87,7 @@ TEST_F(STWSandboxMappingTest, MappingsArePushedOnAddAndWithdrawnOnRemove) {
     EXPECT_TRUE(remove(data) && remove(group) && remove(system));
     EXPECT_TRUE(links().empty());
     // Withdrawing what is not there is no failure.
-    EXPECT_EQ(store->setUserStateItem({501, 1000, 1, "com.never.pushed"}, std::nullopt), 0);
+    EXPECT_TRUE(store->setUserStateItem({501, 1000, 1, "com.never.pushed"}, std::nullopt, nullptr));
 
     // No mapping for: a bundle, a transient container, an enterprise identity's container of
     // a bundle it shares with the personal persona, a personal container of an
@@ -116,7 +117,7 @@ TEST_F(STWSandboxMappingTest, IdentifiersThatAreNoFileNameAreStoredEscapedAndNev
     std::set<std::string> names;
     for (const std::string& identifier : hostile) {
         STWSandboxMappingItem item{501, 1000, 1, identifier};
-        ASSERT_EQ(store->setUserStateItem(item, container.url), 0) << identifier;
+        ASSERT_TRUE(store->setUserStateItem(item, container.url, nullptr)) << identifier;
         EXPECT_EQ(store->userStateItem(item), container.url);
         std::string name = STWSandboxMappingStore::nameForIdentifier(identifier);
         EXPECT_EQ(name.size(), 65u);
@@ -128,7 +129,7 @@ TEST_F(STWSandboxMappingTest, IdentifiersThatAreNoFileNameAreStoredEscapedAndNev
     // Plain names, odd as they may be, are stored as they are.
     for (const char* odd : {"a..b", "with space", "caf\xc3\xa9", "-", "a%b"}) {
         STWSandboxMappingItem item{501, 1000, 1, odd};
-        ASSERT_EQ(store->setUserStateItem(item, container.url), 0) << odd;
+        ASSERT_TRUE(store->setUserStateItem(item, container.url, nullptr)) << odd;
         EXPECT_EQ(fs::read_symlink(directory / odd), container.url);
     }
     // Its mapping lives inside the store too.
@@ -146,8 +147,13 @@ TEST_F(STWSandboxMappingTest, LinksPlantedInTheStoreAreNeverFollowed) {
     fs::create_directory_symlink(outside, base / "501/1000");
 
     STWSandboxMappingItem item{501, 1000, 1, "com.example.app"};
-    EXPECT_NE(store->setUserStateItem(item, fs::path("/somewhere")), 0);
-    EXPECT_NE(store->setUserStateItem(item, std::nullopt), 0);
+    for (const std::optional<fs::path>& path :
+         {std::optional<fs::path>("/somewhere"), std::optional<fs::path>()}) {
+        STWErrorRef error;
+        EXPECT_FALSE(store->setUserStateItem(item, path, &error));
+        ASSERT_TRUE(error);
+        EXPECT_TRUE(error->isPOSIX(ELOOP) || error->isPOSIX(ENOTDIR)) << error->description();
+    }
     auto container = STWMakeTestContainer(mobile, "com.example.app", 2);
     ASSERT_TRUE(add(container)); // the failed push is logged, not returned
     EXPECT_TRUE(remove(container));
@@ -169,7 +175,7 @@ TEST_F(STWSandboxMappingTest, ReplacingAMappingNeverLeavesItMissing) {
     STWSandboxMappingItem item{501, 1000, 1, "com.example.app"};
     const fs::path paths[] = {"/private/var/mobile/Containers/Data/Application/A",
                               "/private/var/mobile/Containers/Data/Application/B"};
-    ASSERT_EQ(store->setUserStateItem(item, paths[0]), 0);
+    ASSERT_TRUE(store->setUserStateItem(item, paths[0], nullptr));
     std::atomic<bool> done{false};
     std::atomic<int> missing{0}, seen{0};
     std::thread reader([&] {
@@ -182,10 +188,10 @@ TEST_F(STWSandboxMappingTest, ReplacingAMappingNeverLeavesItMissing) {
     });
     std::thread second([&] {
         for (int i = 0; i < 500; ++i)
-            EXPECT_EQ(store->setUserStateItem(item, paths[i % 2]), 0);
+            EXPECT_TRUE(store->setUserStateItem(item, paths[i % 2], nullptr));
     });
     for (int i = 0; i < 500; ++i)
-        EXPECT_EQ(store->setUserStateItem(item, paths[(i + 1) % 2]), 0);
+        EXPECT_TRUE(store->setUserStateItem(item, paths[(i + 1) % 2], nullptr));
     second.join();
     done = true;
     reader.join();
@@ -198,15 +204,15 @@ TEST_F(STWSandboxMappingTest, ReplacingAMappingNeverLeavesItMissing) {
 TEST_F(STWSandboxMappingTest, AStoreClearedBehindItsBackIsBuiltAgain) {
     STWSandboxMappingItem item{501, 1000, 1, "com.example.app"};
     const fs::path container("/private/var/mobile/Containers/Data/Application/A");
-    ASSERT_EQ(store->setUserStateItem(item, container), 0);
+    ASSERT_TRUE(store->setUserStateItem(item, container, nullptr));
     // Whoever clears the runtime directory takes the directories the store keeps open.
     fs::remove_all(base);
     EXPECT_EQ(store->userStateItem(item), std::nullopt);
-    EXPECT_EQ(store->setUserStateItem(item, std::nullopt), 0);
-    ASSERT_EQ(store->setUserStateItem(item, container), 0);
+    EXPECT_TRUE(store->setUserStateItem(item, std::nullopt, nullptr));
+    ASSERT_TRUE(store->setUserStateItem(item, container, nullptr));
     EXPECT_EQ(fs::read_symlink(base / "501/1000/1/com.example.app"), container);
     EXPECT_EQ(store->userStateItem(item), container);
-    EXPECT_EQ(store->setUserStateItem(item, std::nullopt), 0);
+    EXPECT_TRUE(store->setUserStateItem(item, std::nullopt, nullptr));
     EXPECT_FALSE(fs::exists(fs::symlink_status(base / "501/1000/1/com.example.app")));
 }
 
