@@ -189,6 +189,16 @@ STWClientRegistryEntryRef STWClientRegistry::entryForExecutable(const std::files
     return entry;
 }
 
+std::vector<std::filesystem::path>
+STWClientRegistry::executablesForCodeSigningIdentifier(std::string_view identifier) {
+    std::vector<std::filesystem::path> executables;
+    STWSharedLockGuard guard(_lock);
+    for (const auto& [executable, entry] : _lock_entriesByExecutable)
+        if (entry->codeSigningIdentifier == identifier)
+            executables.push_back(executable);
+    return executables;
+}
+
 std::optional<std::string> STWClientRegistry::_digestOfExecutable(int fd, STWErrorRef* error) {
     struct stat st;
     if (fstat(fd, &st) != 0) {

@@ -20,8 +20,10 @@
 #include <optional>
 #include <shared_mutex>
 #include <string>
+#include <string_view>
 #include <sys/types.h>
 #include <tuple>
+#include <vector>
 
 class STWPeerConnection;
 
@@ -55,6 +57,9 @@ public:
     // The entry for an executable opened as `executableFD`, whose path is `path`.
     STWClientRegistryEntryRef entryForExecutable(const std::filesystem::path& path, int executableFD,
                                                  STWErrorRef* error);
+    // The executables registered under a code-signing identifier (an application's bundle
+    // identifier); several programs may share one. Empty when none is.
+    std::vector<std::filesystem::path> executablesForCodeSigningIdentifier(std::string_view identifier);
 
     // Rereads the directory. Bad files are logged and skipped.
     void reload();
