@@ -9,9 +9,6 @@
 
 #include <gtest/gtest.h>
 
-#include <csignal>
-#include <cstdlib>
-#include <sys/wait.h>
 
 namespace fs = std::filesystem;
 
@@ -44,15 +41,11 @@ TEST(STWCreationCrash, EveryCrashPointLeavesTheContainerWholeOrAbsent) {
     for (std::string_view point : STWCrashPoint::creation) {
         SCOPED_TRACE(std::string(point));
         STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}}, {}, false);
-        setenv("STOWLY_CRASH_AT", std::string(point).c_str(), 1);
-        bool started = daemon.start();
-        unsetenv("STOWLY_CRASH_AT");
-        ASSERT_TRUE(started);
+        ASSERT_TRUE(daemon.startWith("STOWLY_CRASH_AT", std::string(point)));
         auto client = daemon.connectAs("com.example.installer", allowed);
         ASSERT_NE(client, nullptr);
         EXPECT_TRUE(STWDaemonProcess::send(*client, 0, keys(true)).empty()) << "no reply from a daemon that died";
-        auto status = daemon.waitForExit(STWDaemonProcess::timeout);
-        ASSERT_TRUE(status && WIFSIGNALED(*status) && WTERMSIG(*status) == SIGKILL);
+        ASSERT_TRUE(daemon.killedItself());
 
         ASSERT_TRUE(daemon.start());
         client = daemon.connectAs("com.example.installer", allowed);
@@ -93,10 +86,7 @@ TEST(STWCreationCrash, AFailedCallAtAnyStepLeavesNothingBehind) {
             SCOPED_TRACE(std::string(point) + ":" + std::to_string(call));
             ASSERT_LT(call, 40u) << "the creation never got past the point";
             std::string identifier = STWFormat("com.example.%s.%u", point, call);
-            setenv("STOWLY_FAULT", STWFormat("%s:%u:28", point, call).c_str(), 1);
-            bool started = daemon.start();
-            unsetenv("STOWLY_FAULT");
-            ASSERT_TRUE(started);
+            ASSERT_TRUE(daemon.startWith("STOWLY_FAULT", STWFormat("%s:%u:28", point, call)));
             auto client = daemon.connectAs("com.example.installer", allowed);
             ASSERT_NE(client, nullptr);
             size_t before = visible(containers / "Data/Application");

@@ -9,10 +9,7 @@
 
 #include <gtest/gtest.h>
 
-#include <csignal>
-#include <cstdlib>
 #include <fstream>
-#include <sys/wait.h>
 
 namespace fs = std::filesystem;
 
@@ -253,10 +250,7 @@ TEST(STWLifecycleCrash, EveryCrashPointLeavesOneWholeContainerOrNone) {
         SCOPED_TRACE(std::string(point));
         STWDaemonProcess daemon(internal, {}, false);
         Layout layout{daemon.root()};
-        setenv("STOWLY_CRASH_AT", std::string(point).c_str(), 1);
-        bool started = daemon.start();
-        unsetenv("STOWLY_CRASH_AT");
-        ASSERT_TRUE(started);
+        ASSERT_TRUE(daemon.startWith("STOWLY_CRASH_AT", std::string(point)));
         auto client = daemon.connectAs("com.example.installer", allowed);
         ASSERT_NE(client, nullptr);
         auto live = STWDaemonProcess::send(*client, 0, keys("com.example.k"));
@@ -274,8 +268,7 @@ TEST(STWLifecycleCrash, EveryCrashPointLeavesOneWholeContainerOrNone) {
                 STWDaemonProcess::send(*client, 4, {});
             }
         }
-        auto status = daemon.waitForExit(STWDaemonProcess::timeout);
-        ASSERT_TRUE(status && WIFSIGNALED(*status) && WTERMSIG(*status) == SIGKILL);
+        ASSERT_TRUE(daemon.killedItself());
 
         ASSERT_TRUE(daemon.start());
         client = daemon.connectAs("com.example.installer", allowed);

@@ -81,6 +81,18 @@ STWDaemonProcess::~STWDaemonProcess() {
     STWFileManager::defaultManager()->removeItemAtURL(_root);
 }
 
+bool STWDaemonProcess::startWith(const char* variable, const std::string& value) {
+    setenv(variable, value.c_str(), 1);
+    bool started = start();
+    unsetenv(variable);
+    return started;
+}
+
+bool STWDaemonProcess::killedItself() {
+    std::optional<int> status = waitForExit(timeout);
+    return status && WIFSIGNALED(*status) && WTERMSIG(*status) == SIGKILL;
+}
+
 bool STWDaemonProcess::start() {
     if (_pid > 0 && isRunning())
         return true;

@@ -40,6 +40,12 @@ public:
     // SIGTERM, then waits for the exit; true when the daemon exited with status 0 within
     // stopTimeout. One that did not is killed (and counts as a failure).
     bool stop();
+    // start() with one variable set in the daemon's environment only (STOWLY_CRASH_AT or
+    // STOWLY_FAULT, which a daemon whose configuration says InternalImage honours).
+    bool startWith(const char* variable, const std::string& value);
+    // Waits for a daemon armed at a crash point to kill itself there: true when it died of
+    // SIGKILL within the time-out.
+    bool killedItself();
     // Waits for a daemon that is to end by itself (at a crash point, say) and answers its
     // wait status, or nullopt when it still runs after `timeout`; no failure is reported.
     std::optional<int> waitForExit(std::chrono::milliseconds timeout);
