@@ -44,9 +44,12 @@ enum STWFileManagerMoveOptions : unsigned {
     // fsynced after it (after a copy, for a move across file systems). Use it for every
     // move that makes something visible that must not be lost or half there: a staged
     // container renamed into its class directory, a replaced container moved into place, a
-    // metadata file or a journal renamed over its target. Moves into death row or into a
-    // staging area need no durability and should not pay for it.
+    // metadata file or a journal renamed over its target.
     STWFileManagerMoveDurable = 1u << 0,
+    // Only the two directories are fsynced after the rename: the rename itself survives a
+    // power cut, what was moved need not (a container parked or sent to death row, a
+    // journal sent away once the renames it guards are on disk). moveDirectoryAt() only.
+    STWFileManagerMoveSyncDirectories = 1u << 1,
 };
 
 enum STWOpenBeneathOptions : unsigned {

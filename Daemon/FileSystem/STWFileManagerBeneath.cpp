@@ -246,7 +246,7 @@ bool STWFileManager::moveDirectoryAt(int fromfd, const std::string& name, int to
                                            strerror(ESTALE)));
         return false;
     }
-    if (!durable)
+    if (!durable && !(options & STWFileManagerMoveSyncDirectories))
         return true;
     e = syncDescriptor(tofd, parentPath(to));
     if (!e && parentPath(to) != parentPath(from))

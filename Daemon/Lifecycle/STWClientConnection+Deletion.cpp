@@ -33,7 +33,8 @@ bool STWClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& 
         STW_CRASH_POINT(STWCrashPoint::deathRowAfterTemporaryDirectory);
         std::filesystem::path destination = *unique / url.filename();
         // The item may sit in a directory an app owns: nothing on the way is followed.
-        if (fileManager->moveItemAtURLWithoutForeignLinks(url, destination, STWFileManagerMoveDefault, &stepError))
+        if (fileManager->moveItemAtURLWithoutForeignLinks(url, destination, STWFileManagerMoveSyncDirectories,
+                                                        &stepError))
             break;
         bool missing = stepError && stepError->isPOSIX(ENOENT);
         if (missing && fileManager->itemDoesNotExistAtURL(url))
@@ -55,9 +56,12 @@ bool STWClientConnection::_removeItemOrMoveToTempAtURL(const std::filesystem::pa
     if (fileManager->removeItemAtURL(url, &removeError) || (removeError && removeError->isPOSIX(ENOENT)))
         return true;
     STW_LOG_DEBUG(STWLogCategory::Lifecycle, "Couldn't remove, so moving item to /tmp: %@ : %@", url, removeError);
-    std::filesystem::path destination =
-        STWPlatformConfiguration::sharedInstance()->resolve("/tmp") / url.filename();
+    std::filesystem::path temporary = STWPlatformConfiguration::sharedInstance()->resolve("/tmp");
+    std::filesystem::path destination = temporary / url.filename();
     STWErrorRef moveError;
+    // A private root prefix may have no temporary directory yet.
+    if (fileManager->itemDoesNotExistAtURL(temporary))
+        fileManager->createDirectoryAtURL(temporary, true, 01777, &moveError);
     if (!fileManager->moveItemAtURL(url, destination, &moveError)) {
         STWSetError(error, STW_ERROR(STWErrorMoveDirectoryFailed, moveError, "Failed to move dir: %@ to: %@", url,
                                      destination));

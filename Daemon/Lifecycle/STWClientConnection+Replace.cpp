@@ -151,7 +151,7 @@ bool STWClientConnection::replaceContainerIdentity(const STWConcreteContainerIde
                 return fail(_codeOfError(stepError));
             }
             STW_CRASH_POINT(STWCrashPoint::replaceAfterJournal);
-            if (!moveContainerDirectory(*oldRecord, staging, STWFileManagerMoveDefault, &stepError)) {
+            if (!moveContainerDirectory(*oldRecord, staging, STWFileManagerMoveSyncDirectories, &stepError)) {
                 STW_ERROR(STWErrorMoveToStagingFailed, stepError, "Failed to move old %@ to staging %@",
                           oldRecord->url(), staging);
                 return fail(STWErrorMoveToStagingFailed);

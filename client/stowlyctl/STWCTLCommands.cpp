@@ -124,7 +124,7 @@ void STWCTLCommands::_addContainerCommands(CLI::App& app) {
 }
 
 // Containers leaving and changing places: delete, stage-delete, wipe, replace and
-// empty-death-row.
+// empty-deathrow.
 void STWCTLCommands::_addDeletionCommands(CLI::App& app) {
     struct Arguments {
         std::string identifier;
@@ -204,7 +204,7 @@ void STWCTLCommands::_addDeletionCommands(CLI::App& app) {
         return session.send(m);
     });
 
-    CLI::App* empty = app.add_subcommand("empty-death-row", "Remove everything in death row (waits for it)");
+    CLI::App* empty = app.add_subcommand("empty-deathrow", "Remove everything in death row (waits for it)");
     _onRun(empty, [](STWCTLSession& session) { return session.send({{"Command", STWValue(4)}}); });
 }
 

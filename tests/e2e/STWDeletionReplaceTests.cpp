@@ -232,6 +232,8 @@ TEST(STWReplaceRecovery, TheNextStartFollowsTheJournal) {
     journal("B.plist", 2, true);
     write(layout.journals() / "C.plist", "not a property list");
     ASSERT_TRUE(daemon.start());
+    // Requests are served once start-up, recovery included, is done.
+    EXPECT_EQ(STWDaemonProcess::replyError(*daemon.connect(), 27), STWErrorNotEntitled);
     EXPECT_TRUE(fs::is_directory(area / "old1/x"));
     EXPECT_FALSE(fs::exists(area / "parked1"));
     EXPECT_TRUE(fs::is_directory(area / "parked2/x"));

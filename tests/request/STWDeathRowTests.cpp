@@ -1,0 +1,76 @@
+#include "Daemon/FileSystem/STWFaultInjection.h"
+#include "Daemon/Lifecycle/STWCommandStageForDelete.h"
+#include "Daemon/Lifecycle/STWDaemonQueues.h"
+#include "Daemon/Model/STWGlobalConfiguration.h"
+#include "Daemon/Model/STWUserIdentityCache.h"
+#include "Daemon/Request/STWClientConnection.h"
+#include "platform/STWPlatformConfiguration.h"
+#include "tests/support/STWTestRoot.h"
+
+#include <gtest/gtest.h>
+
+#include <fstream>
+#include <future>
+
+namespace fs = std::filesystem;
+
+namespace {
+
+class STWDeathRow : public ::testing::Test {
+protected:
+    uint64_t pass() {
+        std::promise<uint64_t> done;
+        STWClientConnection::deleteContainersOnDeathRowWithCompletion([&](uint64_t code) { done.set_value(code); });
+        return done.get_future().get();
+    }
+    STWContainerIdentityRef identity(const std::string& identifier) {
+        return STWContainerIdentity::containerIdentityWithUserIdentity(user, identifier, 2, nullptr);
+    }
+
+    STWTestRoot& root = STWTestRoot::shared();
+    STWClientConnection connection;
+    STWUserIdentityRef user = STWUserIdentityCache::defaultUserIdentity();
+    fs::path deathRow = STWGlobalConfiguration::sharedInstance()->deathrowDirectory();
+};
+
+} // namespace
+
+// A stage-for-delete that cannot find its first container still stages the second, tells
+// onError the look-up's code and answers success, so the queue goes on.
+TEST_F(STWDeathRow, StagingGoesOnPastAContainerItCannotFind) {
+    uint64_t code = STWErrorSuccess;
+    auto made = connection.createOrLookupContainerWithContainerIdentity(identity("com.example.staged"), true, false,
+                                                                        true, &code);
+    ASSERT_TRUE(made);
+    std::vector<uint64_t> reported;
+    auto queue = STWCommandQueue::init();
+    queue->insertCommand(STWCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+        {identity("com.example.unknown"), identity("com.example.staged")}, true,
+        [&](uint64_t error) { reported.push_back(error); }));
+    EXPECT_TRUE(queue->executeAllUntilExhaustedOrError(&code));
+    EXPECT_EQ(reported, std::vector<uint64_t>{STWErrorNotFound});
+    EXPECT_FALSE(fs::exists(made->url()));
+    EXPECT_TRUE(fs::is_directory(deathRow / made->url().filename()));
+    EXPECT_EQ(pass(), STWErrorSuccess);
+}
+
+// Nothing to move is moved (and starts no pass); what a pass cannot remove is moved aside
+// to the temporary directory, and the pass still completes.
+TEST_F(STWDeathRow, WhatIsNotThereOrWillNotGoDoesNotStopDeathRow) {
+    fs::create_directories(deathRow / "kept");
+    STWErrorRef error;
+    EXPECT_TRUE(connection._moveItemAtURLToDeathRow(root.resolve("/private/var/missing"), true, true, &error));
+    STWDaemonQueues::deathRow()->sync([] {});
+    EXPECT_TRUE(fs::exists(deathRow / "kept")) << "no pass was started";
+    EXPECT_EQ(pass(), STWErrorSuccess);
+
+    fs::create_directories(deathRow / "kept");
+    std::ofstream(deathRow / "kept/file") << "x";
+    ASSERT_TRUE(STWFaultInjection::arm("unlinkat", 1, EIO));
+    EXPECT_EQ(pass(), STWErrorSuccess);
+    STWFaultInjection::disarm();
+    fs::path aside = STWPlatformConfiguration::sharedInstance()->resolve("/tmp") / "kept";
+    EXPECT_TRUE(fs::exists(aside / "file"));
+    EXPECT_FALSE(fs::exists(deathRow / "kept"));
+    fs::remove_all(aside);
+}
