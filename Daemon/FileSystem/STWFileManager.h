@@ -43,13 +43,16 @@ enum STWFileManagerMoveOptions : unsigned {
     // moved is fsynced before the rename, and the directories that the rename changed are
     // fsynced after it (after a copy, for a move across file systems). Use it for every
     // move that makes something visible that must not be lost or half there: a staged
-    // container renamed into its class directory, a replaced container moved into place, a
-    // metadata file or a journal renamed over its target.
+    // container renamed into its class directory, a metadata file or a journal renamed over
+    // its target.
     STWFileManagerMoveDurable = 1u << 0,
     // Only the two directories are fsynced after the rename: the rename itself survives a
-    // power cut, what was moved need not (a container parked or sent to death row, a
-    // journal sent away once the renames it guards are on disk). moveDirectoryAt() only.
+    // power cut (a container parked, replaced or put back; its content was made durable
+    // when it was made). moveDirectoryAt() only.
     STWFileManagerMoveSyncDirectories = 1u << 1,
+    // Only the directory the item left is fsynced: its leaving survives a power cut, where
+    // it went does not matter (a move into death row). moveDirectoryAt() only.
+    STWFileManagerMoveSyncSourceDirectory = 1u << 2,
 };
 
 enum STWOpenBeneathOptions : unsigned {

@@ -246,10 +246,12 @@ bool STWFileManager::moveDirectoryAt(int fromfd, const std::string& name, int to
                                            strerror(ESTALE)));
         return false;
     }
-    if (!durable && !(options & STWFileManagerMoveSyncDirectories))
+    bool syncSource = durable || (options & (STWFileManagerMoveSyncDirectories | STWFileManagerMoveSyncSourceDirectory));
+    bool syncDestination = durable || (options & STWFileManagerMoveSyncDirectories);
+    if (!syncSource)
         return true;
-    e = syncDescriptor(tofd, parentPath(to));
-    if (!e && parentPath(to) != parentPath(from))
+    e = syncDestination ? syncDescriptor(tofd, parentPath(to)) : 0;
+    if (!e && (!syncDestination || parentPath(to) != parentPath(from)))
         e = syncDescriptor(fromfd, parentPath(from));
     if (e) {
         // Not durable, so not done: the directory goes back, and the caller, told that the

@@ -32,8 +32,9 @@ bool STWClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& 
         }
         STW_CRASH_POINT(STWCrashPoint::deathRowAfterTemporaryDirectory);
         std::filesystem::path destination = *unique / url.filename();
-        // The item may sit in a directory an app owns: nothing on the way is followed.
-        if (fileManager->moveItemAtURLWithoutForeignLinks(url, destination, STWFileManagerMoveSyncDirectories,
+        // The item may sit in a directory an app owns: nothing on the way is followed. Once
+        // moved, it is gone from where it was even after a power cut.
+        if (fileManager->moveItemAtURLWithoutForeignLinks(url, destination, STWFileManagerMoveSyncSourceDirectory,
                                                         &stepError))
             break;
         bool missing = stepError && stepError->isPOSIX(ENOENT);

@@ -182,7 +182,8 @@ bool STWClientConnection::replaceContainerIdentity(const STWConcreteContainerIde
             STWFileDescriptor directory = newRecord->openContainerDirectory(&stepError);
             moved = directory && replacement->writeMetadataToContainerDirectory(directory.get(), &stepError);
         }
-        if (!moved || !moveContainerDirectory(*replacement, destination, STWFileManagerMoveDurable, &stepError)) {
+        if (!moved ||
+            !moveContainerDirectory(*replacement, destination, STWFileManagerMoveSyncDirectories, &stepError)) {
             STW_ERROR(STWErrorReplaceFailed, stepError, "Failed to replace: %@ with: %@ at: %@",
                       oldRecord ? STWFormatArg(oldRecord->url()) : STWFormatArg(nullptr), newRecord->url(),
                       destination);
@@ -217,7 +218,7 @@ bool STWClientConnection::replaceContainerIdentity(const STWConcreteContainerIde
             STW_LOG_DEBUG(STWLogCategory::Lifecycle, "Recovering from exception by moving: %@ to %@", staging,
                           oldRecord->url());
             STWErrorRef moveError;
-            if (!fileManager->moveItemAtURLWithoutForeignLinks(staging, oldRecord->url(), STWFileManagerMoveDurable,
+            if (!fileManager->moveItemAtURLWithoutForeignLinks(staging, oldRecord->url(), STWFileManagerMoveSyncDirectories,
                                                                &moveError)) {
                 // The journal stays for the next start, which tries again.
                 STW_ERROR(STWErrorBadReplaceFile, moveError, "Failed to recover replace move: %@ to %@", staging,
@@ -323,7 +324,7 @@ bool STWClientConnection::_recoverFromReplaceOperationsWithError(STWErrorRef* er
                               info->stagingURL, info->oldURL);
                 STWErrorRef moveError;
                 if (!fileManager->moveItemAtURLWithoutForeignLinks(info->stagingURL, info->oldURL,
-                                                                   STWFileManagerMoveDurable, &moveError)) {
+                                                                   STWFileManagerMoveSyncDirectories, &moveError)) {
                     STWSetError(error, STW_ERROR(STWErrorBadReplaceFile, moveError,
                                                  "Failed to recover replace move: %@ to %@", info->stagingURL,
                                                  info->oldURL));

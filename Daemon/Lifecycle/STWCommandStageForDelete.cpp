@@ -92,7 +92,7 @@ bool STWCommandStageForDelete::_stageContainer(const STWMetadata& record) {
     }
     STWFileDescriptor deathRow = fileManager->openDirectoryAtURLWithoutForeignLinks(destination.parent_path(), &stepError);
     if (deathRow && fileManager->moveDirectoryAt(classfd.get(), name, deathRow.get(), name, containerfd.get(),
-                                                 STWFileManagerMoveSyncDirectories, url, destination, &stepError))
+                                                 STWFileManagerMoveSyncSourceDirectory, url, destination, &stepError))
         return true;
     STW_LOG_DEBUG(STWLogCategory::Lifecycle, "Couldn't stage for deletion from %@ to %@: %@", url, destination,
                   stepError);

@@ -5,6 +5,13 @@
 //       driven by the same client code; ratio = daemon throughput / echo throughput.
 //   create_data_container  new data containers over the socket against the same file-system
 //       steps done directly in this process; ratio = daemon time / direct time.
+//   delete_container  a delete request (look-up, stage, the rename into death row and the
+//       syncs of its two directories, reply) against the same request answered by the echo
+//       server plus that rename and those syncs done here.
+//   replace_with_journal  a replace request against its raw steps done here: a small
+//       journal written and synced with its directory, the two renames with the syncs of
+//       their directories, the journal's removal synced.
+//   deathrow_pass_10000_files  emptying death row of a 10,000-file container against rm -rf.
 //   first_lookup_after_restart_10000  the first look-up after a start, which rebuilds the
 //       class cache from 10,000 containers, against listing and parsing their metadata files.
 //   lookup_latency_100_vs_100000  median look-up latency with 100 and with 100,000
@@ -363,6 +370,7 @@ public:
 private:
     void _lookups();
     void _creation();
+    void _deletionAndReplace();
     bool _createDirectly(const fs::path& staging, const fs::path& classDirectory, const std::string& identifier);
     void _firstLookupAfterRestart();
     void _largeClass();
@@ -490,6 +498,140 @@ void DaemonBench::_creation() {
     double d = percentile(daemon, 0.5), b = percentile(baseline, 0.5);
     printf("data containers created: %zu each, median stowlyd %.0f us, direct %.0f us\n", count, d, b);
     printf("create_data_container: ratio %.2f (goal <= 1.5)\n", d / b);
+    fflush(stdout);
+}
+
+
+bool syncDirectory(const fs::path& directory) {
+    int fd = open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    bool synced = fd >= 0 && fsync(fd) == 0;
+    if (fd >= 0)
+        close(fd);
+    return synced;
+}
+
+bool writeSynced(const fs::path& file, const std::string& bytes) {
+    int fd = open(file.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+    bool written = fd >= 0 && write(fd, bytes.data(), bytes.size()) == static_cast<ssize_t>(bytes.size()) &&
+                   fsync(fd) == 0;
+    if (fd >= 0)
+        close(fd);
+    return written;
+}
+
+// A tree of `files` small files in directories of 100.
+void makeTree(const fs::path& root, size_t files) {
+    for (size_t i = 0; i < files; ++i) {
+        fs::path directory = root / std::to_string(i / 100);
+        if (i % 100 == 0)
+            fs::create_directories(directory);
+        std::ofstream(directory / std::to_string(i)) << "x";
+    }
+}
+
+
+void DaemonBench::_deletionAndReplace() {
+    EchoServer echo(_main.root() / "run/echo-deletion.sock");
+    auto client = connectWithHello(_main.socket());
+    auto echoClient = connectWithHello(echo.socket());
+    fs::path direct = _main.root() / "bench-direct";
+    for (const char* d : {"live", "dead", "staging", "temp", "journals"})
+        fs::create_directories(direct / d);
+    auto send = [&](STWValue::Dictionary message, const std::string& what) {
+        STWErrorRef error;
+        auto reply = client->sendMessage(message, kTimeout, &error);
+        if (replyError(reply) != STWErrorSuccess)
+            die(what + " failed: " +
+                (reply ? STWDescribeDictionary(*reply) : error ? error->description() : std::string("no reply")));
+        return *reply;
+    };
+    auto uuidOf = [](const STWValue::Dictionary& reply) { return *STWDictionaryFind(reply, "ReplyUUID")->uuid(); };
+    const size_t count = _quick ? 20 : 100;
+    std::vector<double> deleted, deletedBaseline, replaced, replacedBaseline;
+    // One of each in turn, so that both meet the same disk.
+    for (size_t i = 0; i < count; ++i) {
+        std::string identifier = "com.example.bench.gone" + std::to_string(i), name = std::to_string(i);
+        send(containerRequest(identifier, true), "creation of " + identifier);
+        STWValue::Dictionary remove{{"Command", STWValue(uint64_t{10})},
+                                    {"Identifier", STWValue(identifier)},
+                                    {"ContainerClass", STWValue(uint64_t{kDataClass})}};
+        auto before = Clock::now();
+        send(remove, "deletion of " + identifier);
+        deleted.push_back(micros(Clock::now() - before));
+
+        fs::create_directory(direct / "live" / name);
+        before = Clock::now();
+        if (replyError(echoClient->sendMessage(remove, kTimeout, nullptr)) != STWErrorSuccess ||
+            rename((direct / "live" / name).c_str(), (direct / "dead" / name).c_str()) != 0 ||
+            !syncDirectory(direct / "live") || !syncDirectory(direct / "dead"))
+            die("direct deletion in " + direct.string() + " failed");
+        deletedBaseline.push_back(micros(Clock::now() - before));
+
+        identifier = "com.example.bench.replaced" + std::to_string(i);
+        auto old = send(containerRequest(identifier, true), "creation of " + identifier);
+        auto transient = containerRequest(identifier, true);
+        transient["Transient"] = STWValue(true);
+        auto fresh = send(transient, "creation of transient " + identifier);
+        STWValue::Dictionary replace{{"Command", STWValue(uint64_t{2})},
+                                     {"OldIdentifier", STWValue(identifier)},
+                                     {"OldContainerClass", STWValue(uint64_t{kDataClass})},
+                                     {"OldContainerUUID", STWValue(uuidOf(old))},
+                                     {"NewIdentifier", STWValue(identifier)},
+                                     {"NewContainerClass", STWValue(uint64_t{kDataClass})},
+                                     {"NewContainerUUID", STWValue(uuidOf(fresh))}};
+        before = Clock::now();
+        send(replace, "replace of " + identifier);
+        replaced.push_back(micros(Clock::now() - before));
+
+        fs::create_directory(direct / "live" / ("old" + name));
+        fs::create_directory(direct / "temp" / ("new" + name));
+        fs::path journal = direct / "journals" / (name + ".plist");
+        std::string journalBytes(300, 'j');
+        before = Clock::now();
+        if (!writeSynced(journal, journalBytes) || !syncDirectory(direct / "journals") ||
+            rename((direct / "live" / ("old" + name)).c_str(), (direct / "staging" / name).c_str()) != 0 ||
+            !syncDirectory(direct / "staging") || !syncDirectory(direct / "live") ||
+            rename((direct / "temp" / ("new" + name)).c_str(), (direct / "live" / ("new" + name)).c_str()) != 0 ||
+            !syncDirectory(direct / "live") || !syncDirectory(direct / "temp") || unlink(journal.c_str()) != 0 ||
+            !syncDirectory(direct / "journals"))
+            die("direct replace in " + direct.string() + " failed");
+        replacedBaseline.push_back(micros(Clock::now() - before));
+    }
+    double d = percentile(deleted, 0.5), db = percentile(deletedBaseline, 0.5);
+    double r = percentile(replaced, 0.5), rb = percentile(replacedBaseline, 0.5);
+    printf("deletions: %zu, median stowlyd %.0f us, echo and rename %.0f us\n", count, d, db);
+    printf("delete_container: ratio %.2f (goal <= 1.5)\n", d / db);
+    printf("replaces: %zu, median stowlyd %.0f us, raw steps %.0f us\n", count, r, rb);
+    printf("replace_with_journal: ratio %.2f (goal <= 1.3)\n", r / rb);
+    fflush(stdout);
+
+    // The class holds what it held before; a pass over death row holding one large
+    // container then runs against rm -rf of its twin.
+    for (size_t i = 0; i < count; ++i)
+        send({{"Command", STWValue(uint64_t{10})},
+              {"Identifier", STWValue("com.example.bench.replaced" + std::to_string(i))},
+              {"ContainerClass", STWValue(uint64_t{kDataClass})}},
+             "deletion of a replaced container");
+    send({{"Command", STWValue(uint64_t{4})}}, "a death-row pass");
+    const size_t files = 10000;
+    makeTree(STWGlobalConfiguration::sharedInstance()->deathrowDirectory() / "large", files);
+    makeTree(direct / "large", files);
+    auto before = Clock::now();
+    send({{"Command", STWValue(uint64_t{4})}}, "the death-row pass");
+    double pass = seconds(Clock::now() - before);
+    before = Clock::now();
+    pid_t pid = fork();
+    if (pid == 0) {
+        execlp("rm", "rm", "-rf", (direct / "large").c_str(), nullptr);
+        _exit(127);
+    }
+    int status = 0;
+    if (pid < 0 || waitpid(pid, &status, 0) != pid || !WIFEXITED(status) || WEXITSTATUS(status) != 0)
+        die("rm -rf failed");
+    double rm = seconds(Clock::now() - before);
+    STWFileManager::defaultManager()->removeItemAtURL(direct);
+    printf("death-row pass over %zu files: stowlyd %.1f ms, rm -rf %.1f ms\n", files, pass * 1e3, rm * 1e3);
+    printf("deathrow_pass_10000_files: ratio %.2f (goal <= 1.1)\n", pass / rm);
     fflush(stdout);
 }
 
@@ -633,6 +775,7 @@ void DaemonBench::run() {
     _main.start();
     _lookups();
     _creation();
+    _deletionAndReplace();
     _firstLookupAfterRestart();
     _largeClass();
     _main.stop();
