@@ -71,6 +71,8 @@ public:
     static const std::shared_ptr<STWQueue>& sharedQueue();
     const std::shared_ptr<STWQueue>& queue() const { return _queue; }
     const std::shared_ptr<STWUserIdentityCache>& userIdentityCache() const { return _userIdentityCache; }
+    // The database; only to be used on queue().
+    STWSQLiteDB& codeSigningMappingDB() { return *_codeSigningMappingDB; }
 
     // MARK: Updates
 
