@@ -402,26 +402,29 @@ std::optional<STWGroupIdentifierList> STWCodeSigningMapping::systemGroupIdentifi
     return _systemGroupIdentifiersForIdentifier(identifier, entitlementsForIdentifier(identifier));
 }
 
-std::optional<std::vector<std::string>> STWCodeSigningMapping::childBundleIdentifiersForParentIdentifier(
-    const std::string& identifier) {
+template <class Query>
+auto STWCodeSigningMapping::_familyQuery(const std::string& identifier, const Query& query) {
     return _queue->syncResult([&] {
         STWErrorRef error;
-        auto children = _codeSigningMappingDB->childIdentifiersForParentIdentifier(identifier, &error);
-        if (!children && error && !isNotFound(error))
+        auto answer = query(*_codeSigningMappingDB, &error);
+        // "Not found" is an answer: no children, or no parent.
+        if (!answer && error && !isNotFound(error))
             STW_LOG_ERROR(kCategory, "Error retrieving child bundles ids from DB with identifier %@ : %@", identifier,
                           error);
-        return children;
+        return answer;
+    });
+}
+
+std::optional<std::vector<std::string>> STWCodeSigningMapping::childBundleIdentifiersForParentIdentifier(
+    const std::string& identifier) {
+    return _familyQuery(identifier, [&](STWSQLiteDB& db, STWErrorRef* error) {
+        return db.childIdentifiersForParentIdentifier(identifier, error);
     });
 }
 
 std::optional<std::string> STWCodeSigningMapping::parentIdentifierForChildIdentifier(const std::string& identifier) {
-    return _queue->syncResult([&] {
-        STWErrorRef error;
-        auto parent = _codeSigningMappingDB->parentIdentifierForChildIdentifier(identifier, &error);
-        if (!parent && error && !isNotFound(error))
-            STW_LOG_ERROR(kCategory, "Error retrieving child bundles ids from DB with identifier %@ : %@", identifier,
-                          error);
-        return parent;
+    return _familyQuery(identifier, [&](STWSQLiteDB& db, STWErrorRef* error) {
+        return db.parentIdentifierForChildIdentifier(identifier, error);
     });
 }
 

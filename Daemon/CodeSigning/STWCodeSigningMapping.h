@@ -180,6 +180,9 @@ private:
     std::optional<_Registration> _rememberedRegistration(const std::string& identifier);
     void _onQueue_rememberRegistration(const std::string& identifier, _Registration registration);
     std::optional<STWValue::Dictionary> _migrateEntitlementsFromBundleContainer(const std::string& identifier);
+    // Runs a parent or children query on the queue, logging failures other than "not found".
+    template <class Query>
+    auto _familyQuery(const std::string& identifier, const Query& query);
     uint64_t _codeOfError(const STWErrorRef& error) const;
 
     std::shared_ptr<STWUserIdentityCache> _userIdentityCache;
