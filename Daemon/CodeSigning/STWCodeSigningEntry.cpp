@@ -70,3 +70,36 @@ std::string STWCodeSigningEntry::description() const {
         "STWCodeSigningEntry", yesNo(_invalid), yesNo(_placeholder), yesNo(_advanceCopy),
         yesNo(_registeredByCaller), _dataContainerClass, children, info);
 }
+
+STWValue::Dictionary STWCodeSigningEntry::serialize() const {
+    STWValue::Dictionary serialized{{"Invalid", STWValue(_invalid)},
+                                    {"Placeholder", STWValue(_placeholder)},
+                                    {"AdvanceCopy", STWValue(_advanceCopy)},
+                                    {"RegisteredByCaller", STWValue(_registeredByCaller)},
+                                    {"DataContainerClass", STWValue(_dataContainerClass)}};
+    if (_codeSigningInfo)
+        serialized["CodeSigningInfo"] = STWValue(*_codeSigningInfo);
+    if (_childBundleIdentifiers)
+        serialized["ChildBundleIds"] =
+            STWValue(STWValue::Array(_childBundleIdentifiers->begin(), _childBundleIdentifiers->end()));
+    return serialized;
+}
+
+STWCodeSigningEntry STWCodeSigningEntry::initWithSerializedDictionary(const STWValue::Dictionary& serialized) {
+    std::optional<STWValue::Dictionary> info;
+    if (const STWValue::Dictionary* d = STWDictionaryDictionary(serialized, "CodeSigningInfo"))
+        info = *d;
+    STWCodeSigningEntry entry(std::move(info), STWDictionaryUInt64(serialized, "DataContainerClass").value_or(0));
+    if (const STWValue* children = STWDictionaryFind(serialized, "ChildBundleIds"); children && children->array()) {
+        std::vector<std::string> identifiers;
+        for (const STWValue& child : *children->array())
+            if (const std::string* s = child.string())
+                identifiers.push_back(*s);
+        entry.setChildBundleIdentifiers(std::move(identifiers));
+    }
+    entry.setInvalid(STWDictionaryBool(serialized, "Invalid"));
+    entry.setPlaceholder(STWDictionaryBool(serialized, "Placeholder"));
+    entry.setAdvanceCopy(STWDictionaryBool(serialized, "AdvanceCopy"));
+    entry.setRegisteredByCaller(STWDictionaryBool(serialized, "RegisteredByCaller"));
+    return entry;
+}

@@ -51,6 +51,13 @@ public:
     uint64_t dataContainerClass() const { return _dataContainerClass; }
     void setDataContainerClass(uint64_t dataContainerClass) { _dataContainerClass = dataContainerClass; }
 
+    // The dictionary form of the legacy mapping file: "CodeSigningInfo", "ChildBundleIds",
+    // "Invalid", "Placeholder", "AdvanceCopy", "RegisteredByCaller", "DataContainerClass".
+    // Missing or mistyped keys read as absent, false or 0; child identifiers that are not
+    // strings are dropped.
+    STWValue::Dictionary serialize() const;
+    static STWCodeSigningEntry initWithSerializedDictionary(const STWValue::Dictionary& serialized);
+
     // Two absent dictionaries (or child lists) compare equal; child order matters.
     bool operator==(const STWCodeSigningEntry& other) const;
     size_t hash() const;

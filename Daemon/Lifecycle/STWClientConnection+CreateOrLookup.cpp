@@ -2,7 +2,9 @@
 // published by one rename (the operations of STWClientConnection that make containers).
 #include "Daemon/Request/STWClientConnection.h"
 
+#include "Daemon/CodeSigning/STWCodeSigningMapping.h"
 #include "Daemon/CodeSigning/STWWhitelist.h"
+#include "Daemon/DataProtection/STWDataProtectionManager.h"
 #include "Daemon/FileSystem/STWFileManager.h"
 #include "Daemon/Lifecycle/STWContainerCache.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
@@ -46,11 +48,12 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
         }
         if (c == STWContainerClassDataSystem && !allowOtherIdLookup() && !unrestricted() &&
             !isEntitledForLookupWithClass(c, id)) {
-            // The code-signing mapping that records which programs own a system container is
-            // not part of this build: no identifier has one, so only the well-known list lets
-            // such a caller through.
-            bool hasSystemContainer = false;
-            if (!whitelisted && !(hasSystemContainer && client && *client == id)) {
+            // An app whose entitlements ask for a system container may have its own.
+            auto ownsSystemContainer = [&] {
+                auto mapping = STWCodeSigningMapping::sharedInstance();
+                return client && *client == id && mapping && mapping->identifierHasSystemContainer(id);
+            };
+            if (!whitelisted && !ownsSystemContainer()) {
                 STW_ERROR(STWErrorNotEntitled, nullptr, "%@ not entitled for system container with identifier %@",
                           clientArg, id);
                 *code = STWErrorNotEntitled;
@@ -287,9 +290,8 @@ int32_t STWClientConnection::_dataProtectionClassForContainerMetadata(const STWM
         if (value && value->isNumber())
             return static_cast<int32_t>(value->truncatedInt64Value().value_or(0));
     }
-    // The class intended from the identifier's entitlements comes from the code-signing
-    // mapping, which is not part of this build: new containers get class 0 until then.
-    return 0;
+    return STWDataProtectionManager::defaultManager()->intendedDataProtectionClassBasedOnEntitlementsForIdentifier(
+        metadata.identifier());
 }
 
 bool STWClientConnection::_createSubDirectories(int containerfd, const std::filesystem::path& url,

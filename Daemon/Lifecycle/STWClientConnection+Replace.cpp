@@ -4,6 +4,8 @@
 // paths is written first, so that a start after a crash can put the old one back.
 #include "Daemon/Request/STWClientConnection.h"
 
+#include "Daemon/CodeSigning/STWCodeSigningMapping.h"
+
 #include "Daemon/FileSystem/STWFileManager.h"
 #include "Daemon/Lifecycle/STWContainerCache.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
@@ -344,8 +346,11 @@ bool STWClientConnection::_recoverFromReplaceOperationsWithError(STWErrorRef* er
 
 bool STWClientConnection::_invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
                                                                                  STWErrorRef* error) {
-    (void)error;
-    STW_LOG_DEBUG(STWLogCategory::Lifecycle, "No code-signing information of %@ to invalidate: not part of this build",
-                  identifier);
-    return true;
+    auto mapping = STWCodeSigningMapping::sharedInstance();
+    if (!mapping) {
+        STWSetError(error, STW_ERROR(STWErrorDatabase, nullptr, "No code-signing mapping to invalidate %@ in",
+                                     identifier));
+        return false;
+    }
+    return mapping->invalidateCodeSigningInfoForIdentifierAndItsChildren(identifier, error);
 }

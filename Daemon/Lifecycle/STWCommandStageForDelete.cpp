@@ -1,5 +1,6 @@
 #include "Daemon/Lifecycle/STWCommandStageForDelete.h"
 
+#include "Daemon/CodeSigning/STWCodeSigningMapping.h"
 #include "Daemon/FileSystem/STWFileManager.h"
 #include "Daemon/Lifecycle/STWContainerCache.h"
 #include "Daemon/Model/STWConcreteContainerIdentity.h"
@@ -104,7 +105,6 @@ bool STWCommandStageForDelete::_stageContainer(const STWMetadata& record) {
 
 void STWCommandStageForDelete::_removeCodeSigningDictionariesForIdentifierAndItsChildren(const std::string& identifier,
                                                                                         STWCommandQueue& queue) {
-    (void)queue;
-    STW_LOG_DEBUG(STWLogCategory::Lifecycle, "No code-signing information of %@ to remove: not part of this build",
-                  identifier);
+    if (auto mapping = STWCodeSigningMapping::sharedInstance())
+        mapping->removeCodeSigningDictionariesForIdentifierAndItsChildren(identifier, queue);
 }

@@ -39,8 +39,8 @@ private:
     // Moves the record's own directory into death row, or removes it in place; true when the
     // container is no longer in its class directory.
     static bool _stageContainer(const STWMetadata& record);
-    // The code-signing mapping forgets the identifier and its children, queueing follow-up
-    // commands on `queue`. The mapping is not part of this build: nothing to forget yet.
+    // The code-signing mapping forgets the identifier and its children; the groups they were
+    // the last to reference are queued for deletion on `queue`.
     static void _removeCodeSigningDictionariesForIdentifierAndItsChildren(const std::string& identifier,
                                                                           STWCommandQueue& queue);
 

@@ -1,5 +1,6 @@
 #include "Daemon/Lifecycle/STWContainerCache.h"
 
+#include "Daemon/CodeSigning/STWCodeSigningMapping.h"
 #include "Daemon/CodeSigning/STWWhitelist.h"
 #include "Daemon/FileSystem/STWFileManager.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
@@ -61,25 +62,19 @@ std::string STWContainerCache::classCacheKey(const STWUserIdentityRef& userIdent
     return key;
 }
 
-// MARK: - Call sites of subsystems not in this build
+// MARK: - The code-signing mapping
 
 void STWContainerCache::_assertNotOnCodeSigningMappingQueue() const {
     // The registration decision calls into the code-signing mapping, which serialises on its
-    // own queue; a cache operation running on that queue would deadlock there. The mapping
-    // and its queue are not part of this build, so there is nothing to check against yet.
-    static std::once_flag logged;
-    std::call_once(logged, [] {
-        STW_LOG_DEBUG(STWLogCategory::Cache, "The code-signing mapping is not part of this build: no queue to check");
-    });
+    // own queue; a cache operation running on that queue would deadlock there.
+    if (STWCodeSigningMapping::sharedQueue()->isCurrent())
+        STW_FATAL("Container cache operation on the code-signing mapping's queue");
 }
 
 std::optional<std::string> STWContainerCache::_parentIdentifierForChildIdentifier(const std::string& identifier) const {
-    // Plug-in data containers register under their application's identifier once the
-    // code-signing mapping can name the parent. Without it the child's own identifier is
-    // used, which is what the mapping answers for a child it does not know.
-    STW_LOG_DEBUG(STWLogCategory::Cache,
-                  "The code-signing mapping is not part of this build: no parent identifier for %@", identifier);
-    return std::nullopt;
+    // Plug-in data containers register under their application's identifier.
+    auto mapping = STWCodeSigningMapping::sharedInstance();
+    return mapping ? mapping->parentIdentifierForChildIdentifier(identifier) : std::nullopt;
 }
 
 bool STWContainerCache::_isWellKnownContainerName(const std::string& name, STWContainerClass containerClass) const {

@@ -44,8 +44,8 @@ class STWContainerCache {
 public:
     static std::shared_ptr<STWContainerCache> sharedInstance();
 
-    // The code-signing mapping joins the constructor when that subsystem exists; until then
-    // the registration decision knows no parent identifiers (see _parentIdentifierForChildIdentifier).
+    // The registration decision asks the shared code-signing mapping for the parents of
+    // plug-ins (see _parentIdentifierForChildIdentifier).
     explicit STWContainerCache(std::shared_ptr<STWUserIdentityCache> userIdentityCache);
     STWContainerCache(const STWContainerCache&) = delete;
     STWContainerCache& operator=(const STWContainerCache&) = delete;
@@ -183,7 +183,7 @@ private:
     STWMetadataRef _validatedRecord(const STWMetadataRef& record, const std::string& cacheName, bool transient,
                                     STWErrorRef* error);
 
-    // Call sites of subsystems that are not part of this build.
+    // Where the cache consults the code-signing mapping.
     void _assertNotOnCodeSigningMappingQueue() const;
     std::optional<std::string> _parentIdentifierForChildIdentifier(const std::string& identifier) const;
     bool _isWellKnownContainerName(const std::string& name, STWContainerClass containerClass) const;

@@ -122,6 +122,15 @@ public:
     // staging when neither it nor the new one is in place; the journal goes to death row.
     bool _recoverFromReplaceOperationsWithError(STWErrorRef* error);
 
+    // Group containers (CodeSigning/STWClientConnection+Groups.cpp): every group container
+    // of class 7 or 13 that `ownerIdentifier` is entitled to, for `userIdentity`, created
+    // when missing. The caller must be the owner, may look up other identifiers, be
+    // unrestricted, carry a lookup entitlement for (class, owner) or be let through by the
+    // well-known list; otherwise 55. A group whose container cannot be made is left out.
+    std::optional<std::map<std::string, STWMetadataRef>>
+    groupContainersForOwnerIdentifier(const std::string& ownerIdentifier, const STWUserIdentityRef& userIdentity,
+                                      STWContainerClass groupContainerClass, uint64_t* error);
+
     // Start-up work of the daemon's own connection: first-boot and every-start setup,
     // and the cleanups whose completions run later on the background queue.
     void rebootStowlySetup();
@@ -149,8 +158,7 @@ public:
     const std::shared_ptr<STWUserIdentityCache>& userIdentityCache() const { return _userIdentityCache; }
 
 private:
-    // The code-signing mapping drops what it knows of a replaced app and its children. The
-    // mapping is not part of this build: nothing to drop yet.
+    // The code-signing mapping marks a replaced app and its children invalid.
     static bool _invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
                                                                       STWErrorRef* error);
     // The code of an error for a client: its own in the daemon's domain, else 41 (logged).

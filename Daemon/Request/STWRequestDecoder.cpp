@@ -1,5 +1,6 @@
 #include "Daemon/Request/STWRequestDecoder.h"
 
+#include "Daemon/CodeSigning/STWCodeSigningMapping.h"
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
 #include "Daemon/Request/STWClientConnection.h"
 #include "common/STWLog.h"
@@ -36,18 +37,50 @@ STWUserIdentityRef STWRequestDecoder::userIdentityForContainerIdentifier(const S
     STWUserIdentityRef caller = callerUserIdentity(connection);
     if (!caller || !STWContainerClassIsPerUser(containerClass) || !caller->isNoSpecificPersona())
         return caller;
-    // Plug-in data belongs to the persona of its parent application. The code-signing
-    // mapping that knows parents is not part of this build, so no child has a parent yet;
-    // without one the lookup is that of an unknown bundle, which belongs to the personal
-    // persona.
+    // Plug-in data belongs to the persona of its parent application; a child without a
+    // known parent is looked up as an unknown bundle, which belongs to the personal persona.
     std::optional<std::string> lookupIdentifier = identifier;
-    if (STWContainerClassIsChildData(containerClass))
-        lookupIdentifier = std::nullopt;
+    if (STWContainerClassIsChildData(containerClass)) {
+        auto mapping = STWCodeSigningMapping::sharedInstance();
+        lookupIdentifier = mapping ? mapping->parentIdentifierForChildIdentifier(identifier) : std::nullopt;
+    }
     STWUserIdentitySet identities =
         STWUserIdentitySharedCache::sharedInstance()->userIdentitiesForBundleIdentifier(lookupIdentifier.value_or(""));
     STW_LOG_DEBUG(STWLogCategory::Tolvan, "Chose bundleIdentifier: %@, userIdentities: %@ for identifier: %@, class: %llu",
                   lookupIdentifier ? STWFormatArg(*lookupIdentifier) : STWFormatArg(nullptr), describeSet(identities),
                   identifier, containerClass);
+    return _chooseUserIdentity(connection, identities, error, [&] {
+        STW_LOG_FN("userIdentityForContainerIdentifier", STWLogLevel::Error, STWLogCategory::Tolvan,
+                   "%@ trying to look up persona for %llu:%@", connection.clientBundleIdentifier().value_or("<unknown>"),
+                   containerClass, identifier);
+    });
+}
+
+STWUserIdentityRef STWRequestDecoder::userIdentityForGroupOwner(const STWClientConnection& connection,
+                                                                const std::string& owner, uint64_t* error) {
+    STWUserIdentityRef caller = callerUserIdentity(connection);
+    if (!caller || !caller->isNoSpecificPersona())
+        return caller;
+    // A plug-in's groups belong to the persona of its application.
+    auto mapping = STWCodeSigningMapping::sharedInstance();
+    std::string lookupIdentifier = (mapping ? mapping->parentIdentifierForChildIdentifier(owner) : std::nullopt)
+                                       .value_or(owner);
+    STWUserIdentitySet identities =
+        STWUserIdentitySharedCache::sharedInstance()->userIdentitiesForBundleIdentifier(lookupIdentifier);
+    STW_LOG_DEBUG(STWLogCategory::Tolvan,
+                  "Chose bundleIdentifier: %@ for group container lookup, userIdentities: %@ for identifier: %@",
+                  lookupIdentifier, describeSet(identities), owner);
+    return _chooseUserIdentity(connection, identities, error, [&] {
+        STW_LOG_FN("createOrLookupGroupContainers", STWLogLevel::Error, STWLogCategory::Tolvan,
+                   "%@ trying to look up persona for group owner %@",
+                   connection.clientBundleIdentifier().value_or("<unknown>"), owner);
+    });
+}
+
+STWUserIdentityRef STWRequestDecoder::_chooseUserIdentity(const STWClientConnection& connection,
+                                                          const STWUserIdentitySet& identities, uint64_t* error,
+                                                          const std::function<void()>& logNone) {
+    STWUserIdentityRef caller = callerUserIdentity(connection);
     if (identities.size() == 1)
         return *identities.begin();
     if (identities.size() > 1) {
@@ -58,9 +91,7 @@ STWUserIdentityRef STWRequestDecoder::userIdentityForContainerIdentifier(const S
         *error = STWErrorPersonaMismatch;
         return nullptr;
     }
-    STW_LOG_FN("userIdentityForContainerIdentifier", STWLogLevel::Error, STWLogCategory::Tolvan,
-               "%@ trying to look up persona for %llu:%@", connection.clientBundleIdentifier().value_or("<unknown>"),
-               containerClass, identifier);
+    logNone();
     *error = STWErrorPersonaMismatch;
     return nullptr;
 }

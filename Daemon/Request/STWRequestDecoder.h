@@ -7,8 +7,10 @@
 #include "Daemon/Model/STWConcreteContainerIdentity.h"
 #include "Daemon/Model/STWContainerIdentity.h"
 #include "Daemon/Model/STWMetadata.h"
+#include "Daemon/Model/STWUserIdentityCache.h"
 #include "common/STWValue.h"
 
+#include <functional>
 #include <optional>
 #include <string>
 
@@ -27,6 +29,11 @@ public:
     static STWUserIdentityRef userIdentityForContainerIdentifier(const STWClientConnection& connection,
                                                                  STWContainerClass containerClass,
                                                                  const std::string& identifier, uint64_t* error);
+
+    // The user identity whose group containers of `owner` the caller means: as above, with
+    // a plug-in's groups belonging to the persona of its application.
+    static STWUserIdentityRef userIdentityForGroupOwner(const STWClientConnection& connection, const std::string& owner,
+                                                        uint64_t* error);
 
     // The user identity a persona unique string names, as long as the caller may act for
     // it (76 when it is someone else's, 11 when there is none).
@@ -56,4 +63,11 @@ public:
     // sandboxed and the container belongs to an enterprise persona.
     static void issueSandboxExtension(STWValue::Dictionary& into, const std::string& key, const STWMetadata& container,
                                       const STWClientConnection& connection);
+
+private:
+    // The only identity of `identities`, or the caller's own among several; 76 otherwise,
+    // after `logNone` when there is none at all.
+    static STWUserIdentityRef _chooseUserIdentity(const STWClientConnection& connection,
+                                                  const STWUserIdentitySet& identities, uint64_t* error,
+                                                  const std::function<void()>& logNone);
 };

@@ -1,5 +1,6 @@
 #include "Daemon/Request/STWRequestDispatcher.h"
 
+#include "Daemon/CodeSigning/STWCodeSigningMapping.h"
 #include "common/STWLog.h"
 #include "platform/STWPeerConnection.h"
 
@@ -7,11 +8,17 @@
 
 namespace {
 
-// Caller-declared entitlements belong in the code-signing mapping, which this build
-// does not carry yet; nothing is recorded and the decision never depended on it.
-void _processCallerRegisteredEntitlements(const STWClientIdentity& clientIdentity) {
-    STW_LOG_DEBUG(STWLogCategory::Tolvan, "Entitlements of %@ are not recorded: no code-signing mapping in this build",
-                  clientIdentity.bundleIdentifier());
+// A caller's own entitlements go into the code-signing mapping, where the installer's
+// information, when there is any, still wins. The decision never depends on the result.
+void _processCallerRegisteredEntitlements(const STWClientIdentity& clientIdentity, STWCommandQueue& commandQueue) {
+    auto mapping = STWCodeSigningMapping::sharedInstance();
+    if (!mapping)
+        return;
+    uint64_t code = mapping->processCallerRegisteredEntitlements(clientIdentity.entitlements().value_or(STWValue::Dictionary()),
+                                                                 clientIdentity.bundleIdentifier(), commandQueue);
+    if (code != STWErrorSuccess)
+        STW_LOG_FN("checkEntitlementsAndInitClientObject", STWLogLevel::Error, STWLogCategory::Tolvan,
+                   "Error processing entitlements for %@ : %llu", clientIdentity.bundleIdentifier(), code);
 }
 
 } // namespace
@@ -65,7 +72,7 @@ STWRequestDispatcher::checkEntitlementsAndInitClientObject(const STWCommandTable
                    clientIdentity->posixPID(), clientIdentity->bundleIdentifier());
         return nullptr;
     }
-    _processCallerRegisteredEntitlements(*clientIdentity);
+    _processCallerRegisteredEntitlements(*clientIdentity, *commandQueue);
     return std::make_shared<STWClientConnection>(clientIdentity, entitled, allowOtherIdLookup, unrestricted,
                                                  std::move(lookup), std::move(wipeIdentifiers), commandQueue);
 }

@@ -15,6 +15,7 @@ void STWCTLCommands::addAll(CLI::App& app) {
     _addRaw(app);
     _addContainerCommands(app);
     _addDeletionCommands(app);
+    _addCodeSigningCommands(app);
     _addDevice(app);
     app.require_subcommand(1);
 }
@@ -206,6 +207,85 @@ void STWCTLCommands::_addDeletionCommands(CLI::App& app) {
 
     CLI::App* empty = app.add_subcommand("empty-deathrow", "Remove everything in death row (waits for it)");
     _onRun(empty, [](STWCTLSession& session) { return session.send({{"Command", STWValue(4)}}); });
+}
+
+// What the installer tells the daemon about an identifier, and the group and system
+// containers that follow from it: set-codesigning, codesigning, invalidate-codesigning,
+// groups, group-ids, system-container, system-groups and system-group.
+void STWCTLCommands::_addCodeSigningCommands(CLI::App& app) {
+    struct Arguments {
+        std::string identifier;
+        std::string infoFile;
+        std::string parent;
+        uint64_t dataContainerClass = 0;
+        bool placeholder = false;
+        std::string group;
+    };
+    auto arguments = std::make_shared<Arguments>();
+    // Adds the optional identifier: without it the command is about the caller itself.
+    auto identified = [&](CLI::App* command, uint64_t number) {
+        command->add_option("IDENTIFIER", arguments->identifier, "Identifier (default: the caller's own)");
+        _onRun(command, [arguments, number](STWCTLSession& session) {
+            STWValue::Dictionary m{{"Command", STWValue(number)}};
+            if (!arguments->identifier.empty())
+                m["Identifier"] = STWValue(arguments->identifier);
+            return session.send(m);
+        });
+    };
+
+    CLI::App* set = app.add_subcommand("set-codesigning",
+                                       "Store an identifier's code-signing info (a plist file); none forgets it");
+    set->add_option("IDENTIFIER", arguments->identifier, "Code-signing identifier")->required();
+    set->add_option("PLIST", arguments->infoFile, "Property-list file with the code-signing info dictionary");
+    set->add_option("--data-class", arguments->dataContainerClass, "Class of the identifier's data container");
+    set->add_option("--parent", arguments->parent, "Identifier of the parent application (for a plug-in)");
+    set->add_flag("--placeholder", arguments->placeholder, "A placeholder installation");
+    _onRun(set, [arguments](STWCTLSession& session) {
+        STWValue::Dictionary m{{"Command", STWValue(18)}, {"Identifier", STWValue(arguments->identifier)}};
+        if (!arguments->infoFile.empty()) {
+            std::string reason;
+            std::optional<STWValue> info = STWCTLParseTypedValue("plist", arguments->infoFile, &reason);
+            if (!info)
+                return session.usageError(reason);
+            if (!info->dictionary())
+                return session.usageError(arguments->infoFile + " does not hold a dictionary");
+            m["CodeSigningInfo"] = std::move(*info);
+        }
+        STWValue::Dictionary options;
+        if (arguments->dataContainerClass)
+            options["com.vorlane.Stowly.DataContainerClass"] = STWValue(arguments->dataContainerClass);
+        if (!arguments->parent.empty())
+            options["com.vorlane.Stowly.ParentBundleID"] = STWValue(arguments->parent);
+        if (arguments->placeholder)
+            options["com.vorlane.Stowly.PlaceholderEntitlements"] = STWValue(true);
+        m["OptionsDictionary"] = STWValue(std::move(options));
+        return session.send(m);
+    });
+
+    CLI::App* show = app.add_subcommand("codesigning", "Show an identifier's code-signing info");
+    show->add_option("IDENTIFIER", arguments->identifier, "Code-signing identifier")->required();
+    _onRun(show, [arguments](STWCTLSession& session) {
+        return session.send({{"Command", STWValue(19)}, {"Identifier", STWValue(arguments->identifier)}});
+    });
+
+    CLI::App* invalidate = app.add_subcommand("invalidate-codesigning",
+                                              "Invalidate the code-signing info of apps whose bundle is gone");
+    _onRun(invalidate, [](STWCTLSession& session) { return session.send({{"Command", STWValue(20)}}); });
+
+    identified(app.add_subcommand("groups", "Create or find the app-group containers of an owner"), 13);
+    identified(app.add_subcommand("group-ids", "List the app groups an owner is entitled to"), 14);
+    identified(app.add_subcommand("system-container", "Create or find a system container"), 15);
+    identified(app.add_subcommand("system-groups", "Create or find the system-group containers of an owner"), 16);
+
+    CLI::App* systemGroup = app.add_subcommand("system-group", "Create or find one system-group container");
+    systemGroup->add_option("GROUP", arguments->group, "System group identifier")->required();
+    systemGroup->add_option("--owner", arguments->identifier, "Owner (default: the caller itself)");
+    _onRun(systemGroup, [arguments](STWCTLSession& session) {
+        STWValue::Dictionary m{{"Command", STWValue(17)}, {"GroupIdentifier", STWValue(arguments->group)}};
+        if (!arguments->identifier.empty())
+            m["Identifier"] = STWValue(arguments->identifier);
+        return session.send(m);
+    });
 }
 
 // device lock|unlock: the keybag state the daemon watches under its root.

@@ -24,6 +24,7 @@ private:
     void _addRaw(CLI::App& app);
     void _addContainerCommands(CLI::App& app);
     void _addDeletionCommands(CLI::App& app);
+    void _addCodeSigningCommands(CLI::App& app);
     void _addDevice(CLI::App& app);
 
     STWCTLSession& _session;
