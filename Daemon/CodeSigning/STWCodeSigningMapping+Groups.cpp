@@ -114,7 +114,8 @@ STWReferenceCountSet STWCodeSigningMapping::_onQueue_copyReferenceCountSetOfType
                           describe(*groups));
             for (const std::string& group : *groups)
                 ++counts[group];
-        });
+        },
+        false);
     if (error)
         STW_LOG_ERROR(kCategory, "Failed to enumerate code signing info: %@", error);
     return counts;

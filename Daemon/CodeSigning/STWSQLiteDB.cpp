@@ -774,7 +774,8 @@ bool STWSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::st
     return false;
 }
 
-STWErrorRef STWSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(const EnumerationBlock& block) {
+STWErrorRef STWSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(const EnumerationBlock& block,
+                                                                            bool withChildren) {
     STWErrorRef lastError;
     try {
         _Statement statement(*this, _Query::SelectAllEntries);
@@ -805,8 +806,9 @@ STWErrorRef STWSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(const 
                 break;
             }
             STWErrorRef childError;
-            std::optional<std::vector<std::string>> children =
-                _selectChildIdentifiers(identifier, false, &childError);
+            std::optional<std::vector<std::string>> children;
+            if (withChildren)
+                children = _selectChildIdentifiers(identifier, false, &childError);
             if (children) {
                 entry->setChildBundleIdentifiers(std::move(children));
             } else if (childError) {

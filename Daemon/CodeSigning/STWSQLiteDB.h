@@ -62,7 +62,10 @@ public:
     bool invalidateCodeSigningForIdentifierAndAllChildren(const std::string& identifier, STWErrorRef* error);
     // Calls `block` for every readable entry; unreadable rows are skipped. Returns nullptr
     // or the last error met; rows already delivered stay delivered.
-    STWErrorRef enumerateIdentifiersAndCodeSigningInfoUsingBlock(const EnumerationBlock& block);
+    // Without `withChildren` the entries carry no child identifiers, which spares one query
+    // per row (a walk that needs only the entitlements).
+    STWErrorRef enumerateIdentifiersAndCodeSigningInfoUsingBlock(const EnumerationBlock& block,
+                                                                 bool withChildren = true);
     // Every stored identifier; absent with no error when the database is empty.
     std::optional<std::vector<std::string>> identifiersWithError(STWErrorRef* error);
     // The parent's children in the order they were linked; 67 when it has none.
