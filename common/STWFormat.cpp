@@ -221,16 +221,6 @@ std::string STWFormatv(std::string_view format, std::initializer_list<STWFormatA
     return out;
 }
 
-int STWHexDigit(char c) {
-    if (c >= '0' && c <= '9')
-        return c - '0';
-    if (c >= 'a' && c <= 'f')
-        return c - 'a' + 10;
-    if (c >= 'A' && c <= 'F')
-        return c - 'A' + 10;
-    return -1;
-}
-
 std::string STWHexString(const unsigned char* bytes, size_t length) {
     static const char* digits = "0123456789abcdef";
     std::string text;

@@ -6,6 +6,7 @@
 // sensible instead of reading garbage: log lines are built from hostile input too.
 #pragma once
 
+#include <array>
 #include <concepts>
 #include <cstdint>
 #include <filesystem>
@@ -92,7 +93,20 @@ std::string STWFormat(std::string_view format, const Args&... args) {
     return STWFormatv(format, {STWFormatArg(args)...});
 }
 
-// The value of one hexadecimal digit (either case), or -1.
-int STWHexDigit(char c);
+// The value of one hexadecimal digit (either case), or -1. A table rather than range tests:
+// the digits of UUIDs and digests come in no order a branch predictor could learn, and a
+// rebuild parses the UUID name of every container it lists.
+inline int STWHexDigit(char c) {
+    static constexpr auto values = [] {
+        std::array<int8_t, 256> table{};
+        table.fill(-1);
+        for (int i = 0; i < 10; ++i)
+            table['0' + i] = static_cast<int8_t>(i);
+        for (int i = 0; i < 6; ++i)
+            table['a' + i] = table['A' + i] = static_cast<int8_t>(10 + i);
+        return table;
+    }();
+    return values[static_cast<unsigned char>(c)];
+}
 // Lower-case hexadecimal text of `length` bytes.
 std::string STWHexString(const unsigned char* bytes, size_t length);

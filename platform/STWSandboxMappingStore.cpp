@@ -46,6 +46,10 @@ std::string directoryKey(const STWSandboxMappingItem& item) {
     return key;
 }
 
+bool inSameDirectory(const STWSandboxMappingItem& a, const STWSandboxMappingItem& b) {
+    return a.uid == b.uid && a.kernelPersonaID == b.kernelPersonaID && a.itemType == b.itemType;
+}
+
 } // namespace
 
 class STWFileSandboxMappingStore::Directory {
@@ -79,6 +83,15 @@ std::shared_ptr<STWSandboxMappingStore> STWSandboxMappingStore::sharedInstance()
 void STWSandboxMappingStore::setSharedInstance(std::shared_ptr<STWSandboxMappingStore> store) {
     std::lock_guard guard(sharedMutex);
     shared = std::move(store);
+}
+
+std::vector<bool> STWSandboxMappingStore::userStateItemsAre(const std::vector<ItemAndPath>& items) {
+    std::vector<bool> current(items.size());
+    for (size_t i = 0; i < items.size(); ++i) {
+        auto path = userStateItem(items[i].first);
+        current[i] = path && path->native() == items[i].second;
+    }
+    return current;
 }
 
 std::string STWSandboxMappingStore::nameForIdentifier(std::string_view identifier) {
@@ -239,12 +252,24 @@ std::optional<std::filesystem::path> STWFileSandboxMappingStore::userStateItem(c
     return std::filesystem::path(std::string(buffer, static_cast<size_t>(length)));
 }
 
-bool STWFileSandboxMappingStore::userStateItemIs(const STWSandboxMappingItem& item, std::string_view path) {
-    DirectoryRef directory = _itemDirectory(item, false, nullptr);
-    if (!directory || path.size() >= PATH_MAX)
-        return false;
-    // One byte more than the path, so that a longer target is not taken for it.
+std::vector<bool> STWFileSandboxMappingStore::userStateItemsAre(const std::vector<ItemAndPath>& items) {
+    std::vector<bool> current(items.size());
+    // A batch is mostly one directory: look it up again only when the item's is another.
+    const STWSandboxMappingItem* directoryItem = nullptr;
+    DirectoryRef directory;
     char buffer[PATH_MAX];
-    ssize_t length = readlinkat(directory->fd(), nameForIdentifier(item.identifier).c_str(), buffer, path.size() + 1);
-    return length >= 0 && std::string_view(buffer, static_cast<size_t>(length)) == path;
+    for (size_t i = 0; i < items.size(); ++i) {
+        const auto& [item, path] = items[i];
+        if (!directoryItem || !inSameDirectory(*directoryItem, item)) {
+            directory = _itemDirectory(item, false, nullptr);
+            directoryItem = &item;
+        }
+        if (!directory || path.size() >= PATH_MAX)
+            continue;
+        // One byte more than the path, so that a longer target is not taken for it.
+        ssize_t length =
+            readlinkat(directory->fd(), nameForIdentifier(item.identifier).c_str(), buffer, path.size() + 1);
+        current[i] = length >= 0 && std::string_view(buffer, static_cast<size_t>(length)) == path;
+    }
+    return current;
 }

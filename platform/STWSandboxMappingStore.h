@@ -26,6 +26,9 @@
 // walk from the base. A directory removed behind the store's back (someone clearing the
 // runtime directory) is noticed when a link cannot be made in it, and is opened afresh.
 // Only root can write the tree, so nobody else can swap a kept directory for another.
+// After a restart most of what a rebuild pushes is there already, so a rebuild first asks
+// which of a batch of items already map to their paths (userStateItemsAre) and pushes only
+// the others: one read of each link, in a directory found once per batch.
 //
 // STWSandboxMappingStore is the interface; sharedInstance() is the Linux store of the
 // configured root prefix unless a test installed another with setSharedInstance().
@@ -46,6 +49,8 @@
 #include <string_view>
 #include <sys/types.h>
 #include <unordered_map>
+#include <utility>
+#include <vector>
 
 // Which item of the store: the fields the sandbox keys its user state by.
 struct STWSandboxMappingItem {
@@ -72,11 +77,10 @@ public:
 
     // The path the item maps to, or nullopt when there is none (or it cannot be read).
     virtual std::optional<std::filesystem::path> userStateItem(const STWSandboxMappingItem& item) = 0;
-    // Whether the item maps to exactly `path` (a rebuild asks this of every container).
-    virtual bool userStateItemIs(const STWSandboxMappingItem& item, std::string_view path) {
-        auto current = userStateItem(item);
-        return current && current->native() == path;
-    }
+    // For each item, whether it maps to exactly the path given with it, in order: what a
+    // rebuild asks of every container it finds, a batch at a time.
+    using ItemAndPath = std::pair<STWSandboxMappingItem, std::string_view>;
+    virtual std::vector<bool> userStateItemsAre(const std::vector<ItemAndPath>& items);
 
     // The file name under which the identifier's link is stored.
     static std::string nameForIdentifier(std::string_view identifier);
@@ -93,7 +97,7 @@ public:
     bool setUserStateItem(const STWSandboxMappingItem& item, const std::optional<std::filesystem::path>& path,
                           STWErrorRef* error) override;
     std::optional<std::filesystem::path> userStateItem(const STWSandboxMappingItem& item) override;
-    bool userStateItemIs(const STWSandboxMappingItem& item, std::string_view path) override;
+    std::vector<bool> userStateItemsAre(const std::vector<ItemAndPath>& items) override;
 
 private:
     class Directory;

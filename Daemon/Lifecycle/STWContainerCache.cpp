@@ -101,12 +101,14 @@ void STWContainerCache::_storeRecord(ClassCache& cache, STWMetadataRef record) {
 }
 
 bool STWContainerCache::containerURL(const fs::path& url, STWContainerClass isValidForContainerClass) const {
-    std::string name = url.filename().string();
+    return _isContainerName(url.filename().string(), isValidForContainerClass);
+}
+
+bool STWContainerCache::_isContainerName(const std::string& name, STWContainerClass containerClass) const {
     if (STWUUID::fromString(name))
         return true;
-    if (isValidForContainerClass == STWContainerClassDataSystem ||
-        isValidForContainerClass == STWContainerClassSharedSystemGroup)
-        return _isWellKnownContainerName(name, isValidForContainerClass);
+    if (containerClass == STWContainerClassDataSystem || containerClass == STWContainerClassSharedSystemGroup)
+        return _isWellKnownContainerName(name, containerClass);
     return false;
 }
 
@@ -137,22 +139,44 @@ void STWContainerCache::RebuildMappingPushes::_send() {
     if (_batch.empty())
         return;
     _cache._rebuildMappingQueue->async([this, batch = std::move(_batch)] {
-        for (const STWMetadataRef& record : batch) {
-            if (_exception)
-                return;
-            try {
-                if (!_cache._setSandboxContainerMappingForUserIdentity(record->userIdentity(), record->identifier(),
-                                                                       _contentClass, record->url(), true))
-                    STW_LOG_ERROR(STWLogCategory::Cache,
-                                  "Failed to set container mapping during create/lookup operation of %@, %llu",
-                                  record->identifier(), _contentClass);
-            } catch (...) {
-                _exception = std::current_exception();
-            }
+        if (_exception)
+            return;
+        try {
+            _push(batch);
+        } catch (...) {
+            _exception = std::current_exception();
         }
     });
     _batch.clear();
     _queued = true;
+}
+
+void STWContainerCache::RebuildMappingPushes::_push(const std::vector<STWMetadataRef>& batch) {
+    // After a restart the store holds what the last run pushed: one read of each link
+    // instead of a removal and a new link. Only the others are pushed.
+    constexpr size_t unchecked = SIZE_MAX;
+    std::vector<STWSandboxMappingStore::ItemAndPath> items;
+    std::vector<size_t> itemOfRecord;
+    items.reserve(batch.size());
+    itemOfRecord.reserve(batch.size());
+    for (const STWMetadataRef& record : batch) {
+        auto item = _sandboxMappingItem(record->userIdentity(), record->identifier(), _contentClass);
+        itemOfRecord.push_back(item ? items.size() : unchecked);
+        if (item)
+            items.emplace_back(std::move(*item), record->urlString());
+    }
+    std::vector<bool> current = STWSandboxMappingStore::sharedInstance()->userStateItemsAre(items);
+    for (size_t i = 0; i < batch.size(); ++i) {
+        if (itemOfRecord[i] != unchecked && current[itemOfRecord[i]])
+            continue;
+        const STWMetadataRef& record = batch[i];
+        // Without an item this only logs why there is none.
+        if (!_cache._setSandboxContainerMappingForUserIdentity(record->userIdentity(), record->identifier(),
+                                                               _contentClass, record->url()))
+            STW_LOG_ERROR(STWLogCategory::Cache,
+                          "Failed to set container mapping during create/lookup operation of %@, %llu",
+                          record->identifier(), _contentClass);
+    }
 }
 
 void STWContainerCache::RebuildMappingPushes::_drain() {
@@ -212,13 +236,11 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
     // handed out, so nobody is given a container the sandbox cannot resolve yet.
     RebuildMappingPushes pushes(*this, contentClass);
     for (const STWFileManager::DirectoryItem& entry : *entries) {
-        fs::path url = *directory / entry.name;
-        if (!containerURL(url, contentClass))
-            continue;
         // Containers are always real directories (the reader refuses links too; this only
-        // spares it the attempt).
-        if (!entry.isDirectory)
+        // spares it the attempt). The name is checked before a path is built for it.
+        if (!entry.isDirectory || !_isContainerName(entry.name, contentClass))
             continue;
+        fs::path url = *directory / entry.name;
         // The reader logs why a directory is not a container.
         auto record = STWMetadata::readAndValidateMetadataInDirectory(classDirectory.get(), entry.name, url,
                                                                       userIdentity, true, nullptr);
@@ -586,12 +608,10 @@ bool STWContainerCache::setSandboxContainerMappingForUserIdentity(const STWUserI
 bool STWContainerCache::_setSandboxContainerMappingForUserIdentity(const STWUserIdentityRef& userIdentity,
                                                                    const std::string& identifier,
                                                                    STWContainerClass containerClass,
-                                                                   const std::optional<fs::path>& url,
-                                                                   bool keepIfCurrent) {
+                                                                   const std::optional<fs::path>& url) {
     if (STWContainerClassIsBundle(containerClass))
         return true;
-    std::optional<uint32_t> itemType = STWContainerClassSandboxItemType(containerClass);
-    if (!itemType) {
+    if (!STWContainerClassSandboxItemType(containerClass)) {
         STW_LOG_ERROR(STWLogCategory::Sandbox, "Unsupported class for setting sandbox container mapping: %llu",
                       containerClass);
         return false;
@@ -601,21 +621,9 @@ bool STWContainerCache::_setSandboxContainerMappingForUserIdentity(const STWUser
         return false;
     }
 
-    STWSandboxMappingItem item;
-    // System containers belong to no user; their mappings live in the state of user 0.
-    item.uid = STWContainerClassIsSystem(containerClass) ? 0 : userIdentity->posixUIDForContainerClass(containerClass);
-    // Keyed by the kernel persona id, which an identity has at every start; one built
-    // without persona data goes by its user id.
-    item.kernelPersonaID = userIdentity->kernelPersonaID() ? userIdentity->kernelPersonaID() : userIdentity->posixUID();
-    item.itemType = *itemType;
-    item.identifier = identifier;
+    STWSandboxMappingItem item = *_sandboxMappingItem(userIdentity, identifier, containerClass);
     const char* path = url ? url->c_str() : nullptr;
     auto store = STWSandboxMappingStore::sharedInstance();
-
-    // After a restart the store mostly holds what a rebuild pushes already: one read
-    // instead of a removal and a new link.
-    if (keepIfCurrent && url && store->userStateItemIs(item, url->native()))
-        return true;
     // The store leaves its errors to be logged here, after the line that names the mapping.
     STWErrorRef storeError;
     if (!store->setUserStateItem(item, std::nullopt, &storeError)) {
@@ -637,4 +645,21 @@ bool STWContainerCache::_setSandboxContainerMappingForUserIdentity(const STWUser
                   "Pushed user: %u, itemType: %llu, identifier %s, class: %llu, persona id: %d, path: %s", item.uid,
                   item.itemType, identifier, containerClass, item.kernelPersonaID, path);
     return true;
+}
+
+std::optional<STWSandboxMappingItem> STWContainerCache::_sandboxMappingItem(const STWUserIdentityRef& userIdentity,
+                                                                           const std::string& identifier,
+                                                                           STWContainerClass containerClass) {
+    std::optional<uint32_t> itemType = STWContainerClassSandboxItemType(containerClass);
+    if (!itemType || !userIdentity || STWContainerClassIsBundle(containerClass))
+        return std::nullopt;
+    STWSandboxMappingItem item;
+    // System containers belong to no user; their mappings live in the state of user 0.
+    item.uid = STWContainerClassIsSystem(containerClass) ? 0 : userIdentity->posixUIDForContainerClass(containerClass);
+    // Keyed by the kernel persona id, which an identity has at every start; one built
+    // without persona data goes by its user id.
+    item.kernelPersonaID = userIdentity->kernelPersonaID() ? userIdentity->kernelPersonaID() : userIdentity->posixUID();
+    item.itemType = *itemType;
+    item.identifier = identifier;
+    return item;
 }

@@ -25,6 +25,7 @@
 #include "Daemon/Model/STWUserIdentityCache.h"
 #include "common/STWError.h"
 #include "common/STWThreadSafety.h"
+#include "platform/STWSandboxMappingStore.h"
 
 class STWQueue;
 
@@ -106,8 +107,9 @@ private:
     using ClassCache = std::unordered_map<std::string_view, STWMetadataRef>;
 
     // The sandbox mappings a rebuild pushes: handed in batches, in order, to the rebuild
-    // mapping queue, and all done once finish() (or the destructor) returns. finish()
-    // rethrows an exception raised by a push; the pushes after it are not made.
+    // mapping queue, and all done once finish() (or the destructor) returns. Each batch
+    // asks the store once which mappings are current already and pushes the others.
+    // finish() rethrows an exception raised by a push; the pushes after it are not made.
     class RebuildMappingPushes {
     public:
         RebuildMappingPushes(STWContainerCache& cache, STWContainerClass contentClass);
@@ -119,8 +121,11 @@ private:
         void finish();
 
     private:
-        static constexpr size_t kBatchSize = 64;
+        // Large enough that the queue wakes seldom (with one core, each wake-up is a switch
+        // away from the reads), small enough that the last batch adds little after them.
+        static constexpr size_t kBatchSize = 512;
         void _send();
+        void _push(const std::vector<STWMetadataRef>& batch);
         void _drain();
 
         STWContainerCache& _cache;
@@ -172,16 +177,22 @@ private:
     bool _removeContainerForUserIdentity(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass,
                                          const std::string& identifier, bool transient,
                                          const STWMetadataRef& onlyRecord, STWErrorRef* error);
-    // With `keepIfCurrent` a mapping that is already `url` is left as it is (rebuilds).
     bool _setSandboxContainerMappingForUserIdentity(const STWUserIdentityRef& userIdentity,
                                                     const std::string& identifier, STWContainerClass containerClass,
-                                                    const std::optional<std::filesystem::path>& url,
-                                                    bool keepIfCurrent = false);
+                                                    const std::optional<std::filesystem::path>& url);
+    // The store item of a container's mapping; nullopt for a class without one or without
+    // a user identity.
+    static std::optional<STWSandboxMappingItem> _sandboxMappingItem(const STWUserIdentityRef& userIdentity,
+                                                                    const std::string& identifier,
+                                                                    STWContainerClass containerClass);
     // The stale-record check shared by the single and the bulk look-up: nullptr and the
     // (logged) error when the record has no usable path or its metadata file is gone (then
     // the record is dropped).
     STWMetadataRef _validatedRecord(const STWMetadataRef& record, const std::string& cacheName, bool transient,
                                     STWErrorRef* error);
+
+    // containerURL() on the directory entry's name alone.
+    bool _isContainerName(const std::string& name, STWContainerClass containerClass) const;
 
     // Where the cache consults the code-signing mapping.
     void _assertNotOnCodeSigningMappingQueue() const;

@@ -68,7 +68,7 @@ uid_t daemonUser() {
 } // namespace
 
 STWMetadata::STWMetadata(const STWConcreteContainerIdentityRef& containerIdentity,
-                         std::optional<STWValue::Dictionary> info, std::filesystem::path url,
+                         std::optional<STWValue::Dictionary> info, const std::filesystem::path& url,
                          std::optional<std::string> userManagedAssetsDirName)
     : _containerClass(containerIdentity->containerClass()), _userIdentity(containerIdentity->userIdentity()),
       _identifier(containerIdentity->identifier()), _uuid(containerIdentity->uuid()), _url(url.native()),
@@ -194,20 +194,20 @@ std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataAtFileUrl(const
         STWSetError(error, STW_ERROR(STWErrorReadFileFailed, nullptr, "Failed to read metadata at URL %@", fileURL));
         return nullptr;
     }
-    return _readAndValidateMetadata(classfd.get(), (container.filename() / fileURL.filename()).native(), fileURL, container,
-                                    forUserIdentity, checkClassPath, error);
+    return _readAndValidateMetadata(classfd.get(), (container.filename() / fileURL.filename()).native(),
+                                    fileURL.native(), container, forUserIdentity, checkClassPath, error);
 }
 
 std::shared_ptr<STWMetadata> STWMetadata::readAndValidateMetadataInDirectory(int classfd, const std::string& name,
                                                                              const std::filesystem::path& containerURL,
                                                                              const STWUserIdentityRef& forUserIdentity,
                                                                              bool checkClassPath, STWErrorRef* error) {
-    return _readAndValidateMetadata(classfd, name + "/" + fileName, containerURL / fileName, containerURL,
-                                    forUserIdentity, checkClassPath, error);
+    return _readAndValidateMetadata(classfd, name + "/" + fileName, containerURL.native() + "/" + fileName,
+                                    containerURL, forUserIdentity, checkClassPath, error);
 }
 
 std::shared_ptr<STWMetadata> STWMetadata::_readAndValidateMetadata(int dirfd, const std::string& relativePath,
-                                                                   const std::filesystem::path& fileURL,
+                                                                   const std::string& fileURL,
                                                                    const std::filesystem::path& container,
                                                                    const STWUserIdentityRef& forUserIdentity,
                                                                    bool checkClassPath, STWErrorRef* error) {

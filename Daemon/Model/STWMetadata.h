@@ -38,7 +38,7 @@ public:
     static constexpr const char* cachedCodeSigningInfoInfoKey = "com.vorlane.Setwright.CachedCodeSigningInfo";
 
     STWMetadata(const STWConcreteContainerIdentityRef& containerIdentity, std::optional<STWValue::Dictionary> info,
-                std::filesystem::path url, std::optional<std::string> userManagedAssetsDirName);
+                const std::filesystem::path& url, std::optional<std::string> userManagedAssetsDirName);
 
     bool transient() const { return _transient; }
     void setTransient(bool transient) { _transient = transient; }
@@ -50,6 +50,8 @@ public:
     const STWUUID& uuid() const { return _uuid; }
     void setUuid(const STWUUID& uuid) { _uuid = uuid; }
     std::filesystem::path url() const { return std::filesystem::path(_url); }
+    // The same path as text, for callers that would only take the text back out of url().
+    const std::string& urlString() const { return _url; }
     void setUrl(const std::filesystem::path& url) { _url = url.native(); }
     const std::optional<std::string>& userManagedAssetsDirName() const { return _userManagedAssetsDirName; }
     void setUserManagedAssetsDirName(std::optional<std::string> name) { _userManagedAssetsDirName = std::move(name); }
@@ -93,9 +95,10 @@ public:
     static constexpr size_t maximumFileSize = 1u << 20;
 
 private:
-    // Reads `relativePath` beneath `dirfd` (the file at `fileURL` inside `container`).
+    // Reads `relativePath` beneath `dirfd` (the file at `fileURL` inside `container`). The
+    // file's path is text, only for messages: a rebuild reads one file per container.
     static std::shared_ptr<STWMetadata> _readAndValidateMetadata(int dirfd, const std::string& relativePath,
-                                                                 const std::filesystem::path& fileURL,
+                                                                 const std::string& fileURL,
                                                                  const std::filesystem::path& container,
                                                                  const STWUserIdentityRef& forUserIdentity,
                                                                  bool checkClassPath, STWErrorRef* error);

@@ -1,14 +1,19 @@
 #include "Daemon/Lifecycle/STWContainerCache.h"
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
 #include "tests/lifecycle/STWLifecycleTestSupport.h"
+#include "common/STWFileDescriptor.h"
 #include "tests/support/STWTestRoot.h"
 
 #include <gtest/gtest.h>
 
 #include <cerrno>
+#include <fcntl.h>
 #include <fstream>
 #include <set>
+#include <sys/stat.h>
 #include <thread>
+#include <utility>
+#include <vector>
 
 namespace fs = std::filesystem;
 
@@ -101,6 +106,45 @@ TEST_F(STWSandboxMappingTest, MappingsArePushedOnAddAndWithdrawnOnRemove) {
     ASSERT_TRUE(add(STWMakeTestContainer(enterprise, "com.work.mail", 4)));
     ASSERT_TRUE(add(STWMakeTestContainer(mobile, "com.shared.app", 11)));
     EXPECT_EQ(links(), (std::set<fs::path>{base / "501/1001/1/com.work.mail", base / "501/1000/1/com.shared.app"}));
+}
+
+// What a restart finds in the store: the rebuild leaves the links that are right as they
+// are and repairs the others, one link per container.
+TEST_F(STWSandboxMappingTest, ARebuildKeepsCurrentLinksAndRepairsTheOthers) {
+    auto current = STWMakeTestContainer(mobile, "com.example.current", 2);
+    auto escaped = STWMakeTestContainer(mobile, "../escaped", 2);
+    auto wrong = STWMakeTestContainer(mobile, "com.example.wrong", 2);
+    auto longer = STWMakeTestContainer(mobile, "com.example.longer", 2);
+    auto missing = STWMakeTestContainer(mobile, "com.example.missing", 2);
+    fs::path directory = base / "501/1000/1";
+    auto link = [&](const STWTestContainer& container) {
+        return directory / STWSandboxMappingStore::nameForIdentifier(container.metadata->identifier());
+    };
+    fs::create_directories(directory);
+    fs::create_symlink(current.url, link(current));
+    fs::create_symlink(escaped.url, link(escaped));
+    fs::create_symlink(current.url, link(wrong));
+    fs::create_symlink(longer.url.string() + "-old", link(longer));
+    // Held open, the links that must stay keep their inode numbers from new links.
+    std::vector<std::pair<fs::path, STWFileDescriptor>> kept;
+    for (const STWTestContainer* container : {&current, &escaped})
+        kept.emplace_back(link(*container), open(link(*container).c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+
+    STWErrorRef error;
+    ASSERT_TRUE(cache->containerForContainerIdentity(
+        STWContainerIdentity::containerIdentityWithUserIdentity(mobile, "com.example.missing", 2, nullptr), false,
+        true, &error));
+    std::set<fs::path> expected;
+    for (const STWTestContainer* container : {&current, &escaped, &wrong, &longer, &missing}) {
+        EXPECT_EQ(fs::read_symlink(link(*container)), container->url) << container->metadata->identifier();
+        expected.insert(link(*container));
+    }
+    EXPECT_EQ(links(), expected);
+    for (const auto& [path, fd] : kept) {
+        struct stat held, now;
+        ASSERT_TRUE(fstat(fd.get(), &held) == 0 && lstat(path.c_str(), &now) == 0) << path;
+        EXPECT_EQ(held.st_ino, now.st_ino) << path << " was made again";
+    }
 }
 
 TEST_F(STWSandboxMappingTest, IdentifiersThatAreNoFileNameAreStoredEscapedAndNeverClimb) {
