@@ -25,6 +25,8 @@ private:
     void _addContainerCommands(CLI::App& app);
     void _addDeletionCommands(CLI::App& app);
     void _addDevice(CLI::App& app);
+    // STWCTLCommands+Upcall.cpp
+    void _addUpcall(CLI::App& app);
 
     STWCTLSession& _session;
     Action _chosen;
