@@ -122,64 +122,59 @@ void STWUpcallListener::_acceptPending() {
             setsockopt(fd, SOL_SOCKET, SO_SNDBUF, &kReplySendBuffer, sizeof kReplySendBuffer);
         auto connection = std::make_unique<Connection>();
         uint64_t serial = peer->serial();
-        connection->peer = std::move(peer);
-        connection->readable = _loop->watchReadable(fd, [this, serial] { _packetArrived(serial); });
+        connection->peer = std::make_shared<Peer>(Peer{std::move(peer)});
+        connection->readable = _loop->watchReadable(fd, [this, serial] { _packetsArrived(serial); }, true);
         if (!connection->readable) {
-            STW_LOG_ERROR(STWLogCategory::Upcall, "Cannot watch %@: %s", connection->peer, strerror(errno));
+            STW_LOG_ERROR(STWLogCategory::Upcall, "Cannot watch %@: %s", connection->peer->connection,
+                          strerror(errno));
             continue;
         }
         _connections.emplace(serial, std::move(connection));
     }
 }
 
-void STWUpcallListener::_packetArrived(uint64_t serial) {
+void STWUpcallListener::_packetsArrived(uint64_t serial) {
     auto it = _connections.find(serial);
     if (it == _connections.end())
         return;
-    Connection& connection = *it->second;
-    // Not watched again until this packet is answered: one upcall of a connection at a time.
-    connection.readable.setEnabled(false);
-    _queue->async([this, serial, peer = connection.peer, sequence = connection.sequence++] {
-        bool keepOpen = _serveOnePacket(*peer, sequence);
-        _loop->post([this, serial, keepOpen] { _packetServed(serial, keepOpen); });
+    _queue->async([this, serial, peer = it->second->peer] {
+        PacketResult result;
+        while ((result = _serveOnePacket(*peer)) == PacketResult::Served) {
+        }
+        if (result == PacketResult::Close)
+            _loop->post([this, serial] { _close(serial); });
     });
 }
 
-void STWUpcallListener::_packetServed(uint64_t serial, bool keepOpen) {
-    auto it = _connections.find(serial);
-    if (it == _connections.end())
-        return;
-    if (keepOpen)
-        it->second->readable.setEnabled(true);
-    else
-        _connections.erase(it);
-}
+void STWUpcallListener::_close(uint64_t serial) { _connections.erase(serial); }
 
-bool STWUpcallListener::_serveOnePacket(const STWPeerConnection& peer, uint32_t sequence) {
-    int fd = peer.fd();
+STWUpcallListener::PacketResult STWUpcallListener::_serveOnePacket(Peer& peer) {
+    const STWPeerConnection& connection = *peer.connection;
+    int fd = connection.fd();
     // The packet's true size, without taking it.
     ssize_t size = recv(fd, nullptr, 0, MSG_PEEK | MSG_TRUNC | MSG_DONTWAIT);
     if (size < 0 && (errno == EAGAIN || errno == EINTR))
-        return true;
+        return PacketResult::NoneWaiting;
     if (size <= 0)
-        return false; // the peer closed (or failed)
+        return PacketResult::Close; // the peer closed (or failed)
     if (static_cast<size_t>(size) > STWUpcallMaxPacketSize) {
-        STW_LOG_ERROR(STWLogCategory::Upcall, "Closing %@: a packet of %zd bytes is larger than any upcall", peer,
-                      size);
-        return false;
+        STW_LOG_ERROR(STWLogCategory::Upcall, "Closing %@: a packet of %zd bytes is larger than any upcall",
+                      peer.connection, size);
+        return PacketResult::Close;
     }
     std::string packet(static_cast<size_t>(size), '\0');
     if (recv(fd, packet.data(), packet.size(), MSG_DONTWAIT) != size)
-        return false;
+        return PacketResult::Close;
     std::string reply;
-    if (!STWKernServePacket(packet, peer.auditToken(), sequence, &reply)) {
-        STW_LOG_ERROR(STWLogCategory::Upcall, "Closing %@: nothing answers its packet of %zd bytes", peer, size);
-        return false;
+    if (!STWKernServePacket(packet, connection.auditToken(), peer.sequence++, &reply)) {
+        STW_LOG_ERROR(STWLogCategory::Upcall, "Closing %@: nothing answers its packet of %zd bytes", peer.connection,
+                      size);
+        return PacketResult::Close;
     }
     if (send(fd, reply.data(), reply.size(), MSG_DONTWAIT | MSG_NOSIGNAL) != static_cast<ssize_t>(reply.size())) {
-        STW_LOG_ERROR(STWLogCategory::Upcall, "Closing %@: its reply of %zu bytes cannot be sent: %s", peer,
+        STW_LOG_ERROR(STWLogCategory::Upcall, "Closing %@: its reply of %zu bytes cannot be sent: %s", peer.connection,
                       reply.size(), strerror(errno));
-        return false;
+        return PacketResult::Close;
     }
-    return true;
+    return PacketResult::Served;
 }

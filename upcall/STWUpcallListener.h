@@ -4,14 +4,16 @@
 // upcall starts a daemon that exited when idle.
 //
 // Each packet is one upcall (see STWKernTransport.h). Upcalls of every connection are
-// served on one serial queue, one at a time; a connection's next packet is read only once
-// the reply to its last one was sent. A connection is closed when its peer sends what no
-// routine answers, when its packet is larger than STWUpcallMaxPacketSize, or when its
-// reply cannot be sent at once (a peer that does not read its replies holds nothing up).
+// served on one serial queue, one at a time, in the order each connection sent them. A
+// connection is closed when its peer sends what no routine answers, when its packet is
+// larger than STWUpcallMaxPacketSize, or when its reply cannot be sent at once (a peer that
+// does not read its replies holds nothing up).
 //
-// Threads: the event loop accepts and watches the connections, and is the only thread
-// that touches the connection table; the queue reads, serves and replies, and hands each
-// connection back to the loop when done. The object lives for the process once started.
+// Threads: the event loop accepts, watches the connections (edge-triggered: it only hands
+// a connection that received something to the queue) and is the only thread that touches
+// the connection table; the queue reads every packet that arrived, serves and replies, and
+// asks the loop to drop a connection that is to close. The object lives for the process
+// once started.
 #pragma once
 
 #include "common/STWError.h"
@@ -44,18 +46,23 @@ public:
     void stop();
 
 private:
-    struct Connection {
-        std::shared_ptr<STWPeerConnection> peer;
-        STWEventLoop::Source readable;
-        uint32_t sequence = 0;
+    // What the queue keeps of a connection: only the queue touches it.
+    struct Peer {
+        std::shared_ptr<STWPeerConnection> connection;
+        uint32_t sequence = 0; // of the next packet, for the receiver's trailer
     };
+    struct Connection {
+        std::shared_ptr<Peer> peer;
+        STWEventLoop::Source readable;
+    };
+    enum class PacketResult { Served, NoneWaiting, Close };
 
     int _socketFromServiceManager();
     void _acceptPending();
-    void _packetArrived(uint64_t serial);
-    // On the queue: reads one packet and answers it; false when the connection is to close.
-    bool _serveOnePacket(const STWPeerConnection& peer, uint32_t sequence);
-    void _packetServed(uint64_t serial, bool keepOpen);
+    void _packetsArrived(uint64_t serial);
+    // On the queue: reads one packet and answers it.
+    PacketResult _serveOnePacket(Peer& peer);
+    void _close(uint64_t serial);
 
     const std::filesystem::path _socketPath;
     const std::shared_ptr<STWQueue> _queue;
