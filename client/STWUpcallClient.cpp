@@ -142,6 +142,7 @@ std::optional<STWUpcallClient::Reply> STWUpcallClient::replyFromPacket(std::stri
     std::unique_ptr<sb_packbuff, PackbuffFree> pb(
         sb_packbuff_init_with_buffer(buffer.data(), buffer.size(), true, SB_PACKBUFF_DEALLOC_NONE));
     uint16_t tag;
+    bool sawStatus = false;
     while (pb && sb_packbuff_get_item_value_type(pb.get(), &tag)) {
         bool read = true;
         switch (tag) {
@@ -166,7 +167,7 @@ std::optional<STWUpcallClient::Reply> STWUpcallClient::replyFromPacket(std::stri
         case STW_KERN_REPLY_STATUS: {
             int unpackError = 0;
             reply.status = sb_packbuff_unpack_uint32(pb.get(), &unpackError);
-            read = unpackError == 0;
+            read = sawStatus = unpackError == 0;
             break;
         }
         default:
@@ -177,7 +178,7 @@ std::optional<STWUpcallClient::Reply> STWUpcallClient::replyFromPacket(std::stri
             return std::nullopt;
         }
     }
-    if (!reply.status) {
+    if (!sawStatus) {
         STWSetError(error, badReply("no status"));
         return std::nullopt;
     }

@@ -10,7 +10,7 @@
 
 #include "common/STWError.h"
 #include "common/STWFileDescriptor.h"
-#include "upcall/STWKernMessages.h"
+#include "upcall/STWKernProcessContainers.h"
 
 #include <chrono>
 #include <filesystem>
@@ -18,7 +18,6 @@
 #include <optional>
 #include <string>
 #include <string_view>
-#include <utility>
 #include <vector>
 
 class STWUpcallClient {
@@ -34,16 +33,9 @@ public:
         std::vector<std::string> systemGroupIdentifiers;
         std::optional<uint32_t> personaID;
     };
-    // An error reply (returnCode not 0, nothing else set) or the items of a success reply.
-    struct Reply {
+    // The return code of an error reply (nothing else set), or 0 and the items of a success reply.
+    struct Reply : STWKernProcessContainersReply {
         STWKernReturn returnCode = STWKernSuccess;
-        std::optional<std::string> homeDirectory;
-        std::optional<std::string> dataContainer;
-        std::optional<std::string> tempDirectory;
-        std::vector<std::pair<std::string, std::string>> appGroups; // identifier, path
-        std::optional<std::string> systemContainer;
-        std::vector<std::pair<std::string, std::string>> systemGroups;
-        std::optional<uint32_t> status;
     };
 
     // The upcall socket of a daemon started with --root `root`.

@@ -15,6 +15,8 @@ using Pairs = std::vector<std::pair<std::string, std::string>>;
 // The reply as a dictionary for --json; an error reply is its return code alone.
 STWValue::Dictionary replyDictionary(const STWUpcallClient::Reply& reply) {
     STWValue::Dictionary d{{"ReturnCode", STWValue(static_cast<int64_t>(reply.returnCode))}};
+    if (reply.returnCode != STWKernSuccess)
+        return d;
     auto path = [&](const char* key, const std::optional<std::string>& value) {
         if (value)
             d[key] = STWValue(*value);
@@ -32,8 +34,7 @@ STWValue::Dictionary replyDictionary(const STWUpcallClient::Reply& reply) {
     pairs("AppGroups", reply.appGroups);
     path("SystemContainer", reply.systemContainer);
     pairs("SystemGroups", reply.systemGroups);
-    if (reply.status)
-        d["Status"] = STWValue(uint64_t{*reply.status});
+    d["Status"] = STWValue(uint64_t{reply.status});
     return d;
 }
 
@@ -56,7 +57,7 @@ std::string replyText(const STWUpcallClient::Reply& reply) {
     pairs("AppGroup", reply.appGroups);
     path("SystemContainer", reply.systemContainer);
     pairs("SystemGroup", reply.systemGroups);
-    out += "Status: " + std::to_string(reply.status.value_or(0)) + "\n";
+    out += "Status: " + std::to_string(reply.status) + "\n";
     return out;
 }
 
@@ -108,6 +109,7 @@ void STWCTLCommands::_addUpcall(CLI::App& app) {
         }
         std::string text = session.options.json ? STWCTLReplyJSON(replyDictionary(*reply)) + "\n" : replyText(*reply);
         fwrite(text.data(), 1, text.size(), stdout);
+        fflush(stdout);
         if (reply->returnCode != STWKernSuccess || reply->status != 1u) {
             fprintf(stderr, "error: %s\n",
                     reply->returnCode != STWKernSuccess ? "the upcall was refused" : "some container could not be made");
