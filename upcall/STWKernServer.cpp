@@ -145,40 +145,31 @@ STWKernReturn server_get_process_containers(const void* requestMemory, uint32_t 
     connection->setAllowGroupIdLookup(true);
     connection->setUnrestricted(true);
 
+    // Every named container is made, whatever failed before it; one failure turns the status to 0.
     STWKernProcessContainersReply reply;
+    auto make = [&](const std::string& identifier, STWContainerClass containerClass, const char* failure) {
+        auto path = _createOrLookup(*connection, userIdentity, identifier, containerClass, failure);
+        if (!path)
+            reply.status = 0;
+        return path;
+    };
     const std::optional<std::string>& identifier = request.identifier();
     if (identifier) {
         STWContainerClass dataClass = _dataContainerClass(*identifier, request.containerType);
         _checkUID(*connection, dataClass, request.uid);
-        reply.dataContainer = _createOrLookup(*connection, userIdentity, *identifier, dataClass,
-                                              "createOrLookupContainerForUser: Failed with error: %llu");
-        if (!reply.dataContainer)
-            reply.status = 0;
+        reply.dataContainer = make(*identifier, dataClass, "createOrLookupContainerForUser: Failed with error: %llu");
     }
-    if (request.systemContainerIdentifier) {
-        reply.systemContainer = _createOrLookup(
-            *connection, userIdentity, *request.systemContainerIdentifier, 12,
-            "createOrLookupContainerForUser:(system container) Failed with error: %llu");
-        if (!reply.systemContainer)
-            reply.status = 0;
-    }
+    if (request.systemContainerIdentifier)
+        reply.systemContainer = make(*request.systemContainerIdentifier, 12,
+                                     "createOrLookupContainerForUser:(system container) Failed with error: %llu");
     if (!request.appGroupIdentifiers.empty())
         _checkUID(*connection, 7, request.uid);
-    for (const std::string& group : request.appGroupIdentifiers) {
-        auto path = _createOrLookup(*connection, userIdentity, group, 7, "createOrLookupGroupContainersForUser: Failed with error: %llu");
-        if (path)
+    for (const std::string& group : request.appGroupIdentifiers)
+        if (auto path = make(group, 7, "createOrLookupGroupContainersForUser: Failed with error: %llu"))
             reply.appGroups.emplace_back(group, std::move(*path));
-        else
-            reply.status = 0;
-    }
-    for (const std::string& group : request.systemGroupIdentifiers) {
-        auto path = _createOrLookup(*connection, userIdentity, group, 13,
-                                    "createOrLookupContainerForUser:(system group container) Failed with error: %llu");
-        if (path)
+    for (const std::string& group : request.systemGroupIdentifiers)
+        if (auto path = make(group, 13, "createOrLookupContainerForUser:(system group container) Failed with error: %llu"))
             reply.systemGroups.emplace_back(group, std::move(*path));
-        else
-            reply.status = 0;
-    }
 
     if (reply.status == 1) {
         if (reply.dataContainer)
