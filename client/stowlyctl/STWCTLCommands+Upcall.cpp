@@ -6,59 +6,63 @@
 
 #include <cstdio>
 #include <cstring>
+#include <functional>
 #include <unistd.h>
 
 namespace {
 
-using Pairs = std::vector<std::pair<std::string, std::string>>;
+using Reply = STWUpcallClient::Reply;
+// Visits the paths of a success reply in reply order: an item's name, the group identifier
+// for group items, and the path.
+using ItemVisitor = std::function<void(const char* name, const std::string* group, const std::string& path)>;
 
-// The reply as a dictionary for --json; an error reply is its return code alone.
-STWValue::Dictionary replyDictionary(const STWUpcallClient::Reply& reply) {
-    STWValue::Dictionary d{{"ReturnCode", STWValue(static_cast<int64_t>(reply.returnCode))}};
-    if (reply.returnCode != STWKernSuccess)
-        return d;
-    auto path = [&](const char* key, const std::optional<std::string>& value) {
+void forEachItem(const Reply& reply, const ItemVisitor& visit) {
+    auto path = [&](const char* name, const std::optional<std::string>& value) {
         if (value)
-            d[key] = STWValue(*value);
+            visit(name, nullptr, *value);
     };
-    auto pairs = [&](const char* key, const Pairs& value) {
-        STWValue::Dictionary paths;
-        for (const auto& [identifier, p] : value)
-            paths[identifier] = STWValue(p);
-        if (!paths.empty())
-            d[key] = STWValue(std::move(paths));
+    auto groups = [&](const char* name, const std::vector<std::pair<std::string, std::string>>& pairs) {
+        for (const auto& [identifier, value] : pairs)
+            visit(name, &identifier, value);
     };
     path("HomeDirectory", reply.homeDirectory);
     path("DataContainer", reply.dataContainer);
     path("TempDirectory", reply.tempDirectory);
-    pairs("AppGroups", reply.appGroups);
+    groups("AppGroup", reply.appGroups);
     path("SystemContainer", reply.systemContainer);
-    pairs("SystemGroups", reply.systemGroups);
+    groups("SystemGroup", reply.systemGroups);
+}
+
+// The reply as a dictionary for --json (groups under "AppGroups" and "SystemGroups"); an
+// error reply is its return code alone.
+STWValue::Dictionary replyDictionary(const Reply& reply) {
+    STWValue::Dictionary d{{"ReturnCode", STWValue(static_cast<int64_t>(reply.returnCode))}};
+    if (reply.returnCode != STWKernSuccess)
+        return d;
+    STWValue::Dictionary groups[2];
+    forEachItem(reply, [&](const char* name, const std::string* group, const std::string& path) {
+        if (group)
+            groups[strcmp(name, "AppGroup") == 0 ? 0 : 1][*group] = STWValue(path);
+        else
+            d[name] = STWValue(path);
+    });
+    if (!groups[0].empty())
+        d["AppGroups"] = STWValue(std::move(groups[0]));
+    if (!groups[1].empty())
+        d["SystemGroups"] = STWValue(std::move(groups[1]));
     d["Status"] = STWValue(uint64_t{reply.status});
     return d;
 }
 
 // One line per item, in the order of the reply.
-std::string replyText(const STWUpcallClient::Reply& reply) {
+std::string replyText(const Reply& reply) {
     if (reply.returnCode != STWKernSuccess)
         return "ReturnCode: " + std::to_string(reply.returnCode) + "\n";
     std::string out;
-    auto path = [&](const char* name, const std::optional<std::string>& value) {
-        if (value)
-            out += std::string(name) + ": " + *value + "\n";
-    };
-    auto pairs = [&](const char* name, const Pairs& value) {
-        for (const auto& [identifier, p] : value)
-            out += std::string(name) + " " + identifier + ": " + p + "\n";
-    };
-    path("HomeDirectory", reply.homeDirectory);
-    path("DataContainer", reply.dataContainer);
-    path("TempDirectory", reply.tempDirectory);
-    pairs("AppGroup", reply.appGroups);
-    path("SystemContainer", reply.systemContainer);
-    pairs("SystemGroup", reply.systemGroups);
-    out += "Status: " + std::to_string(reply.status) + "\n";
-    return out;
+    forEachItem(reply, [&](const char* name, const std::string* group, const std::string& path) {
+        out += std::string(name) + (group ? " " + *group : std::string()) + ": " + path + "\n";
+    });
+    return out + "Status: " + std::to_string(reply.status) + "\n";
 }
 
 } // namespace

@@ -1,5 +1,6 @@
 // The message layer in-process: which messages demux_server takes and the error replies it
 // makes. Every case here is answered before any container work, so no daemon runs.
+#include "client/STWUpcallClient.h"
 #include "upcall/STWKernServer.h"
 
 #include <gtest/gtest.h>
@@ -12,22 +13,10 @@ namespace {
 // A well-formed request from the kernel for `buffer`, as the transport delivers it.
 STWKernReceivedRequest wellFormed(const std::string& buffer) {
     STWKernReceivedRequest received{};
-    STWKernRequest& request = received.request;
-    request.header = {.bits = STWKernMessageBitsComplex | 18, // a send-once right for the reply
-                      .size = sizeof request,
-                      .remotePort = 0x1234,
-                      .localPort = 0x99,
-                      .voucherPort = 0,
-                      .id = STWKernGetProcessContainersID};
-    request.descriptorCount = 1;
-    request.data = {.address = reinterpret_cast<uintptr_t>(buffer.data()),
-                    .deallocate = 0,
-                    .copy = STWKernCopyVirtual,
-                    .pad = 0,
-                    .type = STWKernDescriptorTypeOutOfLine,
-                    .size = static_cast<uint32_t>(buffer.size())};
-    request.ndr = STWKernNDRRecord;
-    request.dataCount = static_cast<uint32_t>(buffer.size());
+    std::string packet = STWUpcallClient::packetWithBuffer(buffer);
+    memcpy(&received.request, packet.data(), sizeof received.request);
+    received.request.header.remotePort = 0x1234;
+    received.request.data.address = reinterpret_cast<uintptr_t>(buffer.data());
     received.trailer.type = STWKernTrailerFormat0;
     received.trailer.size = sizeof received.trailer;
     return received;
@@ -63,7 +52,7 @@ TEST(STWKernDemuxTest, BadLayoutsGetTheMessageLayersCodes) {
         EXPECT_TRUE(demux_server(&received.request.header, &reply.header)) << c.name;
         EXPECT_EQ(reply.error.returnCode, c.code) << c.name;
         EXPECT_EQ(reply.header.size, sizeof(STWKernErrorReply)) << c.name;
-        EXPECT_EQ(reply.header.bits, 18u) << c.name;
+        EXPECT_EQ(reply.header.bits, 19u) << c.name; // the request's remote disposition
         EXPECT_EQ(reply.header.remotePort, 0x1234u) << c.name;
         EXPECT_EQ(reply.header.localPort, 0u) << c.name;
         EXPECT_EQ(reply.header.id, 322515000u) << c.name;
