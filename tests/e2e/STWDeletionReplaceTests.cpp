@@ -232,6 +232,10 @@ TEST(STWReplaceRecovery, TheNextStartFollowsTheJournal) {
     journal("B.plist", 2, true);
     write(layout.journals() / "C.plist", "not a property list");
     ASSERT_TRUE(daemon.start());
+    // The socket accepts before start-up is done; the first reply comes after it.
+    auto client = daemon.connect();
+    ASSERT_NE(client, nullptr);
+    EXPECT_NE(STWDaemonProcess::replyError(*client, 27), 0u);
     EXPECT_TRUE(fs::is_directory(area / "old1/x"));
     EXPECT_FALSE(fs::exists(area / "parked1"));
     EXPECT_TRUE(fs::is_directory(area / "parked2/x"));
