@@ -109,10 +109,10 @@ STWEventLoop::Source STWEventLoop::_wrap(int result, sd_event_source* source,
     return wrapped;
 }
 
-STWEventLoop::Source STWEventLoop::watchReadable(int fd, std::function<void()> handler) {
+STWEventLoop::Source STWEventLoop::watchReadable(int fd, std::function<void()> handler, bool edgeTriggered) {
     auto owned = std::make_unique<std::function<void()>>(std::move(handler));
     sd_event_source* source = nullptr;
-    int r = sd_event_add_io(_event, &source, fd, EPOLLIN, onIO, owned.get());
+    int r = sd_event_add_io(_event, &source, fd, EPOLLIN | (edgeTriggered ? EPOLLET : 0u), onIO, owned.get());
     return _wrap(r, source, std::move(owned));
 }
 

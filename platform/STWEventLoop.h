@@ -65,8 +65,10 @@ public:
     STWEventLoop& operator=(const STWEventLoop&) = delete;
 
     // Each answers an empty source, with errno set, when sd-event refuses.
-    // `handler` runs whenever `fd` is readable (level-triggered: until it is drained).
-    Source watchReadable(int fd, std::function<void()> handler);
+    // `handler` runs whenever `fd` is readable (level-triggered: until it is drained). With
+    // `edgeTriggered` it runs once each time new data arrives, and whoever it hands the
+    // reading to must read until EAGAIN.
+    Source watchReadable(int fd, std::function<void()> handler, bool edgeTriggered = false);
     // `handler` runs for each delivery of `signal`, which every thread must block.
     Source watchSignal(int signal, std::function<void()> handler);
     // A one-shot timer on the monotonic clock (steady_clock), off until armed.

@@ -15,6 +15,7 @@
 #include "platform/STWPlatformConfiguration.h"
 #include "platform/STWSandboxExtension.h"
 #include "platform/STWTransaction.h"
+#include "upcall/STWKernServer.h"
 
 #include <CLI/CLI.hpp>
 #include <atomic>
@@ -39,12 +40,6 @@ std::atomic<bool> initialisationFinishedFlag{false};
 // Written only by the lock-state callback, on the main thread; read by anyone.
 std::atomic<int> lockState{3};
 bool firstBoot = false;
-
-// The kernel upcall server is not part of this build: start-up records that and goes on.
-bool STWKernServerStart() {
-    STW_LOG_DEBUG(STWLogCategory::Upcall, "The kernel upcall server is not part of this build");
-    return true;
-}
 
 void signpost(const char* interval, bool begin) {
     STW_LOG_DEBUG(STWLogCategory::Tolvan, "%s %s", begin ? "begin" : "end", interval);
@@ -285,6 +280,7 @@ int STWDaemon::main(int argc, char** argv) {
     // A request parked behind a test lock would wait for a release no client can send now.
     if (configuration->isInternalImage())
         STWTestLocks::sharedInstance()->releaseAllLocks();
+    STWKernServerStop();
     bool connectionsEnded = listener.stop(deadline - std::chrono::steady_clock::now());
     if (!connectionsEnded || !STWTransaction::waitForIdle(deadline - std::chrono::steady_clock::now())) {
         // Whatever still runs uses objects that returning from main would destroy: leave

@@ -17,6 +17,7 @@ void STWCTLCommands::addAll(CLI::App& app) {
     _addDeletionCommands(app);
     _addCodeSigningCommands(app);
     _addDevice(app);
+    _addUpcall(app);
     app.require_subcommand(1);
 }
 

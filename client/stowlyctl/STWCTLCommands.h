@@ -26,6 +26,8 @@ private:
     void _addDeletionCommands(CLI::App& app);
     void _addCodeSigningCommands(CLI::App& app);
     void _addDevice(CLI::App& app);
+    // STWCTLCommands+Upcall.cpp
+    void _addUpcall(CLI::App& app);
 
     STWCTLSession& _session;
     Action _chosen;

@@ -33,11 +33,17 @@ std::filesystem::path STWCTLSession::socketPath() const {
     return STWClient::defaultSocketPath();
 }
 
-int STWCTLSession::send(const STWValue::Dictionary& message) {
+std::optional<std::chrono::milliseconds> STWCTLSession::timeout() const {
     if (!std::isfinite(options.timeoutSeconds) || options.timeoutSeconds <= 0)
+        return std::nullopt;
+    return std::chrono::milliseconds(static_cast<int64_t>(std::ceil(std::min(options.timeoutSeconds, 1e9) * 1000)));
+}
+
+int STWCTLSession::send(const STWValue::Dictionary& message) {
+    std::optional<std::chrono::milliseconds> limit = timeout();
+    if (!limit)
         return usageError("--timeout must be a positive number of seconds");
-    auto timeout = std::chrono::milliseconds(
-        static_cast<int64_t>(std::ceil(std::min(options.timeoutSeconds, 1e9) * 1000)));
+    std::chrono::milliseconds timeout = *limit;
 
     std::optional<STWValue::Dictionary> identity;
     if (!options.identifier.empty()) {

@@ -7,6 +7,7 @@
 
 #include "common/STWValue.h"
 
+#include <chrono>
 #include <filesystem>
 #include <optional>
 #include <string>
@@ -38,6 +39,9 @@ public:
     std::filesystem::path root() const;
     // --socket, else the socket under --root, else the production socket.
     std::filesystem::path socketPath() const;
+
+    // --timeout as a duration; nullopt when it is not a positive number of seconds.
+    std::optional<std::chrono::milliseconds> timeout() const;
 
     // Sends `message`, prints the reply and returns the exit status.
     int send(const STWValue::Dictionary& message);
