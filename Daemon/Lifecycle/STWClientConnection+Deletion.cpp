@@ -15,7 +15,8 @@
 #include <algorithm>
 
 bool STWClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& url, bool isDir,
-                                                   bool startDeletionThread, STWErrorRef* error) {
+                                                   bool startDeletionThread, STWErrorRef* error,
+                                                   STWFileManagerMoveOptions options) {
     (void)isDir; // the move takes whatever is there, and checks that it took that
     auto fileManager = STWFileManager::defaultManager();
     auto deathRow = STWGlobalConfiguration::sharedInstance()->deathrowDirectory();
@@ -32,10 +33,8 @@ bool STWClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& 
         }
         STW_CRASH_POINT(STWCrashPoint::deathRowAfterTemporaryDirectory);
         std::filesystem::path destination = *unique / url.filename();
-        // The item may sit in a directory an app owns: nothing on the way is followed. Once
-        // moved, it is gone from where it was even after a power cut.
-        if (fileManager->moveItemAtURLWithoutForeignLinks(url, destination, STWFileManagerMoveSyncSourceDirectory,
-                                                        &stepError))
+        // The item may sit in a directory an app owns: nothing on the way is followed.
+        if (fileManager->moveItemAtURLWithoutForeignLinks(url, destination, options, &stepError))
             break;
         bool missing = stepError && stepError->isPOSIX(ENOENT);
         if (missing && fileManager->itemDoesNotExistAtURL(url))

@@ -232,7 +232,9 @@ bool STWClientConnection::replaceContainerIdentity(const STWConcreteContainerIde
 
     if (!replaceFile.empty()) {
         STWErrorRef cleanupError;
-        if (!_moveItemAtURLToDeathRow(staging, true, false, &cleanupError)) {
+        // The parked container need not leave staging durably: should a power cut bring it
+        // back there, it is garbage that no class directory lists.
+        if (!_moveItemAtURLToDeathRow(staging, true, false, &cleanupError, STWFileManagerMoveDefault)) {
             STW_ERROR(STWErrorRemovePendingFileFailed, cleanupError, "Failed to remove staging dir: %@", staging);
             code = STWErrorRemovePendingFileFailed;
         }

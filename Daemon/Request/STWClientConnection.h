@@ -5,6 +5,7 @@
 #pragma once
 
 #include "common/STWFileDescriptor.h"
+#include "Daemon/FileSystem/STWFileManager.h"
 #include "Daemon/Lifecycle/STWCommandQueue.h"
 #include "Daemon/Model/STWConcreteContainerIdentity.h"
 #include "Daemon/Model/STWContainerClass.h"
@@ -85,8 +86,11 @@ public:
 
     // Death row: moves an item into a fresh "temp." directory of death row (a missing item
     // counts as moved) and optionally starts a deletion pass.
+    // The directory the item left is synced, unless `options` say otherwise (for garbage
+    // that may as well come back after a power cut).
     bool _moveItemAtURLToDeathRow(const std::filesystem::path& url, bool isDir, bool startDeletionThread,
-                                  STWErrorRef* error);
+                                  STWErrorRef* error,
+                                  STWFileManagerMoveOptions options = STWFileManagerMoveSyncSourceDirectory);
     static bool _removeItemOrMoveToTempAtURL(const std::filesystem::path& url, STWErrorRef* error);
     // Empties death row on the death-row queue; the completion gets 1 or the last error's code.
     static void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
