@@ -126,6 +126,12 @@ private:
     STWErrorRef _underlyingError;
 };
 
+// The daemon code an error answers a client with: its own in the daemon's domain, else
+// `otherwise`, the code of the operation that met a failure of another domain.
+inline uint64_t STWDaemonCodeOfError(const STWErrorRef& error, uint64_t otherwise) {
+    return error && error->domain() == STWErrorDomain ? static_cast<uint64_t>(error->code()) : otherwise;
+}
+
 // The one constructor of error objects. `domain` must be one of the constants above.
 STWErrorRef STWErrorCreatev(std::string_view domain, int64_t code, const char* function, uint64_t line,
                             STWErrorRef underlying, bool log, std::string_view format,

@@ -65,12 +65,6 @@ STWCodeSigningMapping::STWCodeSigningMapping(std::shared_ptr<STWUserIdentityCach
 
 void STWCodeSigningMapping::_assertOnQueue(const char* function) const { _queue->assertCurrent(function); }
 
-uint64_t STWCodeSigningMapping::_codeOfError(const STWErrorRef& error) const {
-    if (error && error->domain() == STWErrorDomain)
-        return static_cast<uint64_t>(error->code());
-    return STWErrorDatabase;
-}
-
 std::shared_ptr<STWCodeSigningEntry> STWCodeSigningMapping::_onQueue_entryForIdentifier(const std::string& identifier,
                                                                                         STWErrorRef* error) {
     _assertOnQueue(__func__);
@@ -111,7 +105,7 @@ uint64_t STWCodeSigningMapping::_onQueue_processCodeSigningInfo(
         STWErrorRef readError;
         auto stored = _onQueue_entryForIdentifier(identifier, &readError);
         if (!stored && readError && !isNotFound(readError))
-            return _codeOfError(readError);
+            return STWDaemonCodeOfError(readError, STWErrorDatabase);
 
         STWCodeSigningEntry entry;
         entry.setDataContainerClass(STWDictionaryUInt64(option, "com.vorlane.Stowly.DataContainerClass").value_or(0));
@@ -119,7 +113,7 @@ uint64_t STWCodeSigningMapping::_onQueue_processCodeSigningInfo(
             STWErrorRef parentError;
             auto parentEntry = _onQueue_entryForIdentifier(*parent, &parentError);
             if (!parentEntry && parentError && !isNotFound(parentError))
-                return _codeOfError(parentError);
+                return STWDaemonCodeOfError(parentError, STWErrorDatabase);
             // A parent not stored yet gets an entry without info, which is written only if
             // the parent exists by the time the lists are written.
             STWCodeSigningEntry parentValue = parentEntry ? *parentEntry : STWCodeSigningEntry();
@@ -185,10 +179,13 @@ uint64_t STWCodeSigningMapping::_onQueue_processCodeSigningInfo(
         }
         if (!entries.empty())
             if (STWErrorRef writeError = _onQueue_setCodeSigningDictionaryValues(entries, identifiers))
-                return _codeOfError(writeError);
+                return STWDaemonCodeOfError(writeError, STWErrorDatabase);
         return STWErrorSuccess;
     } catch (...) {
-        return _codeOfError(STWErrorForCurrentException(__func__, __LINE__, STWExceptionReportForImage(STWGlobalConfiguration::sharedInstance()->isInternalImage())));
+        return STWDaemonCodeOfError(
+            STWErrorForCurrentException(__func__, __LINE__,
+                                        STWExceptionReportForImage(STWGlobalConfiguration::sharedInstance()->isInternalImage())),
+            STWErrorDatabase);
     }
 }
 
@@ -247,7 +244,7 @@ uint64_t STWCodeSigningMapping::processCallerRegisteredEntitlements(const STWVal
         STWErrorRef readError;
         auto stored = _onQueue_entryForIdentifier(*identifier, &readError);
         if (!stored && readError && !isNotFound(readError))
-            return _codeOfError(readError);
+            return STWDaemonCodeOfError(readError, STWErrorDatabase);
         if (stored && stored->codeSigningInfo() && !stored->registeredByCaller()) {
             // What the installer provided always wins.
             _onQueue_rememberRegistration(*identifier, {true, {}});
@@ -313,7 +310,7 @@ uint64_t STWCodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBundleCon
         if (!listError)
             return STWErrorSuccess; // nothing stored
         STW_LOG_ERROR(kCategory, "Failed to enumerate containers when invalidating code signing info: %@", listError);
-        return _codeOfError(listError);
+        return STWDaemonCodeOfError(listError, STWErrorDatabase);
     }
     auto cache = STWContainerCache::sharedInstance();
     for (const std::string& identifier : *identifiers) {

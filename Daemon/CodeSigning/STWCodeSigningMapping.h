@@ -183,7 +183,6 @@ private:
     // Runs a parent or children query on the queue, logging failures other than "not found".
     template <class Query>
     auto _familyQuery(const std::string& identifier, const Query& query);
-    uint64_t _codeOfError(const STWErrorRef& error) const;
 
     std::shared_ptr<STWUserIdentityCache> _userIdentityCache;
     std::shared_ptr<STWQueue> _queue;

@@ -176,15 +176,15 @@ bool STWClientConnection::replaceContainerIdentity(const STWConcreteContainerIde
 
         auto replacement = std::make_shared<STWMetadata>(*newRecord);
         STWErrorRef stepError;
-        bool moved = true;
+        bool rewritten = true;
         if (preserveOldUUID && replacement->uuid() != oldRecord->uuid()) {
             // The new content keeps the old UUID on disk as well, before it is in place: the
             // next start reads the container from its metadata file.
             replacement->setUuid(oldRecord->uuid());
             STWFileDescriptor directory = newRecord->openContainerDirectory(&stepError);
-            moved = directory && replacement->writeMetadataToContainerDirectory(directory.get(), &stepError);
+            rewritten = directory && replacement->writeMetadataToContainerDirectory(directory.get(), &stepError);
         }
-        if (!moved ||
+        if (!rewritten ||
             !moveContainerDirectory(*replacement, destination, STWFileManagerMoveSyncDirectories, &stepError)) {
             STW_ERROR(STWErrorReplaceFailed, stepError, "Failed to replace: %@ with: %@ at: %@",
                       oldRecord ? STWFormatArg(oldRecord->url()) : STWFormatArg(nullptr), newRecord->url(),

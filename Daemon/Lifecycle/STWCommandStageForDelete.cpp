@@ -33,10 +33,8 @@ bool STWCommandStageForDelete::fromQueue(STWCommandQueue& queue, uint64_t* error
             } else {
                 STWErrorRef lookupError;
                 record = cache->containerForContainerIdentity(identity, false, true, &lookupError);
-                // The cache reports in the daemon's own codes.
                 if (!record && lookupError)
-                    pending = lookupError->domain() == STWErrorDomain ? static_cast<uint64_t>(lookupError->code())
-                                                                      : uint64_t{STWErrorCacheRebuildFailed};
+                    pending = STWDaemonCodeOfError(lookupError, STWErrorCacheRebuildFailed);
             }
             if (!record)
                 continue;
