@@ -207,7 +207,7 @@ TEST_F(STWFileManagerACLTest, HostileTreeNeverLeadsAWalkOutside) {
         while (!stop.load())
             renameat2(AT_FDCWD, (c / "swap").c_str(), AT_FDCWD, (c / "swap-link").c_str(), RENAME_EXCHANGE);
     });
-    for (int round = 0; round < 20; ++round) {
+    for (int round = 0; round < 200; ++round) {
         fm()->standardizeACLsForSystemContainerAtURL(c);
         fm()->standardizeACLsAtURL(c, false);
         fm()->standardizeOwnershipAtURL(c, 501, 501);
