@@ -54,6 +54,11 @@ std::map<std::string, std::string> snapshot(const fs::path& root, bool directori
         char value[16] = {};
         if (lgetxattr(path.c_str(), "trusted.stowly.protection-class", value, sizeof value) >= 0)
             state += ":class";
+        char acl[256];
+        for (const char* name : {"system.posix_acl_access", "system.posix_acl_default"}) {
+            ssize_t n = lgetxattr(path.c_str(), name, acl, sizeof acl);
+            state += ":" + std::string(acl, n > 0 ? static_cast<size_t>(n) : 0);
+        }
         if (S_ISREG(st.st_mode))
             state += ":" + std::string(std::istreambuf_iterator<char>(std::ifstream(path).rdbuf()), {});
         else if (S_ISLNK(st.st_mode))
@@ -117,27 +122,32 @@ protected:
 };
 
 // A subdirectory of the container swapped, in a loop, with a link to a directory outside it
-// (also the daemon's own library): nothing outside the container changes.
+// (also the daemon's own library): nothing outside the container changes. In a system
+// container, recreating the structure walks the whole container to set its ACLs.
 TEST_F(STWHostileAppTest, SubdirectorySwappedForALinkNeverLeadsOutOfTheContainer) {
-    STWValue::Dictionary identity;
-    fs::path container = create("com.example.swapper", 2, &identity);
-    fs::path ownLibrary = daemon->root() / "private/var/root/Library";
-    ASSERT_TRUE(fs::is_directory(ownLibrary));
-    auto before = snapshot(canary), ownBefore = snapshot(ownLibrary, true);
-    std::atomic<bool> done{false};
-    std::thread app([&] {
-        fs::create_symlink(canary, container / "toCanary");
-        fs::create_symlink(ownLibrary, container / "toOwn");
-        for (unsigned i = 0; !done; ++i)
-            renameat2(AT_FDCWD, (container / "Library").c_str(), AT_FDCWD,
-                      (container / (i % 4 < 2 ? "toCanary" : "toOwn")).c_str(), RENAME_EXCHANGE);
-    });
-    for (int i = 0; i < 300; ++i)
-        STWDaemonProcess::send(*installer, i % 2 ? 8 : 22, identity);
-    done = true;
-    app.join();
-    EXPECT_EQ(snapshot(canary), before);
-    EXPECT_EQ(snapshot(ownLibrary, true), ownBefore);
+    for (uint64_t containerClass : {2u, 12u}) {
+        STWValue::Dictionary identity;
+        fs::path container = create("com.example.swapper", containerClass, &identity);
+        fs::path ownLibrary = daemon->root() / "private/var/root/Library";
+        ASSERT_TRUE(fs::is_directory(ownLibrary));
+        auto before = snapshot(canary), ownBefore = snapshot(ownLibrary, true);
+        std::atomic<bool> done{false};
+        std::thread app([&] {
+            fs::create_symlink(canary, container / "toCanary");
+            fs::create_symlink(ownLibrary, container / "toOwn");
+            mkfifo((container / "fifo").c_str(), 0600);
+            fs::create_symlink("loop", container / "loop");
+            for (unsigned i = 0; !done; ++i)
+                renameat2(AT_FDCWD, (container / "Library").c_str(), AT_FDCWD,
+                          (container / (i % 4 < 2 ? "toCanary" : "toOwn")).c_str(), RENAME_EXCHANGE);
+        });
+        for (int i = 0; i < 300; ++i)
+            STWDaemonProcess::send(*installer, i % 2 ? 8 : 22, identity);
+        done = true;
+        app.join();
+        EXPECT_EQ(snapshot(canary), before) << "class " << containerClass;
+        EXPECT_EQ(snapshot(ownLibrary, true), ownBefore) << "class " << containerClass;
+    }
 }
 
 // The container replaced by a link to a system group container: no command re-owns or fills
