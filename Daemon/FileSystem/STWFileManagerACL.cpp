@@ -430,6 +430,10 @@ bool STWFileManager::standardizeACLsAtURL(const fs::path& url, bool isSystemCont
         return false;
     if (S_ISDIR(root.st.st_mode))
         return standardizeACLsAt(root.fd.get(), url, isSystemContainer, error);
+    if (isSystemContainer) {
+        STWSetError(error, STW_POSIX_ERROR(ENOTDIR, "Could not open %s: %s", path, strerror(ENOTDIR)));
+        return false;
+    }
     if (leftAlone(path))
         return true;
     // Staged content may be a single item.
