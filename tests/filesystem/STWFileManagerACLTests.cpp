@@ -90,6 +90,9 @@ protected:
 TEST_F(STWFileManagerACLTest, SystemContainerWalkGivesEveryItemTheGroupEntryAndTheRootTheTopLevelACL) {
     fs::path c = makeContainer("system");
     fs::permissions(c, fs::perms(0755));
+    // An item that cannot be changed is passed over; the rest is still done.
+    writeFile(c / "Library/locked", "l", 0644);
+    setImmutable(c / "Library/locked", true);
     std::string metadata = fingerprint(c / kMetadata), nested = fingerprint(c / "Library" / kMetadata);
 
     for (int pass = 0; pass < 2; ++pass) { // a second walk finds nothing to change
