@@ -93,6 +93,17 @@ std::optional<gid_t> STWUserDatabase::groupIDWithName(std::string_view name) {
     return result->gr_gid;
 }
 
+uid_t STWUserDatabase::nobodyUID() {
+    auto user = userWithName("nobody");
+    return user ? user->uid : 65534;
+}
+
+gid_t STWUserDatabase::nobodyGID() {
+    if (auto group = groupIDWithName("nogroup"))
+        return *group;
+    return groupIDWithName("nobody").value_or(65534);
+}
+
 std::filesystem::path STWUserDatabase::homeDirectoryURLForPOSIXUID(uid_t uid) {
     char real[PATH_MAX] = {};
     auto user = userWithUID(uid);

@@ -37,6 +37,10 @@
 inline constexpr uid_t STWFileManagerOwnerUnchanged = 0;
 inline constexpr int32_t STWFileManagerClassUnchanged = -1;
 
+// The name of a container's metadata file, which the ACL and ownership walks leave alone
+// (STWMetadata keeps the file; the file layer sits below it).
+inline constexpr const char* STWContainerMetadataFileName = ".com.vorlane.stowly.metadata.plist";
+
 enum STWFileManagerMoveOptions : unsigned {
     STWFileManagerMoveDefault = 0,
     // Make the move survive a power cut once it has been acknowledged: everything that is
@@ -277,6 +281,45 @@ public:
     // A file system without the flag succeeds.
     bool setUserImmutableOfItemAtURL(const std::filesystem::path& url, bool immutable,
                                      STWErrorRef* error = nullptr) const;
+
+    // MARK: ACLs and ownership of container trees
+    //
+    // System containers (and system group containers) are shared by system processes of
+    // different users: what lies below the container directory is owned by nobody, has no
+    // permission bits and carries one ACL entry that gives the group "systemusers" full
+    // access; the container directory itself lets the group create items and hands full
+    // rights down through its default ACL. Ordinary containers get owner and modes instead.
+    // The walks never follow a link and never act outside the tree, however its owner
+    // rearranges it meanwhile: they act on descriptors opened from the parent's descriptor.
+    // An item they cannot change is logged and skipped; only a walk that cannot start or
+    // read a directory fails. The container's metadata file (and anything whose name
+    // contains its name) is left alone, and so is an item with hard links that were not
+    // all met inside the tree. ACL failures are code 63; a missing "systemusers" group is
+    // one. The path forms open the root without following a link; the descriptor forms act
+    // on the directory open as `rootfd` (`path` names it in errors and logs).
+
+    // The container directory's ACL: the group may create and name items there; everything
+    // made below inherits full access.
+    bool setTopLevelSystemContainerACLAtURL(const std::filesystem::path& url, STWErrorRef* error = nullptr) const;
+    bool setTopLevelSystemContainerACLAt(int rootfd, const std::filesystem::path& path,
+                                         STWErrorRef* error = nullptr) const;
+    // Every item below the root: mode 000, owner and group nobody, the group's ACL. The root
+    // gets the top-level ACL when `isSystemContainer` (mode and owner untouched), else the
+    // same as everything below (content staged into a system group container).
+    bool standardizeACLsAtURL(const std::filesystem::path& url, bool isSystemContainer,
+                              STWErrorRef* error = nullptr) const;
+    bool standardizeACLsAt(int rootfd, const std::filesystem::path& path, bool isSystemContainer,
+                           STWErrorRef* error = nullptr) const;
+    bool standardizeACLsForSystemContainerAtURL(const std::filesystem::path& url, STWErrorRef* error = nullptr) const;
+    // Each entry of a directory of system containers; a missing or empty directory is
+    // success. One container that fails does not stop the others, but fails the result.
+    bool standardizeAllSystemContainerACLsAtURL(const std::filesystem::path& url, STWErrorRef* error = nullptr) const;
+    // Owner (uid, gid) for the tree and the root, mode 0755 for directories and anything with
+    // an execute bit, 0644 for the rest; links are re-owned only.
+    bool standardizeOwnershipAtURL(const std::filesystem::path& url, uid_t uid, gid_t gid,
+                                   STWErrorRef* error = nullptr) const;
+    bool standardizeOwnershipAt(int rootfd, const std::filesystem::path& path, uid_t uid, gid_t gid,
+                                STWErrorRef* error = nullptr) const;
 
     // Tests observe every fsync made for durability, with the path synced.
     static void setSyncObserverForTesting(std::function<void(const std::string& path)> observer);

@@ -13,6 +13,7 @@
 #include "platform/STWContainerLibrary.h"
 #include "platform/STWCrashPoint.h"
 #include "platform/STWPlatformConfiguration.h"
+#include "platform/STWUserDatabase.h"
 
 #include <algorithm>
 
@@ -142,14 +143,17 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
                 metadata = std::make_shared<STWMetadata>(concrete, std::nullopt, staging, std::nullopt);
                 if (!metadata->writeMetadataToContainerDirectory(containerfd.get(), &stepError)) {
                     fail(_codeOfError(stepError), stepError);
-                } else if (STWContainerClassIsSystem(c)) {
-                    // System containers get their ACLs here once ACL handling is part of the
-                    // daemon; until then they keep the modes set above.
-                    STW_LOG_DEBUG(STWLogCategory::Lifecycle, "No system-container ACL for %@: not part of this build",
-                                  staging);
+                } else if (STWContainerClassIsSystem(c) &&
+                           !fileManager->setTopLevelSystemContainerACLAt(containerfd.get(), staging, &stepError)) {
+                    fail(_codeOfError(stepError), stepError);
                 }
                 if (failureCode == STWErrorSuccess &&
                     !_createSubDirectories(containerfd.get(), staging, *metadata, &stepError))
+                    fail(_codeOfError(stepError), stepError);
+                // The subdirectories were made with mode 0, and on Linux the mode's group bits
+                // are the mask of the ACL they inherited: give them their entry in full.
+                if (failureCode == STWErrorSuccess && STWContainerClassIsSystem(c) &&
+                    !fileManager->standardizeACLsAt(containerfd.get(), staging, true, &stepError))
                     fail(_codeOfError(stepError), stepError);
             }
         }
@@ -258,11 +262,12 @@ bool STWClientConnection::recreateDefaultStructureWithContainerIdentity(const ST
             // descriptor of the directory that holds the record's own metadata file.
             STWErrorRef stepError;
             STWFileDescriptor containerfd = found->openContainerDirectory(&stepError);
-            success = containerfd && _createSubDirectories(containerfd.get(), found->url(), *found, &stepError);
+            success = containerfd && _createSubDirectories(containerfd.get(), found->url(), *found, &stepError) &&
+                      (!STWContainerClassIsSystem(found->containerClass()) ||
+                       STWFileManager::defaultManager()->standardizeACLsAt(containerfd.get(), found->url(), true,
+                                                                          &stepError));
             if (!success)
                 *error = containerfd ? _codeOfError(stepError) : uint64_t{STWErrorNotFound};
-            // System containers get their ACLs reapplied here once ACL handling is part of
-            // the daemon.
         } else {
             STW_ERROR(STWErrorNotFound, nullptr, "No Container with identity: %@", identity);
             *error = STWErrorNotFound;
@@ -299,7 +304,7 @@ bool STWClientConnection::_createSubDirectories(int containerfd, const std::file
     STWContainerClass c = metadata.containerClass();
     mode_t mode = STWContainerClassIsSystem(c) ? 0 : 0755;
     uid_t owner = STWContainerClassIsBundle(c)   ? STWPlatformConfiguration::sharedInstance()->installationUID()
-                  : STWContainerClassIsSystem(c) ? static_cast<uid_t>(-2)
+                  : STWContainerClassIsSystem(c) ? STWUserDatabase::nobodyUID()
                                                  : metadata.userIdentity()->posixUIDForContainerClass(c);
     int32_t protectionClass = _dataProtectionClassForContainerMetadata(metadata);
     STWErrorRef listError;

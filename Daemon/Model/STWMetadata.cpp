@@ -12,6 +12,9 @@
 #include <fcntl.h>
 #include <unistd.h>
 
+// The file layer recognises the file by this name, which it cannot take from here.
+static_assert(std::string_view(STWMetadata::fileName) == STWContainerMetadataFileName);
+
 namespace {
 
 constexpr const char* kClassKey = "STWMetadataContentClass";

@@ -7,7 +7,9 @@
 #include "platform/STWAuditToken.h"
 #include "platform/STWSandboxExtension.h"
 
+#include <acl/libacl.h>
 #include <gtest/gtest.h>
+#include <sys/acl.h>
 
 #include <atomic>
 #include <fstream>
@@ -141,6 +143,24 @@ TEST_F(STWContainerCommandsTest, SystemContainersAreNamedAndGuarded) {
     auto reply = STWDaemonProcess::send(*installer, 0, createKeys("com.vorlane.maple", 12));
     ASSERT_EQ(code(reply), STWErrorSuccess);
     EXPECT_EQ(std::filesystem::path(path(reply)).filename(), "com.vorlane.maple");
+    // The group may create items in the container; what lies below is the group's in full.
+    auto aclText = [](const std::filesystem::path& item) {
+        acl_t acl = acl_get_file(item.c_str(), ACL_TYPE_ACCESS);
+        char* text = acl ? acl_to_any_text(acl, nullptr, ',', TEXT_ABBREVIATE | TEXT_NUMERIC_IDS) : nullptr;
+        std::string result = text ? text : "";
+        acl_free(text);
+        acl_free(acl);
+        return result;
+    };
+    EXPECT_NE(aclText(path(reply)).find("g:950:-wx"), std::string::npos) << aclText(path(reply));
+    int subdirectories = 0;
+    for (const auto& item : std::filesystem::directory_iterator(path(reply))) {
+        if (item.is_directory()) {
+            ++subdirectories;
+            EXPECT_EQ(aclText(item.path()), "u::---,g::---,g:950:rwx,m::rwx,o::---") << item.path();
+        }
+    }
+    EXPECT_GT(subdirectories, 0);
 
     // A program asking for its own system container needs more than being itself.
     auto plain = daemon->connectAs("com.example.service", {});
