@@ -62,6 +62,17 @@ bool isStrictlyBelow(const fs::path& path, const fs::path& directory) {
     return p != path.end();
 }
 
+// A relative path split into the directory that holds its last component and that
+// component; nullopt for a path without a last name ("", ".", "a/..", "a/").
+std::optional<std::pair<std::string, std::string>> splitLastComponent(const std::string& relativePath) {
+    fs::path path(relativePath);
+    std::string name = path.filename();
+    if (name.empty() || name == "." || name == "..")
+        return std::nullopt;
+    std::string parent = path.parent_path();
+    return std::pair{parent.empty() ? std::string(".") : parent, name};
+}
+
 std::string randomSuffix() {
     static constexpr char alphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789";
     unsigned char bytes[6] = {};
@@ -439,6 +450,107 @@ bool STWClientConnection::deleteUserManagedAssetWithContainerIdentity(const STWC
             return false;
         }
         return true;
+    });
+}
+
+std::optional<fs::path> STWClientConnection::stageSharedContentForIdentifier(const STWValue& identifier,
+                                                                            const STWValue& sourceRelativePath,
+                                                                            const STWValue& destRelativePath,
+                                                                            uint64_t* error) {
+    return _catchingExceptions<std::optional<fs::path>>(__func__, error, std::nullopt, [&]() -> std::optional<fs::path> {
+        auto identity = STWContainerIdentity::containerIdentityWithUserIdentity(
+            STWUserIdentityCache::defaultUserIdentity(), identifier, STWContainerClassSharedSystemGroup, error);
+        if (!identity)
+            return std::nullopt;
+        const std::string* source = sourceRelativePath.string();
+        const std::string* dest = destRelativePath.string();
+        if (!identifier.string() || !source || !dest) {
+            STW_ERROR(STWErrorInvalidClass, nullptr, "Can't act on invalid input: ID: %@, source: %@, dest: %@",
+                      identifier.description(), sourceRelativePath.description(), destRelativePath.description());
+            *error = STWErrorInvalidClass;
+            return std::nullopt;
+        }
+        if (containsDotDotPathComponents(*source) || containsDotDotPathComponents(*dest)) {
+            STW_ERROR(STWErrorInvalidArgument, nullptr, "Paths can't contain dots. source: %@, dest: %@", *source, *dest);
+            *error = STWErrorInvalidArgument;
+            return std::nullopt;
+        }
+        const std::string& group = identity->identifier();
+        std::optional<std::string> client = clientBundleIdentifier();
+        auto mapping = STWCodeSigningMapping::sharedInstance();
+        auto entitled = mapping && client ? mapping->systemGroupIdentifiersForIdentifier(*client) : std::nullopt;
+        if (!entitled || std::find(entitled->begin(), entitled->end(), group) == entitled->end()) {
+            STW_ERROR(STWErrorNotEntitled, nullptr, "%@ not entitled for system group container %@",
+                      client ? STWFormatArg(*client) : STWFormatArg(nullptr), group);
+            *error = STWErrorNotEntitled;
+            return std::nullopt;
+        }
+        auto cache = STWContainerCache::sharedInstance();
+        STWErrorRef stepError;
+        STWMetadataRef found = cache->containerForContainerIdentity(identity, false, true, &stepError);
+        if (!found) {
+            STW_ERROR(STWErrorNotFound, stepError, "System group container with identifier %@ not found: %@", group,
+                      stepError);
+            *error = STWErrorNotFound;
+            return std::nullopt;
+        }
+        STWIdentifierLockGuard lock(found->containerIdentity()->uuid().string(), STWLockMode::Writing);
+        fs::path container = found->url();
+        auto invalid = [&](const char* which, const std::string& relative) {
+            STW_ERROR(STWErrorInvalidPath, stepError, "Invalid %s URL %@ for %@ at %@", which, container / relative,
+                      group, container);
+            *error = STWErrorInvalidPath;
+            return std::nullopt;
+        };
+        auto fileManager = STWFileManager::defaultManager();
+        STWFileDescriptor containerfd = found->openContainerDirectory(&stepError);
+        if (!containerfd)
+            return invalid("source", *source);
+        // Both parents resolved beneath the container (its own links are followed as long as
+        // they stay inside); the two last names are entries of those parents.
+        auto sourceParts = splitLastComponent(*source);
+        STWFileDescriptor sourceParent;
+        if (sourceParts)
+            sourceParent = fileManager->openBeneath(containerfd.get(), sourceParts->first, O_RDONLY | O_DIRECTORY, 0,
+                                                    STWOpenBeneathDefault, &stepError);
+        // Only a directory or a file of its own is staged: it is opened (never a FIFO or a
+        // link), and a file with other names could be anybody's.
+        struct stat st;
+        STWFileDescriptor item;
+        if (sourceParent && fstatat(sourceParent.get(), sourceParts->second.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0 &&
+            (S_ISDIR(st.st_mode) || (S_ISREG(st.st_mode) && st.st_nlink == 1)))
+            item.reset(openat(sourceParent.get(), sourceParts->second.c_str(),
+                              O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+        struct stat opened;
+        if (!item || fstat(item.get(), &opened) != 0 || !sameItem(opened, st))
+            return invalid("source", *source);
+        auto destParts = splitLastComponent(*dest);
+        STWFileDescriptor destParent;
+        if (destParts)
+            destParent = fileManager->openBeneath(containerfd.get(), destParts->first, O_RDONLY | O_DIRECTORY, 0,
+                                                  STWOpenBeneathDefault, &stepError);
+        std::optional<fs::path> destParentPath = destParent ? pathOfDescriptor(destParent.get()) : std::nullopt;
+        if (!destParentPath)
+            return invalid("dest", *dest);
+        fs::path from = container / *source;
+        fs::path to = *destParentPath / destParts->second;
+        // The tree is the app's no longer: the walk acts on the descriptor just opened. A
+        // file has nothing below it to walk, which the walk reports as ENOTDIR.
+        if (!fileManager->standardizeACLsAt(item.get(), from, false, &stepError) &&
+            !(S_ISREG(st.st_mode) && stepError && stepError->isPOSIX(ENOTDIR))) {
+            STW_ERROR(STWErrorSetACLFailed, stepError, "Failed to standardize ACLs for %@ at %@: %@", group, from,
+                      stepError);
+            *error = STWErrorSetACLFailed;
+            return std::nullopt;
+        }
+        if (!fileManager->moveDirectoryAt(sourceParent.get(), sourceParts->second, destParent.get(), destParts->second,
+                                          item.get(), STWFileManagerMoveSyncDirectories, from, to, &stepError)) {
+            STW_ERROR(STWErrorMoveFailed, stepError, "Failed move for %@ from %@ to: %@: %@", group, from, to,
+                      stepError);
+            *error = STWErrorMoveFailed;
+            return std::nullopt;
+        }
+        return to;
     });
 }
 

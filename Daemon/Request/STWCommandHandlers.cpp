@@ -35,7 +35,6 @@ void _operationNotInThisBuild(const char* command, uint64_t* error) {
 
 STW_COMMAND_NOT_IN_THIS_BUILD(setDataProtection)
 STW_COMMAND_NOT_IN_THIS_BUILD(performDataMigration)
-STW_COMMAND_NOT_IN_THIS_BUILD(stageSharedContent)
 STW_COMMAND_NOT_IN_THIS_BUILD(performPerUserDataMigration)
 
 STW_COMMAND_HANDLER(createOrLookupContainer) {

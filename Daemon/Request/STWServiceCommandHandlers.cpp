@@ -80,6 +80,13 @@ STW_COMMAND_HANDLER(retryTest) {
     connection.retryTestWithNumCrashes(STWDictionaryUInt64(request, "NumRetryCrashes").value_or(0), error);
 }
 
+STW_COMMAND_HANDLER(stageSharedContent) {
+    auto staged = connection.stageSharedContentForIdentifier(
+        valueOrNull(request, "Identifier"), valueOrNull(request, "SourcePath"), valueOrNull(request, "DestPath"), error);
+    if (staged)
+        reply->set("ReplyPath", STWValue(staged->native()));
+}
+
 STW_COMMAND_HANDLER(userManagedAssetsPath) {
     auto identity = assetsContainerIdentity(request, connection, error);
     if (!identity)

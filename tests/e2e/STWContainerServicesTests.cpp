@@ -83,7 +83,53 @@ fs::path makeCanary() {
     return canary;
 }
 
+const STWValue::Dictionary stagingEntitlement{{"com.vorlane.private.Stowly.stageSharedContent", STWValue(true)}};
+constexpr const char* kGroup = "systemgroup.com.example.shared";
+
+STWValue::Dictionary stage(const char* group, const char* source, const char* dest) {
+    return {{"Identifier", STWValue(group)}, {"SourcePath", STWValue(source)}, {"DestPath", STWValue(dest)}};
+}
+
+// The system group container kGroup and a client entitled to stage content into it.
+fs::path makeSharedGroup(STWDaemonProcess& daemon, STWClient& installer, std::unique_ptr<STWClient>* stager) {
+    fs::path group;
+    create(installer, kGroup, 13, &group);
+    STWValue::Dictionary entitlements{
+        {"com.vorlane.security.system-groups", STWValue(STWValue::Array{STWValue(kGroup)})}};
+    EXPECT_EQ(STWDaemonProcess::replyError(installer, 18,
+                                           {{"Identifier", STWValue("com.example.stager")},
+                                            {"CodeSigningInfo", STWValue(STWValue::Dictionary{
+                                                                    {"com.vorlane.Stowly.Entitlements",
+                                                                     STWValue(entitlements)}})}}),
+              STWErrorSuccess);
+    *stager = daemon.connectAs("com.example.stager", stagingEntitlement);
+    return group;
+}
+
 } // namespace
+
+// Staging checks its input before it looks anything up, then the caller's system groups,
+// and moves content only within the group container.
+TEST(STWContainerServices, StagedSharedContentIsCheckedAndMovedWithinTheGroup) {
+    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}});
+    auto installer = daemon.connectAs("com.example.installer", allowed);
+    std::unique_ptr<STWClient> stager;
+    fs::path group = makeSharedGroup(daemon, *installer, &stager);
+    auto stranger = daemon.connectAs("com.example.stranger", stagingEntitlement);
+    EXPECT_EQ(STWDaemonProcess::replyError(*stranger, 26, stage("systemgroup.com.example.none", "a/../b", "c")),
+              STWErrorInvalidArgument);
+    EXPECT_EQ(STWDaemonProcess::replyError(*stranger, 26, stage(kGroup, "a", "b")), STWErrorNotEntitled);
+
+    fs::create_directories(group / "incoming/pkg");
+    writeFile(group / "incoming/pkg/file", 10);
+    auto staged = STWDaemonProcess::send(*stager, 26, stage(kGroup, "incoming/pkg", "pkg"));
+    ASSERT_EQ(code(staged), STWErrorSuccess);
+    EXPECT_EQ(path(staged), group / "pkg");
+    EXPECT_TRUE(fs::exists(group / "pkg/file"));
+    EXPECT_FALSE(fs::exists(group / "incoming/pkg"));
+    EXPECT_EQ(STWDaemonProcess::replyError(*stager, 26, stage(kGroup, "incoming/pkg", "again")), STWErrorInvalidPath);
+    EXPECT_EQ(STWDaemonProcess::replyError(*stager, 26, stage(kGroup, "pkg", "")), STWErrorInvalidPath);
+}
 
 // A value set and removed again (nil), and a UUID regenerated: both survive a restart,
 // which rebuilds everything from the metadata files.
@@ -225,9 +271,9 @@ TEST(STWContainerServices, RetryTestExitsTheDaemonNTimesThenSucceeds) {
     EXPECT_EQ(STWDaemonProcess::replyError(*installer, 0, lookup), STWErrorNotFound);
 }
 
-// What an app can plant in its own container: links to a directory outside in place of its
-// subdirectories and assets, FIFOs, link loops, and its Library swapped with such a link
-// all the while. No command changes anything outside, and each answers promptly.
+// What an app can plant in its own container (and a system process in a system group
+// container): links to a directory outside in place of subdirectories, assets and staged
+// content, FIFOs, link loops, and a directory swapped with such a link all the while. No command changes anything outside, and each answers promptly.
 TEST(STWContainerServices, HostileContainerContentNeverLeadsOut) {
     STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}});
     auto installer = daemon.connectAs("com.example.installer", allowed);
@@ -237,9 +283,15 @@ TEST(STWContainerServices, HostileContainerContentNeverLeadsOut) {
                                     {"CreateIfNecessary", STWValue(true)}};
     fs::path assets = path(STWDaemonProcess::send(*installer, 28, assetsKeys));
     ASSERT_FALSE(assets.empty());
+    std::unique_ptr<STWClient> stager;
+    fs::path group = makeSharedGroup(daemon, *installer, &stager);
     fs::path canary = makeCanary();
     auto before = snapshot(canary);
 
+    fs::create_directories(group / "incoming/pkg");
+    fs::create_symlink(canary, group / "out");
+    fs::create_symlink(canary, group / "toCanary");
+    ASSERT_EQ(mkfifo((group / "fifo").c_str(), 0644), 0);
     fs::remove_all(container / "Library/Caches");
     fs::create_symlink(canary / "Caches", container / "Library/Caches");
     fs::create_symlink(canary, assets / "out");
@@ -254,6 +306,8 @@ TEST(STWContainerServices, HostileContainerContentNeverLeadsOut) {
     std::atomic<bool> done{false};
     std::thread app([&] {
         for (unsigned i = 0; !done; ++i) {
+            renameat2(AT_FDCWD, (group / "incoming").c_str(), AT_FDCWD, (group / "toCanary").c_str(),
+                      RENAME_EXCHANGE);
             if (i % 2)
                 renameat2(AT_FDCWD, (container / "Library").c_str(), AT_FDCWD, (container / "toCanary").c_str(),
                           RENAME_EXCHANGE);
@@ -267,11 +321,15 @@ TEST(STWContainerServices, HostileContainerContentNeverLeadsOut) {
     };
     const std::vector<std::pair<uint64_t, STWValue::Dictionary>> requests = {
         {8, identity},           {23, identity},          {28, assetsKeys},         {29, asset("out/secret")},
-        {29, asset("out")},      {29, asset("fifo")},     {29, asset("loop")},      {29, asset("../Caches/secret")}};
+        {29, asset("out")},      {29, asset("fifo")},     {29, asset("loop")},      {29, asset("../Caches/secret")},
+        {26, stage(kGroup, "out/Caches", "x")}, {26, stage(kGroup, "incoming/pkg", "out/pkg")},
+        {26, stage(kGroup, "fifo", "y")},       {26, stage(kGroup, "incoming/pkg", "pkg")},
+        {26, stage(kGroup, "pkg", "incoming/pkg")}};
     for (int round = 0; round < 20; ++round) {
         for (const auto& [command, keys] : requests) {
             auto start = std::chrono::steady_clock::now();
-            EXPECT_NE(STWDaemonProcess::replyError(*installer, command, keys), 0u) << "command " << command;
+            STWClient& client = command == 26 ? *stager : *installer;
+            EXPECT_NE(STWDaemonProcess::replyError(client, command, keys), 0u) << "command " << command;
             EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(2)) << "command " << command;
         }
     }
