@@ -91,6 +91,11 @@ public:
     bool _moveItemAtURLToDeathRow(const std::filesystem::path& url, bool isDir, bool startDeletionThread,
                                   STWErrorRef* error,
                                   STWFileManagerMoveOptions options = STWFileManagerMoveSyncSourceDirectory);
+    // The same for an item found below a directory someone else owns: the entry `name` of
+    // `parentfd` moves into a fresh "temp." directory only while it is still the item open
+    // as `itemfd` (ESTALE otherwise); the directory it left is synced.
+    bool _moveItemAtToDeathRow(int parentfd, const std::string& name, int itemfd, const std::filesystem::path& url,
+                               STWErrorRef* error);
     static bool _removeItemOrMoveToTempAtURL(const std::filesystem::path& url, STWErrorRef* error);
     // Empties death row on the death-row queue; the completion gets 1 or the last error's code.
     static void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
@@ -160,11 +165,6 @@ public:
                                                                          const STWValue& destRelativePath,
                                                                          uint64_t* error);
     bool retryTestWithNumCrashes(uint64_t numCrashes, uint64_t* error);
-    // Death row for an item found below a directory someone else owns: the entry `name` of
-    // `parentfd` moves into a fresh "temp." directory only while it is still the item open
-    // as `itemfd` (ESTALE otherwise); the directory it left is synced.
-    bool _moveItemAtToDeathRow(int parentfd, const std::string& name, int itemfd, const std::filesystem::path& url,
-                               STWErrorRef* error);
 
     // Start-up work of the daemon's own connection: first-boot and every-start setup,
     // and the cleanups whose completions run later on the background queue.
