@@ -90,7 +90,11 @@ double timeDirectWrite(int directoryfd, const std::string& name, const std::stri
 }
 
 void run(bool quick) {
-    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}});
+    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}}, {}, false);
+    // Its system log goes to a file, as on a device, not to this terminal.
+    daemon.setStandardErrorFile(daemon.root() / "stowlyd.stderr");
+    if (!daemon.start())
+        die("stowlyd did not start");
     auto client = daemon.connectAs("com.example.bench", {{"com.vorlane.private.Stowly.allowed", STWValue(true)}});
     if (!client)
         die("cannot connect to stowlyd");
@@ -106,10 +110,10 @@ void run(bool quick) {
     // (a) 10,000 small files in 100 directories.
     const std::string text(300, 'x');
     for (int d = 0; d < 100; ++d) {
-        fs::path directory = container / "Documents" / ("d" + std::to_string(d));
+        fs::path directory = container / "Documents" / std::to_string(d);
         fs::create_directories(directory);
         for (int f = 0; f < 100; ++f)
-            std::ofstream(directory / ("f" + std::to_string(f))) << text;
+            std::ofstream(directory / std::to_string(f)) << text;
     }
     const int rounds = quick ? 5 : 15;
     std::vector<double> daemonTimes, duTimes;
