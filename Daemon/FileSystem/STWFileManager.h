@@ -164,8 +164,11 @@ public:
     // Bytes allocated to the tree, as du counts them (hard links once, one device). The fast
     // variant prefers statistics the file system maintains when the "fast_container_sizing"
     // feature is on; Linux keeps none, so both end up walking. 0 when it cannot be measured.
-    uint64_t fastDiskUsageForURL(const std::filesystem::path& url) const;
-    uint64_t diskUsageForURL(const std::filesystem::path& url) const;
+    // With `directoryfd` the tree is the directory open there (a container resolved beneath
+    // its class directory) and `url` only names it. The walk never follows a link and opens
+    // nothing but directories, so a FIFO or a link loop an app planted costs one lstat.
+    uint64_t fastDiskUsageForURL(const std::filesystem::path& url, int directoryfd = -1) const;
+    uint64_t diskUsageForURL(const std::filesystem::path& url, int directoryfd = -1) const;
 
     // The real path of `url`, a path a client sent, if it lies inside `ifChildOfURL` (the base
     // itself counts); nullopt otherwise. Refuses ".." components and absolute links, and

@@ -57,10 +57,14 @@ private:
 
 // The directory-statistics query. Linux file systems maintain no per-directory statistics,
 // so the fast-only mode has nothing to answer with.
-int directoryStatistics(const std::string& path, DirectoryStatisticsMode mode, DirectoryStatistics* statistics) {
+int directoryStatistics(const std::string& path, int directoryfd, DirectoryStatisticsMode mode,
+                        DirectoryStatistics* statistics) {
     if (mode == DirectoryStatisticsMode::FastOnly)
         return ENOTSUP;
-    STWFileDescriptor fd(open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    // The walk reads from the descriptor's offset: a caller's descriptor is reopened as "."
+    // rather than consumed.
+    STWFileDescriptor fd(directoryfd >= 0 ? openat(directoryfd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC)
+                                          : open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
     if (!fd)
         return errno;
     struct stat st;
@@ -79,33 +83,33 @@ int maintainDirectoryStatistics(const std::string&) { return ENOTSUP; }
 
 } // namespace
 
-uint64_t STWFileManager::fastDiskUsageForURL(const fs::path& url) const {
+uint64_t STWFileManager::fastDiskUsageForURL(const fs::path& url, int directoryfd) const {
     if (!STWPlatformConfiguration::sharedInstance()->isFeatureEnabled("fast_container_sizing"))
-        return diskUsageForURL(url);
+        return diskUsageForURL(url, directoryfd);
     std::string path = pathString(url);
     TraceInterval trace("CalculatingDiskUsage", path);
     DirectoryStatistics statistics;
-    int e = directoryStatistics(path, DirectoryStatisticsMode::FastOnly, &statistics);
+    int e = directoryStatistics(path, directoryfd, DirectoryStatisticsMode::FastOnly, &statistics);
     if (e == ENOTSUP) {
         if (int m = maintainDirectoryStatistics(path)) {
             STW_LOG_ERROR(STWLogCategory::FS, "Failed to set maintain-dir-stats on %s: (err %d) %s", path, m,
                           strerror(m));
             trace.end(path, 0);
-            return diskUsageForURL(url);
+            return diskUsageForURL(url, directoryfd);
         }
         STW_LOG_NOTICE(STWLogCategory::FS, "Enabled fast directory sizing on [%s]", path);
-        e = directoryStatistics(path, DirectoryStatisticsMode::FastOnly, &statistics);
+        e = directoryStatistics(path, directoryfd, DirectoryStatisticsMode::FastOnly, &statistics);
     }
     if (e) {
         STW_LOG_ERROR(STWLogCategory::FS, "Failed to get dirstats on %s: (err %d) %s", path, e, strerror(e));
         trace.end(path, 0);
-        return diskUsageForURL(url);
+        return diskUsageForURL(url, directoryfd);
     }
     if (statistics.totalSize < 0) {
         STW_LOG_ERROR(STWLogCategory::FS, "Invalid size (%lld) from dirstats on %s: (err %d) %s",
                       statistics.totalSize, path, 0, strerror(0));
         trace.end(path, statistics.descendants);
-        return diskUsageForURL(url);
+        return diskUsageForURL(url, directoryfd);
     }
     uint64_t size = static_cast<uint64_t>(statistics.totalSize);
     STW_LOG_INFO(STWLogCategory::FS, "[%s]: descendants: %llu, total size: %llu", path, statistics.descendants,
@@ -114,7 +118,7 @@ uint64_t STWFileManager::fastDiskUsageForURL(const fs::path& url) const {
     return size;
 }
 
-uint64_t STWFileManager::diskUsageForURL(const fs::path& url) const {
+uint64_t STWFileManager::diskUsageForURL(const fs::path& url, int directoryfd) const {
     std::string path = pathString(url);
     TraceInterval trace("CalculatingDiskUsage", path);
     if (path.empty()) {
@@ -123,7 +127,7 @@ uint64_t STWFileManager::diskUsageForURL(const fs::path& url) const {
         return 0;
     }
     DirectoryStatistics statistics;
-    if (int e = directoryStatistics(path, DirectoryStatisticsMode::ForcedWalk, &statistics)) {
+    if (int e = directoryStatistics(path, directoryfd, DirectoryStatisticsMode::ForcedWalk, &statistics)) {
         STW_LOG_ERROR(STWLogCategory::FS, "Failed to get dirstats on %s using fallback: (err %d) %s", path, e,
                       strerror(e));
         trace.end(path, 0);

@@ -13,16 +13,22 @@
 #include "platform/STWPlatformConfiguration.h"
 
 #include <algorithm>
+#include <fcntl.h>
+#include <functional>
+#include <sys/stat.h>
 
-bool STWClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& url, bool isDir,
-                                                   bool startDeletionThread, STWErrorRef* error,
-                                                   STWFileManagerMoveOptions options) {
-    (void)isDir; // the move takes whatever is there, and checks that it took that
+namespace {
+
+// Moves an item into a fresh "temp." directory of death row with `move` (given that
+// directory). A deletion pass running meanwhile may remove the fresh, still empty directory
+// before the item is renamed into it; the rename's ENOENT then means that, not a missing
+// item (`isGone` tells), and the move is tried again in a new one.
+bool moveIntoDeathRow(const std::filesystem::path& url,
+                      const std::function<bool(const std::filesystem::path& unique, STWErrorRef* error)>& move,
+                      const std::function<bool()>& isGone, bool* moved, STWErrorRef* error) {
     auto fileManager = STWFileManager::defaultManager();
     auto deathRow = STWGlobalConfiguration::sharedInstance()->deathrowDirectory();
-    // A deletion pass running meanwhile may remove the fresh, still empty "temp." directory
-    // before the item is renamed into it; the rename's ENOENT then means that, not a missing
-    // item, and the move is tried again in a new one.
+    *moved = false;
     for (int attempt = 0;; ++attempt) {
         STWErrorRef stepError;
         auto unique = fileManager->createTemporaryDirectoryInDirectoryURL(deathRow, "temp.", &stepError);
@@ -32,22 +38,58 @@ bool STWClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& 
             return false;
         }
         STW_CRASH_POINT(STWCrashPoint::deathRowAfterTemporaryDirectory);
-        std::filesystem::path destination = *unique / url.filename();
-        // The item may sit in a directory an app owns: nothing on the way is followed.
-        if (fileManager->moveItemAtURLWithoutForeignLinks(url, destination, options, &stepError))
-            break;
+        if (move(*unique, &stepError)) {
+            *moved = true;
+            return true;
+        }
         bool missing = stepError && stepError->isPOSIX(ENOENT);
-        if (missing && fileManager->itemDoesNotExistAtURL(url))
+        if (missing && isGone())
             return true; // nothing to move; the empty directory goes with the next pass
         if (!missing || attempt == 8) {
             STWSetError(error, STW_ERROR(STWErrorItemOperationFailed, stepError, "Failed to move item at: %@ to: %@",
-                                         url, destination));
+                                         url, *unique / url.filename()));
             return false;
         }
     }
-    if (startDeletionThread)
+}
+
+} // namespace
+
+bool STWClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& url, bool isDir,
+                                                   bool startDeletionThread, STWErrorRef* error,
+                                                   STWFileManagerMoveOptions options) {
+    (void)isDir; // the move takes whatever is there, and checks that it took that
+    auto fileManager = STWFileManager::defaultManager();
+    bool moved = false;
+    bool ok = moveIntoDeathRow(
+        url,
+        [&](const std::filesystem::path& unique, STWErrorRef* stepError) {
+            // The item may sit in a directory an app owns: nothing on the way is followed.
+            return fileManager->moveItemAtURLWithoutForeignLinks(url, unique / url.filename(), options, stepError);
+        },
+        [&] { return fileManager->itemDoesNotExistAtURL(url); }, &moved, error);
+    if (ok && moved && startDeletionThread)
         deleteContainersOnDeathRowWithCompletion(nullptr);
-    return true;
+    return ok;
+}
+
+bool STWClientConnection::_moveItemAtToDeathRow(int parentfd, const std::string& name, int itemfd,
+                                                const std::filesystem::path& url, STWErrorRef* error) {
+    auto fileManager = STWFileManager::defaultManager();
+    bool moved = false;
+    return moveIntoDeathRow(
+        url,
+        [&](const std::filesystem::path& unique, STWErrorRef* stepError) {
+            STWFileDescriptor uniquefd = fileManager->openDirectoryAtURLWithoutForeignLinks(unique, stepError);
+            return uniquefd && fileManager->moveDirectoryAt(parentfd, name, uniquefd.get(), name, itemfd,
+                                                            STWFileManagerMoveSyncSourceDirectory, url,
+                                                            unique / name, stepError);
+        },
+        [&] {
+            struct stat st;
+            return fstatat(parentfd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0 && errno == ENOENT;
+        },
+        &moved, error);
 }
 
 bool STWClientConnection::_removeItemOrMoveToTempAtURL(const std::filesystem::path& url, STWErrorRef* error) {

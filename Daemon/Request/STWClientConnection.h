@@ -29,7 +29,7 @@
 #include <vector>
 
 // The operations live with their subsystems (Daemon/Lifecycle/STWClientConnection+*.cpp:
-// create-or-lookup, death row, setup); this header is their index.
+// create-or-lookup, death row, replace, services, setup); this header is their index.
 class STWClientConnection {
 public:
     using StringSet = std::set<std::string, std::less<>>;
@@ -91,6 +91,11 @@ public:
     bool _moveItemAtURLToDeathRow(const std::filesystem::path& url, bool isDir, bool startDeletionThread,
                                   STWErrorRef* error,
                                   STWFileManagerMoveOptions options = STWFileManagerMoveSyncSourceDirectory);
+    // The same for an item found below a directory someone else owns: the entry `name` of
+    // `parentfd` moves into a fresh "temp." directory only while it is still the item open
+    // as `itemfd` (ESTALE otherwise); the directory it left is synced.
+    bool _moveItemAtToDeathRow(int parentfd, const std::string& name, int itemfd, const std::filesystem::path& url,
+                               STWErrorRef* error);
     static bool _removeItemOrMoveToTempAtURL(const std::filesystem::path& url, STWErrorRef* error);
     // Empties death row on the death-row queue; the completion gets 1 or the last error's code.
     static void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
@@ -134,6 +139,32 @@ public:
     std::optional<std::map<std::string, STWMetadataRef>>
     groupContainersForOwnerIdentifier(const std::string& ownerIdentifier, const STWUserIdentityRef& userIdentity,
                                       STWContainerClass groupContainerClass, uint64_t* error);
+
+    // Services on one existing container (Lifecycle/STWClientConnection+Services.cpp): its
+    // info values (nil removes the key; 24 for a missing key), a fresh UUID directory, its
+    // disk usage (a bundle's computed once while fast sizing is off), the private assets
+    // directory in an app's Library and the removal of one asset, content staged inside a
+    // system group container, and the retry self-test that exits the daemon. Each takes
+    // the lock its effect needs; below the container directory everything is resolved
+    // beneath its descriptor and nothing leads out of it.
+    bool setInfoValue(const std::optional<STWValue>& value, const STWValue& forKey,
+                      const STWConcreteContainerIdentityRef& containerIdentity, bool useLocking, uint64_t* error);
+    std::optional<STWValue> infoValueForKey(const STWValue& key,
+                                            const STWConcreteContainerIdentityRef& containerIdentity,
+                                            bool useLocking, uint64_t* error);
+    bool regenerateDirectoryUUIDWithContainerIdentity(const STWConcreteContainerIdentityRef& identity,
+                                                      uint64_t* error);
+    uint64_t diskUsageWithContainerIdentity(const STWConcreteContainerIdentityRef& identity, uint64_t* error);
+    std::optional<std::string> userManagedAssetsPathWithContainerIdentity(const STWContainerIdentityRef& identity,
+                                                                          bool isRelative, bool createIfNecessary,
+                                                                          bool* existed, uint64_t* error);
+    bool deleteUserManagedAssetWithContainerIdentity(const STWContainerIdentityRef& identity,
+                                                     const std::optional<std::string>& relativePath, uint64_t* error);
+    std::optional<std::filesystem::path> stageSharedContentForIdentifier(const STWValue& identifier,
+                                                                         const STWValue& sourceRelativePath,
+                                                                         const STWValue& destRelativePath,
+                                                                         uint64_t* error);
+    bool retryTestWithNumCrashes(uint64_t numCrashes, uint64_t* error);
 
     // Start-up work of the daemon's own connection: first-boot and every-start setup,
     // and the cleanups whose completions run later on the background queue.

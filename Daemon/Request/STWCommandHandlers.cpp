@@ -33,15 +33,8 @@ void _operationNotInThisBuild(const char* command, uint64_t* error) {
         _operationNotInThisBuild(#name, error);                                                              \
     }
 
-STW_COMMAND_NOT_IN_THIS_BUILD(setInfoValue)
-STW_COMMAND_NOT_IN_THIS_BUILD(infoValueForKey)
-STW_COMMAND_NOT_IN_THIS_BUILD(regenerateDirectoryUUID)
 STW_COMMAND_NOT_IN_THIS_BUILD(setDataProtection)
-STW_COMMAND_NOT_IN_THIS_BUILD(diskUsage)
 STW_COMMAND_NOT_IN_THIS_BUILD(performDataMigration)
-STW_COMMAND_NOT_IN_THIS_BUILD(stageSharedContent)
-STW_COMMAND_NOT_IN_THIS_BUILD(userManagedAssetsPath)
-STW_COMMAND_NOT_IN_THIS_BUILD(deleteUserManagedAsset)
 STW_COMMAND_NOT_IN_THIS_BUILD(performPerUserDataMigration)
 
 STW_COMMAND_HANDLER(createOrLookupContainer) {
@@ -220,17 +213,6 @@ STW_COMMAND_HANDLER(deleteContainerContent) {
 }
 
 STW_COMMAND_HANDLER(recreateDefaultStructure2) { recreateDefaultStructure(request, reply, connection, error); }
-
-STW_COMMAND_HANDLER(retryTest) {
-    (void)reply;
-    (void)connection;
-    if (!STWGlobalConfiguration::sharedInstance()->isInternalImage()) {
-        STW_LOG_ERROR(STWLogCategory::Tolvan, "People really shouldn't be calling this on non-internal installs!");
-        return;
-    }
-    (void)request;
-    _operationNotInThisBuild("retryTest", error);
-}
 
 STW_COMMAND_HANDLER(unsupportedCommand) {
     (void)request;

@@ -16,6 +16,7 @@ void STWCTLCommands::addAll(CLI::App& app) {
     _addContainerCommands(app);
     _addDeletionCommands(app);
     _addCodeSigningCommands(app);
+    _addServiceCommands(app);
     _addDevice(app);
     _addUpcall(app);
     app.require_subcommand(1);

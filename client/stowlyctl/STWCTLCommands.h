@@ -25,6 +25,8 @@ private:
     void _addContainerCommands(CLI::App& app);
     void _addDeletionCommands(CLI::App& app);
     void _addCodeSigningCommands(CLI::App& app);
+    // STWCTLCommands+Services.cpp
+    void _addServiceCommands(CLI::App& app);
     void _addDevice(CLI::App& app);
     // STWCTLCommands+Upcall.cpp
     void _addUpcall(CLI::App& app);

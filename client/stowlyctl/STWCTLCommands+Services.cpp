@@ -1,0 +1,130 @@
+// The per-container services: info-set, info-get, regenerate-uuid, du, assets-path,
+// assets-delete, stage-shared and retry-test.
+#include "client/stowlyctl/STWCTLArguments.h"
+#include "client/stowlyctl/STWCTLCommands.h"
+
+#include <memory>
+
+void STWCTLCommands::_addServiceCommands(CLI::App& app) {
+    struct Arguments {
+        std::string identifier;
+        uint64_t containerClass = 2;
+        std::string uuid;
+        std::string persona;
+        std::string key;
+        std::string value;
+        std::string source, destination;
+        bool relative = false;
+        bool noCreate = false;
+        uint64_t crashes = 1;
+    };
+    auto arguments = std::make_shared<Arguments>();
+    // The commands on one container named by identifier, class and UUID.
+    auto addConcrete = [&](CLI::App* command) {
+        command->add_option("IDENTIFIER", arguments->identifier, "Container identifier")->required();
+        command->add_option("-c,--class", arguments->containerClass, "Container class (1 to 13)")
+            ->capture_default_str();
+        command->add_option("--uuid", arguments->uuid, "The container's UUID (as created)")->required();
+        command->add_option("--persona", arguments->persona, "Persona unique string of the container's user");
+    };
+    auto concrete = [arguments](uint64_t command, STWCTLSession& session,
+                                STWValue::Dictionary* message) -> int {
+        std::optional<STWUUID> uuid = STWUUID::fromString(arguments->uuid);
+        if (!uuid)
+            return session.usageError("\"" + arguments->uuid + "\" is not a UUID");
+        *message = {{"Command", STWValue(command)},
+                    {"Identifier", STWValue(arguments->identifier)},
+                    {"ContainerClass", STWValue(arguments->containerClass)},
+                    {"UUID", STWValue(*uuid)}};
+        if (!arguments->persona.empty())
+            (*message)["PersonaUniqueString"] = STWValue(arguments->persona);
+        return 0;
+    };
+
+    CLI::App* set = app.add_subcommand("info-set", "Set (or, without a value, remove) a container's info value");
+    addConcrete(set);
+    set->add_option("--key", arguments->key, "Info key")->required();
+    set->add_option("--value", arguments->value, "TYPE:VALUE as for raw (str:hello, u64:3, plist:FILE)");
+    _onRun(set, [arguments, concrete](STWCTLSession& session) {
+        STWValue::Dictionary m;
+        if (int status = concrete(5, session, &m))
+            return status;
+        m["Key"] = STWValue(arguments->key);
+        if (!arguments->value.empty()) {
+            size_t colon = arguments->value.find(':');
+            if (colon == std::string::npos)
+                return session.usageError("--value wants TYPE:VALUE");
+            std::string reason;
+            auto value = STWCTLParseTypedValue(std::string_view(arguments->value).substr(0, colon),
+                                               std::string_view(arguments->value).substr(colon + 1), &reason);
+            if (!value)
+                return session.usageError(reason);
+            m["Value"] = std::move(*value);
+        }
+        return session.send(m);
+    });
+
+    CLI::App* get = app.add_subcommand("info-get", "Show one of a container's info values");
+    addConcrete(get);
+    get->add_option("--key", arguments->key, "Info key")->required();
+    _onRun(get, [arguments, concrete](STWCTLSession& session) {
+        STWValue::Dictionary m;
+        if (int status = concrete(6, session, &m))
+            return status;
+        m["Key"] = STWValue(arguments->key);
+        return session.send(m);
+    });
+
+    CLI::App* regenerate = app.add_subcommand("regenerate-uuid", "Move a container to a new UUID directory");
+    addConcrete(regenerate);
+    _onRun(regenerate, [concrete](STWCTLSession& session) {
+        STWValue::Dictionary m;
+        int status = concrete(9, session, &m);
+        return status ? status : session.send(m);
+    });
+
+    CLI::App* du = app.add_subcommand("du", "Show the bytes a container takes on disk");
+    addConcrete(du);
+    _onRun(du, [concrete](STWCTLSession& session) {
+        STWValue::Dictionary m;
+        int status = concrete(23, session, &m);
+        return status ? status : session.send(m);
+    });
+
+    CLI::App* assets = app.add_subcommand("assets-path", "Create or find an app's user-managed assets directory");
+    assets->add_option("IDENTIFIER", arguments->identifier, "Application identifier")->required();
+    assets->add_flag("--relative", arguments->relative, "Answer the path relative to the data container");
+    assets->add_flag("--no-create", arguments->noCreate, "Only find an existing directory");
+    _onRun(assets, [arguments](STWCTLSession& session) {
+        return session.send({{"Command", STWValue(28)},
+                             {"Identifier", STWValue(arguments->identifier)},
+                             {"IsRelative", STWValue(arguments->relative)},
+                             {"CreateIfNecessary", STWValue(!arguments->noCreate)}});
+    });
+
+    CLI::App* remove = app.add_subcommand("assets-delete", "Delete an item of an app's user-managed assets directory");
+    remove->add_option("IDENTIFIER", arguments->identifier, "Application identifier")->required();
+    remove->add_option("PATH", arguments->source, "Path relative to the assets directory")->required();
+    _onRun(remove, [arguments](STWCTLSession& session) {
+        return session.send({{"Command", STWValue(29)},
+                             {"Identifier", STWValue(arguments->identifier)},
+                             {"SourcePath", STWValue(arguments->source)}});
+    });
+
+    CLI::App* stage = app.add_subcommand("stage-shared", "Move content into place inside a system group container");
+    stage->add_option("GROUP", arguments->identifier, "System group identifier")->required();
+    stage->add_option("SOURCE", arguments->source, "Source, relative to the group container")->required();
+    stage->add_option("DEST", arguments->destination, "Destination, relative to the group container")->required();
+    _onRun(stage, [arguments](STWCTLSession& session) {
+        return session.send({{"Command", STWValue(26)},
+                             {"Identifier", STWValue(arguments->identifier)},
+                             {"SourcePath", STWValue(arguments->source)},
+                             {"DestPath", STWValue(arguments->destination)}});
+    });
+
+    CLI::App* retry = app.add_subcommand("retry-test", "Make the daemon exit N times (internal builds)");
+    retry->add_option("N", arguments->crashes, "Exits before the test succeeds")->capture_default_str();
+    _onRun(retry, [arguments](STWCTLSession& session) {
+        return session.send({{"Command", STWValue(25)}, {"NumRetryCrashes", STWValue(arguments->crashes)}});
+    });
+}

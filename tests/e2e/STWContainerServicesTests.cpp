@@ -1,0 +1,342 @@
+// The services on one container over the socket: info values, UUID regeneration, disk
+// usage, user-managed assets, staged shared content and the retry self-test; and what an
+// app that owns the container can do to them with links, FIFOs and swaps.
+#include "tests/support/STWDaemonProcess.h"
+
+#include "Daemon/FileSystem/STWFileManager.h"
+#include "common/STWError.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <fcntl.h>
+#include <fstream>
+#include <map>
+#include <sys/stat.h>
+#include <thread>
+#include <unistd.h>
+
+namespace fs = std::filesystem;
+
+namespace {
+
+const STWValue::Dictionary allowed{{"com.vorlane.private.Stowly.allowed", STWValue(true)}};
+const STWValue::Dictionary tester{{"com.vorlane.private.Stowly.testability", STWValue(true)}};
+const STWValue::Dictionary internal{{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}};
+
+uint64_t code(const STWValue::Dictionary& reply) { return STWDictionaryUInt64(reply, "ReplyError").value_or(0); }
+fs::path path(const STWValue::Dictionary& reply) {
+    const std::string* p = STWDictionaryString(reply, "ReplyPath");
+    return p ? fs::path(*p) : fs::path();
+}
+
+// Creates the container and answers the keys that name it (identifier, class, UUID).
+STWValue::Dictionary create(STWClient& client, const std::string& identifier, uint64_t containerClass,
+                            fs::path* where = nullptr) {
+    auto reply = STWDaemonProcess::send(client, 0,
+                                        {{"Identifier", STWValue(identifier)},
+                                         {"ContainerClass", STWValue(containerClass)},
+                                         {"CreateIfNecessary", STWValue(true)}});
+    EXPECT_EQ(code(reply), STWErrorSuccess) << identifier;
+    if (where)
+        *where = path(reply);
+    return {{"Identifier", STWValue(identifier)}, {"ContainerClass", STWValue(containerClass)}, {"UUID", reply["ReplyUUID"]}};
+}
+
+STWValue::Dictionary with(STWValue::Dictionary keys, const std::string& key, STWValue value) {
+    keys[key] = std::move(value);
+    return keys;
+}
+
+uint64_t diskUsage(STWClient& client, const STWValue::Dictionary& identity) {
+    auto reply = STWDaemonProcess::send(client, 23, identity);
+    EXPECT_EQ(code(reply), STWErrorSuccess);
+    return STWDictionaryUInt64(reply, "ReplyDiskUsage").value_or(0);
+}
+
+void writeFile(const fs::path& file, size_t bytes) { std::ofstream(file) << std::string(bytes, 'x'); }
+
+// Type, mode, owner and contents (or link target) of every entry below `root`.
+std::map<std::string, std::string> snapshot(const fs::path& root) {
+    std::map<std::string, std::string> entries;
+    std::error_code ec;
+    for (fs::recursive_directory_iterator it(root, ec), end; !ec && it != end; it.increment(ec)) {
+        struct stat st;
+        if (lstat(it->path().c_str(), &st) != 0)
+            continue;
+        std::string state = std::to_string(st.st_mode) + ":" + std::to_string(st.st_uid) + ":" + std::to_string(st.st_gid);
+        if (S_ISREG(st.st_mode))
+            state += ":" + std::string(std::istreambuf_iterator<char>(std::ifstream(it->path()).rdbuf()), {});
+        entries[it->path().lexically_relative(root).string()] = state;
+    }
+    return entries;
+}
+
+// A directory outside the daemon's root that links planted in containers point at.
+fs::path makeCanary() {
+    char templ[] = "/tmp/stowly-canary-XXXXXX";
+    fs::path canary = mkdtemp(templ);
+    fs::create_directories(canary / "Caches");
+    std::ofstream(canary / "secret") << "root only";
+    std::ofstream(canary / "Caches/secret") << "root only";
+    return canary;
+}
+
+const STWValue::Dictionary stagingEntitlement{{"com.vorlane.private.Stowly.stageSharedContent", STWValue(true)}};
+constexpr const char* kGroup = "systemgroup.com.example.shared";
+
+STWValue::Dictionary stage(const char* group, const char* source, const char* dest) {
+    return {{"Identifier", STWValue(group)}, {"SourcePath", STWValue(source)}, {"DestPath", STWValue(dest)}};
+}
+
+// The system group container kGroup and a client entitled to stage content into it.
+fs::path makeSharedGroup(STWDaemonProcess& daemon, STWClient& installer, std::unique_ptr<STWClient>* stager) {
+    fs::path group;
+    create(installer, kGroup, 13, &group);
+    STWValue::Dictionary entitlements{
+        {"com.vorlane.security.system-groups", STWValue(STWValue::Array{STWValue(kGroup)})}};
+    EXPECT_EQ(STWDaemonProcess::replyError(installer, 18,
+                                           {{"Identifier", STWValue("com.example.stager")},
+                                            {"CodeSigningInfo", STWValue(STWValue::Dictionary{
+                                                                    {"com.vorlane.Stowly.Entitlements",
+                                                                     STWValue(entitlements)}})}}),
+              STWErrorSuccess);
+    *stager = daemon.connectAs("com.example.stager", stagingEntitlement);
+    return group;
+}
+
+} // namespace
+
+// Staging checks its input before it looks anything up, then the caller's system groups,
+// and moves content only within the group container.
+TEST(STWContainerServices, StagedSharedContentIsCheckedAndMovedWithinTheGroup) {
+    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}});
+    auto installer = daemon.connectAs("com.example.installer", allowed);
+    std::unique_ptr<STWClient> stager;
+    fs::path group = makeSharedGroup(daemon, *installer, &stager);
+    auto stranger = daemon.connectAs("com.example.stranger", stagingEntitlement);
+    EXPECT_EQ(STWDaemonProcess::replyError(*stranger, 26, stage("systemgroup.com.example.none", "a/../b", "c")),
+              STWErrorInvalidArgument);
+    EXPECT_EQ(STWDaemonProcess::replyError(*stranger, 26, stage(kGroup, "a", "b")), STWErrorNotEntitled);
+
+    fs::create_directories(group / "incoming/pkg");
+    writeFile(group / "incoming/pkg/file", 10);
+    auto staged = STWDaemonProcess::send(*stager, 26, stage(kGroup, "incoming/pkg", "pkg"));
+    ASSERT_EQ(code(staged), STWErrorSuccess);
+    EXPECT_EQ(path(staged), group / "pkg");
+    EXPECT_TRUE(fs::exists(group / "pkg/file"));
+    EXPECT_FALSE(fs::exists(group / "incoming/pkg"));
+    EXPECT_EQ(STWDaemonProcess::replyError(*stager, 26, stage(kGroup, "incoming/pkg", "again")), STWErrorInvalidPath);
+    EXPECT_EQ(STWDaemonProcess::replyError(*stager, 26, stage(kGroup, "pkg", "")), STWErrorInvalidPath);
+}
+
+// A value set and removed again (nil), and a UUID regenerated: both survive a restart,
+// which rebuilds everything from the metadata files.
+TEST(STWContainerServices, InfoValuesAndRegeneratedUUIDAreKeptOnDisk) {
+    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}});
+    auto client = daemon.connectAs("com.example.installer", allowed);
+    fs::path before;
+    auto identity = create(*client, "com.example.info", 2, &before);
+    EXPECT_EQ(STWDaemonProcess::replyError(*client, 5, with(with(identity, "Key", STWValue("kept")), "Value", STWValue(7u))),
+              STWErrorSuccess);
+    EXPECT_EQ(STWDaemonProcess::replyError(*client, 5, with(with(identity, "Key", STWValue("gone")), "Value", STWValue("x"))),
+              STWErrorSuccess);
+    EXPECT_EQ(STWDaemonProcess::replyError(*client, 5, with(identity, "Key", STWValue("gone"))), STWErrorSuccess);
+    EXPECT_EQ(STWDaemonProcess::replyError(*client, 5, with(identity, "Key", STWValue(3u))), STWErrorInvalidArgument);
+    EXPECT_EQ(STWDaemonProcess::replyError(*client, 9, identity), STWErrorSuccess);
+
+    ASSERT_TRUE(daemon.stop());
+    ASSERT_TRUE(daemon.start());
+    client = daemon.connectAs("com.example.installer", allowed);
+    auto kept = STWDaemonProcess::send(*client, 6, with(identity, "Key", STWValue("kept")));
+    ASSERT_EQ(code(kept), STWErrorSuccess);
+    EXPECT_EQ(kept["ReplyInfoValue"], STWValue(7u));
+    auto gone = STWDaemonProcess::send(*client, 6, with(identity, "Key", STWValue("gone")));
+    EXPECT_EQ(code(gone), STWErrorInfoValueNotFound);
+    EXPECT_FALSE(gone.count("ReplyInfoValue"));
+    fs::path after = path(STWDaemonProcess::send(*client, 7, identity));
+    EXPECT_NE(after, before);
+    EXPECT_EQ(after.parent_path(), before.parent_path());
+    EXPECT_TRUE(fs::is_directory(after));
+    EXPECT_FALSE(fs::exists(fs::symlink_status(before)));
+}
+
+// A bundle's size is measured once while fast sizing is off and every time while it is
+// on; test lock 2 parks a measurement until it is released.
+TEST(STWContainerServices, DiskUsageIsCachedForBundlesAndParksBehindTestLock2) {
+    for (bool fast : {false, true}) {
+        SCOPED_TRACE(fast ? "fast sizing" : "no fast sizing");
+        auto settings = internal;
+        settings["Features"] = STWValue(STWValue::Dictionary{{"fast_container_sizing", STWValue(fast)}});
+        STWDaemonProcess daemon(settings);
+        auto client = daemon.connectAs("com.example.installer", allowed);
+        fs::path bundle, data;
+        auto bundleIdentity = create(*client, "com.example.bundle", 1, &bundle);
+        auto dataIdentity = create(*client, "com.example.data", 2, &data);
+        uint64_t first = diskUsage(*client, bundleIdentity);
+        uint64_t firstData = diskUsage(*client, dataIdentity);
+        EXPECT_GT(first, 0u);
+        writeFile(bundle / "late", 1 << 20);
+        writeFile(data / "late", 1 << 20);
+        if (fast)
+            EXPECT_GE(diskUsage(*client, bundleIdentity), first + (1 << 20));
+        else
+            EXPECT_EQ(diskUsage(*client, bundleIdentity), first);
+        EXPECT_GE(diskUsage(*client, dataIdentity), firstData + (1 << 20));
+        if (fast)
+            continue;
+
+        auto control = daemon.connectAs("com.example.tester", tester);
+        ASSERT_EQ(STWDaemonProcess::replyError(*control, 31, {{"TestLock", STWValue(2)}, {"Enable", STWValue(true)}}),
+                  STWErrorSuccess);
+        std::atomic<uint64_t> parked{0};
+        std::thread measure([&] {
+            auto other = daemon.connectAs("com.example.installer", allowed);
+            parked = STWDaemonProcess::replyError(*other, 23, dataIdentity);
+        });
+        std::this_thread::sleep_for(std::chrono::milliseconds(300));
+        EXPECT_EQ(parked.load(), 0u);
+        EXPECT_EQ(STWDaemonProcess::replyError(*control, 31, {{"TestLock", STWValue(2)}, {"Enable", STWValue(false)}}),
+                  STWErrorSuccess);
+        measure.join();
+        EXPECT_EQ(parked.load(), STWErrorSuccess);
+    }
+}
+
+// The assets directory is made once; only what resolves strictly inside it can be deleted,
+// and a link out of it is refused without touching its target.
+TEST(STWContainerServices, UserManagedAssetsStayInsideTheirDirectory) {
+    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}});
+    auto installer = daemon.connectAs("com.example.installer", allowed);
+    fs::path container;
+    create(*installer, "com.example.app", 2, &container);
+    auto app = daemon.connectAs("com.example.app", {});
+    STWValue::Dictionary ask{{"Identifier", STWValue("com.example.app")},
+                             {"IsRelative", STWValue(true)},
+                             {"CreateIfNecessary", STWValue(true)}};
+    auto first = STWDaemonProcess::send(*app, 28, ask);
+    ASSERT_EQ(code(first), STWErrorSuccess);
+    auto second = STWDaemonProcess::send(*app, 28, ask);
+    EXPECT_EQ(second["ReplyExisted"], STWValue(true));
+    EXPECT_EQ(first["ReplyExisted"], STWValue(false));
+    EXPECT_EQ(path(second), path(first));
+    EXPECT_EQ(*path(first).begin(), "Library");
+    EXPECT_EQ(STWDaemonProcess::replyError(*app, 28, with(ask, "Identifier", STWValue("com.example.other"))),
+              STWErrorInvalidArgument);
+    fs::path assets = container / path(first);
+    struct stat st;
+    ASSERT_EQ(stat(assets.c_str(), &st), 0);
+    EXPECT_EQ(st.st_uid, 501u);
+    EXPECT_EQ(st.st_mode & 07777, 0755u);
+
+    fs::path canary = makeCanary();
+    fs::create_symlink(canary, assets / "out");
+    fs::create_directory(assets.string() + "2"); // a sibling whose name begins with the directory's
+    writeFile(assets.string() + "2/file", 1);
+    fs::create_symlink("../" + assets.filename().string() + "2/file", assets / "sibling");
+    writeFile(assets / "doc", 10);
+    auto remove = [&](const char* relative) {
+        return STWDaemonProcess::replyError(*installer, 29,
+                                            {{"Identifier", STWValue("com.example.app")}, {"SourcePath", STWValue(relative)}});
+    };
+    for (const char* refused : {".", "", "out/secret", "out", "sibling", "..", "nothing"})
+        EXPECT_EQ(remove(refused), STWErrorInvalidPath) << refused;
+    EXPECT_EQ(remove("doc"), STWErrorSuccess);
+    EXPECT_FALSE(fs::exists(assets / "doc"));
+    EXPECT_TRUE(fs::is_directory(assets));
+    EXPECT_TRUE(fs::exists(canary / "secret"));
+    EXPECT_TRUE(fs::exists(assets.string() + "2/file"));
+    STWFileManager::defaultManager()->removeItemAtURL(canary);
+}
+
+// The daemon exits N times, one per request, and the request after the last exit succeeds
+// and takes the test container away.
+TEST(STWContainerServices, RetryTestExitsTheDaemonNTimesThenSucceeds) {
+    STWDaemonProcess daemon(internal);
+    for (int exits = 0; exits < 2; ++exits) {
+        auto client = daemon.connectAs("com.example.tester", tester);
+        EXPECT_EQ(STWDaemonProcess::replyError(*client, 25, {{"NumRetryCrashes", STWValue(2u)}}), 0u);
+        EXPECT_EQ(daemon.waitForExit(std::chrono::seconds(10)), 0);
+        ASSERT_TRUE(daemon.start());
+    }
+    auto client = daemon.connectAs("com.example.tester", tester);
+    auto installer = daemon.connectAs("com.example.installer", allowed);
+    STWValue::Dictionary lookup{{"Identifier", STWValue("com.vorlane.retryTest")},
+                                {"ContainerClass", STWValue(2u)},
+                                {"CreateIfNecessary", STWValue(false)}};
+    EXPECT_EQ(STWDaemonProcess::replyError(*installer, 0, lookup), STWErrorSuccess);
+    EXPECT_EQ(STWDaemonProcess::replyError(*client, 25, {{"NumRetryCrashes", STWValue(2u)}}), STWErrorSuccess);
+    EXPECT_TRUE(daemon.isRunning());
+    EXPECT_EQ(STWDaemonProcess::replyError(*installer, 0, lookup), STWErrorNotFound);
+}
+
+// What an app can plant in its own container (and a system process in a system group
+// container): links to a directory outside in place of subdirectories, assets and staged
+// content, FIFOs, link loops, and a directory swapped with such a link all the while. No command changes anything outside, and each answers promptly.
+TEST(STWContainerServices, HostileContainerContentNeverLeadsOut) {
+    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}});
+    auto installer = daemon.connectAs("com.example.installer", allowed);
+    fs::path container;
+    auto identity = create(*installer, "com.example.hostile", 2, &container);
+    STWValue::Dictionary assetsKeys{{"Identifier", STWValue("com.example.hostile")},
+                                    {"CreateIfNecessary", STWValue(true)}};
+    fs::path assets = path(STWDaemonProcess::send(*installer, 28, assetsKeys));
+    ASSERT_FALSE(assets.empty());
+    std::unique_ptr<STWClient> stager;
+    fs::path group = makeSharedGroup(daemon, *installer, &stager);
+    fs::path canary = makeCanary();
+    auto before = snapshot(canary);
+
+    fs::create_directories(group / "incoming/pkg");
+    fs::create_symlink(canary, group / "out");
+    fs::create_symlink(canary, group / "toCanary");
+    ASSERT_EQ(mkfifo((group / "fifo").c_str(), 0644), 0);
+    fs::remove_all(container / "Library/Caches");
+    fs::create_symlink(canary / "Caches", container / "Library/Caches");
+    fs::create_symlink(canary, assets / "out");
+    for (const fs::path& fifo : {container / "fifo", container / "Library/fifo", assets / "fifo"})
+        ASSERT_EQ(mkfifo(fifo.c_str(), 0644), 0);
+    fs::create_symlink("loop2", container / "loop1");
+    fs::create_symlink("loop1", container / "loop2");
+    fs::create_symlink("loop", assets / "loop");
+    fs::create_symlink(canary, container / "toCanary");
+    fs::create_symlink(canary, container / "Library/toCanary");
+
+    std::atomic<bool> done{false};
+    std::thread app([&] {
+        for (unsigned i = 0; !done; ++i) {
+            renameat2(AT_FDCWD, (group / "incoming").c_str(), AT_FDCWD, (group / "toCanary").c_str(),
+                      RENAME_EXCHANGE);
+            if (i % 2)
+                renameat2(AT_FDCWD, (container / "Library").c_str(), AT_FDCWD, (container / "toCanary").c_str(),
+                          RENAME_EXCHANGE);
+            else
+                renameat2(AT_FDCWD, assets.c_str(), AT_FDCWD, (container / "Library/toCanary").c_str(),
+                          RENAME_EXCHANGE);
+        }
+    });
+    auto asset = [](const char* relative) {
+        return STWValue::Dictionary{{"Identifier", STWValue("com.example.hostile")}, {"SourcePath", STWValue(relative)}};
+    };
+    const std::vector<std::pair<uint64_t, STWValue::Dictionary>> requests = {
+        {8, identity},           {23, identity},          {28, assetsKeys},         {29, asset("out/secret")},
+        {29, asset("out")},      {29, asset("fifo")},     {29, asset("loop")},      {29, asset("../Caches/secret")},
+        {26, stage(kGroup, "out/Caches", "x")}, {26, stage(kGroup, "incoming/pkg", "out/pkg")},
+        {26, stage(kGroup, "fifo", "y")},       {26, stage(kGroup, "incoming/pkg", "pkg")},
+        {26, stage(kGroup, "pkg", "incoming/pkg")}};
+    for (int round = 0; round < 20; ++round) {
+        for (const auto& [command, keys] : requests) {
+            auto start = std::chrono::steady_clock::now();
+            STWClient& client = command == 26 ? *stager : *installer;
+            EXPECT_NE(STWDaemonProcess::replyError(client, command, keys), 0u) << "command " << command;
+            EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(2)) << "command " << command;
+        }
+    }
+    done = true;
+    app.join();
+    EXPECT_EQ(snapshot(canary), before);
+    EXPECT_TRUE(daemon.isRunning());
+    EXPECT_EQ(STWDaemonProcess::replyError(*installer, 7, identity), STWErrorSuccess);
+    STWFileManager::defaultManager()->removeItemAtURL(canary);
+}
