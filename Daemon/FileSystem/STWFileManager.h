@@ -305,7 +305,8 @@ public:
                                          STWErrorRef* error = nullptr) const;
     // Every item below the root: mode 000, owner and group nobody, the group's ACL. The root
     // gets the top-level ACL when `isSystemContainer` (mode and owner untouched), else the
-    // same as everything below (content staged into a system group container).
+    // same as everything below (content staged into a system group container, which may
+    // also be a single file).
     bool standardizeACLsAtURL(const std::filesystem::path& url, bool isSystemContainer,
                               STWErrorRef* error = nullptr) const;
     bool standardizeACLsAt(int rootfd, const std::filesystem::path& path, bool isSystemContainer,

@@ -428,27 +428,7 @@ bool STWFileManager::standardizeACLsAtURL(const fs::path& url, bool isSystemCont
     Item root;
     if (!openRoot(path, &root, error))
         return false;
-    if (S_ISDIR(root.st.st_mode))
-        return standardizeACLsAt(root.fd.get(), url, isSystemContainer, error);
-    if (isSystemContainer) {
-        STWSetError(error, STW_POSIX_ERROR(ENOTDIR, "Could not open %s: %s", path, strerror(ENOTDIR)));
-        return false;
-    }
-    if (leftAlone(path))
-        return true;
-    // Staged content may be a single item.
-    auto group = systemUsersGroup(error);
-    if (!group)
-        return false;
-    ACL itemACL = copySystemContainerItemACL(*group, error);
-    if (!itemACL)
-        return false;
-    ACLWalk walk;
-    walk.itemACL = itemACL.get();
-    walk.uid = STWUserDatabase::nobodyUID();
-    walk.gid = STWUserDatabase::nobodyGID();
-    walk.change(root, path);
-    return true;
+    return standardizeACLsAt(root.fd.get(), url, isSystemContainer, error);
 }
 
 bool STWFileManager::standardizeACLsAt(int rootfd, const fs::path& url, bool isSystemContainer,
@@ -478,6 +458,13 @@ bool STWFileManager::standardizeACLsAt(int rootfd, const fs::path& url, bool isS
         trace.end(path, 0);
         return false;
     }
+    bool isDirectory = S_ISDIR(root.st.st_mode);
+    if (isSystemContainer && !isDirectory) {
+        root.fd.release();
+        STWSetError(error, STW_POSIX_ERROR(ENOTDIR, "Could not open %s: %s", path, strerror(ENOTDIR)));
+        trace.end(path, 0);
+        return false;
+    }
     if (isSystemContainer) {
         STWErrorRef rootError;
         if (!setTopLevelACL(root, *group, walk.itemACL, path, &rootError))
@@ -487,7 +474,8 @@ bool STWFileManager::standardizeACLsAt(int rootfd, const fs::path& url, bool isS
         walk.change(root, path);
     }
     root.fd.release(); // the caller's
-    bool ok = walkBelow(rootfd, path, walk, error);
+    // Staged content may be a single item, with nothing below it.
+    bool ok = !isDirectory || walkBelow(rootfd, path, walk, error);
     trace.end(path, 0);
     return ok;
 }

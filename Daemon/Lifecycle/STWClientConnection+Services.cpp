@@ -534,10 +534,8 @@ std::optional<fs::path> STWClientConnection::stageSharedContentForIdentifier(con
             return invalid("dest", *dest);
         fs::path from = container / *source;
         fs::path to = *destParentPath / destParts->second;
-        // The tree is the app's no longer: the walk acts on the descriptor just opened. A
-        // file has nothing below it to walk, which the walk reports as ENOTDIR.
-        if (!fileManager->standardizeACLsAt(item.get(), from, false, &stepError) &&
-            !(S_ISREG(st.st_mode) && stepError && stepError->isPOSIX(ENOTDIR))) {
+        // The tree is the app's no longer: the walk acts on the descriptor just opened.
+        if (!fileManager->standardizeACLsAt(item.get(), from, false, &stepError)) {
             STW_ERROR(STWErrorSetACLFailed, stepError, "Failed to standardize ACLs for %@ at %@: %@", group, from,
                       stepError);
             *error = STWErrorSetACLFailed;

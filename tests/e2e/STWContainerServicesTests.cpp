@@ -129,6 +129,14 @@ TEST(STWContainerServices, StagedSharedContentIsCheckedAndMovedWithinTheGroup) {
     EXPECT_FALSE(fs::exists(group / "incoming/pkg"));
     EXPECT_EQ(STWDaemonProcess::replyError(*stager, 26, stage(kGroup, "incoming/pkg", "again")), STWErrorInvalidPath);
     EXPECT_EQ(STWDaemonProcess::replyError(*stager, 26, stage(kGroup, "pkg", "")), STWErrorInvalidPath);
+
+    // A single file is staged too, and leaves the app's hands like a tree does.
+    writeFile(group / "note", 10);
+    ASSERT_EQ(STWDaemonProcess::replyError(*stager, 26, stage(kGroup, "note", "pkg/note")), STWErrorSuccess);
+    struct stat st;
+    ASSERT_EQ(lstat((group / "pkg/note").c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0707, 0u);
+    EXPECT_EQ(st.st_uid, 65534u); // nobody: the private root's user database has none
 }
 
 // A value set and removed again (nil), and a UUID regenerated: both survive a restart,
