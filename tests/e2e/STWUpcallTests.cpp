@@ -8,6 +8,7 @@
 
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <cstring>
 #include <sys/fsuid.h>
 #include <sys/socket.h>
@@ -342,4 +343,33 @@ TEST(STWUpcallFailureTest, AGroupThatCannotBeMadeLeavesOnlyAStatusOfZero) {
     };
     EXPECT_EQ(lookup("group.com.example.upcall.first"), STWErrorNotFound);
     EXPECT_EQ(lookup("group.com.example.upcall.second"), STWErrorSuccess);
+}
+
+// Stopping waits for the upcall being served: one parked behind a test lock (which SIGTERM
+// releases) still gets its reply, and the daemon exits cleanly.
+TEST(STWUpcallFailureTest, AnUpcallInFlightIsAnsweredBeforeTheDaemonStops) {
+    if (geteuid() != 0)
+        GTEST_SKIP() << "the upcall socket is root's alone: run the tests as root";
+    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}});
+    auto control =
+        daemon.connectAs("com.example.tester", {{"com.vorlane.private.Stowly.testability", STWValue(true)}});
+    ASSERT_NE(control, nullptr);
+    auto client = connectUpcall(daemon);
+    ASSERT_NE(client, nullptr);
+    ASSERT_EQ(
+        STWDaemonProcess::replyError(*control, 31, {{"TestLock", STWValue(1)}, {"Enable", STWValue(true)}}),
+        STWErrorSuccess);
+    std::optional<Reply> reply;
+    std::atomic<bool> answered{false};
+    std::thread launch([&] {
+        STWErrorRef error;
+        reply = client->send(appRequest("com.example.upcall.parked"), kTimeout, &error);
+        answered = true;
+    });
+    std::this_thread::sleep_for(std::chrono::milliseconds(300));
+    EXPECT_FALSE(answered) << "the upcall did not wait for the lock";
+    EXPECT_TRUE(daemon.stop());
+    launch.join();
+    ASSERT_TRUE(reply);
+    EXPECT_EQ(reply->status, 1u);
 }
