@@ -103,7 +103,7 @@ std::optional<std::string> _createOrLookup(STWClientConnection& connection, cons
         STW_ROUTINE_LOG(STWLogLevel::Error, failure, error);
         return std::nullopt;
     }
-    return container->url().native();
+    return container->urlString();
 }
 
 void _logContainers(const std::string& identifier, const STWKernProcessContainersRequest& request,

@@ -172,6 +172,7 @@ void STWUpcallListener::_acceptPending() {
 
 void STWUpcallListener::_serve() {
     pthread_setname_np(pthread_self(), "stowlyd.upcall");
+    _packetBuffer.resize(STWUpcallMaxPacketSize);
     // A launch waits for every upcall: above the default, like user-initiated queues.
     setpriority(PRIO_PROCESS, static_cast<id_t>(gettid()), -5);
     struct Peer {
@@ -241,8 +242,8 @@ void STWUpcallListener::_serve() {
 STWUpcallListener::PacketResult
 STWUpcallListener::_serveOnePacket(const std::shared_ptr<STWPeerConnection>& connection, uint32_t& sequence) {
     int fd = connection->fd();
-    // The packet's true size, without taking it.
-    ssize_t size = recv(fd, nullptr, 0, MSG_PEEK | MSG_TRUNC | MSG_DONTWAIT);
+    // One read takes the packet and tells its true size: a larger one is cut to the buffer.
+    ssize_t size = recv(fd, _packetBuffer.data(), _packetBuffer.size(), MSG_TRUNC | MSG_DONTWAIT);
     if (size < 0 && (errno == EAGAIN || errno == EINTR))
         return PacketResult::NoneWaiting;
     if (size <= 0)
@@ -252,9 +253,7 @@ STWUpcallListener::_serveOnePacket(const std::shared_ptr<STWPeerConnection>& con
                       connection, size);
         return PacketResult::Close;
     }
-    std::string packet(static_cast<size_t>(size), '\0');
-    if (recv(fd, packet.data(), packet.size(), MSG_DONTWAIT) != size)
-        return PacketResult::Close;
+    std::string_view packet(_packetBuffer.data(), static_cast<size_t>(size));
     std::string reply;
     if (!STWKernServePacket(packet, connection->auditToken(), sequence++, &reply)) {
         STW_LOG_ERROR(STWLogCategory::Upcall, "Closing %@: nothing answers its packet of %zd bytes",

@@ -75,6 +75,8 @@ private:
     STWFileDescriptor _wakeFD;
     std::thread _thread;
     std::atomic<size_t> _connectionCount{0};
+    // The upcall thread's only: room for the largest packet.
+    std::vector<char> _packetBuffer;
 
     STWMutex _handoverLock; // a leaf lock
     std::vector<std::shared_ptr<STWPeerConnection>> _handedOver STW_GUARDED_BY(_handoverLock);
