@@ -17,9 +17,13 @@
 //       made), against command 0 creating the data container plus command 13 creating the
 //       groups of another new app; ratio = upcall time / requests time, goal <= 1.2.
 //
-// Latencies are per round trip (p50, p99). The daemon runs with its default settings plus
-// developer mode on a private root in /tmp, its system log in a file. The upcall socket is
-// root's alone, so the benchmark needs root. Usage: stowly_bench_upcall [--quick]
+// Latencies are per round trip (p50, p99). On a virtual machine with few cores, a round trip
+// whose two ends sit on different cores pays for waking an idle core, tens of microseconds;
+// where the scheduler puts the daemon's upcall thread then decides the figures of one
+// sender. `taskset -c N stowly_bench_upcall` puts everything on one core and compares the
+// work alone. The daemon runs with its default settings plus developer mode on a private
+// root in /tmp, its system log in a file. The upcall socket is root's alone, so the
+// benchmark needs root. Usage: stowly_bench_upcall [--quick]
 #include "client/STWUpcallClient.h"
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWLog.h"
