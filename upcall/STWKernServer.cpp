@@ -18,8 +18,8 @@
 
 namespace {
 
-// Made once by STWKernServerStart and kept for the life of the process: queued upcalls
-// and the event loop's handlers refer to it.
+// Made once by STWKernServerStart and kept for the life of the process: its thread and
+// the event loop's handlers refer to it.
 STWUpcallListener* upcallListener = nullptr;
 
 // The data-container class the code-signing mapping recorded for `identifier` (0 when
@@ -103,7 +103,7 @@ std::optional<std::string> _createOrLookup(STWClientConnection& connection, cons
         STW_ROUTINE_LOG(STWLogLevel::Error, failure, error);
         return std::nullopt;
     }
-    return container->url().native();
+    return container->urlString();
 }
 
 void _logContainers(const std::string& identifier, const STWKernProcessContainersRequest& request,
@@ -183,10 +183,8 @@ STWKernReturn server_get_process_containers(const void* requestMemory, uint32_t 
 }
 
 bool STWKernServerStart() {
-    auto queue = STWQueue::create("com.vorlane.stowlyd.upcall",
-                                  {.priority = STWQueue::Priority::UserInitiated, .holdsTransactions = true});
     auto listener = std::make_unique<STWUpcallListener>(
-        STWPlatformConfiguration::sharedInstance()->runtimeDirectory() / "upcall.sock", std::move(queue));
+        STWPlatformConfiguration::sharedInstance()->runtimeDirectory() / "upcall.sock");
     STWErrorRef error;
     if (!listener->checkIn(&error)) {
         STW_LOG_ERROR(STWLogCategory::Upcall, "bootstrap_check_in: %s", error->message());
@@ -200,7 +198,6 @@ bool STWKernServerStart() {
     return true;
 }
 
-void STWKernServerStop() {
-    if (upcallListener)
-        upcallListener->stop();
+bool STWKernServerStop(std::chrono::steady_clock::duration timeout) {
+    return !upcallListener || upcallListener->stop(timeout);
 }

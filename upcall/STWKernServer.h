@@ -3,7 +3,7 @@
 // privileges, and answers with their paths.
 //
 // STWKernServerStart() is run once by the daemon's start-up (a server that cannot start
-// stops the daemon); from then on the upcall socket is served on the serial queue
+// stops the daemon); from then on the upcall socket is served by the upcall thread
 // "com.vorlane.stowlyd.upcall", one upcall at a time, concurrently with requests. The
 // container work takes the same locks as a request's.
 //
@@ -14,12 +14,15 @@
 
 #include "upcall/STWKernMessages.h"
 
+#include <chrono>
+
 // Checks in the upcall socket and starts serving it on the main event loop. False
 // (logged) when the socket cannot be had or watched.
 bool STWKernServerStart();
-// Stops accepting and drops the upcall connections; upcalls already queued still run.
-// On the event loop's thread, or once the loop has stopped.
-void STWKernServerStop();
+// Stops accepting and drops the upcall connections once the upcall being served (if any)
+// is answered; false when that takes longer than `timeout`. On the event loop's thread,
+// or once the loop has stopped.
+bool STWKernServerStop(std::chrono::steady_clock::duration timeout);
 
 // The demultiplexer: `request` is a received message with its trailer
 // (STWKernReceivedRequest), `reply` room for STWKernMaxMessageSize bytes (STWKernReply).

@@ -4,27 +4,33 @@
 // upcall starts a daemon that exited when idle.
 //
 // Each packet is one upcall (see STWKernTransport.h). Upcalls of every connection are
-// served on one serial queue, one at a time, in the order each connection sent them. A
-// connection is closed when its peer sends what no routine answers, when its packet is
-// larger than STWUpcallMaxPacketSize, or when its reply cannot be sent at once (a peer that
-// does not read its replies holds nothing up).
+// served by one thread, "com.vorlane.stowlyd.upcall", one at a time, in the order each
+// connection sent them and taking turns between connections. A connection is closed when
+// its peer sends what no routine answers, when its packet is larger than
+// STWUpcallMaxPacketSize, or when its reply cannot be sent at once (a peer that does not
+// read its replies holds nothing up).
 //
-// Threads: the event loop accepts, watches the connections (edge-triggered: it only hands
-// a connection that received something to the queue) and is the only thread that touches
-// the connection table; the queue reads every packet that arrived, serves and replies, and
-// asks the loop to drop a connection that is to close. The object lives for the process
-// once started.
+// Threads: the event loop accepts and hands each new connection over; the upcall thread
+// owns the connections from then on, waits for their packets itself, serves and replies.
+// An upcall waits for nobody else on its way: on the launch path, a hop through the event
+// loop and a queue's worker cost more than the upcall's own work. Each packet is served
+// under an IPC transaction, so idle exit never cuts one short. The object lives for the
+// process once started.
 #pragma once
 
 #include "common/STWError.h"
 #include "common/STWFileDescriptor.h"
+#include "common/STWThreadSafety.h"
 #include "platform/STWEventLoop.h"
 #include "platform/STWPeerConnection.h"
-#include "platform/STWQueue.h"
 
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
 #include <filesystem>
-#include <map>
 #include <memory>
+#include <thread>
+#include <vector>
 
 // The largest request packet: the layout and a request buffer of 1 MiB, far more than the
 // identifiers and groups of one process take.
@@ -34,42 +40,47 @@ inline constexpr size_t STWUpcallMaxConnections = 64;
 
 class STWUpcallListener {
 public:
-    STWUpcallListener(std::filesystem::path socketPath, std::shared_ptr<STWQueue> queue);
+    explicit STWUpcallListener(std::filesystem::path socketPath);
     STWUpcallListener(const STWUpcallListener&) = delete;
     STWUpcallListener& operator=(const STWUpcallListener&) = delete;
 
     // Takes the socket the service manager passed, or binds and listens at the path.
     bool checkIn(STWErrorRef* error);
-    // Accepts on `loop` from when it runs. Where the loop runs, before it does.
+    // Starts the upcall thread and accepts on `loop` from when it runs. Where the loop
+    // runs, before it does.
     bool resume(STWEventLoop& loop, STWErrorRef* error);
-    // Stops accepting and closes every connection (see STWKernServerStop).
-    void stop();
+    // Stops accepting and tells the upcall thread to close every connection once the
+    // upcall it serves (if any) is answered; true when the thread ended within `timeout`
+    // (and was joined). On the event loop's thread, or once the loop has stopped.
+    bool stop(std::chrono::steady_clock::duration timeout);
 
 private:
-    // What the queue keeps of a connection: only the queue touches it.
-    struct Peer {
-        std::shared_ptr<STWPeerConnection> connection;
-        uint32_t sequence = 0; // of the next packet, for the receiver's trailer
-    };
-    struct Connection {
-        std::shared_ptr<Peer> peer;
-        STWEventLoop::Source readable;
-    };
     enum class PacketResult { Served, NoneWaiting, Close };
 
     int _socketFromServiceManager();
     void _acceptPending();
-    void _packetsArrived(uint64_t serial);
-    // On the queue: reads one packet and answers it.
-    PacketResult _serveOnePacket(Peer& peer);
-    void _close(uint64_t serial);
+    // The upcall thread's loop.
+    void _serve();
+    // On the upcall thread: reads one packet and answers it; `sequence` numbers the
+    // connection's packets for the receiver's trailer.
+    PacketResult _serveOnePacket(const std::shared_ptr<STWPeerConnection>& connection, uint32_t& sequence);
 
     const std::filesystem::path _socketPath;
-    const std::shared_ptr<STWQueue> _queue;
-    STWEventLoop* _loop = nullptr;
     STWFileDescriptor _listenFD;
     bool _socketActivated = false;
     STWEventLoop::Source _acceptSource;
-    // The loop's thread only.
-    std::map<uint64_t, std::unique_ptr<Connection>> _connections;
+    // The upcall thread waits on _epollFD for its connections and for _wakeFD, which says
+    // that connections were handed over or that it is to stop.
+    STWFileDescriptor _epollFD;
+    STWFileDescriptor _wakeFD;
+    std::thread _thread;
+    std::atomic<size_t> _connectionCount{0};
+    // The upcall thread's only: room for the largest packet.
+    std::vector<char> _packetBuffer;
+
+    STWMutex _handoverLock; // a leaf lock
+    std::vector<std::shared_ptr<STWPeerConnection>> _handedOver STW_GUARDED_BY(_handoverLock);
+    bool _stopping STW_GUARDED_BY(_handoverLock) = false;
+    bool _finished STW_GUARDED_BY(_handoverLock) = false;
+    std::condition_variable _finishedCondition;
 };

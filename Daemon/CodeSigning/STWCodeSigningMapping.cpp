@@ -382,8 +382,24 @@ bool STWCodeSigningMapping::identifierHasCallerRegisteredEntitlements(const std:
 }
 
 uint64_t STWCodeSigningMapping::dataContainerTypeForIdentifier(const std::string& identifier) {
-    auto entry = codeSigningEntryForIdentifier(identifier, nullptr);
-    return entry ? entry->dataContainerClass() : 0;
+    {
+        STWLockGuard guard(_registrationsLock);
+        if (auto it = _dataContainerClasses.find(identifier); it != _dataContainerClasses.end())
+            return it->second;
+    }
+    // Read and remembered in one go on the queue, so that no write can come between.
+    return _queue->syncResult([&] {
+        STWErrorRef error;
+        auto entry = _onQueue_entryForIdentifier(identifier, &error);
+        uint64_t dataContainerClass = entry ? entry->dataContainerClass() : 0;
+        if (entry || isNotFound(error)) {
+            STWLockGuard guard(_registrationsLock);
+            if (_dataContainerClasses.size() >= _maxRegistrations)
+                _dataContainerClasses.clear();
+            _dataContainerClasses[identifier] = dataContainerClass;
+        }
+        return dataContainerClass;
+    });
 }
 
 bool STWCodeSigningMapping::identifierHasSystemContainer(const std::string& identifier) {
@@ -452,8 +468,11 @@ void STWCodeSigningMapping::_onQueue_rememberRegistration(const std::string& ide
 void STWCodeSigningMapping::_onQueue_forgetRegistration(const std::optional<std::string>& identifier) {
     _assertOnQueue(__func__);
     STWLockGuard guard(_registrationsLock);
-    if (identifier)
+    if (identifier) {
         _registrations.erase(*identifier);
-    else
+        _dataContainerClasses.erase(*identifier);
+    } else {
         _registrations.clear();
+        _dataContainerClasses.clear();
+    }
 }

@@ -110,6 +110,8 @@ public:
     // app's bundle container is migrated in. Never call from the queue.
     std::optional<STWValue::Dictionary> entitlementsForIdentifier(const std::string& identifier);
     bool identifierHasCallerRegisteredEntitlements(const std::string& identifier);
+    // The recorded data-container class (0 when none is). Asked on every upcall, so it is
+    // answered from memory after the first time, until the identifier's entry is written.
     uint64_t dataContainerTypeForIdentifier(const std::string& identifier);
     bool identifierHasSystemContainer(const std::string& identifier);
     std::optional<STWGroupIdentifierList> appGroupIdentifiersForIdentifier(const std::string& identifier);
@@ -174,8 +176,8 @@ private:
     std::shared_ptr<STWCodeSigningEntry> _onQueue_entryForIdentifier(const std::string& identifier,
                                                                      STWErrorRef* error);
     void _assertOnQueue(const char* function) const;
-    // Forgets the remembered registration of `identifier` (every one, when nullopt); runs
-    // on the queue with every write.
+    // Forgets the remembered registration and data-container class of `identifier` (every
+    // one, when nullopt); runs on the queue with every write.
     void _onQueue_forgetRegistration(const std::optional<std::string>& identifier);
     std::optional<_Registration> _rememberedRegistration(const std::string& identifier);
     void _onQueue_rememberRegistration(const std::string& identifier, _Registration registration);
@@ -191,4 +193,6 @@ private:
     // Read by the dispatcher's threads, written on _queue; a leaf lock.
     STWMutex _registrationsLock;
     std::unordered_map<std::string, _Registration> _registrations STW_GUARDED_BY(_registrationsLock);
+    // Remembered on the queue after a read, like the registrations; as bounded.
+    std::unordered_map<std::string, uint64_t> _dataContainerClasses STW_GUARDED_BY(_registrationsLock);
 };

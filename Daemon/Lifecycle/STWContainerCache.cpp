@@ -269,21 +269,27 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
 
 STWMetadataRef STWContainerCache::_validatedRecord(const STWMetadataRef& record, const std::string& cacheName,
                                                    bool transient, STWErrorRef* error) {
-    fs::path url = record->url();
+    // Every look-up of a known container comes through here: the path stays text, as
+    // splitting it into components costs more than the lstat.
+    const std::string& url = record->urlString();
     if (url.empty()) {
-        STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Cache: %@%@: Invalid URL path string: %@",
-                                     cacheName, transientMarker(transient), url));
+        STWSetError(error,
+                    STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Cache: %@%@: Invalid URL path string: %@",
+                              cacheName, transientMarker(transient), fs::path(url)));
         return nullptr;
     }
     // The metadata file's path is only meaningful below an absolute container path.
-    if (!url.is_absolute()) {
-        STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Cache: %@%@: nil URL from %@", cacheName,
-                                     transientMarker(transient), url));
+    if (url.front() != '/') {
+        STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Cache: %@%@: nil URL from %@",
+                                     cacheName, transientMarker(transient), fs::path(url)));
         return nullptr;
     }
     // Still the very file the record was read from or written to: a container that its app
     // removed, or replaced (by a link to some other container, say), is no longer there.
-    fs::path metadataFile = url / STWMetadata::fileName;
+    std::string metadataFile = url;
+    if (metadataFile.back() != '/')
+        metadataFile += '/';
+    metadataFile += STWMetadata::fileName;
     struct stat file;
     if (lstat(metadataFile.c_str(), &file) == 0 && record->isRecordOfFile(file))
         return record;

@@ -280,8 +280,8 @@ int STWDaemon::main(int argc, char** argv) {
     // A request parked behind a test lock would wait for a release no client can send now.
     if (configuration->isInternalImage())
         STWTestLocks::sharedInstance()->releaseAllLocks();
-    STWKernServerStop();
-    bool connectionsEnded = listener.stop(deadline - std::chrono::steady_clock::now());
+    bool upcallsEnded = STWKernServerStop(deadline - std::chrono::steady_clock::now());
+    bool connectionsEnded = listener.stop(deadline - std::chrono::steady_clock::now()) && upcallsEnded;
     if (!connectionsEnded || !STWTransaction::waitForIdle(deadline - std::chrono::steady_clock::now())) {
         // Whatever still runs uses objects that returning from main would destroy: leave
         // without running destructors. Everything on disk is crash-safe.

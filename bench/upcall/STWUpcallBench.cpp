@@ -1,29 +1,48 @@
-// The upcall on the hot path of an application launch, against the request socket doing the
-// same work, both measured in the same run on one daemon:
+// The upcall on the hot path of an application launch, against baselines measured in the
+// same run on one daemon. Every app is installed first (command 18: data-container class 2
+// and two app groups in its entitlements), as the kernel only asks for installed apps.
 //
-//   upcall_existing_app_and_group  an upcall for an app whose data container and one group
-//       exist, against command 0 looking up the same two containers (two requests on one
-//       connection), back to back; ratio = upcall time / look-ups time, goal <= 1.0: one
-//       upcall does the work of the two look-ups it saves a launch.
-//   upcall_first_launch  the first upcall for a new app and a new group (both containers
-//       made), against command 0 creating the same two containers for another new app;
-//       ratio = upcall time / creation time, goal <= 1.2.
+//   upcall_round_trips_1_sender, upcall_round_trips_8_senders  upcalls for an app whose data
+//       container and two groups exist, from 1 and from 8 senders at once (each its own
+//       connection), against an echo server in this process on a sequenced-packet socket
+//       of its own that answers each request packet with the daemon's reply packet to it,
+//       so both sides send, receive and decode the same bytes. The daemon serves upcalls one
+//       at a time, so the echo server is one thread on an epoll loop; ratio = upcall round
+//       trips per second / echo round trips per second, goal >= 0.5.
+//   upcall_existing_app_and_groups  the same upcall, one sender, against command 0 looking up
+//       the data container plus command 13 looking up the groups (two requests on one
+//       connection); ratio = upcall time / requests time, goal <= 1.0: one upcall does the
+//       work of the requests it saves a launch.
+//   upcall_first_launch  the first upcall for a new app (data container and both groups
+//       made), against command 0 creating the data container plus command 13 creating the
+//       groups of another new app; ratio = upcall time / requests time, goal <= 1.2.
 //
-// Latencies are per upcall and per pair of requests (p50, p99). The daemon runs with its
-// default settings plus developer mode on a private root in /tmp, its system log in a file.
-// The upcall socket is root's alone, so the benchmark needs root. Usage:
-// stowly_bench_upcall [--quick]
+// Latencies are per round trip (p50, p99). On a virtual machine with few cores, a round trip
+// whose two ends sit on different cores pays for waking an idle core, tens of microseconds;
+// where the scheduler puts the daemon's upcall thread then decides the figures of one
+// sender. `taskset -c N stowly_bench_upcall` puts everything on one core and compares the
+// work alone. The daemon runs with its default settings plus developer mode on a private
+// root in /tmp, its system log in a file. The upcall socket is root's alone, so the
+// benchmark needs root. Usage: stowly_bench_upcall [--quick]
 #include "client/STWUpcallClient.h"
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWLog.h"
 #include "tests/support/STWDaemonProcess.h"
 
 #include <algorithm>
+#include <atomic>
 #include <chrono>
 #include <cstdio>
 #include <cstring>
 #include <functional>
+#include <latch>
+#include <map>
+#include <mutex>
 #include <stdexcept>
+#include <sys/epoll.h>
+#include <sys/eventfd.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <thread>
 #include <unistd.h>
 #include <vector>
@@ -31,6 +50,7 @@
 namespace {
 
 using Clock = std::chrono::steady_clock;
+using Request = STWUpcallClient::Request;
 constexpr std::chrono::seconds kTimeout{60};
 const STWValue::Dictionary kAllowed{{"com.vorlane.private.Stowly.allowed", STWValue(true)}};
 
@@ -48,17 +68,102 @@ double mean(const std::vector<double>& values) {
     return sum / static_cast<double>(values.size());
 }
 
+double micros(Clock::duration d) {
+    return std::chrono::duration<double, std::micro>(d).count();
+}
+
 // Microseconds each of `count` calls of `work(i)` took.
 std::vector<double> timed(size_t count, const std::function<void(size_t)>& work) {
-    std::vector<double> micros;
-    micros.reserve(count);
+    std::vector<double> times;
+    times.reserve(count);
     for (size_t i = 0; i < count; i++) {
         auto start = Clock::now();
         work(i);
-        micros.push_back(std::chrono::duration<double, std::micro>(Clock::now() - start).count());
+        times.push_back(micros(Clock::now() - start));
     }
-    return micros;
+    return times;
 }
+
+void printLatencies(const char* name, const std::vector<double>& times) {
+    printf("  %-12s p50 %7.1f us, p99 %7.1f us, mean %7.1f us (%zu)\n", name, percentile(times, 0.5),
+           percentile(times, 0.99), mean(times), times.size());
+}
+
+// The baseline of the round trips: one thread on an epoll loop answers every packet of
+// every connection with `reply`, one packet at a time, as the daemon serves upcalls; as
+// simple as a server on this socket gets.
+class EchoServer {
+public:
+    EchoServer(const std::filesystem::path& path, std::string reply) : _path(path), _reply(std::move(reply)) {
+        sockaddr_un address{};
+        address.sun_family = AF_UNIX;
+        if (path.native().size() >= sizeof address.sun_path)
+            die("echo socket path too long");
+        memcpy(address.sun_path, path.c_str(), path.native().size() + 1);
+        _listenFD.reset(socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
+        _epollFD.reset(epoll_create1(EPOLL_CLOEXEC));
+        _stopFD.reset(eventfd(0, EFD_CLOEXEC));
+        if (!_listenFD || !_epollFD || !_stopFD ||
+            bind(_listenFD.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
+            listen(_listenFD.get(), SOMAXCONN) != 0 || !_watch(_listenFD.get()) || !_watch(_stopFD.get()))
+            die(std::string("echo server: ") + strerror(errno));
+        _thread = std::thread([this] { _run(); });
+    }
+    ~EchoServer() {
+        uint64_t one = 1;
+        if (write(_stopFD.get(), &one, sizeof one) != sizeof one)
+            perror("echo server stop");
+        _thread.join();
+        unlink(_path.c_str());
+    }
+
+private:
+    bool _watch(int fd) {
+        epoll_event event{};
+        event.events = EPOLLIN;
+        event.data.fd = fd;
+        return epoll_ctl(_epollFD.get(), EPOLL_CTL_ADD, fd, &event) == 0;
+    }
+
+    void _run() {
+        std::map<int, STWFileDescriptor> connections;
+        std::vector<char> packet(64 << 10);
+        epoll_event events[16];
+        for (;;) {
+            int count = epoll_wait(_epollFD.get(), events, 16, -1);
+            for (int i = 0; i < count; i++) {
+                int fd = events[i].data.fd;
+                if (fd == _stopFD.get())
+                    return;
+                if (fd == _listenFD.get()) {
+                    STWFileDescriptor connection(accept4(fd, nullptr, nullptr, SOCK_CLOEXEC));
+                    if (connection && _watch(connection.get()))
+                        connections.emplace(connection.get(), std::move(connection));
+                } else if (recv(fd, packet.data(), packet.size(), MSG_DONTWAIT) <= 0 ||
+                           send(fd, _reply.data(), _reply.size(), MSG_DONTWAIT | MSG_NOSIGNAL) < 0) {
+                    connections.erase(fd); // closing it leaves the epoll set too
+                }
+            }
+        }
+    }
+
+    const std::filesystem::path _path;
+    const std::string _reply;
+    STWFileDescriptor _listenFD, _epollFD, _stopFD;
+    std::thread _thread;
+};
+
+// What `senders` connections at once did: how long they took together, and each round trip.
+struct RoundTrips {
+    double seconds = 0;
+    std::vector<double> latencies;
+
+    void add(const RoundTrips& other) {
+        seconds += other.seconds;
+        latencies.insert(latencies.end(), other.latencies.begin(), other.latencies.end());
+    }
+    double perSecond() const { return static_cast<double>(latencies.size()) / seconds; }
+};
 
 class UpcallBench {
 public:
@@ -71,102 +176,212 @@ public:
             die("cannot connect to the request socket");
         auto deadline = Clock::now() + kTimeout;
         STWErrorRef error;
-        while (!(_upcall = STWUpcallClient::connect(STWUpcallClient::socketPathForRoot(_daemon.root()), &error)) &&
-               Clock::now() < deadline)
+        std::unique_ptr<STWUpcallClient> upcall;
+        while (!(upcall = _connectUpcall(&error)) && Clock::now() < deadline)
             std::this_thread::sleep_for(std::chrono::milliseconds(20));
-        if (!_upcall)
+        if (!upcall)
             die("cannot connect to the upcall socket: " + error->description());
     }
 
     void run() {
+        _throughput();
         _existingApp();
         _firstLaunch();
     }
 
 private:
-    static STWUpcallClient::Request _request(const std::string& app, const std::string& group) {
-        STWUpcallClient::Request request;
+    std::unique_ptr<STWUpcallClient> _connectUpcall(STWErrorRef* error) {
+        return STWUpcallClient::connect(STWUpcallClient::socketPathForRoot(_daemon.root()), error);
+    }
+
+    static std::vector<std::string> _groupsOf(const std::string& app) { return {app + ".g1", app + ".g2"}; }
+
+    static Request _request(const std::string& app) {
+        Request request;
         request.codeSignatureIdentifier = app;
         request.uid = 501;
-        request.appGroupIdentifiers = {group};
+        request.appGroupIdentifiers = _groupsOf(app);
         request.containerType = STWKernContainerTypeApplication;
         request.personaID = STWKernNoPersona;
         return request;
     }
 
-    void _sendUpcall(const STWUpcallClient::Request& request) {
+    // What an installer tells the daemon: an app with a class-2 data container and two groups.
+    void _install(const std::string& app) {
+        STWValue::Array groups;
+        for (const std::string& group : _groupsOf(app))
+            groups.emplace_back(group);
+        STWValue::Dictionary entitlements{
+            {"com.vorlane.security.application-groups", STWValue(std::move(groups))}};
+        STWValue::Dictionary keys{
+            {"Identifier", STWValue(app)},
+            {"CodeSigningInfo", STWValue(STWValue::Dictionary{
+                                    {"com.vorlane.Stowly.Entitlements", STWValue(std::move(entitlements))}})},
+            {"OptionsDictionary", STWValue(STWValue::Dictionary{
+                                      {"com.vorlane.Stowly.DataContainerClass", STWValue(uint64_t{2})}})}};
+        if (uint64_t code = STWDaemonProcess::replyError(*_client, 18, keys); code != STWErrorSuccess)
+            die("command 18 failed for " + app + ": " + std::to_string(code));
+    }
+
+    // One upcall; dies unless every container came back.
+    static void _sendUpcall(STWUpcallClient& upcall, const Request& request) {
         STWErrorRef error;
-        auto reply = _upcall->send(request, kTimeout, &error);
-        if (!reply || reply->status != 1u || reply->appGroups.size() != 1)
+        auto reply = upcall.send(request, kTimeout, &error);
+        if (!reply || reply->status != 1u || reply->appGroups.size() != request.appGroupIdentifiers.size())
             die("upcall failed: " + (error ? error->description() : std::string("status 0")));
     }
 
-    // Command 0 for (identifier, class); dies unless it answers a path.
-    void _command0(const std::string& identifier, uint64_t containerClass, bool create) {
+    // Command 0 for the app's data container, then command 13 for its groups; dies unless
+    // both answer their paths.
+    void _requests(const std::string& app, bool create) {
         STWErrorRef error;
-        auto reply = _client->sendMessage({{"Command", STWValue(uint64_t{0})},
-                                           {"Identifier", STWValue(identifier)},
-                                           {"ContainerClass", STWValue(containerClass)},
-                                           {"CreateIfNecessary", STWValue(create)}},
-                                          kTimeout, &error);
-        if (!reply || !STWDictionaryString(*reply, "ReplyPath"))
-            die("command 0 failed for " + identifier);
+        auto data = _client->sendMessage({{"Command", STWValue(uint64_t{0})},
+                                          {"Identifier", STWValue(app)},
+                                          {"ContainerClass", STWValue(uint64_t{2})},
+                                          {"CreateIfNecessary", STWValue(create)}},
+                                         kTimeout, &error);
+        if (!data || !STWDictionaryString(*data, "ReplyPath"))
+            die("command 0 failed for " + app);
+        auto groups = _client->sendMessage(
+            {{"Command", STWValue(uint64_t{13})}, {"Identifier", STWValue(app)}}, kTimeout, &error);
+        const STWValue::Dictionary* paths =
+            groups ? STWDictionaryDictionary(*groups, "ReplyGroupContainerDict") : nullptr;
+        if (!paths || paths->size() != 2)
+            die("command 13 failed for " + app + ": " +
+                std::to_string(groups ? STWDictionaryUInt64(*groups, "ReplyError").value_or(0) : 0));
     }
 
-    static void _report(const char* name, const std::vector<double>& upcall, const std::vector<double>& baseline,
-                        const char* baselineName, const char* goal) {
-        printf("  upcall:   p50 %7.1f us, p99 %7.1f us, mean %7.1f us (%zu)\n", percentile(upcall, 0.5),
-               percentile(upcall, 0.99), mean(upcall), upcall.size());
-        printf("  %s: p50 %7.1f us, p99 %7.1f us, mean %7.1f us (%zu)\n", baselineName, percentile(baseline, 0.5),
-               percentile(baseline, 0.99), mean(baseline), baseline.size());
+    // `count` round trips split over `senders` connections made by `connect`, all at once.
+    static RoundTrips _roundTrips(size_t senders, size_t count, const Request& request,
+                                  const std::function<std::unique_ptr<STWUpcallClient>()>& connect) {
+        std::vector<std::unique_ptr<STWUpcallClient>> clients;
+        for (size_t i = 0; i < senders; i++)
+            if (!clients.emplace_back(connect()))
+                die("cannot connect a sender");
+        std::vector<std::vector<double>> latencies(senders);
+        std::latch ready(static_cast<ptrdiff_t>(senders) + 1);
+        std::vector<std::thread> threads;
+        std::mutex failureMutex;
+        std::string failure;
+        for (size_t i = 0; i < senders; i++)
+            threads.emplace_back([&, i] {
+                ready.arrive_and_wait();
+                try {
+                    latencies[i] = timed(count / senders, [&](size_t) { _sendUpcall(*clients[i], request); });
+                } catch (const std::exception& e) {
+                    std::lock_guard lock(failureMutex);
+                    failure = e.what();
+                }
+            });
+        ready.arrive_and_wait();
+        auto start = Clock::now();
+        for (std::thread& t : threads)
+            t.join();
+        RoundTrips result;
+        result.seconds = std::chrono::duration<double>(Clock::now() - start).count();
+        if (!failure.empty())
+            die(failure);
+        for (const auto& l : latencies)
+            result.latencies.insert(result.latencies.end(), l.begin(), l.end());
+        return result;
+    }
+
+    void _throughput() {
+        const std::string app = "com.example.bench.app";
+        _install(app);
+        Request request = _request(app);
+        auto upcall = _connectUpcall(nullptr);
+        if (!upcall)
+            die("cannot connect to the upcall socket");
+        _sendUpcall(*upcall, request); // makes the containers
+        STWErrorRef error;
+        auto reply = upcall->exchangePacket(
+            STWUpcallClient::packetWithBuffer(STWUpcallClient::packedBufferForRequest(request)), kTimeout,
+            &error);
+        if (!reply)
+            die("upcall failed: " + error->description());
+        EchoServer echo(_daemon.root() / "echo.sock", *reply);
+        using Connect = std::function<std::unique_ptr<STWUpcallClient>()>;
+        Connect connectEcho = [&] { return STWUpcallClient::connect(_daemon.root() / "echo.sock", nullptr); };
+        Connect connectDaemon = [&] { return _connectUpcall(nullptr); };
+
+        const size_t count = _quick ? 2000 : 16000, rounds = _quick ? 2 : 4;
+        for (size_t senders : {size_t{1}, size_t{8}}) {
+            _roundTrips(senders, count / 4, request, connectEcho); // warm-up
+            _roundTrips(senders, count / 4, request, connectDaemon);
+            // Rounds alternate, so that whatever else the machine does weighs on both alike.
+            RoundTrips upcalls, echoes;
+            for (size_t r = 0; r < rounds; r++) {
+                upcalls.add(_roundTrips(senders, count, request, connectDaemon));
+                echoes.add(_roundTrips(senders, count, request, connectEcho));
+            }
+            double upcallRate = upcalls.perSecond(), echoRate = echoes.perSecond();
+            printf("an existing app container and two groups, %zu sender%s:\n", senders,
+                   senders == 1 ? "" : "s");
+            printLatencies("upcall:", upcalls.latencies);
+            printLatencies("echo:", echoes.latencies);
+            printf("  upcall %.0f/s, echo %.0f/s\n", upcallRate, echoRate);
+            printf("upcall_round_trips_%zu_sender%s: ratio %.2f (goal >= 0.5)\n", senders,
+                   senders == 1 ? "" : "s", upcallRate / echoRate);
+            fflush(stdout);
+        }
+    }
+
+    static void _report(const char* name, const std::vector<double>& upcall,
+                        const std::vector<double>& baseline, const char* goal) {
+        printLatencies("upcall:", upcall);
+        printLatencies("cmd 0 + 13:", baseline);
         printf("%s: ratio %.2f (goal %s)\n", name, mean(upcall) / mean(baseline), goal);
         fflush(stdout);
     }
 
     void _existingApp() {
-        const std::string app = "com.example.bench.app", group = "group.com.example.bench";
-        _command0(app, 2, true);
-        _command0(group, 7, true);
-        STWUpcallClient::Request request = _request(app, group);
+        const std::string app = "com.example.bench.app"; // installed and made by _throughput
+        Request request = _request(app);
+        auto upcall = _connectUpcall(nullptr);
+        if (!upcall)
+            die("cannot connect to the upcall socket");
         const size_t count = _quick ? 300 : 2000, rounds = _quick ? 2 : 5;
-        auto upcall = [&](size_t) { _sendUpcall(request); };
-        auto lookups = [&](size_t) {
-            _command0(app, 2, false);
-            _command0(group, 7, false);
-        };
-        timed(count / 4, upcall); // warm-up
-        timed(count / 4, lookups);
-        // Rounds alternate, so that whatever else the machine does weighs on both alike.
-        std::vector<double> upcalls, pairs;
-        for (size_t r = 0; r < rounds; r++) {
-            auto u = timed(count, upcall);
-            auto l = timed(count, lookups);
-            upcalls.insert(upcalls.end(), u.begin(), u.end());
-            pairs.insert(pairs.end(), l.begin(), l.end());
+        auto upcalls = [&](size_t) { _sendUpcall(*upcall, request); };
+        auto requests = [&](size_t) { _requests(app, false); };
+        timed(count / 4, upcalls); // warm-up
+        timed(count / 4, requests);
+        std::vector<double> u, r;
+        for (size_t i = 0; i < rounds; i++) {
+            auto a = timed(count, upcalls);
+            auto b = timed(count, requests);
+            u.insert(u.end(), a.begin(), a.end());
+            r.insert(r.end(), b.begin(), b.end());
         }
-        printf("an existing app container and one group:\n");
-        _report("upcall_existing_app_and_group", upcalls, pairs, "2 x cmd 0", "<= 1.0");
+        printf("an existing app container and two groups, against requests:\n");
+        _report("upcall_existing_app_and_groups", u, r, "<= 1.0");
     }
 
     void _firstLaunch() {
         const size_t count = _quick ? 40 : 200;
-        auto upcalls = timed(count, [&](size_t i) {
-            std::string n = std::to_string(i);
-            _sendUpcall(_request("com.example.bench.new.u" + n, "group.com.example.bench.new.u" + n));
-        });
-        auto creations = timed(count, [&](size_t i) {
-            std::string n = std::to_string(i);
-            _command0("com.example.bench.new.c" + n, 2, true);
-            _command0("group.com.example.bench.new.c" + n, 7, true);
-        });
-        printf("a new app container and a new group:\n");
-        _report("upcall_first_launch", upcalls, creations, "2 x cmd 0", "<= 1.2");
+        auto upcallApp = [](size_t i) { return "com.example.bench.new.u" + std::to_string(i); };
+        auto requestApp = [](size_t i) { return "com.example.bench.new.c" + std::to_string(i); };
+        for (size_t i = 0; i < count; i++) {
+            _install(upcallApp(i));
+            _install(requestApp(i));
+        }
+        auto upcall = _connectUpcall(nullptr);
+        if (!upcall)
+            die("cannot connect to the upcall socket");
+        // Interleaved, so that both see the same number of containers around them.
+        std::vector<double> u, r;
+        for (size_t i = 0; i < count; i++) {
+            Request request = _request(upcallApp(i));
+            u.push_back(timed(1, [&](size_t) { _sendUpcall(*upcall, request); })[0]);
+            r.push_back(timed(1, [&](size_t) { _requests(requestApp(i), true); })[0]);
+        }
+        printf("a new app: its data container and two groups made:\n");
+        _report("upcall_first_launch", u, r, "<= 1.2");
     }
 
     const bool _quick;
     STWDaemonProcess _daemon;
     std::unique_ptr<STWClient> _client;
-    std::unique_ptr<STWUpcallClient> _upcall;
 };
 
 } // namespace

@@ -63,6 +63,11 @@ TEST_F(STWCodeSigningMappingTest, UpdatesWriteOnlyWhatChangedAndTheInstallerWins
     ASSERT_EQ(process(info, "com.t.app", options), STWErrorSuccess);
     EXPECT_EQ(changes(), written);
     EXPECT_EQ(mapping->dataContainerTypeForIdentifier("com.t.app"), 2u);
+    // The class is remembered, but never past a write (here, and for the child and the
+    // uninstall below).
+    ASSERT_EQ(process(info, "com.t.app", {{"com.vorlane.Stowly.DataContainerClass", STWValue(4)}}),
+              STWErrorSuccess);
+    EXPECT_EQ(mapping->dataContainerTypeForIdentifier("com.t.app"), 4u);
 
     // A caller's own entitlements never replace what the installer said.
     STWValue::Dictionary claimed{{STWEntitlementKey::applicationGroups, strings({"stolen"})}};
@@ -85,12 +90,17 @@ TEST_F(STWCodeSigningMappingTest, UpdatesWriteOnlyWhatChangedAndTheInstallerWins
     EXPECT_TRUE(mapping->codeSigningEntryForIdentifier("com.t.orphan.ext", nullptr));
     EXPECT_FALSE(mapping->codeSigningEntryForIdentifier("com.t.absent", nullptr));
     // A stored parent learns its child, and forgetting the parent forgets the child too.
-    ASSERT_EQ(process(info, "com.t.app.ext", {{"com.vorlane.Stowly.ParentBundleID", STWValue("com.t.app")}}),
+    EXPECT_EQ(mapping->dataContainerTypeForIdentifier("com.t.app.ext"), 0u);
+    ASSERT_EQ(process(info, "com.t.app.ext",
+                      {{"com.vorlane.Stowly.ParentBundleID", STWValue("com.t.app")},
+                       {"com.vorlane.Stowly.DataContainerClass", STWValue(4)}}),
               STWErrorSuccess);
+    EXPECT_EQ(mapping->dataContainerTypeForIdentifier("com.t.app.ext"), 4u);
     EXPECT_EQ(mapping->parentIdentifierForChildIdentifier("com.t.app.ext"), "com.t.app");
     mapping->removeCodeSigningDictionariesForIdentifierAndItsChildren("com.t.app", *queue);
     EXPECT_FALSE(mapping->codeSigningEntryForIdentifier("com.t.app", nullptr));
     EXPECT_FALSE(mapping->codeSigningEntryForIdentifier("com.t.app.ext", nullptr));
+    EXPECT_EQ(mapping->dataContainerTypeForIdentifier("com.t.app"), 0u);
 }
 
 TEST_F(STWCodeSigningMappingTest, InvalidEntriesStayQueryableAndTheSweepSparesWhatStillHasAReason) {

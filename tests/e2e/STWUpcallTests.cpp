@@ -3,10 +3,12 @@
 
 #include "client/STWUpcallClient.h"
 #include "common/STWDictionaryUtilities.h"
+#include "common/STWFileIO.h"
 #include "src/packbuff/packbuff.h"
 
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <cstring>
 #include <sys/fsuid.h>
 #include <sys/socket.h>
@@ -92,8 +94,11 @@ std::string packedBuffer(const std::vector<std::pair<uint16_t, std::string>>& st
 class STWUpcallTest : public ::testing::Test {
 protected:
     static void SetUpTestSuite() {
-        if (geteuid() == 0)
-            daemon = new STWDaemonProcess({{"DeveloperMode", STWValue(true)}});
+        if (geteuid() != 0)
+            return;
+        daemon = new STWDaemonProcess({{"DeveloperMode", STWValue(true)}}, {}, false);
+        daemon->setStandardErrorFile(daemon->root() / "stowlyd.stderr");
+        ASSERT_TRUE(daemon->start());
     }
     static void TearDownTestSuite() {
         delete daemon;
@@ -125,6 +130,12 @@ protected:
                                              {"CreateIfNecessary", STWValue(false)}});
         const std::string* path = STWDictionaryString(reply, "ReplyPath");
         return path ? *path : std::string();
+    }
+
+    static std::string log() {
+        std::string text;
+        STWReadFileContents(daemon->root() / "stowlyd.stderr", &text);
+        return text;
     }
 
     static STWDaemonProcess* daemon;
@@ -172,16 +183,28 @@ TEST_F(STWUpcallTest, AnswersEveryContainerInReplyOrderAsTheRequestSocketKnowsTh
     EXPECT_EQ(again->appGroups, reply->appGroups);
 }
 
-// The code-signing mapping's recorded class does not change this: a plug-in's data
-// container is class 4 whatever was recorded.
+// A plug-in's data container is class 4, whether the code-signing mapping recorded nothing
+// for it or recorded an application's class.
 TEST_F(STWUpcallTest, APluginGetsAPluginDataContainer) {
-    Request request = appRequest("com.example.upcall.plugin");
-    request.containerType = STWKernContainerTypePlugin;
-    Reply reply = upcall(request);
-    ASSERT_EQ(reply.returnCode, STWKernSuccess);
-    ASSERT_EQ(reply.status, 1u);
-    EXPECT_EQ(reply.dataContainer, lookedUp("com.example.upcall.plugin", 4));
-    EXPECT_EQ(lookedUp("com.example.upcall.plugin", 2), "");
+    STWValue::Dictionary recorded{
+        {"Identifier", STWValue("com.example.upcall.recorded")},
+        {"CodeSigningInfo", STWValue(STWValue::Dictionary{
+                                {"com.vorlane.Stowly.Entitlements", STWValue(STWValue::Dictionary{})}})},
+        {"OptionsDictionary",
+         STWValue(STWValue::Dictionary{{"com.vorlane.Stowly.DataContainerClass", STWValue(uint64_t{2})}})}};
+    ASSERT_EQ(STWDaemonProcess::replyError(*installer, 18, recorded), STWErrorSuccess);
+    for (const char* identifier : {"com.example.upcall.plugin", "com.example.upcall.recorded"}) {
+        Request request = appRequest(identifier);
+        request.containerType = STWKernContainerTypePlugin;
+        Reply reply = upcall(request);
+        ASSERT_EQ(reply.returnCode, STWKernSuccess) << identifier;
+        ASSERT_EQ(reply.status, 1u) << identifier;
+        EXPECT_EQ(reply.dataContainer, lookedUp(identifier, 4)) << identifier;
+        EXPECT_EQ(lookedUp(identifier, 2), "") << identifier;
+    }
+    EXPECT_NE(
+        log().find("server_get_process_containers: SB Type: 1, Setwright Type: 2.  Declaring this a plugin"),
+        std::string::npos);
 }
 
 TEST_F(STWUpcallTest, RootsHomeAndUnknownPersonas) {
@@ -320,4 +343,33 @@ TEST(STWUpcallFailureTest, AGroupThatCannotBeMadeLeavesOnlyAStatusOfZero) {
     };
     EXPECT_EQ(lookup("group.com.example.upcall.first"), STWErrorNotFound);
     EXPECT_EQ(lookup("group.com.example.upcall.second"), STWErrorSuccess);
+}
+
+// Stopping waits for the upcall being served: one parked behind a test lock (which SIGTERM
+// releases) still gets its reply, and the daemon exits cleanly.
+TEST(STWUpcallFailureTest, AnUpcallInFlightIsAnsweredBeforeTheDaemonStops) {
+    if (geteuid() != 0)
+        GTEST_SKIP() << "the upcall socket is root's alone: run the tests as root";
+    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}});
+    auto control =
+        daemon.connectAs("com.example.tester", {{"com.vorlane.private.Stowly.testability", STWValue(true)}});
+    ASSERT_NE(control, nullptr);
+    auto client = connectUpcall(daemon);
+    ASSERT_NE(client, nullptr);
+    ASSERT_EQ(
+        STWDaemonProcess::replyError(*control, 31, {{"TestLock", STWValue(1)}, {"Enable", STWValue(true)}}),
+        STWErrorSuccess);
+    std::optional<Reply> reply;
+    std::atomic<bool> answered{false};
+    std::thread launch([&] {
+        STWErrorRef error;
+        reply = client->send(appRequest("com.example.upcall.parked"), kTimeout, &error);
+        answered = true;
+    });
+    std::this_thread::sleep_for(std::chrono::milliseconds(300));
+    EXPECT_FALSE(answered) << "the upcall did not wait for the lock";
+    EXPECT_TRUE(daemon.stop());
+    launch.join();
+    ASSERT_TRUE(reply);
+    EXPECT_EQ(reply->status, 1u);
 }
