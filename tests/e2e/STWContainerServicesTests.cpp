@@ -281,7 +281,8 @@ TEST(STWContainerServices, RetryTestExitsTheDaemonNTimesThenSucceeds) {
 
 // What an app can plant in its own container (and a system process in a system group
 // container): links to a directory outside in place of subdirectories, assets and staged
-// content, FIFOs, link loops, and a directory swapped with such a link all the while. No command changes anything outside, and each answers promptly.
+// content, FIFOs, link loops, and a directory swapped with such a link all the while. No
+// command changes anything outside, and each answers promptly.
 TEST(STWContainerServices, HostileContainerContentNeverLeadsOut) {
     STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}});
     auto installer = daemon.connectAs("com.example.installer", allowed);
