@@ -140,7 +140,8 @@ private:
         set(fd, path, target, [&](int32_t current) {
             if (current == 2 || current == target)
                 return false;
-            if ((_changeType & STWDataProtectionChangeOnlyStronger) && target > current)
+            // A file that never had a class (0) has no protection to keep.
+            if ((_changeType & STWDataProtectionChangeOnlyStronger) && current != 0 && target > current)
                 return false;
             STW_LOG_DEBUG(STWLogCategory::FS, "Setting protection class of %s to %d", path, target);
             return true;
