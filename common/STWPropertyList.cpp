@@ -1,5 +1,6 @@
 #include "common/STWPropertyList.h"
 
+#include <algorithm>
 #include <climits>
 #include <cstdlib>
 #include <cstring>
@@ -175,6 +176,52 @@ class BinaryReader {
 public:
     // False when the bytes are not a binary property list this reader takes on.
     bool read(std::string_view bytes, STWValue& out) {
+        if (!_readTrailer(bytes))
+            return false;
+        // Shared objects (libplist's writer shares equal values) are read once per use;
+        // a file whose references fan out further than this is left to libplist.
+        _budget = 8 * _numObjects + 256;
+        return _object(_root, 0, out);
+    }
+
+    // True when the bytes are a binary property list that libplist must not see: one whose
+    // trailer this reader finds wrong, or with a string object that holds a NUL character.
+    // libplist stops such a string at the NUL, but a dictionary key that holds one trips an
+    // assertion in it and takes the process down. Files whose string objects overlap so
+    // much that checking them costs more than a few passes over the file are refused too.
+    bool isUnsafeForLibplist(std::string_view bytes) {
+        if (bytes.compare(0, 6, "bplist") != 0)
+            return false;
+        if (!_readTrailer(bytes))
+            return true;
+        uint64_t budget = 4 * bytes.size();
+        for (uint64_t index = 0; index < _numObjects; ++index) {
+            uint64_t offset = bigEndian(_base + _offsetTable + index * _offsetSize, _offsetSize);
+            if (offset < 8 || offset >= _offsetTable)
+                continue;
+            const uint8_t* p = _base + offset;
+            const uint8_t* end = _base + _offsetTable;
+            uint8_t type = *p & 0xF0, info = *p & 0x0F;
+            ++p;
+            uint64_t count;
+            if ((type != 0x50 && type != 0x60) || !_count(info, p, end, count))
+                continue;
+            uint64_t size = type == 0x60 ? 2 * std::min<uint64_t>(count, UINT64_MAX / 2) : count;
+            size = std::min<uint64_t>(size, static_cast<uint64_t>(end - p));
+            if (size > budget)
+                return true;
+            budget -= size;
+            if (type == 0x50 && memchr(p, 0, size))
+                return true;
+            for (uint64_t i = 0; type == 0x60 && i + 1 < size; i += 2)
+                if (p[i] == 0 && p[i + 1] == 0)
+                    return true;
+        }
+        return false;
+    }
+
+private:
+    bool _readTrailer(std::string_view bytes) {
         static constexpr size_t kHeader = 8, kTrailer = 32;
         if (bytes.size() < kHeader + kTrailer || bytes.compare(0, kHeader, "bplist00") != 0)
             return false;
@@ -183,20 +230,14 @@ public:
         _offsetSize = trailer[6];
         _refSize = trailer[7];
         _numObjects = bigEndian(trailer + 8, 8);
-        uint64_t root = bigEndian(trailer + 16, 8);
+        _root = bigEndian(trailer + 16, 8);
         _offsetTable = bigEndian(trailer + 24, 8);
         uint64_t tableEnd = bytes.size() - kTrailer;
-        if (_offsetSize < 1 || _offsetSize > 8 || _refSize < 1 || _refSize > 8 || _numObjects == 0 ||
-            root >= _numObjects || _offsetTable < kHeader || _offsetTable >= tableEnd ||
-            _numObjects > (tableEnd - _offsetTable) / _offsetSize)
-            return false;
-        // Shared objects (libplist's writer shares equal values) are read once per use;
-        // a file whose references fan out further than this is left to libplist.
-        _budget = 8 * _numObjects + 256;
-        return _object(root, 0, out);
+        return _offsetSize >= 1 && _offsetSize <= 8 && _refSize >= 1 && _refSize <= 8 && _numObjects != 0 &&
+               _root < _numObjects && _offsetTable >= kHeader && _offsetTable < tableEnd &&
+               _numObjects <= (tableEnd - _offsetTable) / _offsetSize;
     }
 
-private:
     static uint64_t bigEndian(const uint8_t* p, unsigned n) {
         uint64_t v = 0;
         for (unsigned i = 0; i < n; ++i)
@@ -361,7 +402,7 @@ private:
     }
 
     const uint8_t* _base = nullptr;
-    uint64_t _numObjects = 0, _offsetTable = 0, _budget = 0;
+    uint64_t _numObjects = 0, _root = 0, _offsetTable = 0, _budget = 0;
     unsigned _offsetSize = 0, _refSize = 0;
     std::vector<uint64_t> _path;
 };
@@ -389,6 +430,8 @@ std::optional<STWValue> parse(std::string_view bytes) {
         return std::nullopt;
     if (auto value = _parseBinaryDirectly(bytes))
         return value;
+    if (BinaryReader().isUnsafeForLibplist(bytes))
+        return std::nullopt;
     return _parseWithLibplist(bytes);
 }
 

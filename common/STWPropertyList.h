@@ -17,7 +17,8 @@ namespace STWPropertyList {
 
 // Parses XML or binary property-list bytes; nullopt when they are not a property list.
 // Binary property lists of the common kinds are read directly; everything else goes
-// through libplist, whose answer is the reference.
+// through libplist, whose answer is the reference, except binary ones with a malformed
+// trailer or a string that holds a NUL, which could abort libplist and are refused.
 std::optional<STWValue> parse(std::string_view bytes);
 // The two routes of parse(), for the tests and the fuzzer that hold them to each other:
 // the direct reader of binary property lists (nullopt when it declines the bytes) and

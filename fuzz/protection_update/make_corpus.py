@@ -27,6 +27,8 @@ SEEDS = {
     "class_14": {**CHANGE, "STWDataOperationContainerClass": 14},
     "bad_uuid": {**CHANGE, "STWDataOperationInternalID": "not-a-uuid"},
 }
+# corpus/nul_in_key is not written here: the fuzzer found it (a key with a NUL in it that
+# took the reader down inside libplist), and it is kept byte for byte.
 
 here = os.path.join(os.path.dirname(os.path.abspath(__file__)), "corpus")
 os.makedirs(here, exist_ok=True)

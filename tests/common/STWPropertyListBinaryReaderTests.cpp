@@ -163,12 +163,11 @@ std::string handMade(const std::vector<std::string>& objects, uint8_t root = 0) 
 }
 
 TEST(STWPropertyListBinaryReaderTest, HostileStructuresAreLeftToLibplist) {
-    // An array holding itself, a dictionary whose key is itself, a string with a NUL, a
-    // sixteen-byte integer, a UTF-16 key: declined, and parse() answers as libplist does.
+    // An array holding itself, a dictionary whose key is itself, a sixteen-byte integer, a
+    // UTF-16 key: declined, and parse() answers as libplist does.
     std::vector<std::string> hostile{
         handMade({std::string("\xa1\x00", 2)}),
         handMade({std::string("\xd1\x00\x01", 3), "\x51x"}),
-        handMade({std::string("\x53" "a\0b", 4)}),
         handMade({std::string("\x14", 1) + std::string(15, '\0') + "\x05"}),
         handMade({std::string("\xd1\x01\x02", 3), std::string("\x61\x00\xe9", 3), std::string("\x09", 1)}),
         handMade({std::string("\xa2\x01\x01", 3), std::string("\x00", 1)}),
@@ -178,6 +177,13 @@ TEST(STWPropertyListBinaryReaderTest, HostileStructuresAreLeftToLibplist) {
         EXPECT_TRUE(same(STWPropertyList::parse(bytes), STWPropertyList::_parseWithLibplist(bytes)));
     }
     EXPECT_FALSE(STWPropertyList::parse(hostile[0]));
+    // A NUL in a string, a key (which libplist would abort on) or a UTF-16 key: refused
+    // before libplist sees it.
+    for (const std::string& bytes :
+         {handMade({std::string("\x53" "a\0b", 4)}),
+          handMade({std::string("\xd1\x01\x02", 3), std::string("\x53" "a\0b", 4), "\x09"}),
+          handMade({std::string("\xd1\x01\x02", 3), std::string("\x61\x00\x00", 3), "\x09"})})
+        EXPECT_FALSE(STWPropertyList::parse(bytes));
 
     // Containers whose references run past the objects into the offset table, whose first
     // byte (8) is then a valid index: libplist refuses them, and so must the reader.
