@@ -43,10 +43,20 @@ inline constexpr const char* replaceBeforeCleanup = "replace.before-cleanup";
 inline constexpr std::array<std::string_view, 4> replace = {replaceAfterJournal, replaceAfterPark, replaceAfterMove,
                                                             replaceBeforeCleanup};
 
-inline constexpr std::array<std::string_view, 10> all = {
+// A protection-class change: its update file written; the container walked, the class not
+// yet recorded in the metadata; the class recorded, the update file not yet removed.
+inline constexpr const char* protectionAfterUpdateFile = "protection.after-update-file";
+inline constexpr const char* protectionAfterWalk = "protection.after-walk";
+inline constexpr const char* protectionAfterRecord = "protection.after-record";
+
+inline constexpr std::array<std::string_view, 3> protection = {protectionAfterUpdateFile, protectionAfterWalk,
+                                                               protectionAfterRecord};
+
+inline constexpr std::array<std::string_view, 13> all = {
     createAfterStaging, createAfterRename,   createBeforeCacheAdd, deathRowAfterTemporaryDirectory,
     deathRowAfterFirstItem, deleteAfterStaging, replaceAfterJournal, replaceAfterPark,
-    replaceAfterMove,   replaceBeforeCleanup};
+    replaceAfterMove,   replaceBeforeCleanup, protectionAfterUpdateFile, protectionAfterWalk,
+    protectionAfterRecord};
 
 extern std::atomic<bool> armed;
 void _reached(const char* name);

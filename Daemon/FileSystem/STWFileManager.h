@@ -157,6 +157,12 @@ public:
                                         STWErrorRef* error = nullptr) const;
     bool setDataProtectionClassOfItemAtURL(const std::filesystem::path& url, int32_t toClass,
                                            const ClassPredicate& ifPredicate, STWErrorRef* error = nullptr) const;
+    // The same through `fd`, a descriptor the caller opened on the item itself (a walk below
+    // a directory someone else owns names nothing by path); `path` only names it in errors,
+    // which are not logged here.
+    bool setDataProtectionClassOfItemWithDescriptor(int fd, const std::string& path, int32_t toClass,
+                                                    const ClassPredicate& ifPredicate,
+                                                    STWErrorRef* error = nullptr) const;
 
     // Logs every item of the tree; the orphan cleanup records what it is about to remove.
     void printDirectoryStructureAtURL(const std::filesystem::path& url) const;

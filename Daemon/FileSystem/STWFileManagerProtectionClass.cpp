@@ -24,6 +24,28 @@ STWFileDescriptor openItem(const std::string& path, const char* function, STWErr
     return fd;
 }
 
+// Reads the class for `ifPredicate` and writes the new one through `fd`. `log` says whether
+// a failure is logged here (a walk that meets many items logs for itself).
+bool setClass(int fd, const std::string& path, int32_t toClass, const STWFileManager::ClassPredicate& ifPredicate,
+              bool log, const char* function, STWErrorRef* error) {
+    if (ifPredicate) {
+        int32_t current = 0;
+        if (int e = readProtectionClass(fd, &current)) {
+            STWSetError(error, STWErrorCreate(STWPOSIXErrorDomain, e, function, __LINE__, nullptr, log,
+                                              "Failed to getclass of file %s: %s", path, strerror(e)));
+            return false;
+        }
+        if (!ifPredicate(current))
+            return true;
+    }
+    if (int e = writeProtectionClass(fd, toClass)) {
+        STWSetError(error, STWErrorCreate(STWPOSIXErrorDomain, e, function, __LINE__, nullptr, log,
+                                          "Failed to setclass(%d) on file %s: %s", toClass, path, strerror(e)));
+        return false;
+    }
+    return true;
+}
+
 } // namespace
 
 bool STWFileManager::dataProtectionClassOfItemAtURL(const fs::path& url, int32_t* dataProtectionClass,
@@ -46,21 +68,11 @@ bool STWFileManager::setDataProtectionClassOfItemAtURL(const fs::path& url, int3
                                                        const ClassPredicate& ifPredicate, STWErrorRef* error) const {
     std::string path = pathString(url);
     STWFileDescriptor fd = openItem(path, __func__, error);
-    if (!fd)
-        return false;
-    if (ifPredicate) {
-        int32_t current = 0;
-        if (int e = readProtectionClass(fd.get(), &current)) {
-            STWSetError(error, STW_POSIX_ERROR(e, "Failed to getclass of file %s: %s", path, strerror(e)));
-            return false;
-        }
-        if (!ifPredicate(current))
-            return true;
-    }
-    if (int e = writeProtectionClass(fd.get(), toClass)) {
-        STWSetError(error,
-                    STW_POSIX_ERROR(e, "Failed to setclass(%d) on file %s: %s", toClass, path, strerror(e)));
-        return false;
-    }
-    return true;
+    return fd && setClass(fd.get(), path, toClass, ifPredicate, true, __func__, error);
+}
+
+bool STWFileManager::setDataProtectionClassOfItemWithDescriptor(int fd, const std::string& path, int32_t toClass,
+                                                                const ClassPredicate& ifPredicate,
+                                                                STWErrorRef* error) const {
+    return setClass(fd, path, toClass, ifPredicate, false, __func__, error);
 }

@@ -1,12 +1,13 @@
 // Start-up setup and cleanup of the daemon's own connection.
 #include "Daemon/Request/STWClientConnection.h"
 
+#include "Daemon/DataProtection/STWDataProtectionManager.h"
 #include "common/STWLog.h"
 
 // Boot-time setup and cleanup of the container store: of their steps, this build has the
-// recovery of interrupted replace operations. Restored system containers, pending
-// protection changes and the sweep of leftovers to death row are not part of it yet; the
-// entry points keep the start-up order in place and claim no work they do not do.
+// recovery of interrupted replace operations and the restart of pending protection
+// changes. Restored system containers and the sweep of leftovers to death row are not part
+// of it yet; the entry points keep the start-up order in place and claim no work they do not do.
 void STWClientConnection::rebootStowlySetup() {
     STW_LOG_DEBUG(STWLogCategory::Startup, "First-boot setup has no steps in this build");
 }
@@ -16,6 +17,12 @@ void STWClientConnection::stowlySetup() {
     STWErrorRef error;
     if (!_recoverFromReplaceOperationsWithError(&error))
         STW_LOG_ERROR(STWLogCategory::Startup, "Failed to recover from replace operations: %@", error);
+    // A protection change that a stop cut short, or that was waiting for an unlock, goes on
+    // from its update file.
+    STWErrorRef protectionError;
+    if (!STWDataProtectionManager::defaultManager()->restartPendingDataProtectionOperationsWithError(&protectionError))
+        STW_LOG_ERROR(STWLogCategory::Startup, "Failed restarting pending data protection operations: %@",
+                      protectionError);
 }
 
 void STWClientConnection::rebootStowlyCleanupWithCompletion(std::function<void()> completion) {

@@ -1,6 +1,7 @@
 #include "Daemon/Request/STWCommandHandlers.h"
 #include "common/STWThreadSafety.h"
 
+#include "Daemon/DataProtection/STWDataProtectionManager.h"
 #include "Daemon/Lifecycle/STWCommandStageForDelete.h"
 #include "Daemon/Lifecycle/STWTestLocks.h"
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
@@ -33,7 +34,6 @@ void _operationNotInThisBuild(const char* command, uint64_t* error) {
         _operationNotInThisBuild(#name, error);                                                              \
     }
 
-STW_COMMAND_NOT_IN_THIS_BUILD(setDataProtection)
 STW_COMMAND_NOT_IN_THIS_BUILD(performDataMigration)
 STW_COMMAND_NOT_IN_THIS_BUILD(performPerUserDataMigration)
 
@@ -169,6 +169,25 @@ STW_COMMAND_HANDLER(deleteContainersOnDeathRow) {
     // The reply waits for the pass.
     STWClientConnection::deleteContainersOnDeathRowWithCompletion(
         [reply](uint64_t code) { reply->sendWithError(code); });
+}
+
+STW_COMMAND_HANDLER(setDataProtection) {
+    auto identity = STWRequestDecoder::classValidatedIdentity(request, connection, false, error);
+    if (!identity)
+        return;
+    const STWValue* value = STWDictionaryFind(request, "DataProtectionClass");
+    // Absent: 0, no class.
+    auto number = value ? value->truncatedInt64Value() : std::optional<int64_t>(0);
+    if (!number || *number < INT32_MIN || *number > INT32_MAX) {
+        STW_LOG_ERROR(STWLogCategory::Tolvan, "Invalid data protection class: %@", value ? STWFormatArg(*value) : nullptr);
+        *error = STWErrorInvalidArgument;
+        return;
+    }
+    // The reply waits for the change; one that waits for an unlock is parked on the
+    // lock-state queue, whose items hold an IPC transaction until they ran.
+    STWDataProtectionManager::defaultManager()->setDataProtectionOnDataContainerForContainerIdentity(
+        identity, static_cast<int32_t>(*number), STWDictionaryBool(request, "IsThirdParty"),
+        STWDictionaryBool(request, "RetryIfLocked"), [reply](uint64_t code) { reply->sendWithError(code); });
 }
 
 STW_COMMAND_HANDLER(deleteContainer) {

@@ -1,5 +1,6 @@
 // The per-container services: info-set, info-get, regenerate-uuid, du, assets-path,
-// assets-delete, stage-shared and retry-test.
+// assets-delete, stage-shared and retry-test; and set-protection, a data container's
+// protection class.
 #include "client/stowlyctl/STWCTLArguments.h"
 #include "client/stowlyctl/STWCTLCommands.h"
 
@@ -17,6 +18,10 @@ void STWCTLCommands::_addServiceCommands(CLI::App& app) {
         bool relative = false;
         bool noCreate = false;
         uint64_t crashes = 1;
+        int64_t protectionClass = 0;
+        bool thirdParty = false;
+        bool retryIfLocked = false;
+        bool wait = false;
     };
     auto arguments = std::make_shared<Arguments>();
     // The commands on one container named by identifier, class and UUID.
@@ -126,5 +131,27 @@ void STWCTLCommands::_addServiceCommands(CLI::App& app) {
     retry->add_option("N", arguments->crashes, "Exits before the test succeeds")->capture_default_str();
     _onRun(retry, [arguments](STWCTLSession& session) {
         return session.send({{"Command", STWValue(25)}, {"NumRetryCrashes", STWValue(arguments->crashes)}});
+    });
+
+    // The daemon answers once the change is done; one that waits for the next unlock answers
+    // after it. Without --wait that shows as a time-out after --timeout (the change goes on).
+    CLI::App* protection = app.add_subcommand("set-protection", "Change a data container's data-protection class");
+    protection->add_option("IDENTIFIER", arguments->identifier, "Container identifier")->required();
+    protection->add_option("CLASS", arguments->protectionClass, "Class: 1 complete, 3 until first unlock, 4 none")
+        ->required();
+    protection->add_option("-c,--class", arguments->containerClass, "Container class (2, 4, 6, 7, 9, 10 or 11)")
+        ->capture_default_str();
+    protection->add_flag("--third-party", arguments->thirdParty, "The application is not part of the system");
+    protection->add_flag("--retry", arguments->retryIfLocked, "When the device is locked, wait for the next unlock");
+    protection->add_flag("--wait", arguments->wait, "Block until the daemon answers, however long that takes");
+    _onRun(protection, [arguments](STWCTLSession& session) {
+        if (arguments->wait)
+            session.options.timeoutSeconds = 1e9;
+        return session.send({{"Command", STWValue(21)},
+                             {"Identifier", STWValue(arguments->identifier)},
+                             {"ContainerClass", STWValue(arguments->containerClass)},
+                             {"DataProtectionClass", STWValue(arguments->protectionClass)},
+                             {"IsThirdParty", STWValue(arguments->thirdParty)},
+                             {"RetryIfLocked", STWValue(arguments->retryIfLocked)}});
     });
 }
