@@ -105,16 +105,26 @@ void STWClientConnection::_cleanupOrphanedDataForDirectories(const DirectoryList
     auto fileManager = STWFileManager::defaultManager();
     bool internal = STWGlobalConfiguration::sharedInstance()->isInternalImage();
     int classfd = directories.fd->get();
+    std::string metadataPath;
     for (const auto& entry : directories.items) {
+        struct stat st;
+        bool containerName = cache->containerURL(fs::path(entry.name), containerClass);
+        if (entry.isDirectory && containerName) {
+            // The common case, a container, costs one stat. Should the app have put a link
+            // in its place since the listing, the stat may follow it, and at worst the link
+            // stays until the next sweep: nothing is moved on what this call says.
+            metadataPath.assign(entry.name).append("/").append(STWContainerMetadataFileName);
+            if (fstatat(classfd, metadataPath.c_str(), &st, AT_SYMLINK_NOFOLLOW) == 0 || errno != ENOENT)
+                continue;
+        }
         // Held, never opened: a link or a FIFO an app planted is moved as the entry it is.
         STWFileDescriptor item(openat(classfd, entry.name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
-        struct stat st;
         if (!item || fstat(item.get(), &st) != 0)
             continue; // gone meanwhile
         fs::path url = directories.url / entry.name;
         bool isDirectory = S_ISDIR(st.st_mode);
-        if (isDirectory && cache->containerURL(url, containerClass)) {
-            // Asked of the directory just opened, not of a path an app could redirect since.
+        if (isDirectory && containerName) {
+            // Decided again on the directory just opened, not on a path an app could redirect.
             struct stat metadata;
             if (fstatat(item.get(), STWContainerMetadataFileName, &metadata, AT_SYMLINK_NOFOLLOW) == 0 ||
                 errno != ENOENT)

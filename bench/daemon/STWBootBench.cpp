@@ -5,8 +5,8 @@
 //       user's data class and 1,000 leftovers: 400 directories there without a metadata
 //       file, 300 in the user's staging directory, 300 in death row, each a small
 //       container tree. Baseline: listing every directory involved and removing the
-//       leftovers with one `rm -rf` run at the priority of the daemon's cleanup queues
-//       (nice 19); the same at normal priority is printed beside it. ratio = daemon time /
+//       leftovers with one `rm -rf`, run both at the priority of the daemon's cleanup
+//       queues (nice 19) and at normal priority; the faster counts. ratio = daemon time /
 //       baseline time.
 //   boot_first_request_vs_cleanups  time from exec to the first answered request, against
 //       the time to both cleanups finished: below 1 means requests are served while the
@@ -21,6 +21,7 @@
 #include "common/STWLog.h"
 #include "common/STWValue.h"
 
+#include <algorithm>
 #include <chrono>
 #include <csignal>
 #include <cstdio>
@@ -127,7 +128,10 @@ public:
         printf("first boot with %zu containers and %zu leftovers: first request %.1f ms, both cleanups %.1f ms; "
                "listing and rm -rf %.1f ms at the cleanup queues' priority (nice 19), %.1f ms at ours\n",
                kContainers, kOrphans + kStaging + kDeathRow, bestFirst, best, bestBaseline, bestPlainBaseline);
-        printf("boot_cleanups_10000_containers_1000_leftovers: ratio %.2f (goal <= 1.3)\n", best / bestBaseline);
+        // The same removal at either priority: the faster one met less of the machine's
+        // other load, and is the stricter baseline.
+        printf("boot_cleanups_10000_containers_1000_leftovers: ratio %.2f (goal <= 1.3)\n",
+               best / std::min(bestBaseline, bestPlainBaseline));
         printf("boot_first_request_vs_cleanups: ratio %.2f (goal < 1)\n", bestFirst / best);
         fflush(stdout);
     }
@@ -135,8 +139,7 @@ public:
 private:
     // Listing the three directories and one `rm -rf` of every leftover. The daemon's
     // cleanups run on background queues (nice 19), so on a busy machine they yield to
-    // everyone; `atCleanupPriority` runs rm there too, to compare the work and not the
-    // scheduling.
+    // everyone; `atCleanupPriority` runs rm there too.
     double baseline(bool atCleanupPriority) {
         layOutLeftovers();
         auto before = Clock::now();
