@@ -44,7 +44,7 @@ STWFormatArg describe(const STWValue* value) { return value ? STWFormatArg(*valu
 class ProtectionWalk final : public STWDirectoryWalker::Delegate {
 public:
     ProtectionWalk(int32_t protectionClass, int32_t changeType, const struct stat& container)
-        : _class(protectionClass), _changeType(changeType), _device(container.st_dev), _owner(container.st_uid) {}
+        : _class(protectionClass), _changeType(changeType), _device(container.st_dev) {}
 
     // One of the user-data items, opened beneath the container.
     void walkItem(int fd, const std::string& path) {
@@ -129,17 +129,19 @@ private:
     void file(int fd, const struct stat& st, const std::string& path) {
         if (!(_changeType & STWDataProtectionChangeFiles) || st.st_dev != _device)
             return;
-        // A second name of a file that is not the owner's own may be a link to something
-        // outside the container; its class is not the container's to set.
-        if (st.st_nlink > 1 && st.st_uid != _owner) {
-            STW_LOG_NOTICE(STWLogCategory::FS, "Skipping hard-linked file %s owned by %u", path, st.st_uid);
+        // A file with a second name may be linked in from outside the container (another
+        // app's, of the same user); its class is not this container's to set.
+        if (st.st_nlink > 1) {
+            STW_LOG_NOTICE(STWLogCategory::FS, "Skipping file %s with %llu links", path,
+                           static_cast<unsigned long long>(st.st_nlink));
             return;
         }
         int32_t target = _class == 0 ? 3 : _class;
         set(fd, path, target, [&](int32_t current) {
             if (current == 2 || current == target)
                 return false;
-            if ((_changeType & STWDataProtectionChangeOnlyStronger) && target > current)
+            // A file that never had a class (0) has no protection to keep.
+            if ((_changeType & STWDataProtectionChangeOnlyStronger) && current != 0 && target > current)
                 return false;
             STW_LOG_DEBUG(STWLogCategory::FS, "Setting protection class of %s to %d", path, target);
             return true;
@@ -168,7 +170,6 @@ private:
     const int32_t _class;
     const int32_t _changeType;
     const dev_t _device;
-    const uid_t _owner;
     STWDirectoryWalker _walker;
     STWErrorRef _error;
 };
