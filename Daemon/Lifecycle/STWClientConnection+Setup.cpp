@@ -25,12 +25,13 @@ namespace fs = std::filesystem;
 namespace {
 
 constexpr STWContainerClass kPerUserClasses[] = {
-    STWContainerClassDataApplication,   STWContainerClassDataQuilletPlugin, STWContainerClassDataVPNPlugin,
-    STWContainerClassSharedAppGroup,    STWContainerClassDataTolvanService, STWContainerClassDataInternalDaemon,
+    STWContainerClassDataApplication, STWContainerClassDataQuilletPlugin, STWContainerClassDataVPNPlugin,
+    STWContainerClassSharedAppGroup,  STWContainerClassDataTolvanService, STWContainerClassDataInternalDaemon,
     STWContainerClassDataTempDir};
 constexpr STWContainerClass kGlobalClasses[] = {
-    STWContainerClassBundleApplication, STWContainerClassBundleQuilletPlugin, STWContainerClassBundleVPNPlugin,
-    STWContainerClassBundleFramework,   STWContainerClassDataSystem,          STWContainerClassSharedSystemGroup};
+    STWContainerClassBundleApplication, STWContainerClassBundleQuilletPlugin,
+    STWContainerClassBundleVPNPlugin,   STWContainerClassBundleFramework,
+    STWContainerClassDataSystem,        STWContainerClassSharedSystemGroup};
 
 // Its own system group container keeps its path across upgrades: the telemetry it holds
 // is read by path from before the upgrade.
@@ -48,7 +49,8 @@ void STWClientConnection::stowlySetup() {
     // A protection change that a stop cut short, or that was waiting for an unlock, goes on
     // from its update file.
     STWErrorRef protectionError;
-    if (!STWDataProtectionManager::defaultManager()->restartPendingDataProtectionOperationsWithError(&protectionError))
+    if (!STWDataProtectionManager::defaultManager()->restartPendingDataProtectionOperationsWithError(
+            &protectionError))
         STW_LOG_ERROR(STWLogCategory::Startup, "Failed restarting pending data protection operations: %@",
                       protectionError);
 }
@@ -59,11 +61,13 @@ void STWClientConnection::rebootStowlySetup() {
             _regenerateAllSystemContainerPaths();
             STWErrorRef error;
             if (!upgrade->performSynchronousBuildUpgradeMigration(&error))
-                STW_LOG_ERROR(STWLogCategory::Startup, "Failed to perform build upgrade migration : %@", error);
+                STW_LOG_ERROR(STWLogCategory::Startup, "Failed to perform build upgrade migration : %@",
+                              error);
             upgrade->writeCurrentBuildInfoToDisk();
         }
     } else {
-        STW_LOG_DEBUG(STWLogCategory::Startup, "No build-upgrade migration is built: this start is no upgrade");
+        STW_LOG_DEBUG(STWLogCategory::Startup,
+                      "No build-upgrade migration is built: this start is no upgrade");
     }
 
     _moveSystemContainersIntoPlace();
@@ -74,7 +78,8 @@ void STWClientConnection::rebootStowlySetup() {
         auto commandQueue = STWCommandQueue::init();
         {
             STWAllIdentifiersLockGuard lock(STWLockMode::Writing);
-            STWGroupManager::defaultManager()->reconcileGroupContainersOfType(STWGroupTypeApplication, *commandQueue);
+            STWGroupManager::defaultManager()->reconcileGroupContainersOfType(STWGroupTypeApplication,
+                                                                              *commandQueue);
         }
         uint64_t code = STWErrorSuccess;
         commandQueue->executeAllUntilExhaustedOrError(&code);
@@ -89,7 +94,8 @@ STWClientConnection::_listDirectoryForCleanup(const fs::path& url, const fs::pat
     auto fileManager = STWFileManager::defaultManager();
     auto listing = std::make_shared<DirectoryListing>();
     listing->url = url;
-    listing->fd = std::make_shared<STWFileDescriptor>(fileManager->openDirectoryAtURL(url, trustedAncestor, error));
+    listing->fd =
+        std::make_shared<STWFileDescriptor>(fileManager->openDirectoryAtURL(url, trustedAncestor, error));
     if (!*listing->fd)
         return nullptr;
     auto items = fileManager->itemsInDirectoryAt(listing->fd->get(), url, error);
@@ -129,13 +135,15 @@ void STWClientConnection::_cleanupOrphanedDataForDirectories(const DirectoryList
             if (fstatat(item.get(), STWContainerMetadataFileName, &metadata, AT_SYMLINK_NOFOLLOW) == 0 ||
                 errno != ENOENT)
                 continue;
-            STW_LOG_NOTICE(STWLogCategory::Lifecycle, "Deleting orphaned data missing a metadata file at: %@", url);
+            STW_LOG_NOTICE(STWLogCategory::Lifecycle, "Deleting orphaned data missing a metadata file at: %@",
+                           url);
         }
         if (internal) {
-            STW_LOG_ERROR(STWLogCategory::Lifecycle,
-                          "===== A process wrote data that is no container into %@: please file a problem report "
-                          "naming the process that writes invalid data into container directories =====",
-                          directories.url);
+            STW_LOG_ERROR(
+                STWLogCategory::Lifecycle,
+                "===== A process wrote data that is no container into %@: please file a problem report "
+                "naming the process that writes invalid data into container directories =====",
+                directories.url);
             if (isDirectory)
                 fileManager->printDirectoryStructureAtURL(url);
             STW_LOG_ERROR(STWLogCategory::Lifecycle, "===== End of invalid data at %@ =====", url);
@@ -150,28 +158,30 @@ void STWClientConnection::_cleanupOprhanedCodeSigningMappingData() {
     auto mapping = STWCodeSigningMapping::sharedInstance();
     STWErrorRef error;
     if (mapping && !mapping->removeAllAdvanceCopiesWithError(&error))
-        STW_LOG_ERROR(STWLogCategory::Startup, "Could not remove advance copies of code sign data: %@", error);
+        STW_LOG_ERROR(STWLogCategory::Startup, "Could not remove advance copies of code sign data: %@",
+                      error);
 }
 
 void STWClientConnection::rebootStowlyCleanupWithCompletion(std::function<void()> completion) {
     STWTransaction::begin();
     auto configuration = STWGlobalConfiguration::sharedInstance();
-    // Transient containers never survive a reboot.
-    STWErrorRef error;
-    fs::path transient = configuration->transientDirectory();
-    if (!_moveItemAtURLToDeathRow(transient, true, false, &error, STWFileManagerMoveDefault))
-        STW_LOG_ERROR(STWLogCategory::Startup, "Failed to delete shared transient URL %@ : %@", transient, error);
+    // Transient containers never survive a reboot. Their directories go now, before the
+    // first request, and under the lock that every creation holds: a transient container
+    // made by a request once serving began must not be swept with them.
+    STWAllIdentifiersLockGuard lock(STWLockMode::Writing);
+    auto sentence = [this](const fs::path& url, const char* failure) {
+        STWErrorRef error;
+        if (!_moveItemAtURLToDeathRow(url, true, false, &error, STWFileManagerMoveDefault))
+            STW_LOG_ERROR(STWLogCategory::Startup, failure, url, error);
+    };
+    sentence(configuration->transientDirectory(), "Failed to delete shared transient URL %@ : %@");
     if (auto legacy = configuration->legacyTransientBundleDirectory()) {
-        STW_LOG_NOTICE(STWLogCategory::Startup, "Sentencing legacy transient bundle directory [%@] to final deletion",
-                       *legacy);
-        if (!_moveItemAtURLToDeathRow(*legacy, true, false, &error, STWFileManagerMoveDefault))
-            STW_LOG_ERROR(STWLogCategory::Startup, "Failed to delete legacy shared transient bundle URL %@ : %@",
-                          *legacy, error);
+        STW_LOG_NOTICE(STWLogCategory::Startup,
+                       "Sentencing legacy transient bundle directory [%@] to final deletion", *legacy);
+        sentence(*legacy, "Failed to delete legacy shared transient bundle URL %@ : %@");
     }
-    fs::path transientBundles = configuration->transientBundleDirectory();
-    if (!_moveItemAtURLToDeathRow(transientBundles, true, false, &error, STWFileManagerMoveDefault))
-        STW_LOG_ERROR(STWLogCategory::Startup, "Failed to delete shared transient bundle URL %@ : %@",
-                      transientBundles, error);
+    sentence(configuration->transientBundleDirectory(),
+             "Failed to delete shared transient bundle URL %@ : %@");
 
     // Each class directory is listed here, once, and swept on the background queue.
     auto sweep = [this](const STWUserIdentityRef& user, STWContainerClass containerClass) {
@@ -187,23 +197,19 @@ void STWClientConnection::rebootStowlyCleanupWithCompletion(std::function<void()
                 STW_LOG_ERROR(STWLogCategory::Startup, "Failed to get items : %@", listError);
             return;
         }
-        _backgroundQueue->async(
-            [this, listing, containerClass] { _cleanupOrphanedDataForDirectories(*listing, containerClass); });
-    };
-    _userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock([&](const STWUserIdentityRef& user) {
-        if (!configuration->getPerUserConfigurationForUserIdentity(user))
-            return;
-        _backgroundQueue->async([this, user] {
-            auto perUser = STWGlobalConfiguration::sharedInstance()->getPerUserConfigurationForUserIdentity(user);
-            fs::path url = perUser->transientDirectory();
-            STWErrorRef moveError;
-            if (!_moveItemAtURLToDeathRow(url, true, false, &moveError, STWFileManagerMoveDefault))
-                STW_LOG_ERROR(STWLogCategory::Startup, "Failed to delete per-user transient URL %@ : %@", url,
-                              moveError);
+        _backgroundQueue->async([this, listing, containerClass] {
+            _cleanupOrphanedDataForDirectories(*listing, containerClass);
         });
-        for (STWContainerClass containerClass : kPerUserClasses)
-            sweep(user, containerClass);
-    });
+    };
+    _userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
+        [&](const STWUserIdentityRef& user) {
+            auto perUser = configuration->getPerUserConfigurationForUserIdentity(user);
+            if (!perUser)
+                return;
+            sentence(perUser->transientDirectory(), "Failed to delete per-user transient URL %@ : %@");
+            for (STWContainerClass containerClass : kPerUserClasses)
+                sweep(user, containerClass);
+        });
     for (STWContainerClass containerClass : kGlobalClasses)
         sweep(STWUserIdentityCache::defaultUserIdentity(), containerClass);
     _backgroundQueue->async([this] { _cleanupOprhanedCodeSigningMappingData(); });
@@ -229,26 +235,29 @@ void STWClientConnection::stowlyCleanupWithCompletion(std::function<void(uint64_
         else if (!error || !error->isPOSIX(ENOENT))
             STW_LOG_ERROR(STWLogCategory::Startup, "Failed to get items at global staging URL: %@ : %@",
                           configuration->stagingDirectory(), error);
-        _userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock([&](const STWUserIdentityRef& user) {
-            fs::path staging = configuration->stagingDirectoryURLForUserIdentity(user, STWContainerClassDataApplication);
-            STWErrorRef userError;
-            auto listing = _listDirectoryForCleanup(
-                staging, STWTrustedAncestorForClass(user, STWContainerClassDataApplication), &userError);
-            if (listing)
-                leftovers.push_back(std::move(listing));
-            else if (!userError || !userError->isPOSIX(ENOENT))
-                STW_LOG_ERROR(STWLogCategory::Startup, "Failed to get items at per-user staging URL: %@ : %@", staging,
-                              userError);
-        });
+        _userIdentityCache->forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
+            [&](const STWUserIdentityRef& user) {
+                fs::path staging =
+                    configuration->stagingDirectoryURLForUserIdentity(user, STWContainerClassDataApplication);
+                STWErrorRef userError;
+                auto listing = _listDirectoryForCleanup(
+                    staging, STWTrustedAncestorForClass(user, STWContainerClassDataApplication), &userError);
+                if (listing)
+                    leftovers.push_back(std::move(listing));
+                else if (!userError || !userError->isPOSIX(ENOENT))
+                    STW_LOG_ERROR(STWLogCategory::Startup,
+                                  "Failed to get items at per-user staging URL: %@ : %@", staging, userError);
+            });
     }
     _backgroundQueue->async([this, leftovers = std::move(leftovers), completion = std::move(completion)] {
         for (const auto& listing : leftovers) {
             for (const auto& entry : listing->items) {
-                STWFileDescriptor item(openat(listing->fd->get(), entry.name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+                STWFileDescriptor item(
+                    openat(listing->fd->get(), entry.name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
                 STWErrorRef error;
                 if (item)
-                    _moveItemAtToDeathRow(listing->fd->get(), entry.name, item.get(), listing->url / entry.name,
-                                          &error, STWFileManagerMoveDefault);
+                    _moveItemAtToDeathRow(listing->fd->get(), entry.name, item.get(),
+                                          listing->url / entry.name, &error, STWFileManagerMoveDefault);
             }
         }
         deleteContainersOnDeathRowWithCompletion([completion](uint64_t code) {
@@ -265,13 +274,14 @@ void STWClientConnection::_regenerateAllSystemContainerPaths() {
     STW_LOG_NOTICE(STWLogCategory::Startup, "Rolling system container directory UUIDs on disk");
     auto whitelist = STWWhitelist::sharedWhitelist();
     STWUserIdentityRef userIdentity = _clientIdentity ? _clientIdentity->userIdentity() : nullptr;
-    for (STWContainerClass containerClass : {STWContainerClassDataSystem, STWContainerClassSharedSystemGroup}) {
+    for (STWContainerClass containerClass :
+         {STWContainerClassDataSystem, STWContainerClassSharedSystemGroup}) {
         STWErrorRef error;
-        auto containers =
-            STWContainerCache::sharedInstance()->allContainersForUserIdentity(userIdentity, containerClass, false,
-                                                                              false, &error);
+        auto containers = STWContainerCache::sharedInstance()->allContainersForUserIdentity(
+            userIdentity, containerClass, false, false, &error);
         if (!containers) {
-            STW_LOG_ERROR(STWLogCategory::Startup, "Failed to get list of system containers for migration: %@", error);
+            STW_LOG_ERROR(STWLogCategory::Startup,
+                          "Failed to get list of system containers for migration: %@", error);
             continue;
         }
         for (const auto& container : *containers) {
@@ -282,8 +292,8 @@ void STWClientConnection::_regenerateAllSystemContainerPaths() {
             uint64_t code = STWErrorSuccess;
             if (!regenerateDirectoryUUIDWithContainerIdentity(container->containerIdentity(), &code))
                 STW_LOG_ERROR(STWLogCategory::Startup,
-                              "Failed to regenerate directory UUID for identifier: %@, class: %llu", identifier,
-                              containerClass);
+                              "Failed to regenerate directory UUID for identifier: %@, class: %llu",
+                              identifier, containerClass);
         }
     }
 }

@@ -66,7 +66,8 @@ bool removeItemWithoutForeignLinks(const fs::path& url, STWErrorRef* error) {
 void STWClientConnection::_moveSystemContainersIntoPlace() {
     auto fileManager = STWFileManager::defaultManager();
     auto configuration = STWGlobalConfiguration::sharedInstance();
-    auto perUser = configuration->getPerUserConfigurationForUserIdentity(_userIdentityCache->userIdentityForCurrentContext());
+    auto perUser = configuration->getPerUserConfigurationForUserIdentity(
+        _userIdentityCache->userIdentityForCurrentContext());
     if (!perUser)
         return;
     struct Backup {
@@ -94,8 +95,8 @@ void STWClientConnection::_moveSystemContainersIntoPlace() {
         if (!removeItemWithoutForeignLinks(inprogress, &error))
             STW_LOG_FN(kLogName, STWLogLevel::Error, STWLogCategory::Lifecycle,
                        "Failed to remove existing inprogress system containers: %@", error);
-        if (fileManager->moveItemAtURLWithoutForeignLinks(backup.directory, inprogress, STWFileManagerMoveDefault,
-                                                          &error))
+        if (fileManager->moveItemAtURLWithoutForeignLinks(backup.directory, inprogress,
+                                                          STWFileManagerMoveDefault, &error))
             backup.moved = true;
         else
             STW_LOG_FN(kLogName, STWLogLevel::Error, STWLogCategory::Lifecycle, backup.moveFailure, error);
@@ -107,9 +108,11 @@ void STWClientConnection::_moveSystemContainersIntoPlace() {
         fs::path inprogress = withExtension(backup.directory, "inprogress");
         STWErrorRef error;
         STWFileDescriptor directory = fileManager->openDirectoryAtURLWithoutForeignLinks(inprogress, &error);
-        auto items = directory ? fileManager->itemsInDirectoryAt(directory.get(), inprogress, &error) : std::nullopt;
+        auto items =
+            directory ? fileManager->itemsInDirectoryAt(directory.get(), inprogress, &error) : std::nullopt;
         if (!items) {
-            STW_LOG_FN(kLogName, STWLogLevel::Error, STWLogCategory::Lifecycle, backup.listFailure, inprogress, error);
+            STW_LOG_FN(kLogName, STWLogLevel::Error, STWLogCategory::Lifecycle, backup.listFailure,
+                       inprogress, error);
             continue;
         }
         for (const auto& item : *items)
@@ -125,34 +128,36 @@ void STWClientConnection::_moveSystemContainersIntoPlace() {
     }
 }
 
-void STWClientConnection::_moveSystemContainerIntoPlace(const fs::path& restored, STWContainerClass containerClass) {
+void STWClientConnection::_moveSystemContainerIntoPlace(const fs::path& restored,
+                                                        STWContainerClass containerClass) {
     auto fileManager = STWFileManager::defaultManager();
     std::string identifier = restored.filename();
     fs::path failedDirectory = withExtension(restored.parent_path(), "failed") / identifier;
     uint64_t code = STWErrorSuccess;
     auto identity = STWContainerIdentity::containerIdentityWithIdentifier(identifier, containerClass, &code);
     if (!identity) {
-        STW_LOG_FN(kLogName, STWLogLevel::Error, STWLogCategory::Lifecycle, "Failed to create container identity %@: %llu",
-                   identifier, code);
+        STW_LOG_FN(kLogName, STWLogLevel::Error, STWLogCategory::Lifecycle,
+                   "Failed to create container identity %@: %llu", identifier, code);
         return;
     }
     auto container = createOrLookupContainerWithContainerIdentity(identity, true, false, true, &code);
     if (!container) {
-        STW_LOG_FN(kLogName, STWLogLevel::Error, STWLogCategory::Lifecycle, "Failed to create system container %@: %llu",
-                   identifier, code);
+        STW_LOG_FN(kLogName, STWLogLevel::Error, STWLogCategory::Lifecycle,
+                   "Failed to create system container %@: %llu", identifier, code);
         return;
     }
     fs::path destination = container->url();
-    STW_LOG_FN(kLogName, STWLogLevel::Notice, STWLogCategory::Lifecycle, "Restoring container for %@ at %@ to %@",
-               identifier, restored, destination);
+    STW_LOG_FN(kLogName, STWLogLevel::Notice, STWLogCategory::Lifecycle,
+               "Restoring container for %@ at %@ to %@", identifier, restored, destination);
     STWErrorRef error;
     STWFileDescriptor directory = fileManager->openDirectoryAtURLWithoutForeignLinks(restored, &error);
     // Hidden entries (the backup's metadata file among them) stay: the live container keeps its own.
-    auto items = directory ? fileManager->itemsInDirectoryAt(directory.get(), restored, &error) : std::nullopt;
+    auto items =
+        directory ? fileManager->itemsInDirectoryAt(directory.get(), restored, &error) : std::nullopt;
     if (!items) {
         STW_LOG_FN(kLogName, STWLogLevel::Error, STWLogCategory::Lifecycle,
-                   "Failed to enumerate contents of restored system container %@ at %@: %@", identifier, restored,
-                   error);
+                   "Failed to enumerate contents of restored system container %@ at %@: %@", identifier,
+                   restored, error);
         return;
     }
     for (const auto& entry : *items) {
@@ -160,13 +165,14 @@ void STWClientConnection::_moveSystemContainerIntoPlace(const fs::path& restored
         fs::path to = destination / entry.name;
         STWErrorRef itemError;
         if (!removeItemWithoutForeignLinks(to, &itemError)) {
-            STW_LOG_FN(kLogName, STWLogLevel::Error, STWLogCategory::Lifecycle, "Failed to remove destination %@:%@: %@",
-                       identifier, entry.name, itemError);
-            _moveFailedPathAside(from, failedDirectory);
-        } else if (!fileManager->moveItemAtURLWithoutForeignLinks(from, to, STWFileManagerMoveDefault, &itemError)) {
             STW_LOG_FN(kLogName, STWLogLevel::Error, STWLogCategory::Lifecycle,
-                       "Failed to move file in restored system container %@:%@ to destination %@: %@", identifier,
-                       entry.name, to, itemError);
+                       "Failed to remove destination %@:%@: %@", identifier, entry.name, itemError);
+            _moveFailedPathAside(from, failedDirectory);
+        } else if (!fileManager->moveItemAtURLWithoutForeignLinks(from, to, STWFileManagerMoveDefault,
+                                                                  &itemError)) {
+            STW_LOG_FN(kLogName, STWLogLevel::Error, STWLogCategory::Lifecycle,
+                       "Failed to move file in restored system container %@:%@ to destination %@: %@",
+                       identifier, entry.name, to, itemError);
             _moveFailedPathAside(from, failedDirectory);
         }
     }
@@ -180,12 +186,12 @@ void STWClientConnection::_moveFailedPathAside(const fs::path& item, const fs::p
     auto fileManager = STWFileManager::defaultManager();
     STWErrorRef error;
     if (!fileManager->createDirectoryAtURL(failedDirectory, true, 0777, &error)) {
-        STW_LOG_FN(kLogName, STWLogLevel::Error, STWLogCategory::Lifecycle, "Failed to create %@: %@", failedDirectory,
-                   error);
+        STW_LOG_FN(kLogName, STWLogLevel::Error, STWLogCategory::Lifecycle, "Failed to create %@: %@",
+                   failedDirectory, error);
         return;
     }
     fs::path to = failedDirectory / item.filename();
     if (!fileManager->moveItemAtURLWithoutForeignLinks(item, to, STWFileManagerMoveDefault, &error))
-        STW_LOG_FN(kLogName, STWLogLevel::Error, STWLogCategory::Lifecycle, "Failed to move %@ to %@: %@", item, to,
-                   error);
+        STW_LOG_FN(kLogName, STWLogLevel::Error, STWLogCategory::Lifecycle, "Failed to move %@ to %@: %@",
+                   item, to, error);
 }

@@ -173,9 +173,10 @@ public:
     // which lives for the process. The first start after power-on runs rebootStowlySetup
     // (build upgrade, restored system containers, group reconcile on multi-user devices),
     // every start stowlySetup (replace journals, pending protection changes); both run
-    // before the first request. The cleanups list what they sweep at once and return; the
-    // sweeps run on the background queue while requests are served, each cleanup holding
-    // an IPC transaction until its completion ran. The first-boot cleanup sends transient
+    // before the first request. The cleanups list what they sweep at once (the first-boot
+    // one also sends the transient directories to death row then) and return; the sweeps
+    // run on the background queue while requests are served, each cleanup holding an IPC
+    // transaction until its completion ran. The first-boot cleanup sends transient
     // containers and whatever in a class directory is not a container to death row; the
     // every-start cleanup sends staging leftovers there and then empties death row (its
     // completion gets the pass's code). Nothing is followed below a directory an app owns:

@@ -44,8 +44,12 @@ using Clock = std::chrono::steady_clock;
 
 constexpr size_t kContainers = 10000, kOrphans = 400, kStaging = 300, kDeathRow = 300;
 
-double millis(Clock::duration d) { return std::chrono::duration<double, std::milli>(d).count(); }
-[[noreturn]] void die(const std::string& message) { throw std::runtime_error(message); }
+double millis(Clock::duration d) {
+    return std::chrono::duration<double, std::milli>(d).count();
+}
+[[noreturn]] void die(const std::string& message) {
+    throw std::runtime_error(message);
+}
 
 void mustMake(const fs::path& directory) {
     std::error_code ec;
@@ -125,9 +129,10 @@ public:
             bestBaseline = std::min(bestBaseline, baseline(true));
             bestPlainBaseline = std::min(bestPlainBaseline, baseline(false));
         }
-        printf("first boot with %zu containers and %zu leftovers: first request %.1f ms, both cleanups %.1f ms; "
-               "listing and rm -rf %.1f ms at the cleanup queues' priority (nice 19), %.1f ms at ours\n",
-               kContainers, kOrphans + kStaging + kDeathRow, bestFirst, best, bestBaseline, bestPlainBaseline);
+        printf(
+            "first boot with %zu containers and %zu leftovers: first request %.1f ms, both cleanups %.1f ms; "
+            "listing and rm -rf %.1f ms at the cleanup queues' priority (nice 19), %.1f ms at ours\n",
+            kContainers, kOrphans + kStaging + kDeathRow, bestFirst, best, bestBaseline, bestPlainBaseline);
         // The same removal at either priority: the faster one met less of the machine's
         // other load, and is the stricter baseline.
         printf("boot_cleanups_10000_containers_1000_leftovers: ratio %.2f (goal <= 1.3)\n",
@@ -216,7 +221,8 @@ private:
             std::this_thread::sleep_for(std::chrono::microseconds(200));
         }
         // A request that needs no container: refused for want of an entitlement.
-        auto reply = client->sendMessage({{"Command", STWValue(uint64_t{27})}}, std::chrono::seconds(60), nullptr);
+        auto reply =
+            client->sendMessage({{"Command", STWValue(uint64_t{27})}}, std::chrono::seconds(60), nullptr);
         if (!reply || STWDictionaryUInt64(*reply, "ReplyError").value_or(0) != STWErrorNotEntitled)
             die("the first request was not answered");
         *first = millis(Clock::now() - start);

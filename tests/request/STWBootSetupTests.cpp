@@ -1,46 +1,36 @@
-#include "Daemon/Lifecycle/STWContainerCache.h"
-#include "Daemon/Model/STWUserIdentityCache.h"
 #include "Daemon/Request/STWClientConnection.h"
 #include "tests/support/STWTestRoot.h"
 
 #include <gtest/gtest.h>
 
-namespace fs = std::filesystem;
-
-// A build upgrade moves every system and system group container to a new UUID directory,
-// except the well-known ones and the telemetry group, which keep their paths; the cache
-// follows the moves.
+// A build upgrade moves system and system group containers to new UUID directories, except
+// the well-known ones and the telemetry group; look-ups follow the moves.
 TEST(STWBootSetup, ABuildUpgradeGivesOnlyOrdinarySystemContainersNewDirectories) {
     STWTestRoot::shared();
     auto connection = STWClientConnection::sharedClientConnection();
-    struct Case {
-        const char* identifier;
-        STWContainerClass containerClass;
-        bool moves;
-        fs::path before;
-    };
-    Case cases[] = {{"com.example.system", STWContainerClassDataSystem, true, {}},
-                    {"com.vorlane.maple", STWContainerClassDataSystem, false, {}},
-                    {"systemgroup.com.example.group", STWContainerClassSharedSystemGroup, true, {}},
-                    {"systemgroup.com.vorlane.telemetry", STWContainerClassSharedSystemGroup, false, {}},
-                    {"systemgroup.com.vorlane.alder", STWContainerClassSharedSystemGroup, false, {}}};
-    auto identity = [](const Case& c) {
-        return STWContainerIdentity::containerIdentityWithIdentifier(c.identifier, c.containerClass, nullptr);
-    };
-    for (Case& c : cases) {
+    std::tuple<const char*, STWContainerClass, bool> cases[] = {
+        {"com.example.system", 12, true},
+        {"com.vorlane.maple", 12, false},
+        {"systemgroup.com.example.group", 13, true},
+        {"systemgroup.com.vorlane.telemetry", 13, false},
+        {"systemgroup.com.vorlane.alder", 13, false}};
+    auto container = [&](auto& c, bool create) {
         uint64_t code = STWErrorSuccess;
-        auto made = connection->createOrLookupContainerWithContainerIdentity(identity(c), true, false, true, &code);
-        ASSERT_TRUE(made) << c.identifier << ": " << code;
-        c.before = made->url();
-    }
+        auto identity =
+            STWContainerIdentity::containerIdentityWithIdentifier(std::get<0>(c), std::get<1>(c), nullptr);
+        auto found =
+            connection->createOrLookupContainerWithContainerIdentity(identity, create, false, true, &code);
+        return found ? found->url() : std::filesystem::path();
+    };
+    std::vector<std::filesystem::path> before;
+    for (auto& c : cases)
+        before.push_back(container(c, true));
     connection->_regenerateAllSystemContainerPaths();
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.identifier);
-        uint64_t code = STWErrorSuccess;
-        auto found = connection->createOrLookupContainerWithContainerIdentity(identity(c), false, false, true, &code);
-        ASSERT_TRUE(found);
-        EXPECT_EQ(found->url() != c.before, c.moves);
-        EXPECT_TRUE(fs::is_directory(found->url()));
-        EXPECT_EQ(fs::exists(c.before), !c.moves);
+    for (size_t i = 0; i < std::size(cases); ++i) {
+        SCOPED_TRACE(std::get<0>(cases[i]));
+        std::filesystem::path after = container(cases[i], false);
+        EXPECT_TRUE(std::filesystem::is_directory(after));
+        EXPECT_EQ(after != before[i], std::get<2>(cases[i]));
+        EXPECT_EQ(std::filesystem::exists(before[i]), !std::get<2>(cases[i]));
     }
 }
