@@ -145,6 +145,10 @@ public:
     };
     std::optional<std::vector<DirectoryItem>> itemsInDirectoryAtURL(const std::filesystem::path& url,
                                                                     STWErrorRef* error = nullptr) const;
+    // The same for the directory open as `dirfd` (one below a directory someone else owns,
+    // opened without following links); `url` only names it in errors.
+    std::optional<std::vector<DirectoryItem>> itemsInDirectoryAt(int dirfd, const std::filesystem::path& url,
+                                                                 STWErrorRef* error = nullptr) const;
 
     // lstat-based: a dangling link exists. An item that cannot be examined (other than
     // ENOENT) answers NO to both.
@@ -338,5 +342,8 @@ private:
     // does not begin with "." and the descriptor of the open directory. Errors carry
     // `function` as their function name.
     bool _forEachItemInDirectory(const std::string& path, const char* function, STWErrorRef* error,
+                                 const std::function<void(int directory, const struct dirent& entry)>& body) const;
+    // The same through `dirfd` when it is not -1.
+    bool _forEachItemInDirectory(const std::string& path, const char* function, STWErrorRef* error, int dirfd,
                                  const std::function<void(int directory, const struct dirent& entry)>& body) const;
 };

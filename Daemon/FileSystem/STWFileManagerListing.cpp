@@ -9,6 +9,7 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 namespace fs = std::filesystem;
 using namespace STWFileSystemPrimitives;
@@ -75,9 +76,14 @@ std::optional<std::vector<fs::path>> STWFileManager::urlsForItemsInDirectoryAtUR
 
 std::optional<std::vector<STWFileManager::DirectoryItem>> STWFileManager::itemsInDirectoryAtURL(const fs::path& url,
                                                                                               STWErrorRef* error) const {
+    return itemsInDirectoryAt(-1, url, error);
+}
+
+std::optional<std::vector<STWFileManager::DirectoryItem>>
+STWFileManager::itemsInDirectoryAt(int dirfd, const fs::path& url, STWErrorRef* error) const {
     std::string path = pathString(url);
     std::vector<DirectoryItem> items;
-    bool listed = _forEachItemInDirectory(path, __func__, error, [&](int directory, const dirent& entry) {
+    bool listed = _forEachItemInDirectory(path, __func__, error, dirfd, [&](int directory, const dirent& entry) {
         bool isDirectory = entry.d_type == DT_DIR;
         struct stat st;
         if (entry.d_type == DT_UNKNOWN && fstatat(directory, entry.d_name, &st, AT_SYMLINK_NOFOLLOW) == 0)
@@ -91,7 +97,22 @@ std::optional<std::vector<STWFileManager::DirectoryItem>> STWFileManager::itemsI
 
 bool STWFileManager::_forEachItemInDirectory(const std::string& path, const char* function, STWErrorRef* error,
                                              const std::function<void(int, const dirent&)>& body) const {
-    DIR* directory = opendir(path.c_str());
+    return _forEachItemInDirectory(path, function, error, -1, body);
+}
+
+bool STWFileManager::_forEachItemInDirectory(const std::string& path, const char* function, STWErrorRef* error,
+                                             int directoryfd, const std::function<void(int, const dirent&)>& body) const {
+    // A descriptor of the caller's is read through a fresh open of "." in it, so that the
+    // listing has a position of its own and closing it leaves the caller's descriptor open.
+    DIR* directory = nullptr;
+    if (directoryfd < 0) {
+        directory = opendir(path.c_str());
+    } else {
+        int own = openat(directoryfd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+        directory = own < 0 ? nullptr : fdopendir(own);
+        if (own >= 0 && !directory)
+            close(own);
+    }
     if (!directory) {
         int e = errno;
         if (e != ENOENT)

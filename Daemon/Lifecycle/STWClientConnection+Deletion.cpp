@@ -74,16 +74,16 @@ bool STWClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& 
 }
 
 bool STWClientConnection::_moveItemAtToDeathRow(int parentfd, const std::string& name, int itemfd,
-                                                const std::filesystem::path& url, STWErrorRef* error) {
+                                                const std::filesystem::path& url, STWErrorRef* error,
+                                                STWFileManagerMoveOptions options) {
     auto fileManager = STWFileManager::defaultManager();
     bool moved = false;
     return moveIntoDeathRow(
         url,
         [&](const std::filesystem::path& unique, STWErrorRef* stepError) {
             STWFileDescriptor uniquefd = fileManager->openDirectoryAtURLWithoutForeignLinks(unique, stepError);
-            return uniquefd && fileManager->moveDirectoryAt(parentfd, name, uniquefd.get(), name, itemfd,
-                                                            STWFileManagerMoveSyncSourceDirectory, url,
-                                                            unique / name, stepError);
+            return uniquefd && fileManager->moveDirectoryAt(parentfd, name, uniquefd.get(), name, itemfd, options,
+                                                            url, unique / name, stepError);
         },
         [&] {
             struct stat st;

@@ -93,9 +93,12 @@ public:
                                   STWFileManagerMoveOptions options = STWFileManagerMoveSyncSourceDirectory);
     // The same for an item found below a directory someone else owns: the entry `name` of
     // `parentfd` moves into a fresh "temp." directory only while it is still the item open
-    // as `itemfd` (ESTALE otherwise); the directory it left is synced.
+    // as `itemfd` (ESTALE otherwise); the directory it left is synced unless `options` say
+    // otherwise, as above. `itemfd` may be an O_PATH descriptor (a link or a FIFO is moved as
+    // the entry it is, never opened or followed).
     bool _moveItemAtToDeathRow(int parentfd, const std::string& name, int itemfd, const std::filesystem::path& url,
-                               STWErrorRef* error);
+                               STWErrorRef* error,
+                               STWFileManagerMoveOptions options = STWFileManagerMoveSyncSourceDirectory);
     static bool _removeItemOrMoveToTempAtURL(const std::filesystem::path& url, STWErrorRef* error);
     // Empties death row on the death-row queue; the completion gets 1 or the last error's code.
     static void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
@@ -166,12 +169,50 @@ public:
                                                                          uint64_t* error);
     bool retryTestWithNumCrashes(uint64_t numCrashes, uint64_t* error);
 
-    // Start-up work of the daemon's own connection: first-boot and every-start setup,
-    // and the cleanups whose completions run later on the background queue.
+    // Start-up (Lifecycle/STWClientConnection+Setup.cpp), on the daemon's own connection,
+    // which lives for the process. The first start after power-on runs rebootStowlySetup
+    // (build upgrade, restored system containers, group reconcile on multi-user devices),
+    // every start stowlySetup (replace journals, pending protection changes); both run
+    // before the first request. The cleanups list what they sweep at once (the first-boot
+    // one also sends the transient directories to death row then) and return; the sweeps
+    // run on the background queue while requests are served, each cleanup holding an IPC
+    // transaction until its completion ran. The first-boot cleanup sends transient
+    // containers and whatever in a class directory is not a container to death row; the
+    // every-start cleanup sends staging leftovers there and then empties death row (its
+    // completion gets the pass's code). Nothing is followed below a directory an app owns:
+    // entries are listed and moved through descriptors.
     void rebootStowlySetup();
     void stowlySetup();
     void rebootStowlyCleanupWithCompletion(std::function<void()> completion);
-    void stowlyCleanupWithCompletion(std::function<void()> completion);
+    void stowlyCleanupWithCompletion(std::function<void(uint64_t)> completion);
+    // The entries of one directory as listed through its descriptor, kept open for the
+    // sweep that acts on them later.
+    struct DirectoryListing {
+        std::filesystem::path url;
+        std::shared_ptr<STWFileDescriptor> fd;
+        std::vector<STWFileManager::DirectoryItem> items;
+    };
+    // The directory at `url`, opened without following a link below `trustedAncestor`
+    // (empty: only the last component), and its entries; nullptr with the error otherwise.
+    static std::shared_ptr<const DirectoryListing> _listDirectoryForCleanup(const std::filesystem::path& url,
+                                                                            const std::filesystem::path& trustedAncestor,
+                                                                            STWErrorRef* error);
+    // Moves to death row every entry of a class directory's listing that is not a container
+    // of the class: anything but a directory, a directory whose name is no container name,
+    // and one without a metadata file (one whose metadata state cannot be read stays).
+    void _cleanupOrphanedDataForDirectories(const DirectoryListing& directories, STWContainerClass containerClass);
+    void _cleanupOprhanedCodeSigningMappingData();
+    // A build upgrade gives every system and system group container that is not well known
+    // a new UUID directory.
+    void _regenerateAllSystemContainerPaths();
+
+    // Restored system containers (Lifecycle/STWClientConnection+SystemContainerRestore.cpp):
+    // the backup directories left by a restore are renamed to "inprogress" and each
+    // container in them is installed item by item over the live container; an item that
+    // cannot be installed is kept in the failed-items directory beside them.
+    void _moveSystemContainersIntoPlace();
+    void _moveSystemContainerIntoPlace(const std::filesystem::path& restored, STWContainerClass containerClass);
+    static void _moveFailedPathAside(const std::filesystem::path& item, const std::filesystem::path& failedDirectory);
 
     const std::shared_ptr<STWQueue>& backgroundQueue() const { return _backgroundQueue; }
     bool entitled() const { return _entitled; }

@@ -57,6 +57,14 @@ uint32_t postNotification(const char* name) {
     return 0;
 }
 
+// The marker of a cleanup that is about to run again: a waiter must not take the one an
+// earlier start left for its own run.
+void withdrawNotification(const char* name) {
+    auto file = STWPlatformConfiguration::sharedInstance()->runtimeDirectory() / name;
+    if (unlink(file.c_str()) != 0 && errno != ENOENT)
+        STW_LOG_ERROR(STWLogCategory::Startup, "Failed to withdraw %s: %s", name, strerror(errno));
+}
+
 void firstBootCompletion() {
     STW_LOG_NOTICE(STWLogCategory::Startup, "stowlyd first boot cleanup complete");
     std::string name = STWPlatformConfiguration::sharedInstance()->firstBootSemaphoreName();
@@ -99,7 +107,8 @@ void fixMallocThresholds() {
         STW_LOG_ERROR(STWLogCategory::Startup, "Cannot fix the mmap threshold of malloc");
 }
 
-void cleanupCompletion() {
+void cleanupCompletion(uint64_t) {
+    // The pass's own failures were logged where they happened.
     if (uint32_t status = postNotification("cleanup-complete"))
         STW_LOG_ERROR(STWLogCategory::Startup, "Failed to post cleanup-complete: %u", status);
     signpost("BootCleanup", false);
@@ -141,10 +150,12 @@ void STWDaemon::_onceInitialization() {
 
     std::string semaphoreName = STWPlatformConfiguration::sharedInstance()->firstBootSemaphoreName();
     sem_t* semaphore = sem_open(semaphoreName.c_str(), 0);
+    withdrawNotification("cleanup-complete");
     if (semaphore != SEM_FAILED) {
         sem_close(semaphore);
     } else {
         firstBoot = true;
+        withdrawNotification("reboot-cleanup-complete");
         STW_LOG_NOTICE(STWLogCategory::Startup, "stowlyd performing first boot initialization");
         signpost("FirstBootSetup", true);
         connection->rebootStowlySetup();

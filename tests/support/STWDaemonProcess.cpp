@@ -77,8 +77,24 @@ STWDaemonProcess::~STWDaemonProcess() {
     if (_pid > 0)
         stop();
     // The first-boot marker lives outside the root; a daemon of another root never shares it.
-    sem_unlink(STWPlatformConfiguration(_root).firstBootSemaphoreName().c_str());
+    reboot();
     STWFileManager::defaultManager()->removeItemAtURL(_root);
+}
+
+void STWDaemonProcess::reboot() { sem_unlink(STWPlatformConfiguration(_root).firstBootSemaphoreName().c_str()); }
+
+bool STWDaemonProcess::waitForCleanups(bool firstBoot) {
+    std::filesystem::path run = _root / "run/stowly";
+    auto deadline = std::chrono::steady_clock::now() + timeout;
+    while (!(std::filesystem::exists(run / "cleanup-complete") &&
+             (!firstBoot || std::filesystem::exists(run / "reboot-cleanup-complete")))) {
+        if (std::chrono::steady_clock::now() >= deadline || !isRunning()) {
+            _fail("the cleanups of " + _root.string() + " did not finish");
+            return false;
+        }
+        std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    }
+    return true;
 }
 
 bool STWDaemonProcess::startWith(const char* variable, const std::string& value) {

@@ -49,6 +49,12 @@ public:
     // Waits for a daemon that is to end by itself (at a crash point, say) and answers its
     // wait status, or nullopt when it still runs after `timeout`; no failure is reported.
     std::optional<int> waitForExit(std::chrono::milliseconds timeout);
+    // A power cycle as the daemon sees it: its first-boot semaphore goes, so its next start
+    // is the first since power-on (and runs the first-boot setup and cleanup).
+    void reboot();
+    // Waits until the cleanups of the running daemon's start have finished, as their
+    // completion files say: the every-start cleanup, and with `firstBoot` the first-boot one.
+    bool waitForCleanups(bool firstBoot = false);
     // Where the daemon's standard error (its system log off systemd) goes from the next
     // start on; by default it is ours.
     void setStandardErrorFile(std::filesystem::path file) { _standardErrorFile = std::move(file); }

@@ -1,0 +1,30 @@
+// What the first start after power-on asks of the migration subsystem: whether the
+// system's build changed since the daemon last recorded it, the migration that runs once
+// it did, and the record of the current build.
+//
+// Migration installs its implementation at start (install()); the first-boot setup of
+// STWClientConnection calls installed(). Until one is installed nothing can tell an
+// upgrade, so every start counts as none (said once at debug level). install() runs before
+// the first-boot setup and installed() from it, on the main thread during start-up;
+// both are safe from any thread.
+#pragma once
+
+#include "common/STWError.h"
+
+#include <memory>
+
+class STWBuildUpgrade {
+public:
+    virtual ~STWBuildUpgrade() = default;
+
+    // True when the recorded build differs from the running one.
+    virtual bool isBuildUpgrade() = 0;
+    // Runs the data migrations of a build upgrade; false with the error when one failed.
+    virtual bool performSynchronousBuildUpgradeMigration(STWErrorRef* error) = 0;
+    // Records the running build, so that the next power-on is no upgrade.
+    virtual void writeCurrentBuildInfoToDisk() = 0;
+
+    static void install(std::shared_ptr<STWBuildUpgrade> upgrade);
+    // nullptr while none is installed.
+    static std::shared_ptr<STWBuildUpgrade> installed();
+};
