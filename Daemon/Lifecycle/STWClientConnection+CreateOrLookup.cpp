@@ -22,7 +22,37 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
     uint64_t ignored = STWErrorSuccess;
     uint64_t* code = error ? error : &ignored;
     return _catchingExceptions<std::shared_ptr<STWMetadata>>(__func__, code, nullptr, [&]() -> std::shared_ptr<STWMetadata> {
-        std::optional<std::string> client = clientBundleIdentifier();
+        bool existed = false;
+        STWMetadataRef record =
+            _createOrLookupContainerWithContainerIdentity(identity, createIfNecessary, transient, useLocking, &existed, code);
+        if (!record)
+            return nullptr;
+        // A record of the caller's own: the cache's stays as it is.
+        auto result = std::make_shared<STWMetadata>(*record);
+        result->setExisted(existed);
+        return result;
+    });
+}
+
+STWMetadataRef STWClientConnection::createOrLookupContainerRecordWithContainerIdentity(
+    const STWContainerIdentityRef& identity, bool createIfNecessary, bool transient, bool useLocking, bool* existed,
+    uint64_t* error) {
+    uint64_t ignored = STWErrorSuccess;
+    uint64_t* code = error ? error : &ignored;
+    // Reported under the name of the operation it is a form of.
+    return _catchingExceptions<STWMetadataRef>("createOrLookupContainerWithContainerIdentity", code, nullptr, [&] {
+        return _createOrLookupContainerWithContainerIdentity(identity, createIfNecessary, transient, useLocking, existed,
+                                                             code);
+    });
+}
+
+STWMetadataRef STWClientConnection::_createOrLookupContainerWithContainerIdentity(const STWContainerIdentityRef& identity,
+                                                                                bool createIfNecessary, bool transient,
+                                                                                bool useLocking, bool* existed,
+                                                                                uint64_t* code) {
+    {
+        *existed = false;
+        const std::string* client = _clientIdentity ? &_clientIdentity->bundleIdentifier() : nullptr;
         STWFormatArg clientArg = client ? STWFormatArg(*client) : STWFormatArg(nullptr);
         STW_LOG_DEBUG(STWLogCategory::Lifecycle,
                       "createOrLookup; identity: %@, createIfNecessary: %d, transient: %d, allowOtherIdLookup: %d, "
@@ -37,7 +67,8 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
         const std::string& id = identity->identifier();
         STWContainerClass c = identity->containerClass();
         STWWhitelistRef whitelist = STWWhitelist::sharedWhitelist();
-        bool whitelisted = whitelist->isLookupWhitelistedFromCodeSignIdentifier(client.value_or(""), c, id);
+        static const std::string noClient;
+        bool whitelisted = whitelist->isLookupWhitelistedFromCodeSignIdentifier(client ? *client : noClient, c, id);
         bool isGroup = STWContainerClassIsGroup(c);
         bool allowed = (client && *client == id) || allowOtherIdLookup() || (isGroup && allowGroupIdLookup()) ||
                        unrestricted() || isEntitledForLookupWithClass(c, id) || whitelisted;
@@ -67,9 +98,8 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
             STWAllIdentifiersLockGuard lock(STWLockMode::Reading, useLocking);
             STWErrorRef lookupError;
             if (auto found = cache->containerForContainerIdentity(identity, false, true, &lookupError)) {
-                auto result = std::make_shared<STWMetadata>(*found);
-                result->setExisted(true);
-                return result;
+                *existed = true;
+                return found;
             }
             if (!lookupError || !lookupError->is(STWErrorNotFound)) {
                 *code = _codeOfError(lookupError);
@@ -87,9 +117,8 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
         if (auto found = cache->containerForContainerIdentity(identity, transient, true, &lookupError)) {
             if (!transient) {
                 // Another request made it while we waited for the write lock.
-                auto result = std::make_shared<STWMetadata>(*found);
-                result->setExisted(true);
-                return result;
+                *existed = true;
+                return found;
             }
             STWErrorRef moveError;
             if (!_moveItemAtURLToDeathRow(found->url(), true, true, &moveError)) {
@@ -209,8 +238,8 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
             return nullptr;
         }
         STW_LOG_DEBUG(STWLogCategory::Lifecycle, "end CreatingContainer uuid=%@", name);
-        return std::make_shared<STWMetadata>(*metadata);
-    });
+        return metadata;
+    }
 }
 
 std::optional<std::vector<STWMetadataRef>>
