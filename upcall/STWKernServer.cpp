@@ -189,8 +189,13 @@ STWKernReturn server_get_process_containers(const void* requestMemory, uint32_t 
             reply.systemGroups.emplace_back(group, std::move(*path));
 
     if (reply.status == 1) {
-        if (reply.dataContainer)
-            reply.tempDirectory = (std::filesystem::path(*reply.dataContainer) / "tmp").native();
+        if (reply.dataContainer) {
+            // As std::filesystem::path's "/" would join them, without parsing the path.
+            std::string& temp = reply.tempDirectory.emplace(*reply.dataContainer);
+            if (!temp.empty() && temp.back() != '/')
+                temp += '/';
+            temp += "tmp";
+        }
         reply.homeDirectory = request.uid == 0
                                   ? STWPlatformConfiguration::sharedInstance()->resolve("/private/var/root").native()
                                   : userIdentity->homeDirectoryURL().native();

@@ -54,14 +54,21 @@ STWContainerCache::STWContainerCache(std::shared_ptr<STWUserIdentityCache> userI
       _rebuildMappingQueue(STWQueue::create("com.vorlane.stowlyd.cache.mappings")) {}
 
 std::string STWContainerCache::classCacheKey(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass) {
-    std::string_view directoryName = STWContainerClassDirectoryName(contentClass);
-    if (!STWUserIdentity::isUserIdentityRequiredForContainerClass(contentClass))
-        return std::string(directoryName);
-    std::string key = "[";
-    key += userIdentity ? userIdentity->identifier() : std::string("(null)");
-    key += "]-";
-    key += directoryName;
+    std::string key;
+    _classCacheKey(userIdentity, contentClass, &key);
     return key;
+}
+
+void STWContainerCache::_classCacheKey(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass,
+                                       std::string* key) {
+    std::string_view directoryName = STWContainerClassDirectoryName(contentClass);
+    key->clear();
+    if (STWUserIdentity::isUserIdentityRequiredForContainerClass(contentClass)) {
+        *key += '[';
+        *key += userIdentity ? std::string_view(userIdentity->identifier()) : std::string_view("(null)");
+        *key += "]-";
+    }
+    *key += directoryName;
 }
 
 // MARK: - The code-signing mapping
@@ -201,10 +208,14 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
                                                                                 STWErrorRef* error) {
     _cacheLock.assertHeld(__func__);
 
-    std::string key = classCacheKey(userIdentity, contentClass);
+    // Every look-up comes here: the key is made in a buffer kept for the purpose, and only
+    // a rebuild takes a string of its own.
+    thread_local std::string lookupKey;
+    _classCacheKey(userIdentity, contentClass, &lookupKey);
     auto& caches = transient ? _transientContainerCache : _liveContainerCache;
-    if (auto it = caches.find(key); it != caches.end())
+    if (auto it = caches.find(lookupKey); it != caches.end())
         return &it->second;
+    std::string key = lookupKey;
 
     STW_LOG_NOTICE(STWLogCategory::Cache, "Rebuilding container class cache: %@%@", key, transientMarker(transient));
     signpost("RebuildingCache", true, contentClass);
@@ -272,20 +283,22 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
 // MARK: - Look-ups
 
 STWMetadataRef STWContainerCache::_validatedRecord(const STWMetadataRef& record, const ClassDirectoryRef& directory,
-                                                   const std::string& cacheName, bool transient, STWErrorRef* error) {
+                                                   bool transient, STWErrorRef* error) {
+    // The record's class cache, by name, for the messages of a record that does not pass.
+    auto cacheName = [&] { return classCacheKey(record->userIdentity(), record->containerClass()); };
     // Every look-up of a known container comes through here: the path stays text, as
     // splitting it into components costs more than the lstat.
     const std::string& url = record->urlString();
     if (url.empty()) {
         STWSetError(error,
                     STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Cache: %@%@: Invalid URL path string: %@",
-                              cacheName, transientMarker(transient), fs::path(url)));
+                              cacheName(), transientMarker(transient), fs::path(url)));
         return nullptr;
     }
     // The metadata file's path is only meaningful below an absolute container path.
     if (url.front() != '/') {
         STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Cache: %@%@: nil URL from %@",
-                                     cacheName, transientMarker(transient), fs::path(url)));
+                                     cacheName(), transientMarker(transient), fs::path(url)));
         return nullptr;
     }
     // Still the very file the record was read from or written to: a container that its app
@@ -308,7 +321,7 @@ STWMetadataRef STWContainerCache::_validatedRecord(const STWMetadataRef& record,
                       record->userIdentity(), record->identifier(), record->containerClass(),
                       static_cast<int>(transient), removeError);
     STWSetError(error, STW_ERROR(STWErrorMetadataMissing, nullptr,
-                                 "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", cacheName,
+                                 "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", cacheName(),
                                  transientMarker(transient), metadataFile, record->identifier(),
                                  record->containerClass()));
     return nullptr;
@@ -373,7 +386,8 @@ STWMetadataRef STWContainerCache::_containerForContainerIdentity(const STWContai
     _assertNotOnCodeSigningMappingQueue();
     const STWUserIdentityRef& userIdentity = identity->userIdentity();
     STWContainerClass contentClass = identity->containerClass();
-    std::string cacheName = classCacheKey(userIdentity, contentClass);
+    // Only messages name the class cache: the name is made when one is written.
+    auto cacheName = [&] { return classCacheKey(userIdentity, contentClass); };
 
     STWMetadataRef record;
     ClassDirectoryRef directory;
@@ -391,16 +405,16 @@ STWMetadataRef STWContainerCache::_containerForContainerIdentity(const STWContai
         auto it = cache->records.find(identity->identifier());
         if (it == cache->records.end()) {
             STWSetError(error, STW_ERROR_NOLOG(STWErrorNotFound, nullptr, "Cache: %@%@: Container Not Found with ID: %@",
-                                               cacheName, transientMarker(transient), identity->identifier()));
+                                               cacheName(), transientMarker(transient), identity->identifier()));
             return nullptr;
         }
         record = it->second;
         directory = cache->directory;
     }
 
-    record = _validatedRecord(record, directory, cacheName, transient, error);
+    record = _validatedRecord(record, directory, transient, error);
     if (record)
-        STW_LOG_DEBUG(STWLogCategory::Cache, "Cache: %@%@: Found Identifier: %@", cacheName, transientMarker(transient),
+        STW_LOG_DEBUG(STWLogCategory::Cache, "Cache: %@%@: Found Identifier: %@", cacheName(), transientMarker(transient),
                       identity->identifier());
     return record;
 }
@@ -499,8 +513,7 @@ std::optional<std::vector<STWMetadataRef>> STWContainerCache::_allContainersForU
         while (i >= directory->first)
             ++directory;
         const STWMetadataRef& record = records[i];
-        if (_validatedRecord(record, directory->second, classCacheKey(record->userIdentity(), contentClass),
-                             transient, nullptr))
+        if (_validatedRecord(record, directory->second, transient, nullptr))
             existing.push_back(record);
     }
     return existing;

@@ -113,6 +113,10 @@ public:
     static std::string classCacheKey(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass);
 
 private:
+    // classCacheKey() into `key`, reusing its memory.
+    static void _classCacheKey(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass, std::string* key);
+
+private:
     // The directory a class cache was built from, open, and its path as the URLs of its
     // entries begin (ending in a separator). Shared, so that a look-up can use it after
     // the cache lock is released while another one replaces it.
@@ -209,8 +213,8 @@ private:
     // The stale-record check shared by the single and the bulk look-up: nullptr and the
     // (logged) error when the record has no usable path or its metadata file is gone (then
     // the record is dropped). `directory` is that of the record's class cache.
-    STWMetadataRef _validatedRecord(const STWMetadataRef& record, const ClassDirectoryRef& directory,
-                                    const std::string& cacheName, bool transient, STWErrorRef* error);
+    STWMetadataRef _validatedRecord(const STWMetadataRef& record, const ClassDirectoryRef& directory, bool transient,
+                                    STWErrorRef* error);
     // Whether the record's metadata file at `metadataFile` (its URL's) is still the one the
     // record was read from: beneath `directory` when the container is one of its entries,
     // else, or when not found there, by the whole path (reopening a replaced directory).
