@@ -352,7 +352,7 @@ bool STWContainerCache::_isMetadataFilePresent(const STWMetadata& record, const 
 }
 
 void STWContainerCache::_reopenClassDirectory(const STWMetadata& record, const ClassDirectoryRef& replaced) {
-    fs::path path(replaced->prefix);
+    fs::path path = fs::path(replaced->prefix).parent_path(); // without the separator the prefix ends in
     STWErrorRef error;
     STWFileDescriptor descriptor = STWFileManager::defaultManager()->openDirectoryAtURL(
         path, STWTrustedAncestorForClass(record.userIdentity(), record.containerClass()), &error);
