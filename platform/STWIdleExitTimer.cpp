@@ -25,8 +25,9 @@ STWIdleExitTimer::STWIdleExitTimer(STWEventLoop& loop, std::chrono::steady_clock
 }
 
 void STWIdleExitTimer::review() {
-    if (_listener.connectionCount() != 0 || STWTransaction::count() != 0) {
-        // The end of this work wakes the loop again.
+    // The end of the work there is wakes the loop again: a connection's close calls this,
+    // and the end of the last transaction is asked to be told.
+    if (_listener.connectionCount() != 0 || STWTransaction::notifyWhenIdle()) {
         _timer.disarm();
         return;
     }

@@ -9,6 +9,7 @@
 #include <mutex>
 #include <sys/eventfd.h>
 #include <unistd.h>
+#include <utility>
 
 namespace {
 
@@ -16,6 +17,7 @@ struct State {
     std::mutex mutex;
     std::condition_variable changed;
     uint64_t count = 0;
+    bool idleWanted = false; // notifyWhenIdle() asked, and the count has not dropped to 0 since
     std::chrono::steady_clock::time_point lastChange = std::chrono::steady_clock::now();
     const STWFileDescriptor idleFD{eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)};
 };
@@ -45,6 +47,8 @@ void STWTransaction::end() {
         if (s.count != 0)
             return;
         s.changed.notify_all();
+        if (!std::exchange(s.idleWanted, false))
+            return;
     }
     uint64_t one = 1;
     if (s.idleFD && write(s.idleFD.get(), &one, sizeof one) != sizeof one)
@@ -65,6 +69,15 @@ std::chrono::steady_clock::time_point STWTransaction::lastChange() {
 }
 
 int STWTransaction::idleEventFD() { return state().idleFD.get(); }
+
+bool STWTransaction::notifyWhenIdle() {
+    State& s = state();
+    std::lock_guard guard(s.mutex);
+    if (s.count == 0)
+        return false;
+    s.idleWanted = true;
+    return true;
+}
 
 bool STWTransaction::waitForIdle(std::chrono::steady_clock::duration timeout) {
     State& s = state();

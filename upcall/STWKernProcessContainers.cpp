@@ -165,19 +165,19 @@ STWKernReturn STWKernProcessContainersReply::copyOut(void** memory, uint32_t* si
         STW_ROUTINE_LOG(STWLogLevel::Error, "sb_packbuff_pack_uint32() fails: %d; type: %u, value: %u\n", error,
                         unsigned{STW_KERN_REPLY_STATUS}, packedStatus);
 
-    // The reply travels in memory of its own, released once it is sent. Heap memory, not
-    // a mapping of its own: unmapping one per upcall costs a TLB shoot-down on every core
-    // the daemon's threads ran on, a tenth of an upcall's time.
+    // The reply travels in memory of its own, released once it is sent: the packed
+    // buffer's own, taken from it rather than copied. Heap memory, not a mapping of its
+    // own: unmapping one per upcall costs a TLB shoot-down on every core the daemon's
+    // threads ran on, a tenth of an upcall's time.
     size_t used = sb_packbuff_get_size(pb.get());
     void* bytes = sb_packbuff_get_bytes(pb.get());
-    void* copy = malloc(used);
-    if (!copy) {
+    void* reply = sb_packbuff_take_bytes(pb.get());
+    if (!reply) {
         STW_ROUTINE_LOG(STWLogLevel::Error, "vm_read(%p, %lu) fails: %d", bytes, used, ENOMEM);
         return STWKernResourceShortage;
     }
-    memcpy(copy, bytes, used);
-    STW_ROUTINE_LOG(STWLogLevel::Debug, "packbuff bytes: %p, reply bytes: %p, reply size: %u", bytes, copy, used);
-    *memory = copy;
+    STW_ROUTINE_LOG(STWLogLevel::Debug, "packbuff bytes: %p, reply bytes: %p, reply size: %u", bytes, reply, used);
+    *memory = reply;
     *size = static_cast<uint32_t>(used);
     *deallocate = true;
     return STWKernSuccess;

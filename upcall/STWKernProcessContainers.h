@@ -47,9 +47,10 @@ struct STWKernProcessContainersReply {
     std::vector<std::pair<std::string, std::string>> systemGroups;
 
     // Packs the paths in reply order while status is 1 (a path that cannot be packed
-    // turns status to 0 and ends the paths), then the status, and copies the buffer into
-    // fresh memory that STWKernReleaseReplyMemory() releases once the reply is sent.
-    // 0, 9 when no buffer can be made, or 6 when the copy fails (no memory handed out).
+    // turns status to 0 and ends the paths), then the status, and hands out the packed
+    // buffer's own memory, which STWKernReleaseReplyMemory() releases once the reply is
+    // sent. 0, 9 when no buffer can be made, or 6 when its memory cannot be handed out
+    // (none is then).
     STWKernReturn copyOut(void** memory, uint32_t* size, bool* deallocate) const;
 };
 

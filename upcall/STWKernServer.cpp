@@ -82,6 +82,24 @@ STWContainerClass _dataContainerClass(const std::string& identifier, uint32_t co
     return fallback;
 }
 
+// The privileged connection upcalls for `userIdentity` go through. Kept from one upcall to
+// the next while the user identity stays the same object: it is the same connection every
+// time (no client, no entitlements to decide, every look-up allowed), and creating or looking
+// up containers leaves nothing on it, so making one per upcall only cost allocations. Per
+// thread, as upcalls are served on one.
+const std::shared_ptr<STWClientConnection>& _privilegedConnectionForUserIdentity(const STWUserIdentityRef& userIdentity) {
+    thread_local STWUserIdentityRef cachedUserIdentity;
+    thread_local std::shared_ptr<STWClientConnection> cachedConnection;
+    if (!cachedConnection || cachedUserIdentity != userIdentity) {
+        cachedConnection = STWClientConnection::privilegedClientConnectionWithUserIdentity(userIdentity);
+        cachedConnection->setAllowOtherIdLookup(true);
+        cachedConnection->setAllowGroupIdLookup(true);
+        cachedConnection->setUnrestricted(true);
+        cachedUserIdentity = userIdentity;
+    }
+    return cachedConnection;
+}
+
 void _checkUID(const STWClientConnection& connection, STWContainerClass containerClass, uint32_t uid) {
     uid_t expected = connection.clientIdentity()->posixUIDForContainerClass(containerClass);
     if (uid != expected)
@@ -94,10 +112,12 @@ std::optional<std::string> _createOrLookup(STWClientConnection& connection, cons
                                            const std::string& identifier, STWContainerClass containerClass,
                                            const char* failure) {
     uint64_t error = STWErrorSuccess;
+    bool existed = false;
     auto identity =
         STWContainerIdentity::containerIdentityWithUserIdentity(userIdentity, identifier, containerClass, &error);
-    std::shared_ptr<STWMetadata> container =
-        identity ? connection.createOrLookupContainerWithContainerIdentity(identity, true, false, true, &error)
+    STWMetadataRef container =
+        identity ? connection.createOrLookupContainerRecordWithContainerIdentity(identity, true, false, true, &existed,
+                                                                                  &error)
                  : nullptr;
     if (!container) {
         STW_ROUTINE_LOG(STWLogLevel::Error, failure, error);
@@ -140,10 +160,7 @@ STWKernReturn server_get_process_containers(const void* requestMemory, uint32_t 
     STWUserIdentityRef userIdentity;
     if (STWKernReturn code = _userIdentityForRequest(request, &userIdentity))
         return code;
-    auto connection = STWClientConnection::privilegedClientConnectionWithUserIdentity(userIdentity);
-    connection->setAllowOtherIdLookup(true);
-    connection->setAllowGroupIdLookup(true);
-    connection->setUnrestricted(true);
+    const std::shared_ptr<STWClientConnection>& connection = _privilegedConnectionForUserIdentity(userIdentity);
 
     // Every named container is made, whatever failed before it; one failure turns the status to 0.
     STWKernProcessContainersReply reply;
@@ -172,8 +189,13 @@ STWKernReturn server_get_process_containers(const void* requestMemory, uint32_t 
             reply.systemGroups.emplace_back(group, std::move(*path));
 
     if (reply.status == 1) {
-        if (reply.dataContainer)
-            reply.tempDirectory = (std::filesystem::path(*reply.dataContainer) / "tmp").native();
+        if (reply.dataContainer) {
+            // As std::filesystem::path's "/" would join them, without parsing the path.
+            std::string& temp = reply.tempDirectory.emplace(*reply.dataContainer);
+            if (!temp.empty() && temp.back() != '/')
+                temp += '/';
+            temp += "tmp";
+        }
         reply.homeDirectory = request.uid == 0
                                   ? STWPlatformConfiguration::sharedInstance()->resolve("/private/var/root").native()
                                   : userIdentity->homeDirectoryURL().native();

@@ -24,6 +24,8 @@ namespace {
 // Room for the largest reply: a path or two for each group of a request buffer of the
 // largest size. A packet beyond the send buffer cannot be sent at all.
 constexpr int kReplySendBuffer = 16 << 20;
+// What an ordinary reply needs, a few paths, with room to spare.
+constexpr size_t kKeptReplyCapacity = 64 << 10;
 
 } // namespace
 
@@ -254,7 +256,15 @@ STWUpcallListener::_serveOnePacket(const std::shared_ptr<STWPeerConnection>& con
         return PacketResult::Close;
     }
     std::string_view packet(_packetBuffer.data(), static_cast<size_t>(size));
-    std::string reply;
+    std::string& reply = _replyBuffer;
+    // A reply for a huge request is not kept around for the next one.
+    struct Release {
+        std::string& reply;
+        ~Release() {
+            if (reply.capacity() > kKeptReplyCapacity)
+                std::string().swap(reply);
+        }
+    } release{reply};
     if (!STWKernServePacket(packet, connection->auditToken(), sequence++, &reply)) {
         STW_LOG_ERROR(STWLogCategory::Upcall, "Closing %@: nothing answers its packet of %zd bytes",
                       connection, size);

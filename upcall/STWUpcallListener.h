@@ -75,8 +75,10 @@ private:
     STWFileDescriptor _wakeFD;
     std::thread _thread;
     std::atomic<size_t> _connectionCount{0};
-    // The upcall thread's only: room for the largest packet.
+    // The upcall thread's only: room for the largest packet, and the reply being built,
+    // kept from one upcall to the next unless it grew large.
     std::vector<char> _packetBuffer;
+    std::string _replyBuffer;
 
     STWMutex _handoverLock; // a leaf lock
     std::vector<std::shared_ptr<STWPeerConnection>> _handedOver STW_GUARDED_BY(_handoverLock);

@@ -22,195 +22,222 @@ std::shared_ptr<STWMetadata> STWClientConnection::createOrLookupContainerWithCon
     uint64_t ignored = STWErrorSuccess;
     uint64_t* code = error ? error : &ignored;
     return _catchingExceptions<std::shared_ptr<STWMetadata>>(__func__, code, nullptr, [&]() -> std::shared_ptr<STWMetadata> {
-        std::optional<std::string> client = clientBundleIdentifier();
-        STWFormatArg clientArg = client ? STWFormatArg(*client) : STWFormatArg(nullptr);
-        STW_LOG_DEBUG(STWLogCategory::Lifecycle,
-                      "createOrLookup; identity: %@, createIfNecessary: %d, transient: %d, allowOtherIdLookup: %d, "
-                      "unrestricted: %d, clientBundleIdentifier: %@",
-                      identity, createIfNecessary ? 1 : 0, transient ? 1 : 0, allowOtherIdLookup() ? 1 : 0,
-                      unrestricted() ? 1 : 0, clientArg);
-        if (!identity) {
-            STW_ERROR(STWErrorInvalidArgument, nullptr, "Cannot lookup a nil container identity.");
-            *code = STWErrorInvalidArgument;
+        bool existed = false;
+        STWMetadataRef record =
+            _createOrLookupContainerWithContainerIdentity(identity, createIfNecessary, transient, useLocking, &existed, code);
+        if (!record)
             return nullptr;
-        }
-        const std::string& id = identity->identifier();
-        STWContainerClass c = identity->containerClass();
-        STWWhitelistRef whitelist = STWWhitelist::sharedWhitelist();
-        bool whitelisted = whitelist->isLookupWhitelistedFromCodeSignIdentifier(client.value_or(""), c, id);
-        bool isGroup = STWContainerClassIsGroup(c);
-        bool allowed = (client && *client == id) || allowOtherIdLookup() || (isGroup && allowGroupIdLookup()) ||
-                       unrestricted() || isEntitledForLookupWithClass(c, id) || whitelisted;
-        if (!allowed) {
-            STW_ERROR(STWErrorNotEntitled, nullptr, "%@ not entitled to retrieve container class %ld with identifier %@",
-                      clientArg, c, id);
+        // A record of the caller's own: the cache's stays as it is.
+        auto result = std::make_shared<STWMetadata>(*record);
+        result->setExisted(existed);
+        return result;
+    });
+}
+
+STWMetadataRef STWClientConnection::createOrLookupContainerRecordWithContainerIdentity(
+    const STWContainerIdentityRef& identity, bool createIfNecessary, bool transient, bool useLocking, bool* existed,
+    uint64_t* error) {
+    uint64_t ignored = STWErrorSuccess;
+    uint64_t* code = error ? error : &ignored;
+    // Reported under the name of the operation it is a form of.
+    return _catchingExceptions<STWMetadataRef>("createOrLookupContainerWithContainerIdentity", code, nullptr, [&] {
+        return _createOrLookupContainerWithContainerIdentity(identity, createIfNecessary, transient, useLocking, existed,
+                                                             code);
+    });
+}
+
+STWMetadataRef STWClientConnection::_createOrLookupContainerWithContainerIdentity(const STWContainerIdentityRef& identity,
+                                                                                bool createIfNecessary, bool transient,
+                                                                                bool useLocking, bool* existed,
+                                                                                uint64_t* code) {
+    *existed = false;
+    const std::string* client = _clientIdentity ? &_clientIdentity->bundleIdentifier() : nullptr;
+    STWFormatArg clientArg = client ? STWFormatArg(*client) : STWFormatArg(nullptr);
+    STW_LOG_DEBUG(STWLogCategory::Lifecycle,
+                  "createOrLookup; identity: %@, createIfNecessary: %d, transient: %d, allowOtherIdLookup: %d, "
+                  "unrestricted: %d, clientBundleIdentifier: %@",
+                  identity, createIfNecessary ? 1 : 0, transient ? 1 : 0, allowOtherIdLookup() ? 1 : 0,
+                  unrestricted() ? 1 : 0, clientArg);
+    if (!identity) {
+        STW_ERROR(STWErrorInvalidArgument, nullptr, "Cannot lookup a nil container identity.");
+        *code = STWErrorInvalidArgument;
+        return nullptr;
+    }
+    const std::string& id = identity->identifier();
+    STWContainerClass c = identity->containerClass();
+    STWWhitelistRef whitelist = STWWhitelist::sharedWhitelist();
+    static const std::string noClient;
+    bool whitelisted = whitelist->isLookupWhitelistedFromCodeSignIdentifier(client ? *client : noClient, c, id);
+    bool isGroup = STWContainerClassIsGroup(c);
+    bool allowed = (client && *client == id) || allowOtherIdLookup() || (isGroup && allowGroupIdLookup()) ||
+                   unrestricted() || isEntitledForLookupWithClass(c, id) || whitelisted;
+    if (!allowed) {
+        STW_ERROR(STWErrorNotEntitled, nullptr, "%@ not entitled to retrieve container class %ld with identifier %@",
+                  clientArg, c, id);
+        *code = STWErrorNotEntitled;
+        return nullptr;
+    }
+    if (c == STWContainerClassDataSystem && !allowOtherIdLookup() && !unrestricted() &&
+        !isEntitledForLookupWithClass(c, id)) {
+        // An app whose entitlements ask for a system container may have its own.
+        auto ownsSystemContainer = [&] {
+            auto mapping = STWCodeSigningMapping::sharedInstance();
+            return client && *client == id && mapping && mapping->identifierHasSystemContainer(id);
+        };
+        if (!whitelisted && !ownsSystemContainer()) {
+            STW_ERROR(STWErrorNotEntitled, nullptr, "%@ not entitled for system container with identifier %@",
+                      clientArg, id);
             *code = STWErrorNotEntitled;
             return nullptr;
         }
-        if (c == STWContainerClassDataSystem && !allowOtherIdLookup() && !unrestricted() &&
-            !isEntitledForLookupWithClass(c, id)) {
-            // An app whose entitlements ask for a system container may have its own.
-            auto ownsSystemContainer = [&] {
-                auto mapping = STWCodeSigningMapping::sharedInstance();
-                return client && *client == id && mapping && mapping->identifierHasSystemContainer(id);
-            };
-            if (!whitelisted && !ownsSystemContainer()) {
-                STW_ERROR(STWErrorNotEntitled, nullptr, "%@ not entitled for system container with identifier %@",
-                          clientArg, id);
-                *code = STWErrorNotEntitled;
-                return nullptr;
-            }
-        }
+    }
 
-        auto cache = STWContainerCache::sharedInstance();
-        if (!transient) {
-            STWAllIdentifiersLockGuard lock(STWLockMode::Reading, useLocking);
-            STWErrorRef lookupError;
-            if (auto found = cache->containerForContainerIdentity(identity, false, true, &lookupError)) {
-                auto result = std::make_shared<STWMetadata>(*found);
-                result->setExisted(true);
-                return result;
-            }
-            if (!lookupError || !lookupError->is(STWErrorNotFound)) {
-                *code = _codeOfError(lookupError);
-                return nullptr;
-            }
-        }
-        if (!createIfNecessary) {
-            STW_ERROR_NOLOG(STWErrorNotFound, nullptr, "Container with identifier: \"%@\" Not Found", id);
-            *code = STWErrorNotFound;
-            return nullptr;
-        }
-
-        STWAllIdentifiersLockGuard lock(STWLockMode::Writing, useLocking);
+    auto cache = STWContainerCache::sharedInstance();
+    if (!transient) {
+        STWAllIdentifiersLockGuard lock(STWLockMode::Reading, useLocking);
         STWErrorRef lookupError;
-        if (auto found = cache->containerForContainerIdentity(identity, transient, true, &lookupError)) {
-            if (!transient) {
-                // Another request made it while we waited for the write lock.
-                auto result = std::make_shared<STWMetadata>(*found);
-                result->setExisted(true);
-                return result;
-            }
-            STWErrorRef moveError;
-            if (!_moveItemAtURLToDeathRow(found->url(), true, true, &moveError)) {
-                STW_ERROR(STWErrorRemoveTransientFailed, moveError, "Failed to remove transient container at %@",
-                          found->url());
-                *code = STWErrorRemoveTransientFailed;
-                return nullptr;
-            }
-        } else if (!lookupError || !lookupError->is(STWErrorNotFound)) {
+        if (auto found = cache->containerForContainerIdentity(identity, false, true, &lookupError)) {
+            *existed = true;
+            return found;
+        }
+        if (!lookupError || !lookupError->is(STWErrorNotFound)) {
             *code = _codeOfError(lookupError);
             return nullptr;
         }
+    }
+    if (!createIfNecessary) {
+        STW_ERROR_NOLOG(STWErrorNotFound, nullptr, "Container with identifier: \"%@\" Not Found", id);
+        *code = STWErrorNotFound;
+        return nullptr;
+    }
 
-        std::string name = STWUUID::random().string();
-        STW_LOG_DEBUG(STWLogCategory::Lifecycle, "begin CreatingContainer uuid=%@ identifier=%@ class=%llu", name, id, c);
-        const STWUserIdentityRef& userIdentity = identity->userIdentity();
-        auto configuration = STWGlobalConfiguration::sharedInstance();
-        auto fileManager = STWFileManager::defaultManager();
-        std::filesystem::path stagingDirectory = configuration->stagingDirectoryURLForUserIdentity(userIdentity, c);
-        std::filesystem::path staging = stagingDirectory / name;
+    STWAllIdentifiersLockGuard lock(STWLockMode::Writing, useLocking);
+    STWErrorRef lookupError;
+    if (auto found = cache->containerForContainerIdentity(identity, transient, true, &lookupError)) {
+        if (!transient) {
+            // Another request made it while we waited for the write lock.
+            *existed = true;
+            return found;
+        }
+        STWErrorRef moveError;
+        if (!_moveItemAtURLToDeathRow(found->url(), true, true, &moveError)) {
+            STW_ERROR(STWErrorRemoveTransientFailed, moveError, "Failed to remove transient container at %@",
+                      found->url());
+            *code = STWErrorRemoveTransientFailed;
+            return nullptr;
+        }
+    } else if (!lookupError || !lookupError->is(STWErrorNotFound)) {
+        *code = _codeOfError(lookupError);
+        return nullptr;
+    }
 
-        // The staging directory belongs to the user whose apps may swap its entries at any
-        // moment: the new container is built only through the descriptor that made it, and
-        // what the final rename publishes is checked to be that directory.
-        STWErrorRef failure;
-        uint64_t failureCode = STWErrorSuccess;
-        std::shared_ptr<STWMetadata> metadata;
-        auto fail = [&](uint64_t failedCode, STWErrorRef failedError) {
-            failureCode = failedCode;
-            failure = std::move(failedError);
-        };
-        STWErrorRef stepError;
-        // Below the user's home everything is the user's: no link is followed there.
-        std::filesystem::path trustedAncestor = STWTrustedAncestorForClass(userIdentity, c);
-        STWFileDescriptor stagingfd = fileManager->openDirectoryAtURL(stagingDirectory, trustedAncestor, &stepError);
-        STWFileDescriptor containerfd;
-        if (stagingfd)
-            containerfd = _createTopLevelContainerDirectory(stagingfd.get(), name, staging, c,
-                                                            userIdentity->posixUIDForContainerClass(c), &stepError);
-        if (!containerfd) {
-            fail(STWErrorCreateStagingFailed,
-                 STW_ERROR(STWErrorCreateStagingFailed, stepError, "Failed to create staging dir at %@ : %@", staging,
-                           stepError));
+    std::string name = STWUUID::random().string();
+    STW_LOG_DEBUG(STWLogCategory::Lifecycle, "begin CreatingContainer uuid=%@ identifier=%@ class=%llu", name, id, c);
+    const STWUserIdentityRef& userIdentity = identity->userIdentity();
+    auto configuration = STWGlobalConfiguration::sharedInstance();
+    auto fileManager = STWFileManager::defaultManager();
+    std::filesystem::path stagingDirectory = configuration->stagingDirectoryURLForUserIdentity(userIdentity, c);
+    std::filesystem::path staging = stagingDirectory / name;
+
+    // The staging directory belongs to the user whose apps may swap its entries at any
+    // moment: the new container is built only through the descriptor that made it, and
+    // what the final rename publishes is checked to be that directory.
+    STWErrorRef failure;
+    uint64_t failureCode = STWErrorSuccess;
+    std::shared_ptr<STWMetadata> metadata;
+    auto fail = [&](uint64_t failedCode, STWErrorRef failedError) {
+        failureCode = failedCode;
+        failure = std::move(failedError);
+    };
+    STWErrorRef stepError;
+    // Below the user's home everything is the user's: no link is followed there.
+    std::filesystem::path trustedAncestor = STWTrustedAncestorForClass(userIdentity, c);
+    STWFileDescriptor stagingfd = fileManager->openDirectoryAtURL(stagingDirectory, trustedAncestor, &stepError);
+    STWFileDescriptor containerfd;
+    if (stagingfd)
+        containerfd = _createTopLevelContainerDirectory(stagingfd.get(), name, staging, c,
+                                                        userIdentity->posixUIDForContainerClass(c), &stepError);
+    if (!containerfd) {
+        fail(STWErrorCreateStagingFailed,
+             STW_ERROR(STWErrorCreateStagingFailed, stepError, "Failed to create staging dir at %@ : %@", staging,
+                       stepError));
+    } else {
+        uint64_t identityError = STWErrorSuccess;
+        auto concrete = STWConcreteContainerIdentity::containerIdentityWithUUID(STWUUID::random(), userIdentity, id,
+                                                                                c, &identityError);
+        if (!concrete) {
+            fail(identityError, nullptr);
         } else {
-            uint64_t identityError = STWErrorSuccess;
-            auto concrete = STWConcreteContainerIdentity::containerIdentityWithUUID(STWUUID::random(), userIdentity, id,
-                                                                                    c, &identityError);
-            if (!concrete) {
-                fail(identityError, nullptr);
-            } else {
-                metadata = std::make_shared<STWMetadata>(concrete, std::nullopt, staging, std::nullopt);
-                if (!metadata->writeMetadataToContainerDirectory(containerfd.get(), &stepError)) {
-                    fail(_codeOfError(stepError), stepError);
-                } else if (STWContainerClassIsSystem(c) &&
-                           !fileManager->setTopLevelSystemContainerACLAt(containerfd.get(), staging, &stepError)) {
-                    fail(_codeOfError(stepError), stepError);
-                }
-                if (failureCode == STWErrorSuccess &&
-                    !_createSubDirectories(containerfd.get(), staging, *metadata, &stepError))
-                    fail(_codeOfError(stepError), stepError);
-                // The subdirectories were made with mode 0, and on Linux the mode's group bits
-                // are the mask of the ACL they inherited: give them their entry in full.
-                if (failureCode == STWErrorSuccess && STWContainerClassIsSystem(c) &&
-                    !fileManager->standardizeACLsAt(containerfd.get(), staging, true, &stepError))
-                    fail(_codeOfError(stepError), stepError);
+            metadata = std::make_shared<STWMetadata>(concrete, std::nullopt, staging, std::nullopt);
+            if (!metadata->writeMetadataToContainerDirectory(containerfd.get(), &stepError)) {
+                fail(_codeOfError(stepError), stepError);
+            } else if (STWContainerClassIsSystem(c) &&
+                       !fileManager->setTopLevelSystemContainerACLAt(containerfd.get(), staging, &stepError)) {
+                fail(_codeOfError(stepError), stepError);
             }
+            if (failureCode == STWErrorSuccess &&
+                !_createSubDirectories(containerfd.get(), staging, *metadata, &stepError))
+                fail(_codeOfError(stepError), stepError);
+            // The subdirectories were made with mode 0, and on Linux the mode's group bits
+            // are the mask of the ACL they inherited: give them their entry in full.
+            if (failureCode == STWErrorSuccess && STWContainerClassIsSystem(c) &&
+                !fileManager->standardizeACLsAt(containerfd.get(), staging, true, &stepError))
+                fail(_codeOfError(stepError), stepError);
         }
+    }
 
-        std::filesystem::path final;
-        if (failureCode == STWErrorSuccess) {
-            STW_CRASH_POINT(STWCrashPoint::createAfterStaging);
-            std::optional<std::filesystem::path> classDirectory =
-                configuration->containerDirectoryURLForUserIdentity(userIdentity, c, transient);
-            std::optional<std::string> wellKnown = whitelist->wellknownContainerForId(id, c);
-            std::string finalName = wellKnown ? *wellKnown : name;
-            final = (classDirectory ? *classDirectory : std::filesystem::path()) / finalName;
-            STWFileDescriptor classfd;
-            if (classDirectory)
-                classfd = fileManager->openDirectoryAtURL(*classDirectory, trustedAncestor, &stepError);
-            if (!classfd || !fileManager->moveDirectoryAt(stagingfd.get(), name, classfd.get(), finalName,
-                                                          containerfd.get(), STWFileManagerMoveDurable, staging, final,
-                                                          &stepError)) {
-                fail(STWErrorMoveStagingFailed, STW_ERROR(STWErrorMoveStagingFailed, stepError,
-                                                          "Failed to move staging dir: %@ to live dir: %@", staging,
-                                                          final));
-            } else {
-                STW_CRASH_POINT(STWCrashPoint::createAfterRename);
-            }
+    std::filesystem::path final;
+    if (failureCode == STWErrorSuccess) {
+        STW_CRASH_POINT(STWCrashPoint::createAfterStaging);
+        std::optional<std::filesystem::path> classDirectory =
+            configuration->containerDirectoryURLForUserIdentity(userIdentity, c, transient);
+        std::optional<std::string> wellKnown = whitelist->wellknownContainerForId(id, c);
+        std::string finalName = wellKnown ? *wellKnown : name;
+        final = (classDirectory ? *classDirectory : std::filesystem::path()) / finalName;
+        STWFileDescriptor classfd;
+        if (classDirectory)
+            classfd = fileManager->openDirectoryAtURL(*classDirectory, trustedAncestor, &stepError);
+        if (!classfd || !fileManager->moveDirectoryAt(stagingfd.get(), name, classfd.get(), finalName,
+                                                      containerfd.get(), STWFileManagerMoveDurable, staging, final,
+                                                      &stepError)) {
+            fail(STWErrorMoveStagingFailed, STW_ERROR(STWErrorMoveStagingFailed, stepError,
+                                                      "Failed to move staging dir: %@ to live dir: %@", staging,
+                                                      final));
+        } else {
+            STW_CRASH_POINT(STWCrashPoint::createAfterRename);
         }
-        if (failureCode != STWErrorSuccess) {
-            STWErrorRef cleanupError;
-            if (!_moveItemAtURLToDeathRow(staging, true, true, &cleanupError)) {
-                STW_ERROR(STWErrorRemoveStagingFailed, cleanupError, "Failed to remove staging dir: %@", staging);
-                failureCode = STWErrorRemoveStagingFailed;
-            }
-            *code = failureCode;
-            return nullptr;
+    }
+    if (failureCode != STWErrorSuccess) {
+        STWErrorRef cleanupError;
+        if (!_moveItemAtURLToDeathRow(staging, true, true, &cleanupError)) {
+            STW_ERROR(STWErrorRemoveStagingFailed, cleanupError, "Failed to remove staging dir: %@", staging);
+            failureCode = STWErrorRemoveStagingFailed;
         }
+        *code = failureCode;
+        return nullptr;
+    }
 
-        if (STWPlatformConfiguration::sharedInstance()->isFeatureEnabled("fast_container_sizing"))
-            STWFileManager::defaultManager()->fastDiskUsageForURL(final);
-        metadata->setUrl(final);
-        metadata->setExisted(false);
-        metadata->setTransient(transient);
-        STW_CRASH_POINT(STWCrashPoint::createBeforeCacheAdd);
-        STWErrorRef addError;
-        if (!cache->addContainerMetadata(metadata, final, transient, true, &addError)) {
-            STW_ERROR(STWErrorCacheAddFailed, addError, "Failed to add to cache : %@, url: %@, transient: %d",
-                      metadata, final, transient ? 1 : 0);
-            // Published but unknown to the cache: it must not stay behind, or every retry
-            // would leave one more.
-            STWErrorRef cleanupError;
-            if (!_moveItemAtURLToDeathRow(final, true, true, &cleanupError))
-                STW_LOG_ERROR(STWLogCategory::Lifecycle, "Failed to send %@ to death row after the cache refused it: %@",
-                              final, cleanupError);
-            *code = STWErrorCacheAddFailed;
-            return nullptr;
-        }
-        STW_LOG_DEBUG(STWLogCategory::Lifecycle, "end CreatingContainer uuid=%@", name);
-        return std::make_shared<STWMetadata>(*metadata);
-    });
+    if (STWPlatformConfiguration::sharedInstance()->isFeatureEnabled("fast_container_sizing"))
+        STWFileManager::defaultManager()->fastDiskUsageForURL(final);
+    metadata->setUrl(final);
+    metadata->setExisted(false);
+    metadata->setTransient(transient);
+    STW_CRASH_POINT(STWCrashPoint::createBeforeCacheAdd);
+    STWErrorRef addError;
+    if (!cache->addContainerMetadata(metadata, final, transient, true, &addError)) {
+        STW_ERROR(STWErrorCacheAddFailed, addError, "Failed to add to cache : %@, url: %@, transient: %d",
+                  metadata, final, transient ? 1 : 0);
+        // Published but unknown to the cache: it must not stay behind, or every retry
+        // would leave one more.
+        STWErrorRef cleanupError;
+        if (!_moveItemAtURLToDeathRow(final, true, true, &cleanupError))
+            STW_LOG_ERROR(STWLogCategory::Lifecycle, "Failed to send %@ to death row after the cache refused it: %@",
+                          final, cleanupError);
+        *code = STWErrorCacheAddFailed;
+        return nullptr;
+    }
+    STW_LOG_DEBUG(STWLogCategory::Lifecycle, "end CreatingContainer uuid=%@", name);
+    return metadata;
 }
 
 std::optional<std::vector<STWMetadataRef>>

@@ -10,7 +10,9 @@
 #include "platform/STWQueue.h"
 #include "platform/STWSandboxMappingStore.h"
 
+#include <fcntl.h>
 #include <malloc.h>
+#include <sys/stat.h>
 #include <unordered_set>
 #include <utility>
 
@@ -52,14 +54,21 @@ STWContainerCache::STWContainerCache(std::shared_ptr<STWUserIdentityCache> userI
       _rebuildMappingQueue(STWQueue::create("com.vorlane.stowlyd.cache.mappings")) {}
 
 std::string STWContainerCache::classCacheKey(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass) {
-    std::string_view directoryName = STWContainerClassDirectoryName(contentClass);
-    if (!STWUserIdentity::isUserIdentityRequiredForContainerClass(contentClass))
-        return std::string(directoryName);
-    std::string key = "[";
-    key += userIdentity ? userIdentity->identifier() : std::string("(null)");
-    key += "]-";
-    key += directoryName;
+    std::string key;
+    _classCacheKey(userIdentity, contentClass, &key);
     return key;
+}
+
+void STWContainerCache::_classCacheKey(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass,
+                                       std::string* key) {
+    std::string_view directoryName = STWContainerClassDirectoryName(contentClass);
+    key->clear();
+    if (STWUserIdentity::isUserIdentityRequiredForContainerClass(contentClass)) {
+        *key += '[';
+        *key += userIdentity ? std::string_view(userIdentity->identifier()) : std::string_view("(null)");
+        *key += "]-";
+    }
+    *key += directoryName;
 }
 
 // MARK: - The code-signing mapping
@@ -93,11 +102,11 @@ void STWContainerCache::_storeRecord(ClassCache& cache, STWMetadataRef record) {
     // The key views the record's own identifier, so the old entry (key and record) must go
     // before the new one comes; assigning over it would leave the key pointing into the
     // record it replaced.
-    auto it = cache.find(record->identifier());
-    if (it != cache.end())
-        cache.erase(it);
+    auto it = cache.records.find(record->identifier());
+    if (it != cache.records.end())
+        cache.records.erase(it);
     std::string_view key = record->identifier();
-    cache.emplace(key, std::move(record));
+    cache.records.emplace(key, std::move(record));
 }
 
 bool STWContainerCache::containerURL(const fs::path& url, STWContainerClass isValidForContainerClass) const {
@@ -199,10 +208,14 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
                                                                                 STWErrorRef* error) {
     _cacheLock.assertHeld(__func__);
 
-    std::string key = classCacheKey(userIdentity, contentClass);
+    // Every look-up comes here: the key is made in a buffer kept for the purpose, and only
+    // a rebuild takes a string of its own.
+    thread_local std::string lookupKey;
+    _classCacheKey(userIdentity, contentClass, &lookupKey);
     auto& caches = transient ? _transientContainerCache : _liveContainerCache;
-    if (auto it = caches.find(key); it != caches.end())
+    if (auto it = caches.find(lookupKey); it != caches.end())
         return &it->second;
+    std::string key = lookupKey;
 
     STW_LOG_NOTICE(STWLogCategory::Cache, "Rebuilding container class cache: %@%@", key, transientMarker(transient));
     signpost("RebuildingCache", true, contentClass);
@@ -228,7 +241,7 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
     }
 
     ClassCache cache;
-    cache.reserve(entries->size());
+    cache.records.reserve(entries->size());
     bool pushMappings = populateSandboxCache && !transient;
     // The mappings are pushed on their own queue, in listing order, while the next metadata
     // files are read: a push is a few file-system calls of its own, and done inline they
@@ -259,6 +272,8 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
     // containers). Give those pages back.
     entries.reset();
     malloc_trim(0);
+    cache.directory = std::make_shared<const ClassDirectory>(
+        ClassDirectory{(*directory / "").native(), std::move(classDirectory)});
 
     auto inserted = caches.emplace(std::move(key), std::move(cache)).first;
     signpost("RebuildingCache", false, contentClass);
@@ -267,31 +282,34 @@ STWContainerCache::ClassCache* STWContainerCache::_lock_getCacheForUserIdentity(
 
 // MARK: - Look-ups
 
-STWMetadataRef STWContainerCache::_validatedRecord(const STWMetadataRef& record, const std::string& cacheName,
+STWMetadataRef STWContainerCache::_validatedRecord(const STWMetadataRef& record, const ClassDirectoryRef& directory,
                                                    bool transient, STWErrorRef* error) {
+    // The record's class cache, by name, for the messages of a record that does not pass.
+    auto cacheName = [&] { return classCacheKey(record->userIdentity(), record->containerClass()); };
     // Every look-up of a known container comes through here: the path stays text, as
     // splitting it into components costs more than the lstat.
     const std::string& url = record->urlString();
     if (url.empty()) {
         STWSetError(error,
                     STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Cache: %@%@: Invalid URL path string: %@",
-                              cacheName, transientMarker(transient), fs::path(url)));
+                              cacheName(), transientMarker(transient), fs::path(url)));
         return nullptr;
     }
     // The metadata file's path is only meaningful below an absolute container path.
     if (url.front() != '/') {
         STWSetError(error, STW_ERROR(STWErrorCacheInvalidInput, nullptr, "Cache: %@%@: nil URL from %@",
-                                     cacheName, transientMarker(transient), fs::path(url)));
+                                     cacheName(), transientMarker(transient), fs::path(url)));
         return nullptr;
     }
     // Still the very file the record was read from or written to: a container that its app
     // removed, or replaced (by a link to some other container, say), is no longer there.
-    std::string metadataFile = url;
+    std::string metadataFile;
+    metadataFile.reserve(url.size() + 1 + std::char_traits<char>::length(STWMetadata::fileName));
+    metadataFile = url;
     if (metadataFile.back() != '/')
         metadataFile += '/';
     metadataFile += STWMetadata::fileName;
-    struct stat file;
-    if (lstat(metadataFile.c_str(), &file) == 0 && record->isRecordOfFile(file))
+    if (_isMetadataFilePresent(*record, metadataFile, directory))
         return record;
 
     // Gone behind the daemon's back: drop the record so that the next look-up answers
@@ -303,10 +321,52 @@ STWMetadataRef STWContainerCache::_validatedRecord(const STWMetadataRef& record,
                       record->userIdentity(), record->identifier(), record->containerClass(),
                       static_cast<int>(transient), removeError);
     STWSetError(error, STW_ERROR(STWErrorMetadataMissing, nullptr,
-                                 "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", cacheName,
+                                 "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", cacheName(),
                                  transientMarker(transient), metadataFile, record->identifier(),
                                  record->containerClass()));
     return nullptr;
+}
+
+bool STWContainerCache::_isMetadataFilePresent(const STWMetadata& record, const std::string& metadataFile,
+                                               const ClassDirectoryRef& directory) {
+    struct stat file;
+    // The container's name within the class directory, when its URL is that of an entry.
+    std::string_view relative;
+    if (directory && metadataFile.starts_with(directory->prefix)) {
+        relative = std::string_view(metadataFile).substr(directory->prefix.size());
+        size_t slash = relative.find('/');
+        std::string_view name = relative.substr(0, slash);
+        if (name.empty() || name == "." || name == ".." || relative.substr(slash + 1) != STWMetadata::fileName)
+            relative = {};
+    }
+    // The relative path ends the path string, so it is terminated.
+    if (!relative.empty() && fstatat(directory->descriptor.get(), relative.data(), &file, AT_SYMLINK_NOFOLLOW) == 0 &&
+        record.isRecordOfFile(file))
+        return true;
+    if (lstat(metadataFile.c_str(), &file) != 0 || !record.isRecordOfFile(file))
+        return false;
+    // Found by its path but not beneath the directory the cache holds: that one was replaced.
+    if (!relative.empty())
+        _reopenClassDirectory(record, directory);
+    return true;
+}
+
+void STWContainerCache::_reopenClassDirectory(const STWMetadata& record, const ClassDirectoryRef& replaced) {
+    fs::path path = fs::path(replaced->prefix).parent_path(); // without the separator the prefix ends in
+    STWErrorRef error;
+    STWFileDescriptor descriptor = STWFileManager::defaultManager()->openDirectoryAtURL(
+        path, STWTrustedAncestorForClass(record.userIdentity(), record.containerClass()), &error);
+    if (!descriptor) {
+        STW_LOG_ERROR(STWLogCategory::Cache, "Cannot open the class directory %@ again: %@", path, error);
+        return;
+    }
+    STW_LOG_NOTICE(STWLogCategory::Cache, "The class directory %@ was replaced; opened it again", path);
+    auto reopened = std::make_shared<const ClassDirectory>(ClassDirectory{replaced->prefix, std::move(descriptor)});
+    STWLockGuard guard(_cacheLock);
+    for (auto* caches : {&_liveContainerCache, &_transientContainerCache})
+        for (auto& [key, cache] : *caches)
+            if (cache.directory == replaced)
+                cache.directory = reopened;
 }
 
 STWMetadataRef STWContainerCache::containerForContainerIdentity(const STWContainerIdentityRef& identity, bool transient,
@@ -326,9 +386,11 @@ STWMetadataRef STWContainerCache::_containerForContainerIdentity(const STWContai
     _assertNotOnCodeSigningMappingQueue();
     const STWUserIdentityRef& userIdentity = identity->userIdentity();
     STWContainerClass contentClass = identity->containerClass();
-    std::string cacheName = classCacheKey(userIdentity, contentClass);
+    // Only messages name the class cache: the name is made when one is written.
+    auto cacheName = [&] { return classCacheKey(userIdentity, contentClass); };
 
     STWMetadataRef record;
+    ClassDirectoryRef directory;
     {
         STWLockGuard guard(_cacheLock);
         STWErrorRef underlying;
@@ -340,18 +402,19 @@ STWMetadataRef STWContainerCache::_containerForContainerIdentity(const STWContai
                                          transientMarker(transient)));
             return nullptr;
         }
-        auto it = cache->find(identity->identifier());
-        if (it == cache->end()) {
+        auto it = cache->records.find(identity->identifier());
+        if (it == cache->records.end()) {
             STWSetError(error, STW_ERROR_NOLOG(STWErrorNotFound, nullptr, "Cache: %@%@: Container Not Found with ID: %@",
-                                               cacheName, transientMarker(transient), identity->identifier()));
+                                               cacheName(), transientMarker(transient), identity->identifier()));
             return nullptr;
         }
         record = it->second;
+        directory = cache->directory;
     }
 
-    record = _validatedRecord(record, cacheName, transient, error);
+    record = _validatedRecord(record, directory, transient, error);
     if (record)
-        STW_LOG_DEBUG(STWLogCategory::Cache, "Cache: %@%@: Found Identifier: %@", cacheName, transientMarker(transient),
+        STW_LOG_DEBUG(STWLogCategory::Cache, "Cache: %@%@: Found Identifier: %@", cacheName(), transientMarker(transient),
                       identity->identifier());
     return record;
 }
@@ -397,6 +460,8 @@ std::optional<std::vector<STWMetadataRef>> STWContainerCache::_allContainersForU
     _assertNotOnCodeSigningMappingQueue();
 
     std::vector<STWMetadataRef> records;
+    // Each class cache's directory, after the index of its last record plus one.
+    std::vector<std::pair<size_t, ClassDirectoryRef>> directories;
     {
         STWLockGuard guard(_cacheLock);
         std::vector<ClassCache*> caches;
@@ -430,18 +495,25 @@ std::optional<std::vector<STWMetadataRef>> STWContainerCache::_allContainersForU
         }
         size_t total = 0;
         for (ClassCache* cache : caches)
-            total += cache->size();
+            total += cache->records.size();
         records.reserve(total);
-        for (ClassCache* cache : caches)
-            for (const auto& [identifier, record] : *cache)
+        directories.reserve(caches.size());
+        for (ClassCache* cache : caches) {
+            for (const auto& [identifier, record] : cache->records)
                 records.push_back(record);
+            directories.emplace_back(records.size(), cache->directory);
+        }
     }
 
     // Stale records are logged and dropped, never reported: the caller asked for what exists.
     std::vector<STWMetadataRef> existing;
     existing.reserve(records.size());
-    for (const STWMetadataRef& record : records) {
-        if (_validatedRecord(record, classCacheKey(record->userIdentity(), contentClass), transient, nullptr))
+    auto directory = directories.begin();
+    for (size_t i = 0; i < records.size(); i++) {
+        while (i >= directory->first)
+            ++directory;
+        const STWMetadataRef& record = records[i];
+        if (_validatedRecord(record, directory->second, transient, nullptr))
             existing.push_back(record);
     }
     return existing;
@@ -540,14 +612,14 @@ bool STWContainerCache::_removeContainerForUserIdentity(const STWUserIdentityRef
                                          transientMarker(transient)));
             return false;
         }
-        auto it = cache->find(identifier);
-        if (it != cache->end()) {
+        auto it = cache->records.find(identifier);
+        if (it != cache->records.end()) {
             // A stale record that was replaced meanwhile (a new container under the same
             // identifier) stays, and so does its mapping.
             if (onlyRecord && it->second != onlyRecord)
                 superseded = true;
             else
-                cache->erase(it);
+                cache->records.erase(it);
         }
         shouldRegister = _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier, contentClass);
     }

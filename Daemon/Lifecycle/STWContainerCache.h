@@ -9,6 +9,14 @@
 // there and drops a record whose file vanished behind the daemon's back (reported once as
 // code 44, then as not found).
 //
+// That check runs on every look-up (three per kernel upcall), so the class cache keeps the
+// class directory it was built from open and looks for an entry's metadata file beneath it:
+// two path components instead of the whole path. Only a miss there is final after the
+// whole path missed too; when the whole path finds the file, the class directory was
+// replaced since it was opened, and it is opened again. (A class directory moved away whole,
+// with its containers intact, is not noticed that way: only root could move it, and the
+// daemon never does.)
+//
 // The cache is also the one place that pushes container paths to the sandbox mapping store:
 // data, app-group and system containers are registered under their identifier when they are
 // added or found by a rebuild, and withdrawn when they are removed.
@@ -24,6 +32,7 @@
 #include "Daemon/Model/STWUserIdentity.h"
 #include "Daemon/Model/STWUserIdentityCache.h"
 #include "common/STWError.h"
+#include "common/STWFileDescriptor.h"
 #include "common/STWThreadSafety.h"
 #include "platform/STWSandboxMappingStore.h"
 
@@ -104,7 +113,23 @@ public:
     static std::string classCacheKey(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass);
 
 private:
-    using ClassCache = std::unordered_map<std::string_view, STWMetadataRef>;
+    // classCacheKey() into `key`, reusing its memory.
+    static void _classCacheKey(const STWUserIdentityRef& userIdentity, STWContainerClass contentClass, std::string* key);
+
+private:
+    // The directory a class cache was built from, open, and its path as the URLs of its
+    // entries begin (ending in a separator). Shared, so that a look-up can use it after
+    // the cache lock is released while another one replaces it.
+    struct ClassDirectory {
+        std::string prefix;
+        STWFileDescriptor descriptor;
+    };
+    using ClassDirectoryRef = std::shared_ptr<const ClassDirectory>;
+
+    struct ClassCache {
+        std::unordered_map<std::string_view, STWMetadataRef> records;
+        ClassDirectoryRef directory;
+    };
 
     // The sandbox mappings a rebuild pushes: handed in batches, in order, to the rebuild
     // mapping queue, and all done once finish() (or the destructor) returns. Each batch
@@ -187,9 +212,17 @@ private:
                                                                     STWContainerClass containerClass);
     // The stale-record check shared by the single and the bulk look-up: nullptr and the
     // (logged) error when the record has no usable path or its metadata file is gone (then
-    // the record is dropped).
-    STWMetadataRef _validatedRecord(const STWMetadataRef& record, const std::string& cacheName, bool transient,
+    // the record is dropped). `directory` is that of the record's class cache.
+    STWMetadataRef _validatedRecord(const STWMetadataRef& record, const ClassDirectoryRef& directory, bool transient,
                                     STWErrorRef* error);
+    // Whether the record's metadata file at `metadataFile` (its URL's) is still the one the
+    // record was read from: beneath `directory` when the container is one of its entries,
+    // else, or when not found there, by the whole path (reopening a replaced directory).
+    bool _isMetadataFilePresent(const STWMetadata& record, const std::string& metadataFile,
+                                const ClassDirectoryRef& directory);
+    // Opens the class directory again after it was replaced, for the caches that still
+    // hold `replaced`.
+    void _reopenClassDirectory(const STWMetadata& record, const ClassDirectoryRef& replaced);
 
     // containerURL() on the directory entry's name alone.
     bool _isContainerName(const std::string& name, STWContainerClass containerClass) const;

@@ -46,7 +46,10 @@ STWContainerIdentityRef STWContainerIdentity::containerIdentityWithUserIdentity(
                                                                                 const std::string& identifier,
                                                                                 STWContainerClass containerClass,
                                                                                 uint64_t* error) {
-    return containerIdentityWithUserIdentity(userIdentity, STWValue(identifier), containerClass, error);
+    // A string is an identifier already; the value form checks (and logs) the rest.
+    if (!userIdentity || !STWContainerClassIsValid(containerClass))
+        return containerIdentityWithUserIdentity(userIdentity, STWValue(identifier), containerClass, error);
+    return STWContainerIdentityRef(new STWContainerIdentity(userIdentity, identifier, containerClass));
 }
 
 STWContainerIdentityRef STWContainerIdentity::containerIdentityWithIdentifier(const std::string& identifier,

@@ -63,6 +63,11 @@ public:
     std::shared_ptr<STWMetadata> createOrLookupContainerWithContainerIdentity(const STWContainerIdentityRef& identity,
                                                                               bool createIfNecessary, bool transient,
                                                                               bool useLocking, uint64_t* error);
+    // The same, answering the cache's own record (never to be changed) and whether the
+    // container existed, for callers that only read it: a look-up then copies nothing.
+    STWMetadataRef createOrLookupContainerRecordWithContainerIdentity(const STWContainerIdentityRef& identity,
+                                                                      bool createIfNecessary, bool transient,
+                                                                      bool useLocking, bool* existed, uint64_t* error);
     // Every container of a class of the caller's user identity.
     std::optional<std::vector<STWMetadataRef>> containersWithClass(STWContainerClass containerClass, bool transient,
                                                                    uint64_t* error);
@@ -240,10 +245,17 @@ private:
     // The code of an error for a client: its own in the daemon's domain, else 41 (logged).
     static uint64_t _codeOfError(const STWErrorRef& error);
     static void _reportException(const char* function);
+    // createOrLookupContainerRecordWithContainerIdentity without the exception guard; the
+    // code goes to `code` (never null).
+    STWMetadataRef _createOrLookupContainerWithContainerIdentity(const STWContainerIdentityRef& identity,
+                                                                 bool createIfNecessary, bool transient,
+                                                                 bool useLocking, bool* existed, uint64_t* code);
     // Runs `body`, turning an exception into code 40 (an internal image stops instead, so
     // the report is not lost): no exception leaves a client operation.
-    template <class T>
-    static T _catchingExceptions(const char* function, uint64_t* error, T failure, const std::function<T()>& body) {
+    // The body is called as it is, not through a std::function: its captures would be a
+    // heap allocation on every look-up.
+    template <class T, class Body>
+    static T _catchingExceptions(const char* function, uint64_t* error, T failure, Body&& body) {
         try {
             return body();
         } catch (...) {

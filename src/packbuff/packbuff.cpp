@@ -292,6 +292,17 @@ void* sb_packbuff_get_bytes(const sb_packbuff* pb) {
     return pb->item_buffer;
 }
 
+void* sb_packbuff_take_bytes(sb_packbuff* pb) {
+    if (pb->dealloc_type != SB_PACKBUFF_DEALLOC_FREE)
+        return nullptr;
+    void* bytes = pb->item_buffer;
+    pb->dealloc_type = SB_PACKBUFF_DEALLOC_NONE;
+    pb->block_size = 0;
+    pb->bytes_allocated = pb->bytes_remaining = pb->bytes_used = 0;
+    pb->item_buffer = pb->item = nullptr;
+    return bytes;
+}
+
 size_t sb_packbuff_get_size(const sb_packbuff* pb) {
     return pb->bytes_used;
 }

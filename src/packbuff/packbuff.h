@@ -65,6 +65,10 @@ sb_packbuff* sb_packbuff_init_with_buffer_and_tag(void* memory, size_t size, boo
 void sb_packbuff_free(sb_packbuff* pb);
 
 void* sb_packbuff_get_bytes(const sb_packbuff* pb);
+// Hands an owned heap buffer's memory (SB_PACKBUFF_DEALLOC_FREE) to the caller, who
+// releases it with free(), so that a finished buffer is sent without a copy; the packed
+// buffer is left empty, fit only for sb_packbuff_free(). NULL for wrapped or mapped memory.
+void* sb_packbuff_take_bytes(sb_packbuff* pb);
 size_t sb_packbuff_get_size(const sb_packbuff* pb);
 // For memory filled by someone else: `size` must not exceed bytes_allocated.
 void sb_packbuff_set_size(sb_packbuff* pb, size_t size);

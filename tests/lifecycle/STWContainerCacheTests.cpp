@@ -101,6 +101,24 @@ TEST_F(STWContainerCacheTest, AContainerDeletedBehindTheCachesBackLosesItsRecord
     EXPECT_TRUE(error->is(21));
 }
 
+// A look-up checks the metadata file beneath the class directory the cache opened; one
+// that was replaced is opened again, and the old one no longer counts.
+TEST_F(STWContainerCacheTest, AReplacedClassDirectoryIsOpenedAgain) {
+    auto moved = STWMakeTestContainer(mobile, "com.example.moved", 2);
+    STWErrorRef error;
+    ASSERT_TRUE(lookup("com.example.moved", &error));
+    fs::path old = classDirectory().native() + ".old";
+    fs::rename(classDirectory(), old);
+    fs::create_directory(classDirectory());
+    fs::rename(old / moved.url.filename(), moved.url);
+    auto found = lookup("com.example.moved", &error);
+    ASSERT_TRUE(found) << error->description();
+    EXPECT_EQ(found->url(), moved.url);
+    fs::rename(moved.url, old / moved.url.filename());
+    EXPECT_FALSE(lookup("com.example.moved", &error));
+    EXPECT_TRUE(error && error->is(44));
+}
+
 TEST_F(STWContainerCacheTest, DuplicateIdentifiersOnDiskKeepTheLaterEntryInListingOrder) {
     std::set<fs::path> copies;
     for (int i = 0; i < 6; ++i)

@@ -153,6 +153,14 @@ TEST(Packbuff, GrowingKeepsEverything) {
         ASSERT_EQ(pb->bytes_remaining, pb->bytes_allocated - pb->bytes_used);
     }
     EXPECT_EQ(contents(pb), contents(flat));
+    // The grown memory can be taken with everything in it; wrapped memory cannot be.
+    Bytes packed = contents(pb);
+    auto* taken = static_cast<uint8_t*>(sb_packbuff_take_bytes(pb));
+    ASSERT_NE(taken, nullptr);
+    EXPECT_EQ(Bytes(taken, taken + packed.size()), packed);
+    EXPECT_EQ(sb_packbuff_get_size(pb), 0u);
+    free(taken);
+    EXPECT_EQ(sb_packbuff_take_bytes(flat), nullptr);
     sb_packbuff_free(pb);
     sb_packbuff_free(flat);
 }

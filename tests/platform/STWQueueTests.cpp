@@ -8,6 +8,7 @@
 #include <future>
 #include <stdexcept>
 #include <thread>
+#include <unistd.h>
 #include <vector>
 
 using namespace std::chrono_literals;
@@ -115,6 +116,23 @@ TEST(STWQueue, TransactionsAreHeldFromSubmissionUntilTheWorkRan) {
         EXPECT_EQ(STWTransaction::count(), 1u);
     }
     EXPECT_EQ(STWTransaction::count(), 0u);
+
+    // The idle descriptor is written once, for the end that was asked to be told of.
+    auto drained = [] {
+        uint64_t value;
+        return read(STWTransaction::idleEventFD(), &value, sizeof value) == sizeof value;
+    };
+    drained();
+    EXPECT_FALSE(STWTransaction::notifyWhenIdle()); // idle already
+    { STWTransaction::Scope unasked; }
+    EXPECT_FALSE(drained());
+    {
+        STWTransaction::Scope asked;
+        EXPECT_TRUE(STWTransaction::notifyWhenIdle());
+    }
+    EXPECT_TRUE(drained());
+    { STWTransaction::Scope unaskedAgain; }
+    EXPECT_FALSE(drained());
 }
 
 TEST(STWQueueDeathTest, SyncFromTheQueuesOwnThreadIsDetected) {
