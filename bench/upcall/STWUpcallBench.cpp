@@ -4,8 +4,8 @@
 //
 //   upcall_round_trips_1_sender, upcall_round_trips_8_senders  upcalls for an app whose data
 //       container and two groups exist, from 1 and from 8 senders at once (each its own
-//       connection), against an echo server in this process on a sequenced-packet socket
-//       of its own that answers each request packet with the daemon's reply packet to it,
+//       connection), against an echo server in a process of its own, as the daemon is, on
+//       a sequenced-packet socket that answers each request packet with the daemon's reply,
 //       so both sides send, receive and decode the same bytes. The daemon serves upcalls one
 //       at a time, so the echo server is one thread on an epoll loop; ratio = upcall round
 //       trips per second / echo round trips per second, goal >= 0.5.
@@ -26,12 +26,14 @@
 // benchmark needs root. Usage: stowly_bench_upcall [--quick]
 #include "client/STWUpcallClient.h"
 #include "common/STWDictionaryUtilities.h"
+#include "common/STWFileIO.h"
 #include "common/STWLog.h"
 #include "tests/support/STWDaemonProcess.h"
 
 #include <algorithm>
 #include <atomic>
 #include <chrono>
+#include <csignal>
 #include <cstdio>
 #include <cstring>
 #include <functional>
@@ -40,9 +42,9 @@
 #include <mutex>
 #include <stdexcept>
 #include <sys/epoll.h>
-#include <sys/eventfd.h>
 #include <sys/socket.h>
 #include <sys/un.h>
+#include <sys/wait.h>
 #include <thread>
 #include <unistd.h>
 #include <vector>
@@ -89,68 +91,79 @@ void printLatencies(const char* name, const std::vector<double>& times) {
            percentile(times, 0.99), mean(times), times.size());
 }
 
-// The baseline of the round trips: one thread on an epoll loop answers every packet of
-// every connection with `reply`, one packet at a time, as the daemon serves upcalls; as
-// simple as a server on this socket gets.
+// The baseline of the round trips: a process of its own, as the daemon is, with one thread
+// on an epoll loop that answers every packet of every connection with the daemon's reply
+// to it, one packet at a time, as the daemon serves upcalls; as simple as a server on this
+// socket gets. This program runs it when started with --echo-server.
+int echoServerMain(int listenFD, const char* replyFile) {
+    std::string reply;
+    if (STWReadFileContents(replyFile, &reply, STWReadDefault, 1 << 20) != 0)
+        return 2;
+    STWFileDescriptor epollFD(epoll_create1(EPOLL_CLOEXEC));
+    auto watch = [&](int fd) {
+        epoll_event event{};
+        event.events = EPOLLIN;
+        event.data.fd = fd;
+        return epoll_ctl(epollFD.get(), EPOLL_CTL_ADD, fd, &event) == 0;
+    };
+    if (!epollFD || !watch(listenFD))
+        return 2;
+    std::map<int, STWFileDescriptor> connections;
+    std::vector<char> packet(64 << 10);
+    epoll_event events[16];
+    for (;;) {
+        int count = epoll_wait(epollFD.get(), events, 16, -1);
+        for (int i = 0; i < count; i++) {
+            int fd = events[i].data.fd;
+            if (fd == listenFD) {
+                STWFileDescriptor connection(accept4(fd, nullptr, nullptr, SOCK_CLOEXEC));
+                if (connection && watch(connection.get()))
+                    connections.emplace(connection.get(), std::move(connection));
+            } else if (recv(fd, packet.data(), packet.size(), MSG_DONTWAIT) <= 0 ||
+                       send(fd, reply.data(), reply.size(), MSG_DONTWAIT | MSG_NOSIGNAL) < 0) {
+                connections.erase(fd); // closing it leaves the epoll set too
+            }
+        }
+    }
+}
+
 class EchoServer {
 public:
-    EchoServer(const std::filesystem::path& path, std::string reply) : _path(path), _reply(std::move(reply)) {
+    EchoServer(const std::filesystem::path& path, const std::string& reply) : _path(path) {
+        _replyFile = path;
+        _replyFile += ".reply";
+        if (STWWriteFile(_replyFile, reply, 0600, false) != 0)
+            die("cannot write " + _replyFile.native());
         sockaddr_un address{};
         address.sun_family = AF_UNIX;
         if (path.native().size() >= sizeof address.sun_path)
             die("echo socket path too long");
         memcpy(address.sun_path, path.c_str(), path.native().size() + 1);
-        _listenFD.reset(socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0));
-        _epollFD.reset(epoll_create1(EPOLL_CLOEXEC));
-        _stopFD.reset(eventfd(0, EFD_CLOEXEC));
-        if (!_listenFD || !_epollFD || !_stopFD ||
-            bind(_listenFD.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
-            listen(_listenFD.get(), SOMAXCONN) != 0 || !_watch(_listenFD.get()) || !_watch(_stopFD.get()))
+        // Listening before the server runs: connections wait in the backlog meanwhile.
+        STWFileDescriptor listenFD(socket(AF_UNIX, SOCK_SEQPACKET, 0)); // inherited by the server
+        if (!listenFD || bind(listenFD.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
+            listen(listenFD.get(), SOMAXCONN) != 0)
             die(std::string("echo server: ") + strerror(errno));
-        _thread = std::thread([this] { _run(); });
+        std::string fd = std::to_string(listenFD.get());
+        _pid = fork();
+        if (_pid == 0) {
+            execl("/proc/self/exe", "stowly_bench_upcall", "--echo-server", fd.c_str(), _replyFile.c_str(), nullptr);
+            _exit(127);
+        }
+        if (_pid < 0)
+            die(std::string("echo server: ") + strerror(errno));
     }
     ~EchoServer() {
-        uint64_t one = 1;
-        if (write(_stopFD.get(), &one, sizeof one) != sizeof one)
-            perror("echo server stop");
-        _thread.join();
+        kill(_pid, SIGTERM);
+        waitpid(_pid, nullptr, 0);
         unlink(_path.c_str());
+        unlink(_replyFile.c_str());
     }
 
 private:
-    bool _watch(int fd) {
-        epoll_event event{};
-        event.events = EPOLLIN;
-        event.data.fd = fd;
-        return epoll_ctl(_epollFD.get(), EPOLL_CTL_ADD, fd, &event) == 0;
-    }
-
-    void _run() {
-        std::map<int, STWFileDescriptor> connections;
-        std::vector<char> packet(64 << 10);
-        epoll_event events[16];
-        for (;;) {
-            int count = epoll_wait(_epollFD.get(), events, 16, -1);
-            for (int i = 0; i < count; i++) {
-                int fd = events[i].data.fd;
-                if (fd == _stopFD.get())
-                    return;
-                if (fd == _listenFD.get()) {
-                    STWFileDescriptor connection(accept4(fd, nullptr, nullptr, SOCK_CLOEXEC));
-                    if (connection && _watch(connection.get()))
-                        connections.emplace(connection.get(), std::move(connection));
-                } else if (recv(fd, packet.data(), packet.size(), MSG_DONTWAIT) <= 0 ||
-                           send(fd, _reply.data(), _reply.size(), MSG_DONTWAIT | MSG_NOSIGNAL) < 0) {
-                    connections.erase(fd); // closing it leaves the epoll set too
-                }
-            }
-        }
-    }
-
     const std::filesystem::path _path;
-    const std::string _reply;
-    STWFileDescriptor _listenFD, _epollFD, _stopFD;
-    std::thread _thread;
+    std::filesystem::path _replyFile;
+    pid_t _pid = -1;
 };
 
 // What `senders` connections at once did: how long they took together, and each round trip.
@@ -387,6 +400,8 @@ private:
 } // namespace
 
 int main(int argc, char** argv) {
+    if (argc == 4 && strcmp(argv[1], "--echo-server") == 0)
+        return echoServerMain(atoi(argv[2]), argv[3]);
     if (geteuid() != 0) {
         printf("stowly_bench_upcall: skipped, the upcall socket is root's alone\n");
         return 0;
