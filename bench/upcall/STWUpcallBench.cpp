@@ -18,12 +18,13 @@
 //       groups of another new app; ratio = upcall time / requests time, goal <= 1.2.
 //
 // Latencies are per round trip (p50, p99). On a virtual machine with few cores, a round trip
-// whose two ends sit on different cores pays for waking an idle core, tens of microseconds;
-// where the scheduler puts the daemon's upcall thread then decides the figures of one
-// sender. `taskset -c N stowly_bench_upcall` puts everything on one core and compares the
-// work alone. The daemon runs with its default settings plus developer mode on a private
-// root in /tmp, its system log in a file. The upcall socket is root's alone, so the
-// benchmark needs root. Usage: stowly_bench_upcall [--quick]
+// whose two ends sit on different cores pays for waking an idle core, tens of microseconds,
+// and where the scheduler happens to put the daemon's upcall thread and the echo server
+// would decide the figures rather than their work. So the benchmark runs on the core it
+// started on, and the daemon and the echo server, its children, inherit that; --all-cores
+// lets the scheduler place everything. The daemon runs with its default settings plus
+// developer mode on a private root in /tmp, its system log in a file. The upcall socket is
+// root's alone, so the benchmark needs root. Usage: stowly_bench_upcall [--quick] [--all-cores]
 #include "client/STWUpcallClient.h"
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWFileIO.h"
@@ -40,6 +41,7 @@
 #include <latch>
 #include <map>
 #include <mutex>
+#include <sched.h>
 #include <stdexcept>
 #include <sys/epoll.h>
 #include <sys/socket.h>
@@ -406,7 +408,19 @@ int main(int argc, char** argv) {
         printf("stowly_bench_upcall: skipped, the upcall socket is root's alone\n");
         return 0;
     }
-    bool quick = argc > 1 && strcmp(argv[1], "--quick") == 0;
+    bool quick = false, allCores = false;
+    for (int i = 1; i < argc; i++) {
+        quick = quick || strcmp(argv[i], "--quick") == 0;
+        allCores = allCores || strcmp(argv[i], "--all-cores") == 0;
+    }
+    if (!allCores) {
+        cpu_set_t one;
+        CPU_ZERO(&one);
+        int cpu = sched_getcpu();
+        CPU_SET(cpu < 0 ? 0 : cpu, &one);
+        if (sched_setaffinity(0, sizeof one, &one) == 0)
+            printf("on CPU %d with the daemon and the echo server (--all-cores: anywhere)\n", cpu < 0 ? 0 : cpu);
+    }
     STWLog::setSystemLogLevel(STWLogLevel::Error);
     static bool daemonFailed = false;
     STWDaemonProcess::setFailureHandler([](const std::string& message) {
