@@ -19,6 +19,7 @@
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Model/STWMetadata.h"
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
+#include "bench/support/STWBenchSupport.h"
 #include "common/STWPropertyList.h"
 #include "platform/STWPlatformConfiguration.h"
 #include "platform/STWQueue.h"
@@ -26,8 +27,6 @@
 
 #include <sqlite3.h>
 
-#include <algorithm>
-#include <chrono>
 #include <cstdio>
 #include <cstring>
 #include <dirent.h>
@@ -35,24 +34,11 @@
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
-
-double seconds(Clock::duration d) { return std::chrono::duration<double>(d).count(); }
+using STWBench::timed;
 
 [[noreturn]] void die(const std::string& message) { throw std::runtime_error(message); }
 
-double median(std::vector<double> values) {
-    std::sort(values.begin(), values.end());
-    size_t n = values.size();
-    return n % 2 ? values[n / 2] : (values[n / 2 - 1] + values[n / 2]) / 2;
-}
-
-template <class F>
-double timed(F&& f) {
-    auto start = Clock::now();
-    f();
-    return seconds(Clock::now() - start);
-}
+double median(const std::vector<double>& values) { return STWBench::median(values, STWBench::EvenMiddle::mean); }
 
 STWValue::Dictionary appInfo(const std::string& identifier, size_t groupBase) {
     STWValue::Array groups;

@@ -9,12 +9,12 @@
 // Usage: stowly_bench_codesigning [--quick]
 
 #include "Daemon/CodeSigning/STWSQLiteDB.h"
+#include "bench/support/STWBenchSupport.h"
 #include "common/STWPropertyList.h"
 
 #include <sqlite3.h>
 
 #include <algorithm>
-#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -24,7 +24,7 @@
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
+using STWBench::timed;
 
 struct Workload {
     std::vector<std::string> identifiers;
@@ -174,17 +174,6 @@ private:
     sqlite3_stmt* _children = nullptr;
 };
 
-double seconds(Clock::duration d) {
-    return std::chrono::duration<double>(d).count();
-}
-
-template <class F>
-double timed(F&& f) {
-    auto start = Clock::now();
-    f();
-    return seconds(Clock::now() - start);
-}
-
 // Both sides run the same slice of the workload back to back, taking turns at going first,
 // so that both meet the same disk and the same neighbours; the figure is the median of the
 // per-slice ratios, which a stray stall on one slice does not move.
@@ -197,11 +186,7 @@ struct Figures {
         ours += oursSeconds;
         direct += directSeconds;
     }
-    double median() {
-        std::sort(ratios.begin(), ratios.end());
-        size_t n = ratios.size();
-        return n % 2 ? ratios[n / 2] : (ratios[n / 2 - 1] + ratios[n / 2]) / 2;
-    }
+    double median() const { return STWBench::median(ratios, STWBench::EvenMiddle::mean); }
 };
 
 } // namespace

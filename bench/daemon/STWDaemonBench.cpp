@@ -27,6 +27,7 @@
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Model/STWMetadata.h"
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
+#include "bench/support/STWBenchSupport.h"
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWFileIO.h"
 #include "common/STWLog.h"
@@ -78,12 +79,7 @@ double micros(Clock::duration d) { return std::chrono::duration<double, std::mic
 // removed on the way out.
 [[noreturn]] void die(const std::string& message) { throw std::runtime_error(message); }
 
-double percentile(std::vector<double> values, double p) {
-    if (values.empty())
-        return 0;
-    std::sort(values.begin(), values.end());
-    return values[std::min(values.size() - 1, static_cast<size_t>(p * static_cast<double>(values.size())))];
-}
+using STWBench::percentile;
 
 std::string generatedIdentifier(size_t i) { return "com.example.bench.app" + std::to_string(i); }
 

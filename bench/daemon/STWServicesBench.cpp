@@ -9,13 +9,13 @@
 //
 // Medians of interleaved runs, so that a burst of other work on the machine hits both.
 // Usage: stowly_bench_services [--quick]
+#include "bench/support/STWBenchSupport.h"
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWError.h"
 #include "common/STWFileIO.h"
 #include "common/STWLog.h"
 #include "tests/support/STWDaemonProcess.h"
 
-#include <algorithm>
 #include <chrono>
 #include <cstdio>
 #include <cstring>
@@ -34,10 +34,7 @@ using Clock = std::chrono::steady_clock;
 
 double micros(Clock::duration d) { return std::chrono::duration<double, std::micro>(d).count(); }
 
-double median(std::vector<double> values) {
-    std::sort(values.begin(), values.end());
-    return values.empty() ? 0 : values[values.size() / 2];
-}
+using STWBench::median;
 
 [[noreturn]] void die(const std::string& message) { throw std::runtime_error(message); }
 

@@ -10,21 +10,17 @@
 #include "Daemon/FileSystem/STWFileManager.h"
 #include "Daemon/Model/STWUserIdentityCache.h"
 #include "Daemon/Request/STWClientConnection.h"
+#include "bench/support/STWBenchSupport.h"
 #include "common/STWLog.h"
 #include "platform/STWPlatformConfiguration.h"
 
-#include <algorithm>
-#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <fcntl.h>
 #include <filesystem>
 #include <fstream>
 #include <ftw.h>
-#include <linux/magic.h>
 #include <string>
-#include <sys/statfs.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 #include <vector>
@@ -33,26 +29,17 @@ namespace fs = std::filesystem;
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
-constexpr int kTop = 10, kMiddle = 10, kFiles = 100;
+using namespace STWBench;
+
 constexpr const char* kAttribute = "trusted.stowly.protection-class";
 
+// The 10,000-file tree with empty files named fileF, every one at `protectionClass`.
 void buildTree(const fs::path& root, int32_t protectionClass) {
-    for (int t = 0; t < kTop; ++t) {
-        for (int m = 0; m < kMiddle; ++m) {
-            fs::path dir = root / ("top" + std::to_string(t)) / ("mid" + std::to_string(m));
-            fs::create_directories(dir);
-            for (int f = 0; f < kFiles; ++f) {
-                std::string name = (dir / ("file" + std::to_string(f))).native();
-                int fd = open(name.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
-                if (fd < 0 || fsetxattr(fd, kAttribute, &protectionClass, sizeof protectionClass, 0) != 0) {
-                    fprintf(stderr, "cannot build %s: %s\n", name.c_str(), strerror(errno));
-                    exit(2);
-                }
-                close(fd);
-            }
-        }
-    }
+    STWBench::buildTree(root, {.suffix = "",
+                               .bytes = 0,
+                               .attribute = kAttribute,
+                               .attributeValue = std::string(reinterpret_cast<const char*>(&protectionClass),
+                                                             sizeof protectionClass)});
 }
 
 int32_t bareTarget;
@@ -69,32 +56,11 @@ int bareVisit(const char* path, const struct stat*, int type, struct FTW*) {
     return 0;
 }
 
-template <class F>
-double timed(F&& body) {
-    auto start = Clock::now();
-    body();
-    return std::chrono::duration<double>(Clock::now() - start).count();
-}
-
-double median(std::vector<double> values) {
-    std::sort(values.begin(), values.end());
-    return values[values.size() / 2];
-}
-
-// A tmpfs when there is one (or $STOWLY_BENCH_DIR): nothing waits for a device, so the
-// ratio shows what each walk itself does.
-std::string scratchParent() {
-    if (const char* dir = getenv("STOWLY_BENCH_DIR"); dir && *dir)
-        return dir;
-    struct statfs st;
-    if (statfs("/dev/shm", &st) == 0 && st.f_type == TMPFS_MAGIC && access("/dev/shm", W_OK) == 0)
-        return "/dev/shm";
-    return "/tmp";
-}
-
-// A root prefix of the benchmark's own, with the mobile user.
+// A root prefix of the benchmark's own, with the mobile user, on a tmpfs when there is one
+// (or $STOWLY_BENCH_DIR): nothing waits for a device, so the ratio shows what each walk
+// itself does.
 fs::path makeRoot() {
-    std::string templ = scratchParent() + "/stowly-bench-dp-XXXXXX";
+    std::string templ = scratchParent(DiskFallback::tmp) + "/stowly-bench-dp-XXXXXX";
     if (!mkdtemp(templ.data())) {
         perror("mkdtemp");
         exit(2);

@@ -6,25 +6,21 @@
 //   stowly_bench_acl [--quick]
 
 #include "Daemon/FileSystem/STWFileManager.h"
+#include "bench/support/STWBenchSupport.h"
 #include "common/STWLog.h"
 #include "platform/STWPlatformConfiguration.h"
 
 #include <acl/libacl.h>
-#include <algorithm>
 #include <cerrno>
-#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <fcntl.h>
 #include <filesystem>
 #include <fstream>
 #include <ftw.h>
-#include <linux/magic.h>
 #include <string>
 #include <sys/acl.h>
 #include <sys/stat.h>
-#include <sys/statfs.h>
 #include <unistd.h>
 #include <vector>
 
@@ -32,31 +28,10 @@ namespace fs = std::filesystem;
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
+using namespace STWBench;
 
-// 10 x 10 directories of 100 files each, as the other file-layer benchmarks.
-constexpr int kTop = 10, kMiddle = 10, kFiles = 100;
 constexpr gid_t kSystemUsers = 950;
 constexpr uid_t kNobody = 65534;
-
-void buildTree(const fs::path& root) {
-    std::string contents(200, 'c');
-    for (int t = 0; t < kTop; ++t) {
-        for (int m = 0; m < kMiddle; ++m) {
-            fs::path dir = root / ("top" + std::to_string(t)) / ("mid" + std::to_string(m));
-            fs::create_directories(dir);
-            for (int f = 0; f < kFiles; ++f) {
-                std::string name = (dir / ("file" + std::to_string(f) + ".cache")).native();
-                int fd = open(name.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
-                if (fd < 0 || write(fd, contents.data(), contents.size()) != static_cast<ssize_t>(contents.size())) {
-                    fprintf(stderr, "cannot build %s: %s\n", name.c_str(), strerror(errno));
-                    exit(2);
-                }
-                close(fd);
-            }
-        }
-    }
-}
 
 // The baseline's ACLs, the same entries the daemon writes.
 acl_t itemACL, topLevelACL;
@@ -76,28 +51,6 @@ int bareVisit(const char* path, const struct stat* st, int, FTW* ftw) {
         exit(2);
     }
     return 0;
-}
-
-template <class F>
-double timed(F&& body) {
-    auto start = Clock::now();
-    body();
-    return std::chrono::duration<double>(Clock::now() - start).count();
-}
-
-double median(std::vector<double> values) {
-    std::sort(values.begin(), values.end());
-    return values[values.size() / 2];
-}
-
-std::string scratchParent() {
-    if (const char* dir = getenv("STOWLY_BENCH_DIR"); dir && *dir)
-        return dir;
-    struct statfs st;
-    if (statfs("/dev/shm", &st) == 0 && st.f_type == TMPFS_MAGIC && access("/dev/shm", W_OK) == 0)
-        return "/dev/shm";
-    const char* tmp = getenv("TMPDIR");
-    return tmp && *tmp ? tmp : "/tmp";
 }
 
 } // namespace
@@ -175,7 +128,7 @@ int main(int argc, char** argv) {
     double ratio = median(oursTimes) / median(bareTimes);
     printf("acl_walk: ratio %.2f (goal <= 1.2)\n", ratio);
     printf("  stowly %.2f ms, nftw with chmod, chown, acl_set_file %.2f ms (median of %zu runs, %d files)\n",
-           median(oursTimes) * 1e3, median(bareTimes) * 1e3, runs, kTop * kMiddle * kFiles);
+           median(oursTimes) * 1e3, median(bareTimes) * 1e3, runs, kTreeFiles);
 
     // Both sides must have done the same work.
     fs::path sample = "top3/mid4/file5.cache";

@@ -4,9 +4,9 @@
 //   stowly_bench_filesystem [--quick]
 
 #include "Daemon/FileSystem/STWFileManager.h"
+#include "bench/support/STWBenchSupport.h"
 #include "common/STWLog.h"
 
-#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstdio>
@@ -29,31 +29,7 @@ namespace fs = std::filesystem;
 
 namespace {
 
-using Clock = std::chrono::steady_clock;
-
-// 10 x 10 directories of 100 files each: 10,000 small files, the shape of a container's
-// caches.
-constexpr int kTop = 10, kMiddle = 10, kFiles = 100;
-
-void buildTree(const fs::path& root) {
-    fs::create_directories(root);
-    std::string contents(200, 'c');
-    for (int t = 0; t < kTop; ++t) {
-        for (int m = 0; m < kMiddle; ++m) {
-            fs::path dir = root / ("top" + std::to_string(t)) / ("mid" + std::to_string(m));
-            fs::create_directories(dir);
-            for (int f = 0; f < kFiles; ++f) {
-                std::string name = (dir / ("file" + std::to_string(f) + ".cache")).native();
-                int fd = open(name.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
-                if (fd < 0 || write(fd, contents.data(), contents.size()) != static_cast<ssize_t>(contents.size())) {
-                    fprintf(stderr, "cannot build %s: %s\n", name.c_str(), strerror(errno));
-                    exit(2);
-                }
-                close(fd);
-            }
-        }
-    }
-}
+using namespace STWBench;
 
 // Runs a command and answers its wall time in seconds; its standard output goes to
 // `output` when given.
@@ -95,37 +71,10 @@ double runCommand(const std::vector<std::string>& arguments, std::string* output
     return seconds;
 }
 
-template <class F>
-double timed(F&& body) {
-    auto start = Clock::now();
-    body();
-    return std::chrono::duration<double>(Clock::now() - start).count();
-}
-
-double median(std::vector<double> values) {
-    std::sort(values.begin(), values.end());
-    return values[values.size() / 2];
-}
-
 void report(const char* name, double ours, double baseline, double goal, const char* baselineName, size_t runs) {
     printf("%s: ratio %.2f (goal <= %.1f)\n", name, ours / baseline, goal);
     printf("  stowly %.2f ms, %s %.2f ms (median of %zu runs, %d files)\n", ours * 1e3, baselineName,
-           baseline * 1e3, runs, kTop * kMiddle * kFiles);
-}
-
-// Where the trees go: $STOWLY_BENCH_DIR when set, else a tmpfs when there is one. On a
-// tmpfs nothing waits for the device, so the ratios show what each tool itself does; on
-// a disk the device's time is added to both sides (and on virtual disks that discard
-// freed blocks it swamps everything else). The trees are not synced before they are
-// removed, for the same reason.
-std::string scratchParent() {
-    if (const char* dir = getenv("STOWLY_BENCH_DIR"); dir && *dir)
-        return dir;
-    struct statfs st;
-    if (statfs("/dev/shm", &st) == 0 && st.f_type == TMPFS_MAGIC && access("/dev/shm", W_OK) == 0)
-        return "/dev/shm";
-    const char* tmp = getenv("TMPDIR");
-    return tmp && *tmp ? tmp : "/tmp";
+           baseline * 1e3, runs, kTreeFiles);
 }
 
 std::string fileSystemName(const std::string& path) {
@@ -160,6 +109,8 @@ int main(int argc, char** argv) {
         return 2;
     }
     fs::path scratch = templ;
+    // The trees are not synced before they are removed: on a disk the device's time would
+    // swamp what each tool itself does.
     printf("trees in %s (%s)\n", parent.c_str(), fileSystemName(parent).c_str());
     STWFileManager* manager = STWFileManager::defaultManager();
 
