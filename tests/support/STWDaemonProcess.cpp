@@ -113,6 +113,10 @@ bool STWDaemonProcess::start() {
     if (_pid > 0 && isRunning())
         return true;
     _exitStatus.reset();
+    // A daemon that was killed leaves the completion files of its cleanups; the new one
+    // withdraws them only once it runs, so they go now, and waitForCleanups sees this start's.
+    for (const char* name : {"cleanup-complete", "reboot-cleanup-complete"})
+        unlink((_root / "run/stowly" / name).c_str());
     _pid = fork();
     if (_pid == 0) {
         if (_standardErrorFile) {
