@@ -44,7 +44,9 @@ bool readStateFile(const std::filesystem::path& directory) {
 // the root. The state read last is kept while an inotify watch on the runtime directory
 // reports no change to the file. The kernel queues the event before the system call that
 // changed the file returns, so the kept state is never older than a read of the file
-// would be. Without a directory to watch, every call reads the file.
+// would be. Without a directory to watch, every call reads the file. The shared file
+// watcher cannot serve here: its callbacks run later on the event loop, and a class change
+// in between would see the old state.
 class StateCache {
 public:
     bool locked() {

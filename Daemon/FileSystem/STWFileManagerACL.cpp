@@ -133,8 +133,13 @@ std::optional<gid_t> systemUsersGroup(STWErrorRef* error) {
     return gid;
 }
 
-// The ACL of every item below a container directory, also the default ACL of directories.
-ACL copySystemContainerItemACL(gid_t group, STWErrorRef* error) {
+// The ACL of every item below a container directory, also the default ACL of directories;
+// `group` gets the id of "systemusers" it names.
+ACL copySystemContainerItemACL(gid_t* group, STWErrorRef* error) {
+    auto found = systemUsersGroup(error);
+    if (!found)
+        return {};
+    *group = *found;
     ACL acl(acl_init(5));
     if (!acl) {
         STWSetError(error, aclError("acl_init() failed: %s", errno));
@@ -143,7 +148,7 @@ ACL copySystemContainerItemACL(gid_t group, STWErrorRef* error) {
     if (!appendEntry(acl.address(), ACL_USER_OBJ, nullptr, 0, error) ||
         !appendEntry(acl.address(), ACL_GROUP_OBJ, nullptr, 0, error) ||
         !appendEntry(acl.address(), ACL_OTHER, nullptr, 0, error) ||
-        !appendEntry(acl.address(), ACL_GROUP, &group, kFullAccess, error) || !finish(acl.address(), error))
+        !appendEntry(acl.address(), ACL_GROUP, group, kFullAccess, error) || !finish(acl.address(), error))
         return {};
     return acl;
 }
@@ -169,10 +174,6 @@ ACL copyTopLevelSystemContainerACL(int fd, gid_t group, STWErrorRef* error) {
         !finish(acl.address(), error))
         return {};
     return acl;
-}
-
-std::string procPath(int fd) {
-    return "/proc/self/fd/" + std::to_string(fd);
 }
 
 // One item of the tree, open as `fd`: a real descriptor, or with `pathOnly` an O_PATH one.
@@ -208,7 +209,7 @@ int changeOwner(const Item& item, uid_t uid, gid_t gid) {
 int changeMode(const Item& item, mode_t mode) {
     if (S_ISLNK(item.st.st_mode))
         return 0;
-    int r = item.pathOnly ? disk::fchmodat(AT_FDCWD, procPath(item.fd.get()).c_str(), mode, 0)
+    int r = item.pathOnly ? disk::fchmodat(AT_FDCWD, procfsPath(item.fd.get()).c_str(), mode, 0)
                           : disk::fchmod(item.fd.get(), mode);
     return r == 0 ? 0 : errno;
 }
@@ -219,7 +220,7 @@ int setACL(const Item& item, acl_t acl, acl_type_t type) {
     // libacl writes a default ACL only by path.
     int r = !item.pathOnly && type == ACL_TYPE_ACCESS
                 ? acl_set_fd(item.fd.get(), acl)
-                : acl_set_file(procPath(item.fd.get()).c_str(), type, acl);
+                : acl_set_file(procfsPath(item.fd.get()).c_str(), type, acl);
     return r == 0 ? 0 : errno;
 }
 
@@ -409,15 +410,13 @@ bool STWFileManager::setTopLevelSystemContainerACLAtURL(const fs::path& url, STW
 bool STWFileManager::setTopLevelSystemContainerACLAt(int rootfd, const fs::path& url,
                                                      STWErrorRef* error) const {
     std::string path = pathString(url);
-    auto group = systemUsersGroup(error);
-    if (!group)
-        return false;
-    ACL itemACL = copySystemContainerItemACL(*group, error);
+    gid_t group;
+    ACL itemACL = copySystemContainerItemACL(&group, error);
     if (!itemACL)
         return false;
     Item root;
     root.fd.reset(rootfd);
-    bool ok = setTopLevelACL(root, *group, itemACL.get(), path, error);
+    bool ok = setTopLevelACL(root, group, itemACL.get(), path, error);
     root.fd.release(); // the caller's
     return ok;
 }
@@ -435,10 +434,8 @@ bool STWFileManager::standardizeACLsAt(int rootfd, const fs::path& url, bool isS
                                        STWErrorRef* error) const {
     std::string path = pathString(url);
     TraceInterval trace("StandardizingACLs", path);
-    auto group = systemUsersGroup(error);
-    if (!group)
-        return false;
-    ACL itemACL = copySystemContainerItemACL(*group, error);
+    gid_t group;
+    ACL itemACL = copySystemContainerItemACL(&group, error);
     if (!itemACL)
         return false;
     if (leftAlone(path)) {
@@ -467,7 +464,7 @@ bool STWFileManager::standardizeACLsAt(int rootfd, const fs::path& url, bool isS
     }
     if (isSystemContainer) {
         STWErrorRef rootError;
-        if (!setTopLevelACL(root, *group, walk.itemACL, path, &rootError))
+        if (!setTopLevelACL(root, group, walk.itemACL, path, &rootError))
             STW_LOG_ERROR(STWLogCategory::FS, "Failed to set top level ACL on dir %s: %s", path,
                           rootError ? rootError->description() : std::string());
     } else {

@@ -28,8 +28,6 @@ namespace {
 // How often a step is tried again while someone keeps swapping the item under it.
 constexpr int kSwapRetries = 8;
 
-bool sameItem(const struct stat& a, const struct stat& b) { return a.st_dev == b.st_dev && a.st_ino == b.st_ino; }
-
 // Opens the directory `name` of `at`, making it first when missing. A link in its place is
 // removed (never followed) and the step tried again. 0 or the errno.
 int openOrMakeDirectory(int at, const std::string& name, mode_t mode, const std::string& path, STWFileDescriptor* out) {

@@ -77,7 +77,7 @@ private:
         STWFileDescriptor fd(
             openat(dirfd, name.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
         struct stat opened;
-        if (!fd || fstat(fd.get(), &opened) != 0 || opened.st_ino != st.st_ino || opened.st_dev != st.st_dev)
+        if (!fd || fstat(fd.get(), &opened) != 0 || !sameItem(opened, st))
             return false;
         if (!isUserImmutable(fd.get()))
             return false;
@@ -148,7 +148,7 @@ bool STWFileManager::removeDirectoryAt(int parentfd, const std::string& name, in
     int e = 0;
     if (fstat(directoryfd, &expected) != 0 || fstatat(parentfd, name.c_str(), &current, AT_SYMLINK_NOFOLLOW) != 0)
         e = errno;
-    else if (current.st_dev != expected.st_dev || current.st_ino != expected.st_ino)
+    else if (!sameItem(current, expected))
         e = ESTALE; // moved away and replaced meanwhile: what is there now is not ours to remove
     else if (disk::unlinkat(parentfd, name.c_str(), AT_REMOVEDIR) != 0)
         context.itemFailed(parentfd, parentPath(path), name, errno);

@@ -18,6 +18,7 @@
 #include <sys/ioctl.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
+#include <climits>
 #include <unistd.h>
 
 namespace fs = std::filesystem;
@@ -64,6 +65,18 @@ std::string pathString(const fs::path& url) {
 std::string parentPath(const fs::path& path) {
     fs::path parent = path.parent_path();
     return parent.empty() ? std::string(".") : parent.native();
+}
+
+std::string procfsPath(int fd) {
+    return "/proc/self/fd/" + std::to_string(fd);
+}
+
+std::optional<std::filesystem::path> currentPathOfDescriptor(int fd) {
+    char buffer[PATH_MAX];
+    ssize_t n = readlink(procfsPath(fd).c_str(), buffer, sizeof buffer);
+    if (n <= 0 || static_cast<size_t>(n) >= sizeof buffer || buffer[0] != '/')
+        return std::nullopt;
+    return std::filesystem::path(std::string(buffer, static_cast<size_t>(n)));
 }
 
 // MARK: durability

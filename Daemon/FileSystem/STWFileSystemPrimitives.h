@@ -38,6 +38,16 @@ bool hasPrefix(std::string_view text, std::string_view prefix);
 std::string pathString(const std::filesystem::path& url);
 // The directory that holds `path`; "." for a bare name.
 std::string parentPath(const std::filesystem::path& path);
+// Whether two stats describe the same inode.
+inline bool sameItem(const struct stat& a, const struct stat& b) {
+    return a.st_dev == b.st_dev && a.st_ino == b.st_ino;
+}
+// The name under which /proc reaches the very inode open as `fd` (also an O_PATH one).
+std::string procfsPath(int fd);
+// Where the kernel says the item open as `fd` is now; nullopt when it cannot say (the item
+// was removed, or lies outside this mount namespace). Only fit for comparing and naming:
+// acting again goes through descriptors.
+std::optional<std::filesystem::path> currentPathOfDescriptor(int fd);
 
 // fsync, reported to the test observer under `path`. 0 or the errno.
 int syncDescriptor(int fd, const std::string& path);

@@ -12,6 +12,7 @@
 
 #include "Daemon/CodeSigning/STWCodeSigningMapping.h"
 #include "Daemon/FileSystem/STWFileManager.h"
+#include "Daemon/FileSystem/STWFileSystemPrimitives.h"
 #include "Daemon/Lifecycle/STWCommandStageForDelete.h"
 #include "Daemon/Lifecycle/STWContainerCache.h"
 #include "Daemon/Lifecycle/STWTestLocks.h"
@@ -32,25 +33,14 @@
 #include <unistd.h>
 
 namespace fs = std::filesystem;
+using STWFileSystemPrimitives::currentPathOfDescriptor;
+using STWFileSystemPrimitives::sameItem;
 
 namespace {
 
 constexpr const char* kStaticDiskUsageKey = "com.vorlane.Setwright.StaticDiskUsage";
 constexpr const char* kCrashCounterKey = "CrashCounter";
 constexpr const char* kUserManagedAssetsPrefix = "com.vorlane.UserManagedAssets.";
-
-bool sameItem(const struct stat& a, const struct stat& b) { return a.st_dev == b.st_dev && a.st_ino == b.st_ino; }
-
-// Where the kernel says the item open as `fd` is now. Only compared with another such
-// answer; every step that acts goes through descriptors again.
-std::optional<fs::path> pathOfDescriptor(int fd) {
-    std::string link = "/proc/self/fd/" + std::to_string(fd);
-    char buffer[4096];
-    ssize_t n = readlink(link.c_str(), buffer, sizeof buffer);
-    if (n <= 0 || static_cast<size_t>(n) >= sizeof buffer || buffer[0] != '/')
-        return std::nullopt;
-    return fs::path(std::string(buffer, static_cast<size_t>(n)));
-}
 
 // True when `path` lies strictly below `directory`, compared component by component, so
 // that "Assets.abc2" is not taken for a child of "Assets.abc".
@@ -423,8 +413,8 @@ bool STWClientConnection::deleteUserManagedAssetWithContainerIdentity(const STWC
             *error = STWErrorInvalidPath;
             return false;
         }
-        std::optional<fs::path> assetsReal = pathOfDescriptor(assetsfd.get());
-        std::optional<fs::path> itemReal = pathOfDescriptor(itemfd.get());
+        std::optional<fs::path> assetsReal = currentPathOfDescriptor(assetsfd.get());
+        std::optional<fs::path> itemReal = currentPathOfDescriptor(itemfd.get());
         if (!assetsReal || !itemReal)
             return unresolvable(asset);
         if (!isStrictlyBelow(*itemReal, *assetsReal)) {
@@ -508,11 +498,13 @@ std::optional<fs::path> STWClientConnection::stageSharedContentForIdentifier(con
             return invalid("source", *source);
         // Both parents resolved beneath the container (its own links are followed as long as
         // they stay inside); the two last names are entries of those parents.
+        auto openParent = [&](const std::optional<std::pair<std::string, std::string>>& parts) {
+            return parts ? fileManager->openBeneath(containerfd.get(), parts->first, O_RDONLY | O_DIRECTORY, 0,
+                                                    STWOpenBeneathDefault, &stepError)
+                         : STWFileDescriptor();
+        };
         auto sourceParts = splitLastComponent(*source);
-        STWFileDescriptor sourceParent;
-        if (sourceParts)
-            sourceParent = fileManager->openBeneath(containerfd.get(), sourceParts->first, O_RDONLY | O_DIRECTORY, 0,
-                                                    STWOpenBeneathDefault, &stepError);
+        STWFileDescriptor sourceParent = openParent(sourceParts);
         // Only a directory or a file of its own is staged: it is opened (never a FIFO or a
         // link), and a file with other names could be anybody's.
         struct stat st;
@@ -525,11 +517,8 @@ std::optional<fs::path> STWClientConnection::stageSharedContentForIdentifier(con
         if (!item || fstat(item.get(), &opened) != 0 || !sameItem(opened, st))
             return invalid("source", *source);
         auto destParts = splitLastComponent(*dest);
-        STWFileDescriptor destParent;
-        if (destParts)
-            destParent = fileManager->openBeneath(containerfd.get(), destParts->first, O_RDONLY | O_DIRECTORY, 0,
-                                                  STWOpenBeneathDefault, &stepError);
-        std::optional<fs::path> destParentPath = destParent ? pathOfDescriptor(destParent.get()) : std::nullopt;
+        STWFileDescriptor destParent = openParent(destParts);
+        std::optional<fs::path> destParentPath = destParent ? currentPathOfDescriptor(destParent.get()) : std::nullopt;
         if (!destParentPath)
             return invalid("dest", *dest);
         fs::path from = container / *source;

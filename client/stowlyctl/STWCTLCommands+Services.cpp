@@ -80,21 +80,23 @@ void STWCTLCommands::_addServiceCommands(CLI::App& app) {
         return session.send(m);
     });
 
-    CLI::App* regenerate = app.add_subcommand("regenerate-uuid", "Move a container to a new UUID directory");
-    addConcrete(regenerate);
-    _onRun(regenerate, [concrete](STWCTLSession& session) {
-        STWValue::Dictionary m;
-        int status = concrete(9, session, &m);
-        return status ? status : session.send(m);
-    });
-
-    CLI::App* du = app.add_subcommand("du", "Show the bytes a container takes on disk");
-    addConcrete(du);
-    _onRun(du, [concrete](STWCTLSession& session) {
-        STWValue::Dictionary m;
-        int status = concrete(23, session, &m);
-        return status ? status : session.send(m);
-    });
+    // Commands that name one container and nothing else.
+    struct Plain {
+        const char* name;
+        const char* description;
+        uint64_t command;
+    };
+    for (const Plain& plain : {Plain{"regenerate-uuid", "Move a container to a new UUID directory", 9},
+                               Plain{"du", "Show the bytes a container takes on disk", 23}}) {
+        CLI::App* sub = app.add_subcommand(plain.name, plain.description);
+        addConcrete(sub);
+        uint64_t command = plain.command;
+        _onRun(sub, [concrete, command](STWCTLSession& session) {
+            STWValue::Dictionary m;
+            int status = concrete(command, session, &m);
+            return status ? status : session.send(m);
+        });
+    }
 
     CLI::App* assets = app.add_subcommand("assets-path", "Create or find an app's user-managed assets directory");
     assets->add_option("IDENTIFIER", arguments->identifier, "Application identifier")->required();
