@@ -1,0 +1,188 @@
+#include "Daemon/Migration/STWMigrationStatus.h"
+
+#include "Daemon/FileSystem/STWFileManager.h"
+#include "Daemon/Model/STWGlobalConfiguration.h"
+#include "Daemon/Model/STWUserIdentityCache.h"
+#include "common/STWDictionaryUtilities.h"
+#include "common/STWLog.h"
+#include "platform/STWPlatformConfiguration.h"
+
+#include <cerrno>
+#include <utility>
+
+namespace fs = std::filesystem;
+
+namespace {
+
+constexpr auto kCategory = STWLogCategory::Lifecycle;
+
+// Every store object of the process reads and writes its file under this lock.
+STWMutex fileLock;
+
+constexpr std::pair<const char*, const char*> markerFiles[] = {
+    {"stw_bundle_migration_complete.plist", STWMigrationType::bundle},
+    {"stw_acl2_migration_complete.plist", STWMigrationType::acl},
+    {"stw_group_id_migration_complete.plist", STWMigrationType::groupId},
+    {"stw_code_signing_migration_complete.plist", STWMigrationType::codeSigning},
+};
+
+const STWValue::Dictionary& currentBuildInfo() {
+    return STWPlatformConfiguration::sharedInstance()->systemVersion();
+}
+
+} // namespace
+
+std::shared_ptr<STWMigrationStatus> STWMigrationStatus::initForSystemMigration() {
+    auto status = std::make_shared<STWMigrationStatus>(
+        STWGlobalConfiguration::sharedInstance()->libraryDirectory() / systemFileName, true);
+    if (!status->migrationInfo())
+        STW_LOG_ERROR(kCategory, "Error reading system migration file from disk.  This is bad");
+    return status;
+}
+
+std::shared_ptr<STWMigrationStatus> STWMigrationStatus::initForMobileUserMigration() {
+    auto userConfiguration = STWGlobalConfiguration::sharedInstance()->getPerUserConfigurationForUserIdentity(
+        STWUserIdentityCache::defaultUserIdentity());
+    auto status = std::make_shared<STWMigrationStatus>(userConfiguration->libraryDirectory() / userFileName, false);
+    if (!status->migrationInfo())
+        STW_LOG_ERROR(kCategory, "Error reading user migration file from disk.  This is bad");
+    return status;
+}
+
+STWMigrationStatus::STWMigrationStatus(fs::path url, bool foldMarkerFiles) : _migrationFileURL(std::move(url)) {
+    STWLockGuard guard(fileLock);
+    _migrationInfo = readMigrationInfo(_migrationFileURL);
+    if (foldMarkerFiles && _migrationInfo && _migrationInfo->empty())
+        _foldMarkerFiles();
+}
+
+std::optional<STWValue::Dictionary> STWMigrationStatus::readMigrationInfo(const fs::path& url) {
+    STWErrorRef error;
+    auto info = STW_dictionaryWithContentsOfURL(url, 0, &error);
+    if (info)
+        return info;
+    if (error && error->isPOSIX(ENOENT))
+        return STWValue::Dictionary{};
+    STW_LOG_ERROR(kCategory, "Failed to read migration status file at %@ : %@", url, error);
+    return std::nullopt;
+}
+
+void STWMigrationStatus::_foldMarkerFiles() {
+    fileLock.assertHeld();
+    STW_LOG_NOTICE(kCategory, "Migrating from many marker files down to one");
+    fs::path directory = _migrationFileURL.parent_path();
+    for (const auto& [name, type] : markerFiles) {
+        STWErrorRef error;
+        auto marker = STW_dictionaryWithContentsOfURL(directory / name, 0, &error);
+        if (marker)
+            (*_migrationInfo)[type] = std::move(*marker);
+        else if (error && !error->isPOSIX(ENOENT))
+            STW_LOG_ERROR(kCategory, "Failed to read migration marker file at %@ : %@", directory / name, error);
+    }
+    STWErrorRef writeError;
+    if (!STW_writeToURL(*_migrationInfo, _migrationFileURL, STWWriteAtomic | STWWriteDurable, &writeError)) {
+        // The markers stay: the next start folds them again.
+        STW_LOG_ERROR(kCategory, "Failed to write migration status on %@ for %@ : %@", currentBuildVersion(),
+                      "marker files", writeError);
+        return;
+    }
+    auto fileManager = STWFileManager::defaultManager();
+    for (const auto& [name, type] : markerFiles) {
+        STWErrorRef removeError;
+        if (!fileManager->removeItemAtURL(directory / name, &removeError) && removeError &&
+            !removeError->isPOSIX(ENOENT))
+            STW_LOG_ERROR(kCategory, "Failed to remove migration marker file at %@ : %@", directory / name,
+                          removeError);
+    }
+}
+
+std::optional<STWValue::Dictionary> STWMigrationStatus::migrationInfo() {
+    STWLockGuard guard(fileLock);
+    return _migrationInfo;
+}
+
+bool STWMigrationStatus::hasMigrationOccurredForType(const std::string& type) {
+    STWLockGuard guard(fileLock);
+    return _migrationInfo && STWDictionaryFind(*_migrationInfo, type);
+}
+
+template <class Change>
+void STWMigrationStatus::_update(const std::string& what, Change&& change) {
+    STWLockGuard guard(fileLock);
+    // Another store object over the same file may have recorded something since we read.
+    if (auto current = readMigrationInfo(_migrationFileURL))
+        _migrationInfo = std::move(current);
+    if (!_migrationInfo) {
+        // An unreadable store is left as it is for someone to look at; the migrations it
+        // should have recorded run again next time, which they are made to survive.
+        STW_LOG_ERROR(kCategory, "Failed to write migration status on %@ for %@ : %@", currentBuildVersion(), what,
+                      "the status file is unreadable");
+        return;
+    }
+    change(*_migrationInfo);
+    STWErrorRef error;
+    if (!STW_writeToURL(*_migrationInfo, _migrationFileURL, STWWriteAtomic | STWWriteDurable, &error))
+        STW_LOG_ERROR(kCategory, "Failed to write migration status on %@ for %@ : %@", currentBuildVersion(), what,
+                      error);
+}
+
+void STWMigrationStatus::setMigrationCompleteForType(const std::string& type) {
+    std::string build = currentBuildVersion();
+    _update(type, [&](STWValue::Dictionary& info) {
+        info[type] = STWValue::Dictionary{{versionNumberKey, build}, {timeKey, STWDate::now().description()}};
+    });
+    STW_LOG_NOTICE(kCategory, "Migration completed on %@ for %@", build, type);
+}
+
+void STWMigrationStatus::writeCurrentBuildInfoToDisk() {
+    _update(lastBuildInfoKey, [](STWValue::Dictionary& info) { info[lastBuildInfoKey] = currentBuildInfo(); });
+    STW_LOG_NOTICE(kCategory, "Saved last build version of %@", currentBuildVersion());
+}
+
+bool STWMigrationStatus::isBuildUpgrade() {
+    std::optional<STWValue::Dictionary> lastInfo;
+    {
+        STWLockGuard guard(fileLock);
+        if (_migrationInfo)
+            if (const STWValue::Dictionary* last = STWDictionaryDictionary(*_migrationInfo, lastBuildInfoKey))
+                lastInfo = *last;
+    }
+    if (!lastInfo) {
+        STW_LOG_NOTICE(kCategory, "Did not find last build info; we must be upgrading from pre-9.3.1 or this is an "
+                                  "erase install.");
+        return true;
+    }
+    const std::string* lastBuild = STWDictionaryString(*lastInfo, "BuildVersion");
+    if (!lastBuild) {
+        STW_LOG_NOTICE(kCategory, "Could not get build version from last build info dictionary; assuming this is "
+                                  "an upgrade");
+        return true;
+    }
+    const STWValue::Dictionary& current = currentBuildInfo();
+    if (current.empty()) {
+        STW_LOG_NOTICE(kCategory, "Could not get current build info; assuming this is an upgrade");
+        return true;
+    }
+    const std::string* currentBuild = STWDictionaryString(current, "BuildVersion");
+    if (!currentBuild) {
+        STW_LOG_NOTICE(kCategory, "Could not get current build string; assuming this is an upgrade");
+        return true;
+    }
+    const std::string* lastType = STWDictionaryString(*lastInfo, "ReleaseType");
+    const std::string* currentType = STWDictionaryString(current, "ReleaseType");
+    std::string lastRelease = lastType ? *lastType : "", currentRelease = currentType ? *currentType : "";
+    if (*lastBuild == *currentBuild) {
+        STW_LOG_NOTICE(kCategory, "Current build version (%@ / %@) equal to last version recorded (%@ / %@); "
+                                  "skipping upgrade",
+                       *currentBuild, currentRelease, *lastBuild, lastRelease);
+        return false;
+    }
+    STW_LOG_NOTICE(kCategory, "Detected upgrade from %@ (%@) to %@ (%@)", *lastBuild, lastRelease, *currentBuild,
+                   currentRelease);
+    return true;
+}
+
+std::string STWMigrationStatus::currentBuildVersion() {
+    const std::string* build = STWDictionaryString(currentBuildInfo(), "BuildVersion");
+    return build ? *build : std::string();
+}
