@@ -1,5 +1,6 @@
 // stowlyctl run as a program against a scripted daemon: what it sends, what it prints and
 // how it exits.
+#include "Daemon/Request/STWCommandTable.h"
 #include "common/STWDictionaryUtilities.h"
 #include "tests/client/STWFakeDaemon.h"
 
@@ -7,6 +8,8 @@
 
 #include <fcntl.h>
 #include <fstream>
+#include <map>
+#include <regex>
 #include <sstream>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -101,13 +104,39 @@ TEST_F(stowlyctlTest, RawSendsTypedKeysAndPrintsTheReply) {
                                             {"Info", STWValue(Dictionary{{"Nested", STWValue(true)}})}}));
 }
 
+// A command the daemon does not carry yet is answered 49, which stowlyctl reports as the
+// error it is, by number, name and meaning.
 TEST_F(stowlyctlTest, ReplyErrorOtherThanSuccessExitsOne) {
-    answerOnce(daemon, {{"ReplyError", STWValue(55)}, {"When", STWValue(STWDate{0, 0})}}, &received);
-    Outcome r = run({"--json", "raw", "4"});
+    answerOnce(daemon, {{"ReplyError", STWValue(49)}, {"When", STWValue(STWDate{0, 0})}}, &received);
+    Outcome r = run({"--json", "migrate"});
     daemon.join();
     EXPECT_EQ(r.status, 1);
-    EXPECT_EQ(r.out, "{\"ReplyError\":55,\"When\":\"1970-01-01T00:00:00Z\"}\n");
-    EXPECT_EQ(r.err, "error: NotEntitled (55)\n");
+    EXPECT_EQ(r.out, "{\"ReplyError\":49,\"When\":\"1970-01-01T00:00:00Z\"}\n");
+    EXPECT_EQ(r.err, "error: 49 UnsupportedCommand: invalid or unsupported command\n");
+    ASSERT_EQ(received.size(), 1u);
+    EXPECT_EQ(received[0].body, (Dictionary{{"Command", STWValue(24)}}));
+}
+
+// --help ends with the table of command numbers and the verbs that send them; every
+// command of the daemon's table must have one, and each must be a subcommand.
+TEST_F(stowlyctlTest, HelpListsAVerbForEveryCommandOfTheDaemon) {
+    Outcome r = stowlyctl(daemon.root(), {"--help"});
+    ASSERT_EQ(r.status, 0) << r.err;
+    size_t table = r.out.find("Command numbers");
+    ASSERT_NE(table, std::string::npos) << r.out;
+    std::string listing = r.out.substr(0, table), numbers = r.out.substr(table);
+    std::map<uint64_t, std::vector<std::string>> verbs;
+    std::regex entry(R"(\b(\d+) ([a-z0-9/-]+))");
+    for (auto it = std::sregex_iterator(numbers.begin(), numbers.end(), entry); it != std::sregex_iterator(); ++it) {
+        std::stringstream names((*it)[2].str());
+        for (std::string name; std::getline(names, name, '/');)
+            verbs[std::stoull((*it)[1].str())].push_back(name);
+    }
+    for (const STWCommandTableEntry& command : STWCommandTable) {
+        EXPECT_FALSE(verbs[command.command].empty()) << "no verb sends command " << command.command;
+        for (const std::string& verb : verbs[command.command])
+            EXPECT_NE(listing.find("\n  " + verb + " "), std::string::npos) << verb << " is not a subcommand";
+    }
 }
 
 TEST_F(stowlyctlTest, AsSendsHelloWithTheIdentityFirst) {
@@ -137,7 +166,7 @@ TEST_F(stowlyctlTest, RefusedHelloExitsOne) {
     Outcome r = run({"--as", "com.example.tool", "raw", "1"});
     daemon.join();
     EXPECT_EQ(r.status, 1);
-    EXPECT_EQ(r.err, "error: hello refused: NotEntitled (55)\n");
+    EXPECT_EQ(r.err, "error: hello refused: 55 NotEntitled: not entitled\n");
 }
 
 TEST_F(stowlyctlTest, ConnectionProblemsExitTwo) {
