@@ -15,6 +15,7 @@ void STWCTLCommands::addAll(CLI::App& app) {
     _addTestingCommands(app);
     _addDevice(app);
     _addUpcall(app);
+    _addCompletion(app);
     app.require_subcommand(1);
     app.footer(_commandTable());
 }

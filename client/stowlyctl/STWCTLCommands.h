@@ -70,6 +70,8 @@ private:
     void _addDevice(CLI::App& app);
     // STWCTLCommands+Upcall.cpp
     void _addUpcall(CLI::App& app);
+    // STWCTLCommands+Completion.cpp
+    void _addCompletion(CLI::App& app);
 
     STWCTLSession& _session;
     Action _chosen;

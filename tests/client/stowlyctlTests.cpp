@@ -139,6 +139,23 @@ TEST_F(stowlyctlTest, HelpListsAVerbForEveryCommandOfTheDaemon) {
     }
 }
 
+// The shell script asks stowlyctl for the words, which follow the command line as parsed:
+// a verb's own options after the verb, nothing (file names) after an option's value.
+TEST_F(stowlyctlTest, BashCompletionOffersTheWordsOfTheCommandLine) {
+    auto complete = [&](const std::string& line) {
+        std::string script = std::string("source ") + STOWLYCTL_COMPLETION_PATH + "; COMP_WORDS=(" + STOWLYCTL_PATH +
+                             " " + line + "); COMP_CWORD=$((${#COMP_WORDS[@]} - 1)); _stowlyctl; echo ${COMPREPLY[@]}";
+        std::string command = "bash -c '" + script + "' > " + (daemon.root() / "words").string();
+        EXPECT_EQ(system(command.c_str()), 0) << command;
+        return slurp(daemon.root() / "words");
+    };
+    EXPECT_EQ(complete("--root /r mig"), "migrate migrate-user\n");
+    EXPECT_EQ(complete("device \"\""), "lock unlock reboot --help\n");
+    EXPECT_EQ(complete("set-protection x 1 --re"), "--retry\n");
+    EXPECT_EQ(complete("--root \"\""), "\n");
+    EXPECT_EQ(complete("--json create --t"), "--transient\n"); // not the global --timeout
+}
+
 TEST_F(stowlyctlTest, AsSendsHelloWithTheIdentityFirst) {
     std::filesystem::path entitlements = daemon.root() / "entitlements.plist";
     Dictionary granted{{"com.example.containers", STWValue(STWValue::Array{STWValue("a")})}};
