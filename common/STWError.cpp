@@ -13,7 +13,9 @@ struct CodeEntry {
 };
 
 // Every code of STWErrorDomain, in order: its constant's name and what it means to a client.
+// clang-format off
 #define CODE(c, meaning) {STWError##c, #c, meaning}
+// clang-format on
 constexpr CodeEntry codeTable[] = {
     CODE(Success, "success"),
     CODE(MoveDirectoryFailed, "could not move a directory"),

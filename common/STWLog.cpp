@@ -244,8 +244,8 @@ std::vector<std::string> STWLog::journalFields(STWLogLevel level, STWLogCategory
     return fields;
 }
 
-void STWLog::write(STWLogLevel level, STWLogCategory category, const STWLogSite& site, std::string_view message,
-                   const STWError* error) {
+void STWLog::write(STWLogLevel level, STWLogCategory category, const STWLogSite& site,
+                   std::string_view message, const STWError* error) {
     int l = static_cast<int>(level);
     if (l <= systemLevel.load(std::memory_order_relaxed))
         writeSystemLog(level, category, site, message, error);
@@ -257,8 +257,8 @@ void STWLog::write(STWLogLevel level, STWLogCategory category, const STWLogSite&
     }
 }
 
-void STWLog::writev(STWLogLevel level, STWLogCategory category, const STWLogSite& site, std::string_view format,
-                    std::initializer_list<STWFormatArg> args) {
+void STWLog::writev(STWLogLevel level, STWLogCategory category, const STWLogSite& site,
+                    std::string_view format, std::initializer_list<STWFormatArg> args) {
     const STWError* error = nullptr;
     for (const STWFormatArg& arg : args)
         if ((error = arg.error()))

@@ -93,8 +93,8 @@ public:
 };
 
 template <class... Args>
-void STWLogFormatted(STWLogLevel level, STWLogCategory category, const STWLogSite& site, std::string_view format,
-                     const Args&... args) {
+void STWLogFormatted(STWLogLevel level, STWLogCategory category, const STWLogSite& site,
+                     std::string_view format, const Args&... args) {
     STWLog::writev(level, category, site, format, {STWFormatArg(args)...});
 }
 
@@ -102,7 +102,7 @@ void STWLogFormatted(STWLogLevel level, STWLogCategory category, const STWLogSit
 #define STW_LOG_FN(function, level, category, ...)                                                           \
     do {                                                                                                     \
         if (STWLog::isEnabled(level))                                                                        \
-            STWLogFormatted(level, category, STWLogSite{function, __FILE__, __LINE__}, __VA_ARGS__);          \
+            STWLogFormatted(level, category, STWLogSite{function, __FILE__, __LINE__}, __VA_ARGS__);         \
     } while (0)
 
 #define STW_LOG(level, category, ...) STW_LOG_FN(__func__, level, category, __VA_ARGS__)

@@ -48,7 +48,8 @@ void STWCTLCommands::_addCodeSigningCommands(CLI::App& app) {
         });
     set->add_option("IDENTIFIER", arguments->identifier, "Code-signing identifier")->required();
     set->add_option("PLIST", arguments->infoFile, "Property-list file with the code-signing info dictionary");
-    set->add_option("--data-class", arguments->dataContainerClass, "Class of the identifier's data container");
+    set->add_option("--data-class", arguments->dataContainerClass,
+                    "Class of the identifier's data container");
     set->add_option("--parent", arguments->parent, "Identifier of the parent application (for a plug-in)");
     set->add_flag("--placeholder", arguments->placeholder, "A placeholder installation");
 
@@ -56,7 +57,8 @@ void STWCTLCommands::_addCodeSigningCommands(CLI::App& app) {
         ->add_option("IDENTIFIER", arguments->identifier, "Code-signing identifier")
         ->required();
 
-    _addVerb(app, "invalidate-codesigning", 20, "Invalidate the code-signing info of apps whose bundle is gone",
+    _addVerb(app, "invalidate-codesigning", 20,
+             "Invalidate the code-signing info of apps whose bundle is gone",
              [](STWCTLSession&, STWValue::Dictionary&) { return 0; });
 
     struct Owned {
@@ -64,18 +66,20 @@ void STWCTLCommands::_addCodeSigningCommands(CLI::App& app) {
         uint64_t command;
         const char* description;
     };
-    for (const Owned& owned : {Owned{"groups", 13, "Create or find the app-group containers of an owner"},
-                               Owned{"group-ids", 14, "List the app groups an owner is entitled to"},
-                               Owned{"system-container", 15, "Create or find a system container"},
-                               Owned{"system-groups", 16, "Create or find the system-group containers of an owner"}})
+    for (const Owned& owned :
+         {Owned{"groups", 13, "Create or find the app-group containers of an owner"},
+          Owned{"group-ids", 14, "List the app groups an owner is entitled to"},
+          Owned{"system-container", 15, "Create or find a system container"},
+          Owned{"system-groups", 16, "Create or find the system-group containers of an owner"}})
         _addVerb(app, owned.name, owned.command, owned.description, optionalIdentifier)
             ->add_option("IDENTIFIER", arguments->identifier, "Identifier (default: the caller's own)");
 
-    CLI::App* systemGroup = _addVerb(app, "system-group", 17, "Create or find one system-group container",
-                                     [arguments, optionalIdentifier](STWCTLSession& session, STWValue::Dictionary& m) {
-                                         m["GroupIdentifier"] = STWValue(arguments->group);
-                                         return optionalIdentifier(session, m);
-                                     });
+    CLI::App* systemGroup =
+        _addVerb(app, "system-group", 17, "Create or find one system-group container",
+                 [arguments, optionalIdentifier](STWCTLSession& session, STWValue::Dictionary& m) {
+                     m["GroupIdentifier"] = STWValue(arguments->group);
+                     return optionalIdentifier(session, m);
+                 });
     systemGroup->add_option("GROUP", arguments->group, "System group identifier")->required();
     systemGroup->add_option("--owner", arguments->identifier, "Owner (default: the caller itself)");
 }

@@ -35,8 +35,8 @@ void STWCTLCommands::_addCompletion(CLI::App& app) {
                 valueNext = false;
                 continue;
             }
-            const CLI::Option* option = word.starts_with("-") ? optionNamed(current, word.substr(0, word.find('=')))
-                                                              : nullptr;
+            const CLI::Option* option =
+                word.starts_with("-") ? optionNamed(current, word.substr(0, word.find('='))) : nullptr;
             if (option) {
                 valueNext = option->get_expected_min() > 0 && word.find('=') == std::string::npos;
                 continue;

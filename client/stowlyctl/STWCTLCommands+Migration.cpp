@@ -4,6 +4,7 @@
 
 void STWCTLCommands::_addMigrationCommands(CLI::App& app) {
     auto none = [](STWCTLSession&, STWValue::Dictionary&) { return 0; };
-    _addVerb(app, "migrate", 24, "Run the data migration of a build upgrade (dataMigration entitlement)", none);
+    _addVerb(app, "migrate", 24, "Run the data migration of a build upgrade (dataMigration entitlement)",
+             none);
     _addVerb(app, "migrate-user", 30, "Run the per-user data migration of a build upgrade", none);
 }

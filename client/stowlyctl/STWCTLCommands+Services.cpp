@@ -32,8 +32,8 @@ void STWCTLCommands::_addServiceCommands(CLI::App& app) {
                                      if (colon == std::string::npos)
                                          return session.usageError("--value wants TYPE:VALUE");
                                      std::string reason;
-                                     auto value = STWCTLParseTypedValue(text.substr(0, colon), text.substr(colon + 1),
-                                                                        &reason);
+                                     auto value = STWCTLParseTypedValue(text.substr(0, colon),
+                                                                        text.substr(colon + 1), &reason);
                                      if (!value)
                                          return session.usageError(reason);
                                      m["Value"] = std::move(*value);
@@ -56,59 +56,69 @@ void STWCTLCommands::_addServiceCommands(CLI::App& app) {
     auto containerOnly = [arguments](STWCTLSession& session, STWValue::Dictionary& m) {
         return arguments->container.addKeys(session, m);
     };
-    container.addTo(_addVerb(app, "regenerate-uuid", 9, "Move a container to a new UUID directory", containerOnly));
+    container.addTo(
+        _addVerb(app, "regenerate-uuid", 9, "Move a container to a new UUID directory", containerOnly));
     container.addTo(_addVerb(app, "du", 23, "Show the bytes a container takes on disk", containerOnly));
 
-    CLI::App* assets = _addVerb(app, "assets-path", 28, "Create or find an app's user-managed assets directory",
-                                [arguments](STWCTLSession&, STWValue::Dictionary& m) {
-                                    m["Identifier"] = STWValue(arguments->identifier);
-                                    m["IsRelative"] = STWValue(arguments->relative);
-                                    m["CreateIfNecessary"] = STWValue(!arguments->noCreate);
-                                    return 0;
-                                });
+    CLI::App* assets =
+        _addVerb(app, "assets-path", 28, "Create or find an app's user-managed assets directory",
+                 [arguments](STWCTLSession&, STWValue::Dictionary& m) {
+                     m["Identifier"] = STWValue(arguments->identifier);
+                     m["IsRelative"] = STWValue(arguments->relative);
+                     m["CreateIfNecessary"] = STWValue(!arguments->noCreate);
+                     return 0;
+                 });
     assets->add_option("IDENTIFIER", arguments->identifier, "Application identifier")->required();
     assets->add_flag("--relative", arguments->relative, "Answer the path relative to the data container");
     assets->add_flag("--no-create", arguments->noCreate, "Only find an existing directory");
 
-    CLI::App* remove = _addVerb(app, "assets-delete", 29, "Delete an item of an app's user-managed assets directory",
-                                [arguments](STWCTLSession&, STWValue::Dictionary& m) {
-                                    m["Identifier"] = STWValue(arguments->identifier);
-                                    m["SourcePath"] = STWValue(arguments->source);
-                                    return 0;
-                                });
+    CLI::App* remove =
+        _addVerb(app, "assets-delete", 29, "Delete an item of an app's user-managed assets directory",
+                 [arguments](STWCTLSession&, STWValue::Dictionary& m) {
+                     m["Identifier"] = STWValue(arguments->identifier);
+                     m["SourcePath"] = STWValue(arguments->source);
+                     return 0;
+                 });
     remove->add_option("IDENTIFIER", arguments->identifier, "Application identifier")->required();
     remove->add_option("PATH", arguments->source, "Path relative to the assets directory")->required();
 
-    CLI::App* stage = _addVerb(app, "stage-shared", 26, "Move content into place inside a system group container",
-                               [arguments](STWCTLSession&, STWValue::Dictionary& m) {
-                                   m["Identifier"] = STWValue(arguments->identifier);
-                                   m["SourcePath"] = STWValue(arguments->source);
-                                   m["DestPath"] = STWValue(arguments->destination);
-                                   return 0;
-                               });
+    CLI::App* stage =
+        _addVerb(app, "stage-shared", 26, "Move content into place inside a system group container",
+                 [arguments](STWCTLSession&, STWValue::Dictionary& m) {
+                     m["Identifier"] = STWValue(arguments->identifier);
+                     m["SourcePath"] = STWValue(arguments->source);
+                     m["DestPath"] = STWValue(arguments->destination);
+                     return 0;
+                 });
     stage->add_option("GROUP", arguments->identifier, "System group identifier")->required();
     stage->add_option("SOURCE", arguments->source, "Source, relative to the group container")->required();
-    stage->add_option("DEST", arguments->destination, "Destination, relative to the group container")->required();
+    stage->add_option("DEST", arguments->destination, "Destination, relative to the group container")
+        ->required();
 
     // The daemon answers once the change is done; one that waits for the next unlock answers
     // after it. Without --wait that shows as a time-out after --timeout (the change goes on).
-    CLI::App* protection = _addVerb(app, "set-protection", 21, "Change a data container's data-protection class",
-                                    [arguments](STWCTLSession& session, STWValue::Dictionary& m) {
-                                        if (arguments->wait)
-                                            session.options.timeoutSeconds = 1e9;
-                                        m["Identifier"] = STWValue(arguments->identifier);
-                                        m["ContainerClass"] = STWValue(arguments->containerClass);
-                                        m["DataProtectionClass"] = STWValue(arguments->protectionClass);
-                                        m["IsThirdParty"] = STWValue(arguments->thirdParty);
-                                        m["RetryIfLocked"] = STWValue(arguments->retryIfLocked);
-                                        return 0;
-                                    });
+    CLI::App* protection =
+        _addVerb(app, "set-protection", 21, "Change a data container's data-protection class",
+                 [arguments](STWCTLSession& session, STWValue::Dictionary& m) {
+                     if (arguments->wait)
+                         session.options.timeoutSeconds = 1e9;
+                     m["Identifier"] = STWValue(arguments->identifier);
+                     m["ContainerClass"] = STWValue(arguments->containerClass);
+                     m["DataProtectionClass"] = STWValue(arguments->protectionClass);
+                     m["IsThirdParty"] = STWValue(arguments->thirdParty);
+                     m["RetryIfLocked"] = STWValue(arguments->retryIfLocked);
+                     return 0;
+                 });
     protection->add_option("IDENTIFIER", arguments->identifier, "Container identifier")->required();
-    protection->add_option("CLASS", arguments->protectionClass, "Class: 1 complete, 3 until first unlock, 4 none")
+    protection
+        ->add_option("CLASS", arguments->protectionClass, "Class: 1 complete, 3 until first unlock, 4 none")
         ->required();
-    protection->add_option("-c,--class", arguments->containerClass, "Container class (2, 4, 6, 7, 9, 10 or 11)")
+    protection
+        ->add_option("-c,--class", arguments->containerClass, "Container class (2, 4, 6, 7, 9, 10 or 11)")
         ->capture_default_str();
     protection->add_flag("--third-party", arguments->thirdParty, "The application is not part of the system");
-    protection->add_flag("--retry", arguments->retryIfLocked, "When the device is locked, wait for the next unlock");
-    protection->add_flag("--wait", arguments->wait, "Block until the daemon answers, however long that takes");
+    protection->add_flag("--retry", arguments->retryIfLocked,
+                         "When the device is locked, wait for the next unlock");
+    protection->add_flag("--wait", arguments->wait,
+                         "Block until the daemon answers, however long that takes");
 }

@@ -31,12 +31,13 @@ void STWCTLCommands::_addTestingCommands(CLI::App& app) {
 
     // The daemon keeps a lock it was told to hold across requests and connections, until a
     // later test-lock releases it.
-    CLI::App* lock = _addVerb(app, "test-lock", 31, "Hold or release one of the daemon's test locks (internal builds)",
-                              [arguments](STWCTLSession&, STWValue::Dictionary& m) {
-                                  m["TestLock"] = STWValue(arguments->lock);
-                                  m["Enable"] = STWValue(arguments->state == "on");
-                                  return 0;
-                              });
+    CLI::App* lock =
+        _addVerb(app, "test-lock", 31, "Hold or release one of the daemon's test locks (internal builds)",
+                 [arguments](STWCTLSession&, STWValue::Dictionary& m) {
+                     m["TestLock"] = STWValue(arguments->lock);
+                     m["Enable"] = STWValue(arguments->state == "on");
+                     return 0;
+                 });
     lock->add_option("LOCK", arguments->lock,
                      "0 or 1: the daemon-wide lock for reading or writing; 2 to 5: park points "
                      "(2 before a disk-usage walk); 6 with off: turn the test locks off")

@@ -128,18 +128,19 @@ void STWCTLCommands::_addContainerCommands(CLI::App& app) {
     };
 
     for (bool create : {true, false}) {
-        CLI::App* sub = _addVerb(app, create ? "create" : "lookup", 0,
-                                 create ? "Create a container (or find the existing one)"
-                                        : "Find an existing container",
-                                 [arguments, create](STWCTLSession&, STWValue::Dictionary& m) {
-                                     if (!arguments->container.identifier.empty())
-                                         m["Identifier"] = STWValue(arguments->container.identifier);
-                                     m["ContainerClass"] = STWValue(arguments->container.containerClass);
-                                     m["CreateIfNecessary"] = STWValue(create);
-                                     m["Transient"] = STWValue(arguments->transient);
-                                     return 0;
-                                 });
-        sub->add_option("IDENTIFIER", container.identifier, "Container identifier (default: the caller's own)");
+        CLI::App* sub =
+            _addVerb(app, create ? "create" : "lookup", 0,
+                     create ? "Create a container (or find the existing one)" : "Find an existing container",
+                     [arguments, create](STWCTLSession&, STWValue::Dictionary& m) {
+                         if (!arguments->container.identifier.empty())
+                             m["Identifier"] = STWValue(arguments->container.identifier);
+                         m["ContainerClass"] = STWValue(arguments->container.containerClass);
+                         m["CreateIfNecessary"] = STWValue(create);
+                         m["Transient"] = STWValue(arguments->transient);
+                         return 0;
+                     });
+        sub->add_option("IDENTIFIER", container.identifier,
+                        "Container identifier (default: the caller's own)");
         addClass(sub);
     }
 
@@ -160,7 +161,8 @@ void STWCTLCommands::_addContainerCommands(CLI::App& app) {
 
     for (auto [name, command, description] :
          {std::tuple{"recreate-structure", uint64_t{8}, "Create missing standard subdirectories"},
-          std::tuple{"recreate-structure2", uint64_t{22}, "As recreate-structure, through its second command number"}})
+          std::tuple{"recreate-structure2", uint64_t{22},
+                     "As recreate-structure, through its second command number"}})
         container.addTo(_addVerb(app, name, command, description,
                                  [arguments](STWCTLSession& session, STWValue::Dictionary& m) {
                                      return arguments->container.addKeys(session, m);
@@ -194,18 +196,19 @@ void STWCTLCommands::_addDeletionCommands(CLI::App& app) {
     addIdentity(remove);
     remove->add_flag("--transient", arguments->transient, "A transient container");
 
-    CLI::App* stage = _addVerb(
-        app, "stage-delete", 3, "Move one container, named by its UUID, to death row",
-        [arguments](STWCTLSession& session, STWValue::Dictionary& m) {
-            STWUUID uuid;
-            if (int status = STWCTLParseUUID(session, arguments->uuid, &uuid))
-                return status;
-            m["ContainerClassesArray"] = STWValue(STWValue::Array{STWValue(arguments->containerClass)});
-            m["UUIDsArray"] = STWValue(STWValue::Array{STWValue(uuid)});
-            m["IdentifiersArray"] = STWValue(STWValue::Array{STWValue(arguments->identifier)});
-            m["PersonaUniqueStringsArray"] = STWValue(STWValue::Array{STWValue(arguments->persona)});
-            return 0;
-        });
+    CLI::App* stage =
+        _addVerb(app, "stage-delete", 3, "Move one container, named by its UUID, to death row",
+                 [arguments](STWCTLSession& session, STWValue::Dictionary& m) {
+                     STWUUID uuid;
+                     if (int status = STWCTLParseUUID(session, arguments->uuid, &uuid))
+                         return status;
+                     m["ContainerClassesArray"] =
+                         STWValue(STWValue::Array{STWValue(arguments->containerClass)});
+                     m["UUIDsArray"] = STWValue(STWValue::Array{STWValue(uuid)});
+                     m["IdentifiersArray"] = STWValue(STWValue::Array{STWValue(arguments->identifier)});
+                     m["PersonaUniqueStringsArray"] = STWValue(STWValue::Array{STWValue(arguments->persona)});
+                     return 0;
+                 });
     addIdentity(stage);
     stage->add_option("--uuid", arguments->uuid, "The container's UUID")->required();
     stage->add_option("--persona", arguments->persona, "Persona unique string of the container's user");
@@ -226,31 +229,32 @@ void STWCTLCommands::_addDeletionCommands(CLI::App& app) {
                                     });
     wipePlugin->add_option("IDENTIFIER", arguments->identifier, "Plug-in identifier")->required();
 
-    CLI::App* replace = _addVerb(
-        app, "replace", 2, "Put a (transient) container in the place of another",
-        [arguments](STWCTLSession& session, STWValue::Dictionary& m) {
-            STWUUID uuid, oldUUID;
-            if (int status = STWCTLParseUUID(session, arguments->uuid, &uuid))
-                return status;
-            m["NewIdentifier"] = STWValue(arguments->identifier);
-            m["NewContainerClass"] = STWValue(arguments->containerClass);
-            m["NewContainerUUID"] = STWValue(uuid);
-            if (!arguments->oldUUID.empty()) {
-                if (int status = STWCTLParseUUID(session, arguments->oldUUID, &oldUUID))
-                    return status;
-                m["OldIdentifier"] = STWValue(arguments->identifier);
-                m["OldContainerClass"] = STWValue(arguments->containerClass);
-                m["OldContainerUUID"] = STWValue(oldUUID);
-            }
-            if (!arguments->persona.empty()) {
-                m["NewPersonaUniqueString"] = STWValue(arguments->persona);
-                m["OldPersonaUniqueString"] = STWValue(arguments->persona);
-            }
-            return 0;
-        });
+    CLI::App* replace =
+        _addVerb(app, "replace", 2, "Put a (transient) container in the place of another",
+                 [arguments](STWCTLSession& session, STWValue::Dictionary& m) {
+                     STWUUID uuid, oldUUID;
+                     if (int status = STWCTLParseUUID(session, arguments->uuid, &uuid))
+                         return status;
+                     m["NewIdentifier"] = STWValue(arguments->identifier);
+                     m["NewContainerClass"] = STWValue(arguments->containerClass);
+                     m["NewContainerUUID"] = STWValue(uuid);
+                     if (!arguments->oldUUID.empty()) {
+                         if (int status = STWCTLParseUUID(session, arguments->oldUUID, &oldUUID))
+                             return status;
+                         m["OldIdentifier"] = STWValue(arguments->identifier);
+                         m["OldContainerClass"] = STWValue(arguments->containerClass);
+                         m["OldContainerUUID"] = STWValue(oldUUID);
+                     }
+                     if (!arguments->persona.empty()) {
+                         m["NewPersonaUniqueString"] = STWValue(arguments->persona);
+                         m["OldPersonaUniqueString"] = STWValue(arguments->persona);
+                     }
+                     return 0;
+                 });
     addIdentity(replace);
     replace->add_option("--uuid", arguments->uuid, "UUID of the container that takes the place")->required();
-    replace->add_option("--old-uuid", arguments->oldUUID, "UUID of the container it replaces (none: promote)");
+    replace->add_option("--old-uuid", arguments->oldUUID,
+                        "UUID of the container it replaces (none: promote)");
     replace->add_option("--persona", arguments->persona, "Persona unique string of the containers' user");
 
     _addVerb(app, "empty-deathrow", 4, "Remove everything in death row (waits for it)",

@@ -51,8 +51,8 @@ private:
     // Makes `action` what runs when `command` is chosen.
     void _onRun(CLI::App* command, Action action);
     // Adds verb `name`, which sends command `command` with the keys `keys` adds.
-    CLI::App* _addVerb(CLI::App& app, const std::string& name, uint64_t command, const std::string& description,
-                       MessageKeys keys);
+    CLI::App* _addVerb(CLI::App& app, const std::string& name, uint64_t command,
+                       const std::string& description, MessageKeys keys);
     // The table of command numbers and their verbs, wrapped for --help.
     std::string _commandTable() const;
 

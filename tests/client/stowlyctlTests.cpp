@@ -92,7 +92,8 @@ TEST_F(stowlyctlTest, RawSendsTypedKeysAndPrintsTheReply) {
     answerOnce(daemon, {{"ReplyError", STWValue(1)}, {"Path", STWValue("/c/A")}, {"Count", STWValue(3)}},
                &received);
     // Each type's parsing is in the argument tests; here what reaches the wire.
-    Outcome r = run({"raw", "18446744073709551615", "Name=str:a=b:c", "Counts=u64arr:1,2", "Info=plist:" + plist.string()});
+    Outcome r = run({"raw", "18446744073709551615", "Name=str:a=b:c", "Counts=u64arr:1,2",
+                     "Info=plist:" + plist.string()});
     daemon.join();
     EXPECT_EQ(r.status, 0) << r.err;
     EXPECT_EQ(r.out, "ReplyError: 1 (Success)\nCount: 3\nPath: \"/c/A\"\n");
@@ -127,7 +128,8 @@ TEST_F(stowlyctlTest, HelpListsAVerbForEveryCommandOfTheDaemon) {
     std::string listing = r.out.substr(0, table), numbers = r.out.substr(table);
     std::map<uint64_t, std::vector<std::string>> verbs;
     std::regex entry(R"(\b(\d+) ([a-z0-9/-]+))");
-    for (auto it = std::sregex_iterator(numbers.begin(), numbers.end(), entry); it != std::sregex_iterator(); ++it) {
+    for (auto it = std::sregex_iterator(numbers.begin(), numbers.end(), entry); it != std::sregex_iterator();
+         ++it) {
         std::stringstream names((*it)[2].str());
         for (std::string name; std::getline(names, name, '/');)
             verbs[std::stoull((*it)[1].str())].push_back(name);
@@ -143,8 +145,9 @@ TEST_F(stowlyctlTest, HelpListsAVerbForEveryCommandOfTheDaemon) {
 // a verb's own options after the verb, nothing (file names) after an option's value.
 TEST_F(stowlyctlTest, BashCompletionOffersTheWordsOfTheCommandLine) {
     auto complete = [&](const std::string& line) {
-        std::string script = std::string("source ") + STOWLYCTL_COMPLETION_PATH + "; COMP_WORDS=(" + STOWLYCTL_PATH +
-                             " " + line + "); COMP_CWORD=$((${#COMP_WORDS[@]} - 1)); _stowlyctl; echo ${COMPREPLY[@]}";
+        std::string script = std::string("source ") + STOWLYCTL_COMPLETION_PATH + "; COMP_WORDS=(" +
+                             STOWLYCTL_PATH + " " + line +
+                             "); COMP_CWORD=$((${#COMP_WORDS[@]} - 1)); _stowlyctl; echo ${COMPREPLY[@]}";
         std::string command = "bash -c '" + script + "' > " + (daemon.root() / "words").string();
         EXPECT_EQ(system(command.c_str()), 0) << command;
         return slurp(daemon.root() / "words");
@@ -162,7 +165,7 @@ TEST_F(stowlyctlTest, AsSendsHelloWithTheIdentityFirst) {
     STW_writeToURL(granted, entitlements, STWWriteDefault, nullptr);
     answerOnce(daemon, {{"ReplyError", STWValue(1)}}, &received);
     Outcome r = run({"--as", "com.example.tool", "--entitlements", entitlements.string(), "--sandboxed",
-                 "--persona", "PERSONA-1", "raw", "1"});
+                     "--persona", "PERSONA-1", "raw", "1"});
     daemon.join();
     EXPECT_EQ(r.status, 0) << r.err;
     ASSERT_EQ(received.size(), 2u);

@@ -73,22 +73,23 @@ TEST_F(STWLogFileTest, UnwritableLogPathIsReported) {
 // of the error it reports.
 TEST(STWLogJournal, EntriesCarryTheirSiteAndTheCodeOfTheirError) {
     using Fields = std::vector<std::string>;
-    EXPECT_EQ(STWLog::journalFields(STWLogLevel::Error, STWLogCategory::Cache, {"rebuild", "common/x.cpp", 12},
-                                    "gone", nullptr),
+    EXPECT_EQ(STWLog::journalFields(STWLogLevel::Error, STWLogCategory::Cache,
+                                    {"rebuild", "common/x.cpp", 12}, "gone", nullptr),
               (Fields{"MESSAGE=rebuild: gone", "PRIORITY=3", "SYSLOG_IDENTIFIER=stowlyd",
                       "STOWLY_SUBSYSTEM=com.vorlane.stowly", "STOWLY_CATEGORY=cache", "CODE_FUNC=rebuild",
                       "CODE_FILE=common/x.cpp", "CODE_LINE=12"}));
 
     STWErrorRef notFound = STW_ERROR_NOLOG(STWErrorNotFound, nullptr, "no container");
     STWErrorRef posix = STW_POSIX_ERROR_NOLOG(ENOENT, "open");
-    Fields fields = STWLog::journalFields(STWLogLevel::Notice, STWLogCategory::Tolvan, {"caller", "y.cpp", 40},
-                                          "failed", notFound.get());
+    Fields fields = STWLog::journalFields(STWLogLevel::Notice, STWLogCategory::Tolvan,
+                                          {"caller", "y.cpp", 40}, "failed", notFound.get());
     Fields tail(fields.end() - 3, fields.end());
     EXPECT_EQ(tail, (Fields{"CODE_FUNC=TestBody", "CODE_LINE=" + std::to_string(notFound->sourceFileLine()),
                             "STOWLY_RESULT_CODE=21"}));
     EXPECT_EQ(fields.size(), 8u); // no CODE_FILE of the caller beside the error's line
-    EXPECT_EQ(STWLog::journalFields(STWLogLevel::Error, STWLogCategory::FS, {"f", "", 0}, "m", posix.get()).back(),
-              "ERRNO=2");
+    EXPECT_EQ(
+        STWLog::journalFields(STWLogLevel::Error, STWLogCategory::FS, {"f", "", 0}, "m", posix.get()).back(),
+        "ERRNO=2");
 
     // The facade finds the error among the formatted arguments in each form it is passed.
     struct Other {
