@@ -64,6 +64,16 @@ bool useJournal() {
     return journal;
 }
 
+// A source file as the tree names it ("common/STWLog.cpp"): __FILE__ is whatever path the
+// build handed the compiler, absolute under CMake, and says where it was built, not what.
+std::string_view sourcePath(std::string_view file) {
+    static const std::string_view root = [] {
+        std::string_view self = __FILE__, tail = "common/STWLog.cpp";
+        return self.ends_with(tail) ? self.substr(0, self.size() - tail.size()) : std::string_view();
+    }();
+    return !root.empty() && file.starts_with(root) ? file.substr(root.size()) : file;
+}
+
 int syslogPriority(STWLogLevel level) {
     switch (level) {
     case STWLogLevel::Fault:
@@ -238,7 +248,7 @@ std::vector<std::string> STWLog::journalFields(STWLogLevel level, STWLogCategory
     }
     fields.push_back("CODE_FUNC=" + std::string(site.function));
     if (!site.file.empty())
-        fields.push_back("CODE_FILE=" + std::string(site.file));
+        fields.push_back("CODE_FILE=" + std::string(sourcePath(site.file)));
     if (site.line)
         fields.push_back("CODE_LINE=" + std::to_string(site.line));
     return fields;
