@@ -79,10 +79,10 @@ TEST(STWLogJournal, EntriesCarryTheirSiteAndTheCodeOfTheirError) {
                       "STOWLY_SUBSYSTEM=com.vorlane.stowly", "STOWLY_CATEGORY=cache", "CODE_FUNC=rebuild",
                       "CODE_FILE=common/x.cpp", "CODE_LINE=12"}));
 
+    // The file as the tree names it, wherever it was built.
     Fields here =
         STWLog::journalFields(STWLogLevel::Debug, STWLogCategory::Test, {"f", __FILE__, 1}, "m", nullptr);
-    EXPECT_EQ(here[6],
-              "CODE_FILE=tests/common/STWLogTests.cpp"); // as the tree names it, wherever it was built
+    EXPECT_EQ(here[6], "CODE_FILE=tests/common/STWLogTests.cpp");
 
     STWErrorRef notFound = STW_ERROR_NOLOG(STWErrorNotFound, nullptr, "no container");
     STWErrorRef posix = STW_POSIX_ERROR_NOLOG(ENOENT, "open");
