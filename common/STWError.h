@@ -90,6 +90,8 @@ enum STWErrorCode : uint64_t {
 
 // The constant's name without its prefix ("NotEntitled"), or nullptr for an unknown code.
 const char* STWErrorCodeName(uint64_t code);
+// What the code tells a client ("not entitled"), or nullptr for an unknown code.
+const char* STWErrorCodeMeaning(uint64_t code);
 
 class STWError;
 using STWErrorRef = std::shared_ptr<const STWError>;

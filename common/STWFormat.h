@@ -16,6 +16,8 @@
 #include <string_view>
 #include <type_traits>
 
+class STWError;
+
 template <class T>
 concept STWDescribable = requires(const T& t) {
     { t.description() } -> std::convertible_to<std::string>;
@@ -47,7 +49,8 @@ public:
     template <STWDescribable T>
     STWFormatArg(const T& object)
         : _kind(Kind::Object), _object(&object),
-          _describe([](const void* o) { return static_cast<const T*>(o)->description(); }) {}
+          _describe([](const void* o) { return static_cast<const T*>(o)->description(); }),
+          _isError(std::is_same_v<std::remove_cv_t<T>, STWError>) {}
 
     template <STWDescribable T>
     STWFormatArg(const std::shared_ptr<T>& object) : STWFormatArg(object.get()) {}
@@ -61,6 +64,7 @@ public:
         _kind = Kind::Object;
         _object = object;
         _describe = [](const void* o) { return static_cast<const T*>(o)->description(); };
+        _isError = std::is_same_v<std::remove_cv_t<T>, STWError>;
     }
 
     Kind kind() const { return _kind; }
@@ -70,6 +74,9 @@ public:
     const void* pointer() const { return _kind == Kind::Pointer ? _pointer : _object; }
     // What "%@" prints: the object's description, the text itself, the number in decimal.
     std::string description() const;
+    // The error object this argument is (an STWError, by reference, pointer or shared
+    // pointer), else nullptr: the log facade files an entry under its first error's code.
+    const STWError* error() const { return _isError ? static_cast<const STWError*>(_object) : nullptr; }
 
 private:
     Kind _kind = Kind::Null;
@@ -80,6 +87,7 @@ private:
     const void* _pointer = nullptr;
     const void* _object = nullptr;
     std::string (*_describe)(const void*) = nullptr;
+    bool _isError = false;
 };
 
 // Formats `format` with `args`. Understands %@, %s, %d, %i, %u, %x, %X, %o, %c, %p, %f,

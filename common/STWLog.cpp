@@ -1,11 +1,14 @@
 #include "common/STWLog.h"
 
+#include "common/STWError.h"
+
 #include <atomic>
 #include <cstdio>
 #include <cstdlib>
 #include <mutex>
 #include <strings.h>
 #include <sys/stat.h>
+#include <sys/uio.h>
 #include <syslog.h>
 
 #include <spdlog/sinks/rotating_file_sink.h>
@@ -61,6 +64,16 @@ bool useJournal() {
     return journal;
 }
 
+// A source file as the tree names it ("common/STWLog.cpp"): __FILE__ is whatever path the
+// build handed the compiler, absolute under CMake, and says where it was built, not what.
+std::string_view sourcePath(std::string_view file) {
+    static const std::string_view root = [] {
+        std::string_view self = __FILE__, tail = "common/STWLog.cpp";
+        return self.ends_with(tail) ? self.substr(0, self.size() - tail.size()) : std::string_view();
+    }();
+    return !root.empty() && file.starts_with(root) ? file.substr(root.size()) : file;
+}
+
 int syslogPriority(STWLogLevel level) {
     switch (level) {
     case STWLogLevel::Fault:
@@ -78,18 +91,19 @@ int syslogPriority(STWLogLevel level) {
     return LOG_DEBUG;
 }
 
-void writeSystemLog(STWLogLevel level, STWLogCategory category, std::string_view function,
-                    std::string_view message) {
+void writeSystemLog(STWLogLevel level, STWLogCategory category, const STWLogSite& site,
+                    std::string_view message, const STWError* error) {
     if (useJournal()) {
-        sd_journal_send("MESSAGE=%s: %.*s", std::string(function).c_str(), static_cast<int>(message.size()),
-                        message.data(), "PRIORITY=%d", syslogPriority(level), "SYSLOG_IDENTIFIER=stowlyd",
-                        "STOWLY_SUBSYSTEM=%s", STWLog::subsystem.data(), "STOWLY_CATEGORY=%s",
-                        STWLog::categoryName(category), "CODE_FUNC=%s", std::string(function).c_str(),
-                        nullptr);
+        std::vector<std::string> fields = STWLog::journalFields(level, category, site, message, error);
+        std::vector<iovec> vector;
+        vector.reserve(fields.size());
+        for (std::string& field : fields)
+            vector.push_back({field.data(), field.size()});
+        sd_journal_sendv(vector.data(), static_cast<int>(vector.size()));
         return;
     }
     std::string line = "stowlyd <" + std::string(STWLog::levelName(level)) + "> [" +
-                       STWLog::categoryName(category) + "] " + std::string(function) + ": " +
+                       STWLog::categoryName(category) + "] " + std::string(site.function) + ": " +
                        std::string(message) + "\n";
     fwrite(line.data(), 1, line.size(), stderr);
 }
@@ -152,8 +166,8 @@ bool STWLog::openLogFile(const std::filesystem::path& path, std::string_view nam
     // Probe that the file can be created before promising anything.
     FILE* probe = fopen(path.c_str(), "a");
     if (!probe) {
-        writeSystemLog(STWLogLevel::Error, STWLogCategory::Unspecified, "openLogFile",
-                       STWFormat("Failed to set up rotating logs at path %s", path.c_str()));
+        writeSystemLog(STWLogLevel::Error, STWLogCategory::Unspecified, {"openLogFile", "", 0},
+                       STWFormat("Failed to set up rotating logs at path %s", path.c_str()), nullptr);
         return false;
     }
     fclose(probe);
@@ -179,8 +193,8 @@ void STWLog::enableFileWriting(int diskLevel, size_t sizeParameter) {
         logger->flush_on(spdlog::level::err);
         std::atomic_store(&log.logger, logger);
     } catch (const spdlog::spdlog_ex& e) {
-        writeSystemLog(STWLogLevel::Error, STWLogCategory::Unspecified, "enableFileWriting",
-                       STWFormat("Failed to set up rotating logs at path %s", log.path.c_str()));
+        writeSystemLog(STWLogLevel::Error, STWLogCategory::Unspecified, {"enableFileWriting", "", 0},
+                       STWFormat("Failed to set up rotating logs at path %s", log.path.c_str()), nullptr);
     }
 }
 
@@ -207,17 +221,59 @@ bool STWLog::isEnabled(STWLogLevel level) {
     return l <= systemLevel.load(std::memory_order_relaxed) || l <= fileLevel.load(std::memory_order_relaxed);
 }
 
-void STWLog::write(STWLogLevel level, STWLogCategory category, std::string_view function,
-                   std::string_view message) {
+std::vector<std::string> STWLog::journalFields(STWLogLevel level, STWLogCategory category,
+                                               const STWLogSite& site, std::string_view message,
+                                               const STWError* error) {
+    std::vector<std::string> fields;
+    fields.reserve(10);
+    fields.push_back("MESSAGE=" + std::string(site.function) + ": " + std::string(message));
+    fields.push_back("PRIORITY=" + std::to_string(syslogPriority(level)));
+    fields.push_back("SYSLOG_IDENTIFIER=stowlyd");
+    fields.push_back("STOWLY_SUBSYSTEM=" + std::string(subsystem));
+    fields.push_back("STOWLY_CATEGORY=" + std::string(categoryName(category)));
+    if (error) {
+        // The error's own site: the file it was made in is not recorded, so there is no
+        // CODE_FILE rather than the logging call's file beside another file's line.
+        fields.push_back("CODE_FUNC=" + error->functionName());
+        fields.push_back("CODE_LINE=" + std::to_string(error->sourceFileLine()));
+        if (error->domain() == STWErrorDomain) {
+            fields.push_back("STOWLY_RESULT_CODE=" + std::to_string(error->code()));
+        } else if (error->domain() == STWPOSIXErrorDomain) {
+            fields.push_back("ERRNO=" + std::to_string(error->code()));
+        } else {
+            fields.push_back("STOWLY_ERROR_DOMAIN=" + std::string(error->domain()));
+            fields.push_back("STOWLY_ERROR_CODE=" + std::to_string(error->code()));
+        }
+        return fields;
+    }
+    fields.push_back("CODE_FUNC=" + std::string(site.function));
+    if (!site.file.empty())
+        fields.push_back("CODE_FILE=" + std::string(sourcePath(site.file)));
+    if (site.line)
+        fields.push_back("CODE_LINE=" + std::to_string(site.line));
+    return fields;
+}
+
+void STWLog::write(STWLogLevel level, STWLogCategory category, const STWLogSite& site,
+                   std::string_view message, const STWError* error) {
     int l = static_cast<int>(level);
     if (l <= systemLevel.load(std::memory_order_relaxed))
-        writeSystemLog(level, category, function, message);
+        writeSystemLog(level, category, site, message, error);
     if (l <= fileLevel.load(std::memory_order_relaxed)) {
         if (auto logger = std::atomic_load(&fileLog().logger)) {
             logger->log(level <= STWLogLevel::Error ? spdlog::level::err : spdlog::level::info,
-                        "<{}> [{}] {}: {}", levelName(level), categoryName(category), function, message);
+                        "<{}> [{}] {}: {}", levelName(level), categoryName(category), site.function, message);
         }
     }
+}
+
+void STWLog::writev(STWLogLevel level, STWLogCategory category, const STWLogSite& site,
+                    std::string_view format, std::initializer_list<STWFormatArg> args) {
+    const STWError* error = nullptr;
+    for (const STWFormatArg& arg : args)
+        if ((error = arg.error()))
+            break;
+    write(level, category, site, STWFormatv(format, args), error);
 }
 
 void STWLog::flush() {
@@ -227,7 +283,7 @@ void STWLog::flush() {
 }
 
 void STWLog::fatal(std::string_view function, std::string_view message) {
-    write(STWLogLevel::Fault, STWLogCategory::Unspecified, function, message);
+    write(STWLogLevel::Fault, STWLogCategory::Unspecified, {function, "", 0}, message);
     flush();
     if (useJournal() || systemLevel < static_cast<int>(STWLogLevel::Fault))
         fprintf(stderr, "stowlyd: fatal: %.*s\n", static_cast<int>(message.size()), message.data());

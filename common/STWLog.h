@@ -4,13 +4,21 @@
 // it, standard error otherwise) and, once the daemon has opened it, to the rotating file
 // "stowlyd.log". Each line carries its level, its category and the name of the function
 // that logged it. Messages are formatted with STWFormat, so "%@" prints descriptions.
+//
+// A journal entry also carries the source line of the call (CODE_FILE, CODE_LINE) as
+// fields, so `journalctl STOWLY_CATEGORY=cache` or `CODE_FUNC=...` finds it. When one of
+// the formatted arguments is an error object, the entry is filed under that error instead:
+// its code (STOWLY_RESULT_CODE for a daemon code, ERRNO for a system call's) and the
+// function and line where the error was made, which is where the failure happened.
 #pragma once
 
 #include "common/STWFormat.h"
 
+#include <cstdint>
 #include <filesystem>
 #include <string>
 #include <string_view>
+#include <vector>
 
 enum class STWLogLevel : int {
     Fault = 2,
@@ -37,6 +45,13 @@ enum class STWLogCategory {
     CodeSignMapping,
 };
 
+// The logging call: its function, and its file and line where known ("" and 0 otherwise).
+struct STWLogSite {
+    std::string_view function;
+    std::string_view file;
+    uint64_t line = 0;
+};
+
 class STWLog {
 public:
     static constexpr std::string_view subsystem = "com.vorlane.stowly";
@@ -60,8 +75,16 @@ public:
 
     // True when some destination takes this level; callers skip formatting otherwise.
     static bool isEnabled(STWLogLevel level);
-    static void write(STWLogLevel level, STWLogCategory category, std::string_view function,
-                      std::string_view message);
+    // `error`, when given, is the error the line reports (see the top of this file).
+    static void write(STWLogLevel level, STWLogCategory category, const STWLogSite& site,
+                      std::string_view message, const STWError* error = nullptr);
+    // Formats the message and writes it under the first error among `args`.
+    static void writev(STWLogLevel level, STWLogCategory category, const STWLogSite& site,
+                       std::string_view format, std::initializer_list<STWFormatArg> args);
+    // The fields of the journal entry write() sends, each "NAME=value".
+    static std::vector<std::string> journalFields(STWLogLevel level, STWLogCategory category,
+                                                  const STWLogSite& site, std::string_view message,
+                                                  const STWError* error);
     static void flush();
 
     // Logs a fault, flushes, prints the message to standard error and aborts: for broken
@@ -69,10 +92,17 @@ public:
     [[noreturn]] static void fatal(std::string_view function, std::string_view message);
 };
 
+template <class... Args>
+void STWLogFormatted(STWLogLevel level, STWLogCategory category, const STWLogSite& site,
+                     std::string_view format, const Args&... args) {
+    STWLog::writev(level, category, site, format, {STWFormatArg(args)...});
+}
+
+// The level is checked before any argument is formatted or even converted.
 #define STW_LOG_FN(function, level, category, ...)                                                           \
     do {                                                                                                     \
         if (STWLog::isEnabled(level))                                                                        \
-            STWLog::write(level, category, function, STWFormat(__VA_ARGS__));                                \
+            STWLogFormatted(level, category, STWLogSite{function, __FILE__, __LINE__}, __VA_ARGS__);         \
     } while (0)
 
 #define STW_LOG(level, category, ...) STW_LOG_FN(__func__, level, category, __VA_ARGS__)

@@ -162,7 +162,9 @@ std::string STWCTLReplyJSON(const STWValue::Dictionary& reply) {
 
 std::string STWCTLErrorCodeText(uint64_t code) {
     const char* name = STWErrorCodeName(code);
-    return std::string(name ? name : "unknown error") + " (" + std::to_string(code) + ")";
+    if (!name)
+        return std::to_string(code) + " (a code this stowlyctl does not know)";
+    return std::to_string(code) + " " + name + ": " + STWErrorCodeMeaning(code);
 }
 
 std::string STWCTLReplyText(const STWValue::Dictionary& reply) {

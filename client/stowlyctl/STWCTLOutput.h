@@ -15,5 +15,5 @@ std::string STWCTLJSONValue(const STWValue& value);
 
 std::string STWCTLBase64(const STWData& data);
 
-// "NotEntitled (55)", or "unknown error (N)" for a code without a name.
+// "55 NotEntitled: not entitled": the number, the name and the meaning of a result code.
 std::string STWCTLErrorCodeText(uint64_t code);

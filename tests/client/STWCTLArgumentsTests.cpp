@@ -90,5 +90,5 @@ TEST(STWCTLOutput, JSONOfEveryType) {
         EXPECT_EQ(STWCTLBase64(data), text);
     // The text form, with the names of known codes, is in the stowlyctl tests.
     EXPECT_EQ(STWCTLReplyText({{"ReplyError", STWValue(123456)}}), "ReplyError: 123456\n");
-    EXPECT_EQ(STWCTLErrorCodeText(123456), "unknown error (123456)");
+    EXPECT_EQ(STWCTLErrorCodeText(123456), "123456 (a code this stowlyctl does not know)");
 }

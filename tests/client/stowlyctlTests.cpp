@@ -1,5 +1,6 @@
 // stowlyctl run as a program against a scripted daemon: what it sends, what it prints and
 // how it exits.
+#include "Daemon/Request/STWCommandTable.h"
 #include "common/STWDictionaryUtilities.h"
 #include "tests/client/STWFakeDaemon.h"
 
@@ -7,6 +8,8 @@
 
 #include <fcntl.h>
 #include <fstream>
+#include <map>
+#include <regex>
 #include <sstream>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -89,7 +92,8 @@ TEST_F(stowlyctlTest, RawSendsTypedKeysAndPrintsTheReply) {
     answerOnce(daemon, {{"ReplyError", STWValue(1)}, {"Path", STWValue("/c/A")}, {"Count", STWValue(3)}},
                &received);
     // Each type's parsing is in the argument tests; here what reaches the wire.
-    Outcome r = run({"raw", "18446744073709551615", "Name=str:a=b:c", "Counts=u64arr:1,2", "Info=plist:" + plist.string()});
+    Outcome r = run({"raw", "18446744073709551615", "Name=str:a=b:c", "Counts=u64arr:1,2",
+                     "Info=plist:" + plist.string()});
     daemon.join();
     EXPECT_EQ(r.status, 0) << r.err;
     EXPECT_EQ(r.out, "ReplyError: 1 (Success)\nCount: 3\nPath: \"/c/A\"\n");
@@ -101,13 +105,58 @@ TEST_F(stowlyctlTest, RawSendsTypedKeysAndPrintsTheReply) {
                                             {"Info", STWValue(Dictionary{{"Nested", STWValue(true)}})}}));
 }
 
+// A command the daemon does not carry yet is answered 49, which stowlyctl reports as the
+// error it is, by number, name and meaning.
 TEST_F(stowlyctlTest, ReplyErrorOtherThanSuccessExitsOne) {
-    answerOnce(daemon, {{"ReplyError", STWValue(55)}, {"When", STWValue(STWDate{0, 0})}}, &received);
-    Outcome r = run({"--json", "raw", "4"});
+    answerOnce(daemon, {{"ReplyError", STWValue(49)}, {"When", STWValue(STWDate{0, 0})}}, &received);
+    Outcome r = run({"--json", "migrate"});
     daemon.join();
     EXPECT_EQ(r.status, 1);
-    EXPECT_EQ(r.out, "{\"ReplyError\":55,\"When\":\"1970-01-01T00:00:00Z\"}\n");
-    EXPECT_EQ(r.err, "error: NotEntitled (55)\n");
+    EXPECT_EQ(r.out, "{\"ReplyError\":49,\"When\":\"1970-01-01T00:00:00Z\"}\n");
+    EXPECT_EQ(r.err, "error: 49 UnsupportedCommand: invalid or unsupported command\n");
+    ASSERT_EQ(received.size(), 1u);
+    EXPECT_EQ(received[0].body, (Dictionary{{"Command", STWValue(24)}}));
+}
+
+// --help ends with the table of command numbers and the verbs that send them; every
+// command of the daemon's table must have one, and each must be a subcommand.
+TEST_F(stowlyctlTest, HelpListsAVerbForEveryCommandOfTheDaemon) {
+    Outcome r = stowlyctl(daemon.root(), {"--help"});
+    ASSERT_EQ(r.status, 0) << r.err;
+    size_t table = r.out.find("Command numbers");
+    ASSERT_NE(table, std::string::npos) << r.out;
+    std::string listing = r.out.substr(0, table), numbers = r.out.substr(table);
+    std::map<uint64_t, std::vector<std::string>> verbs;
+    std::regex entry(R"(\b(\d+) ([a-z0-9/-]+))");
+    for (auto it = std::sregex_iterator(numbers.begin(), numbers.end(), entry); it != std::sregex_iterator();
+         ++it) {
+        std::stringstream names((*it)[2].str());
+        for (std::string name; std::getline(names, name, '/');)
+            verbs[std::stoull((*it)[1].str())].push_back(name);
+    }
+    for (const STWCommandTableEntry& command : STWCommandTable) {
+        EXPECT_FALSE(verbs[command.command].empty()) << "no verb sends command " << command.command;
+        for (const std::string& verb : verbs[command.command])
+            EXPECT_NE(listing.find("\n  " + verb + " "), std::string::npos) << verb << " is not a subcommand";
+    }
+}
+
+// The shell script asks stowlyctl for the words, which follow the command line as parsed:
+// a verb's own options after the verb, nothing (file names) after an option's value.
+TEST_F(stowlyctlTest, BashCompletionOffersTheWordsOfTheCommandLine) {
+    auto complete = [&](const std::string& line) {
+        std::string script = std::string("source ") + STOWLYCTL_COMPLETION_PATH + "; COMP_WORDS=(" +
+                             STOWLYCTL_PATH + " " + line +
+                             "); COMP_CWORD=$((${#COMP_WORDS[@]} - 1)); _stowlyctl; echo ${COMPREPLY[@]}";
+        std::string command = "bash -c '" + script + "' > " + (daemon.root() / "words").string();
+        EXPECT_EQ(system(command.c_str()), 0) << command;
+        return slurp(daemon.root() / "words");
+    };
+    EXPECT_EQ(complete("--root /r mig"), "migrate migrate-user\n");
+    EXPECT_EQ(complete("device \"\""), "lock unlock reboot --help\n");
+    EXPECT_EQ(complete("set-protection x 1 --re"), "--retry\n");
+    EXPECT_EQ(complete("--root \"\""), "\n");
+    EXPECT_EQ(complete("--json create --t"), "--transient\n"); // not the global --timeout
 }
 
 TEST_F(stowlyctlTest, AsSendsHelloWithTheIdentityFirst) {
@@ -116,7 +165,7 @@ TEST_F(stowlyctlTest, AsSendsHelloWithTheIdentityFirst) {
     STW_writeToURL(granted, entitlements, STWWriteDefault, nullptr);
     answerOnce(daemon, {{"ReplyError", STWValue(1)}}, &received);
     Outcome r = run({"--as", "com.example.tool", "--entitlements", entitlements.string(), "--sandboxed",
-                 "--persona", "PERSONA-1", "raw", "1"});
+                     "--persona", "PERSONA-1", "raw", "1"});
     daemon.join();
     EXPECT_EQ(r.status, 0) << r.err;
     ASSERT_EQ(received.size(), 2u);
@@ -137,7 +186,7 @@ TEST_F(stowlyctlTest, RefusedHelloExitsOne) {
     Outcome r = run({"--as", "com.example.tool", "raw", "1"});
     daemon.join();
     EXPECT_EQ(r.status, 1);
-    EXPECT_EQ(r.err, "error: hello refused: NotEntitled (55)\n");
+    EXPECT_EQ(r.err, "error: hello refused: 55 NotEntitled: not entitled\n");
 }
 
 TEST_F(stowlyctlTest, ConnectionProblemsExitTwo) {

@@ -1,9 +1,11 @@
 #include "common/STWLog.h"
 
+#include "common/STWError.h"
 #include "common/STWFileIO.h"
 
 #include <gtest/gtest.h>
 
+#include <cerrno>
 #include <cstdlib>
 #include <filesystem>
 
@@ -65,6 +67,44 @@ TEST_F(STWLogFileTest, UnwritableLogPathIsReported) {
     EXPECT_FALSE(
         STWLog::openLogFile(dir / "missing" / "stowlyd.log", "com.vorlane.stowlyd", STWLogLevel::Notice));
     EXPECT_FALSE(STWLog::fileIsOpen());
+}
+
+// What `journalctl FIELD=value` finds an entry by: the call's site, or the site and code
+// of the error it reports.
+TEST(STWLogJournal, EntriesCarryTheirSiteAndTheCodeOfTheirError) {
+    using Fields = std::vector<std::string>;
+    EXPECT_EQ(STWLog::journalFields(STWLogLevel::Error, STWLogCategory::Cache,
+                                    {"rebuild", "common/x.cpp", 12}, "gone", nullptr),
+              (Fields{"MESSAGE=rebuild: gone", "PRIORITY=3", "SYSLOG_IDENTIFIER=stowlyd",
+                      "STOWLY_SUBSYSTEM=com.vorlane.stowly", "STOWLY_CATEGORY=cache", "CODE_FUNC=rebuild",
+                      "CODE_FILE=common/x.cpp", "CODE_LINE=12"}));
+
+    // The file as the tree names it, wherever it was built.
+    Fields here =
+        STWLog::journalFields(STWLogLevel::Debug, STWLogCategory::Test, {"f", __FILE__, 1}, "m", nullptr);
+    EXPECT_EQ(here[6], "CODE_FILE=tests/common/STWLogTests.cpp");
+
+    STWErrorRef notFound = STW_ERROR_NOLOG(STWErrorNotFound, nullptr, "no container");
+    STWErrorRef posix = STW_POSIX_ERROR_NOLOG(ENOENT, "open");
+    Fields fields = STWLog::journalFields(STWLogLevel::Notice, STWLogCategory::Tolvan,
+                                          {"caller", "y.cpp", 40}, "failed", notFound.get());
+    Fields tail(fields.end() - 3, fields.end());
+    EXPECT_EQ(tail, (Fields{"CODE_FUNC=TestBody", "CODE_LINE=" + std::to_string(notFound->sourceFileLine()),
+                            "STOWLY_RESULT_CODE=21"}));
+    EXPECT_EQ(fields.size(), 8u); // no CODE_FILE of the caller beside the error's line
+    EXPECT_EQ(
+        STWLog::journalFields(STWLogLevel::Error, STWLogCategory::FS, {"f", "", 0}, "m", posix.get()).back(),
+        "ERRNO=2");
+
+    // The facade finds the error among the formatted arguments in each form it is passed.
+    struct Other {
+        std::string description() const { return "other"; }
+    } other;
+    EXPECT_EQ(STWFormatArg(*notFound).error(), notFound.get());
+    EXPECT_EQ(STWFormatArg(notFound).error(), notFound.get());
+    EXPECT_EQ(STWFormatArg(posix.get()).error(), posix.get());
+    EXPECT_EQ(STWFormatArg(other).error(), nullptr);
+    EXPECT_EQ(STWFormatArg(STWErrorRef()).error(), nullptr);
 }
 
 TEST(STWLogDeathTest, FatalStopsTheProcessWithItsMessage) {
