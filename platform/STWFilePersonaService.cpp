@@ -92,14 +92,14 @@ std::vector<STWPersonaRecord> STWFilePersonaService::personaList() {
             return *_kept->records;
         generation = _kept->generation;
     }
-    std::vector<STWPersonaRecord> records = _readList();
+    std::vector<STWPersonaRecord> records = readList();
     STWLockGuard guard(_kept->lock);
     if (_kept->generation == generation)
         _kept->records = records;
     return records;
 }
 
-std::vector<STWPersonaRecord> STWFilePersonaService::_readList() {
+std::vector<STWPersonaRecord> STWFilePersonaService::readList() {
     std::string bytes;
     int e = STWReadFileContents(personaFile(), &bytes);
     if (e == ENOENT) {

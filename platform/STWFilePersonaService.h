@@ -30,6 +30,8 @@ public:
     static std::filesystem::path personaFile();
     // Parses the file's dictionary entries; invalid entries are logged and skipped.
     static std::vector<STWPersonaRecord> recordsFromPlist(const STWValue& root);
+    // Reads personaFile() now, past the kept list: what personaList() keeps.
+    static std::vector<STWPersonaRecord> readList();
 
 private:
     // Shared with the watches, which may outlive a service that tests replace.
@@ -45,7 +47,6 @@ private:
             ++generation;
         }
     };
-    static std::vector<STWPersonaRecord> _readList();
     // Drops the kept list when the file changes (also without an observer).
     void _watchOnce();
     std::shared_ptr<Kept> _kept = std::make_shared<Kept>();
