@@ -2,6 +2,8 @@
 // reload reads the directory, and whatever entry it makes must be found again the way
 // a connecting process is matched, by its executable's path (and digest, where the entry
 // pins one) and by its signing identifier.
+#include "common/STWDictionaryUtilities.h"
+#include "common/STWFileDescriptor.h"
 #include "common/STWLog.h"
 #include "fuzz/STWFuzzRoot.h"
 #include "platform/STWClientRegistry.h"

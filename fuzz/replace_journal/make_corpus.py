@@ -25,6 +25,9 @@ SEEDS = {
     "not_text": {**JOURNAL, "STWReplaceOperationNewURL": b"/private/var"},
     "array": list(JOURNAL.values()),
 }
+# corpus/non_utf8_path is not written here: the fuzzer found it (a path whose bytes are not
+# UTF-8, which the reader took and the writer could not give back), and it is kept byte
+# for byte.
 
 
 def main():
