@@ -1,8 +1,9 @@
 // Personas from ROOT/etc/stowly/personas.plist: an array of dictionaries with the keys
 // "PersonaUniqueString" (string), "PersonaID" (integer), "Type" ("personal",
 // "enterprise", "universal" or "system"), "BundleIdentifiers" (array of strings),
-// "HomeLayoutPath" (absolute path, enterprise personas) and "KernelType" (integer).
-// Without the file there is one personal persona for the mobile user. The list is read
+// "HomeLayoutPath" (absolute path without "..", taken below the root prefix; enterprise
+// personas) and "KernelType" (integer). An entry without a usable ID, type or home is
+// skipped. Without the file there is one personal persona for the mobile user. The list is read
 // once and kept; a change of the file (noticed with inotify) drops what was kept before it
 // is reported as a persona-list update, so no request reads the file.
 #pragma once

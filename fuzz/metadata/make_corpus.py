@@ -44,6 +44,9 @@ SEEDS = {
     "info_not_dictionary": (2, {**DATA, "STWMetadataInfo": "text"}),
     "array": (2, [DATA]),
 }
+# corpus/non_utf8_info_key is not written here: the fuzzer found it (an info key with a
+# byte that is not UTF-8, which the reader took and a rewrite of the file changed), and it
+# is kept byte for byte.
 
 
 def main():
