@@ -3,9 +3,9 @@
 // "enterprise", "universal" or "system"), "BundleIdentifiers" (array of strings),
 // "HomeLayoutPath" (absolute path without "..", taken below the root prefix; enterprise
 // personas) and "KernelType" (integer). An entry without a usable ID, type or home is
-// skipped. Without the file there is one personal persona for the mobile user. The list is read
-// once and kept; a change of the file (noticed with inotify) drops what was kept before it
-// is reported as a persona-list update, so no request reads the file.
+// skipped. Without the file there is one personal persona for the mobile user. The list
+// is read once and kept; a change of the file (noticed with inotify) drops what was kept
+// before it is reported as a persona-list update, so no request reads the file.
 #pragma once
 
 #include "common/STWValue.h"

@@ -1,8 +1,8 @@
 // The personas file, on whatever bytes it holds: read as the persona service reads it below
-// a private root, every persona it keeps has a known kind and, for an enterprise persona,
-// a home below the root prefix. A list with a usable personal persona then goes through
-// the user identity cache as a persona-list update would, and every persona it lists must
-// come out as a user identity with an absolute home.
+// a private root, every home it keeps for a persona lies below the root prefix. A list
+// with a usable personal persona then goes through the user identity cache as a
+// persona-list update would, and the personal and every enterprise persona must come out
+// as a user identity with an absolute home.
 #include "Daemon/Model/STWUserIdentityCache.h"
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWLog.h"
