@@ -42,4 +42,6 @@ foreach(corpus ${corpora})
   add_test(NAME fuzz_${name}_corpus_replay
            COMMAND ${fuzz_build}/fuzz/${name}/stowly_${name}_fuzzer -runs=0
                    ${PROJECT_SOURCE_DIR}/fuzz/${name}/corpus)
+  # A private root that a crash leaves behind stays in the build directory, not in /tmp.
+  set_tests_properties(fuzz_${name}_corpus_replay PROPERTIES ENVIRONMENT TMPDIR=${fuzz_build}/fuzz/${name})
 endforeach()

@@ -1,5 +1,7 @@
 #include "common/STWPropertyList.h"
 
+#include "common/STWDictionaryUtilities.h"
+
 #include <algorithm>
 #include <climits>
 #include <cstdlib>
@@ -88,9 +90,14 @@ std::optional<STWValue> fromPlist(plist_t node, int depth) {
     }
     case PLIST_STRING:
     case PLIST_KEY: {
+        // Text that is not UTF-8 (high bytes in an ASCII string) has no form the writer
+        // could give back: such a file is malformed.
         uint64_t length = 0;
         const char* s = plist_get_string_ptr(node, &length);
-        return STWValue(std::string(s ? s : "", s ? length : 0));
+        auto text = stringWithFileSystemRepresentation(s ? s : "", s ? length : 0);
+        if (!text)
+            return std::nullopt;
+        return STWValue(std::move(*text));
     }
     case PLIST_DATA: {
         uint64_t length = 0;
@@ -143,6 +150,11 @@ std::optional<STWValue> fromPlist(plist_t node, int depth) {
             }
             auto value = fromPlist(item, depth + 1);
             if (!value) {
+                free(key);
+                ok = false;
+                break;
+            }
+            if (!stringWithFileSystemRepresentation(key)) {
                 free(key);
                 ok = false;
                 break;
@@ -285,11 +297,15 @@ private:
     }
 
     // An ASCII string without NUL (libplist ends a string at its first NUL; such rare files
-    // are its to read).
+    // are its to read) and without high bytes (which parse() refuses as text that is not
+    // UTF-8).
     bool _string(uint8_t info, const uint8_t* p, const uint8_t* end, std::string& out) {
         uint64_t count;
-        if (!_count(info, p, end, count) || count > static_cast<uint64_t>(end - p) || memchr(p, 0, count))
+        if (!_count(info, p, end, count) || count > static_cast<uint64_t>(end - p))
             return false;
+        for (const uint8_t* c = p; c < p + count; ++c)
+            if (*c == 0 || *c >= 0x80)
+                return false;
         out.assign(reinterpret_cast<const char*>(p), count);
         return true;
     }

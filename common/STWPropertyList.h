@@ -15,7 +15,8 @@
 
 namespace STWPropertyList {
 
-// Parses XML or binary property-list bytes; nullopt when they are not a property list.
+// Parses XML or binary property-list bytes; nullopt when they are not a property list or
+// hold a string or key that is not UTF-8.
 // Binary property lists of the common kinds are read directly; everything else goes
 // through libplist, whose answer is the reference, except binary ones with a malformed
 // trailer or a string that holds a NUL, which could abort libplist and are refused.

@@ -1,5 +1,6 @@
 #include "platform/STWFilePersonaService.h"
 
+#include "common/STWDictionaryUtilities.h"
 #include "common/STWFileIO.h"
 #include "common/STWLog.h"
 #include "common/STWPropertyList.h"
@@ -52,8 +53,17 @@ std::vector<STWPersonaRecord> STWFilePersonaService::recordsFromPlist(const STWV
             for (const STWValue& b : *bundles->array())
                 if (b.string())
                     record.bundleIdentifiers.push_back(*b.string());
-        if (const STWValue* home = entry.find("HomeLayoutPath"); home && home->string() && !home->string()->empty())
-            record.homeLayoutPath = configuration->resolve(*home->string());
+        if (const STWValue* home = entry.find("HomeLayoutPath"); home && home->string() && !home->string()->empty()) {
+            // The persona's containers are made there, so it must name a place below the
+            // root prefix: a relative path would follow the daemon's working directory.
+            const std::string& path = *home->string();
+            if (path.front() != '/' || containsDotDotPathComponents(path)) {
+                STW_LOG_ERROR(STWLogCategory::Unspecified, "Skipping persona whose HomeLayoutPath is not absolute: %@",
+                              entry);
+                continue;
+            }
+            record.homeLayoutPath = configuration->resolve(path);
+        }
         if (const STWValue* kernelType = entry.find("KernelType"))
             record.kernelType = static_cast<uint32_t>(kernelType->uint64Value().value_or(0));
         records.push_back(std::move(record));
@@ -92,14 +102,14 @@ std::vector<STWPersonaRecord> STWFilePersonaService::personaList() {
             return *_kept->records;
         generation = _kept->generation;
     }
-    std::vector<STWPersonaRecord> records = _readList();
+    std::vector<STWPersonaRecord> records = readList();
     STWLockGuard guard(_kept->lock);
     if (_kept->generation == generation)
         _kept->records = records;
     return records;
 }
 
-std::vector<STWPersonaRecord> STWFilePersonaService::_readList() {
+std::vector<STWPersonaRecord> STWFilePersonaService::readList() {
     std::string bytes;
     int e = STWReadFileContents(personaFile(), &bytes);
     if (e == ENOENT) {

@@ -1,10 +1,11 @@
 // Personas from ROOT/etc/stowly/personas.plist: an array of dictionaries with the keys
 // "PersonaUniqueString" (string), "PersonaID" (integer), "Type" ("personal",
 // "enterprise", "universal" or "system"), "BundleIdentifiers" (array of strings),
-// "HomeLayoutPath" (absolute path, enterprise personas) and "KernelType" (integer).
-// Without the file there is one personal persona for the mobile user. The list is read
-// once and kept; a change of the file (noticed with inotify) drops what was kept before it
-// is reported as a persona-list update, so no request reads the file.
+// "HomeLayoutPath" (absolute path without "..", taken below the root prefix; enterprise
+// personas) and "KernelType" (integer). An entry without a usable ID, type or home is
+// skipped. Without the file there is one personal persona for the mobile user. The list
+// is read once and kept; a change of the file (noticed with inotify) drops what was kept
+// before it is reported as a persona-list update, so no request reads the file.
 #pragma once
 
 #include "common/STWValue.h"
@@ -30,6 +31,8 @@ public:
     static std::filesystem::path personaFile();
     // Parses the file's dictionary entries; invalid entries are logged and skipped.
     static std::vector<STWPersonaRecord> recordsFromPlist(const STWValue& root);
+    // Reads personaFile() now, past the kept list: what personaList() keeps.
+    static std::vector<STWPersonaRecord> readList();
 
 private:
     // Shared with the watches, which may outlive a service that tests replace.
@@ -45,7 +48,6 @@ private:
             ++generation;
         }
     };
-    static std::vector<STWPersonaRecord> _readList();
     // Drops the kept list when the file changes (also without an observer).
     void _watchOnce();
     std::shared_ptr<Kept> _kept = std::make_shared<Kept>();

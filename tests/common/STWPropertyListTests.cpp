@@ -70,6 +70,17 @@ TEST(STWPropertyList, CorruptAndTruncatedBytesAreRefused) {
     for (size_t cut : {binary.size() / 2, binary.size() - 1, size_t(9)})
         EXPECT_FALSE(STWPropertyList::parse(binary.substr(0, cut))) << cut;
     EXPECT_FALSE(STWPropertyList::parse(xml.substr(0, xml.size() / 2)));
+
+    // Text that is not UTF-8 could not be written back as it was read: high bytes in an
+    // ASCII string or key.
+    auto patched = [](const STWValue::Dictionary& d, const std::string& from, const std::string& to) {
+        std::string bytes = STWPropertyList::serializeBinary(STWValue(d));
+        size_t at = bytes.find(from);
+        EXPECT_NE(at, std::string::npos);
+        return at == std::string::npos ? bytes : bytes.replace(at, from.size(), to);
+    };
+    EXPECT_FALSE(STWPropertyList::parse(patched({{"k", STWValue("/a/abcd")}}, "abcd", "\xc8\xbd\xd2\xc8")));
+    EXPECT_FALSE(STWPropertyList::parse(patched({{"abcd", STWValue(1)}}, "abcd", "ab\xff\xfe")));
 }
 
 // An atomic write replaces the file whole or, failing (here no file may grow past 0 bytes

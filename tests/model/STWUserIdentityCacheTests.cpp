@@ -23,6 +23,9 @@ protected:
             STWTestRoot::persona("ENT-2", 1002, "enterprise", {STWValue("com.both")}),
             STWTestRoot::persona("UNIVERSAL", 1003, "universal", {STWValue("com.vorlane.shared")}),
             STWTestRoot::persona(nullptr, 1004, "enterprise", {STWValue("com.broken")}),
+            // Homes that would not lie below the root prefix.
+            STWTestRoot::persona("ENT-3", 1005, "enterprise", {STWValue("com.broken")}, "private/var/ent3"),
+            STWTestRoot::persona("ENT-4", 1006, "enterprise", {STWValue("com.broken")}, "/private/../../ent4"),
         });
         cache = STWUserIdentityCache::create();
     }
@@ -46,7 +49,7 @@ TEST_F(STWUserIdentityCacheTest, RebuildMapsBundlesToTheIdentitiesThatMayOwnThem
     // A bundle no persona lists (or only the personal one lists) is the personal identity's.
     EXPECT_EQ(identifiers(cache->userIdentitiesForBundleIdentifier("com.unknown")), std::set<std::string>{"501"});
     EXPECT_EQ(identifiers(cache->userIdentitiesForBundleIdentifier("com.personal.only")), std::set<std::string>{"501"});
-    // The enterprise persona without a unique string was skipped.
+    // The enterprise personas without a unique string or a usable home were skipped.
     EXPECT_EQ(identifiers(cache->userIdentitiesForBundleIdentifier("com.broken")), std::set<std::string>{"501"});
 
     auto ent1 = cache->userIdentityForPersonaUniqueString(std::string("ENT-1"), 501, 501);

@@ -1,0 +1,45 @@
+#!/usr/bin/env python3
+"""Writes the seed corpus of the client-registry fuzzer into corpus/ next to this script.
+
+The seeds are registry files as an installation writes them (with and without a digest
+pin, the pin being that of the fuzzer's own program text), paths that normalise, and a few
+that the reader refuses. Run again after changing a seed; the files are committed so that
+the replay test needs no generator.
+"""
+import hashlib
+import os
+import plistlib
+
+# The text of the program the fuzzer matches (kExecutableContent in the fuzzer).
+PROGRAM = b"#!/bin/sh\nexit 0\n"
+ENTRY = {
+    "CodeSigningIdentifier": "com.example.installer",
+    "Executable": "/usr/libexec/installer",
+    "Entitlements": {"com.vorlane.private.stowly.allow": True, "groups": ["group.a"]},
+    "Sandboxed": False,
+}
+SEEDS = {
+    "entry": ENTRY,
+    "pinned": {**ENTRY, "SHA256": hashlib.sha256(PROGRAM).hexdigest().upper()},
+    "wrong_pin": {**ENTRY, "SHA256": "0" * 64},
+    "persona": {**ENTRY, "Persona": "00000000-0000-0000-0000-000000000501", "Sandboxed": True},
+    "unnormal_path": {**ENTRY, "Executable": "//usr/./libexec/../libexec//installer/"},
+    "relative": {**ENTRY, "Executable": "usr/libexec/installer"},
+    "no_identifier": {k: v for k, v in ENTRY.items() if k != "CodeSigningIdentifier"},
+    "entitlements_array": {**ENTRY, "Entitlements": ["x"]},
+    "short_pin": {**ENTRY, "SHA256": "abc"},
+}
+
+
+def main():
+    corpus = os.path.join(os.path.dirname(os.path.abspath(__file__)), "corpus")
+    os.makedirs(corpus, exist_ok=True)
+    for name, value in SEEDS.items():
+        with open(os.path.join(corpus, name), "wb") as f:
+            f.write(plistlib.dumps(value, fmt=plistlib.FMT_BINARY))
+    with open(os.path.join(corpus, "entry_xml"), "wb") as f:
+        f.write(plistlib.dumps(ENTRY, fmt=plistlib.FMT_XML))
+
+
+if __name__ == "__main__":
+    main()

@@ -1,0 +1,63 @@
+#!/usr/bin/env python3
+"""Writes the seed corpus of the metadata fuzzer into corpus/ next to this script.
+
+A seed is one byte that picks the class directory the container lies in (the class
+number minus one) followed by the metadata file: files as the daemon writes them for a
+data container, a bundle, a group and a system group container, older files without a
+user identity, and a few that the reader refuses (a file in another class's directory,
+another user's persona, a bad UUID, no dictionary). Run again after changing a seed; the
+files are committed so that the replay test needs no generator.
+"""
+import os
+import plistlib
+
+IDENTITY = {"posixUID": 501, "posixGID": 501, "type": 0, "version": "2",
+            "personaUniqueString": "00000000-0000-0000-0000-000000000501"}
+DATA = {
+    "STWMetadataContentClass": 2,
+    "STWMetadataIdentifier": "com.example.app",
+    "STWMetadataUUID": "8A0C1C0E-6C1B-4F5B-9C7E-2D6F3B1A9E42",
+    "STWMetadataVersion": "2",
+    "STWMetadataUserIdentity": IDENTITY,
+    "STWMetadataInfo": {"com.vorlane.Setwright.ContentProtectionClass": 3},
+}
+BUNDLE = {k: v for k, v in DATA.items() if k not in ("STWMetadataUserIdentity", "STWMetadataInfo")}
+BUNDLE["STWMetadataContentClass"] = 1
+
+
+def without(d, *keys):
+    return {k: v for k, v in d.items() if k not in keys}
+
+
+SEEDS = {
+    "data": (2, DATA),
+    "data_with_assets": (2, {**DATA, "STWMetadataUserManagedAssetsDirName": "Assets-1",
+                             "STWMetadataInfo": {"k": [1, 2.5, b"\x00", {"n": True}]}}),
+    "data_older_persona": (2, {**without(DATA, "STWMetadataUserIdentity"), "STWMetadataPersona": 501}),
+    "data_wrong_persona": (2, {**DATA, "STWMetadataPersona": 502}),
+    "bundle": (1, BUNDLE),
+    "group": (7, {**DATA, "STWMetadataContentClass": 7, "STWMetadataIdentifier": "group.com.example"}),
+    "system_group": (13, {**BUNDLE, "STWMetadataContentClass": 13, "STWMetadataIdentifier": "systemgroup.x"}),
+    "bundle_in_data_directory": (2, BUNDLE),
+    "class_14": (2, {**DATA, "STWMetadataContentClass": 14}),
+    "bad_uuid": (2, {**DATA, "STWMetadataUUID": "not-a-uuid"}),
+    "info_not_dictionary": (2, {**DATA, "STWMetadataInfo": "text"}),
+    "array": (2, [DATA]),
+}
+# corpus/non_utf8_info_key is not written here: the fuzzer found it (an info key with a
+# byte that is not UTF-8, which the reader took and a rewrite of the file changed), and it
+# is kept byte for byte.
+
+
+def main():
+    corpus = os.path.join(os.path.dirname(os.path.abspath(__file__)), "corpus")
+    os.makedirs(corpus, exist_ok=True)
+    for name, (container_class, value) in SEEDS.items():
+        with open(os.path.join(corpus, name), "wb") as f:
+            f.write(bytes([container_class - 1]) + plistlib.dumps(value, fmt=plistlib.FMT_BINARY))
+    with open(os.path.join(corpus, "data_xml"), "wb") as f:
+        f.write(bytes([1]) + plistlib.dumps(DATA, fmt=plistlib.FMT_XML))
+
+
+if __name__ == "__main__":
+    main()
