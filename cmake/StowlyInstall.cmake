@@ -6,6 +6,7 @@
 #   lib/cmake/stowly/                     (find_package(stowly) -> stowly::stowly)
 #   etc/stowly/                           the default configuration
 #   lib/systemd/system/                   the units of packaging/
+#   lib/tmpfiles.d/stowlyd.conf           /private/var, which the service may write
 #   share/man/                            the man pages (cmake/StowlyMan.cmake)
 
 set(STOWLY_SYSTEMD_UNIT_DIR "lib/systemd/system" CACHE STRING
@@ -62,6 +63,8 @@ foreach(unit stowlyd.service stowlyd.socket stowlyd-upcall.socket)
   file(GENERATE OUTPUT ${PROJECT_BINARY_DIR}/packaging/${unit} CONTENT "${text}")
   install(FILES ${PROJECT_BINARY_DIR}/packaging/${unit} DESTINATION ${STOWLY_SYSTEMD_UNIT_DIR})
 endforeach()
+install(FILES ${PROJECT_SOURCE_DIR}/packaging/stowlyd.tmpfiles DESTINATION lib/tmpfiles.d
+  RENAME stowlyd.conf)
 set_property(DIRECTORY APPEND PROPERTY CMAKE_CONFIGURE_DEPENDS
   ${PROJECT_SOURCE_DIR}/packaging/stowlyd.service ${PROJECT_SOURCE_DIR}/packaging/stowlyd.socket
   ${PROJECT_SOURCE_DIR}/packaging/stowlyd-upcall.socket)
