@@ -18,7 +18,8 @@ install(TARGETS stowlyctl RUNTIME DESTINATION ${CMAKE_INSTALL_BINDIR})
 install(TARGETS stowly EXPORT stowlyTargets
   LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR})
 # The public headers are STWClient.h and STWUpcallClient.h; the others are what those two
-# include. They keep their place in the tree (their includes name it), below include/stowly/.
+# include. They keep their place in the tree (their includes name it), below include/stowly/;
+# the packaging install test compiles each against the installed ones alone.
 set(public_headers
   client/STWClient.h
   client/STWUpcallClient.h

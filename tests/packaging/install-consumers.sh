@@ -37,6 +37,15 @@ fail() {
 
 cmake --install "$build" --prefix "$prefix" >"$work/install.log" || { cat "$work/install.log"; fail "cmake --install"; }
 
+# Every installed header compiles on its own against the installed headers alone: none
+# includes a header of the tree that was left out.
+include=$(find "$prefix" -type d -path '*/include/stowly' -print -quit)
+[ -n "$include" ] || fail "no include/stowly installed"
+for header in $(cd "$include" && find . -name '*.h' | sed 's|^\./||'); do
+    echo "#include \"$header\"" | c++ -std=c++20 -fsyntax-only -I"$include" -x c++ - ||
+        fail "installed header $header does not compile on its own"
+done
+
 # The consumers, each built in a directory of its own from the installed files only.
 cmake -S "$source/examples/cmake-consumer" -B "$work/cmake-consumer" -G Ninja \
     -DCMAKE_PREFIX_PATH="$prefix" >"$work/cmake-consumer.log" 2>&1 &&
