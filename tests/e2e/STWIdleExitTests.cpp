@@ -49,7 +49,9 @@ int listeningSocket(const std::filesystem::path& path, int type) {
 // Started by the service manager, the daemon serves the socket named "stowlyd.sock" among
 // those passed to it (here after the upcall socket). With an idle time (60 s by default
 // then) it leaves when nothing is left to do: no connection and no open transaction for
-// that long. An open connection keeps it.
+// that long. An open connection keeps it. The service manager keeps listening after it
+// left, and the next connection starts it again on the same sockets: that connection,
+// made while no daemon ran, is served by the next one.
 TEST(STWIdleExit, LeavesOnlyWhenNoConnectionIsLeft) {
     STWDaemonProcess prepared({}, {}, false); // only its root, cleaned up at the end
     const std::filesystem::path& root = prepared.root();
@@ -65,18 +67,20 @@ TEST(STWIdleExit, LeavesOnlyWhenNoConnectionIsLeft) {
     for (std::string& variable : environment)
         envp.push_back(variable.data());
     envp.push_back(nullptr);
-    pid_t pid = fork();
-    if (pid == 0) {
-        // Passed sockets start at descriptor 3, in the order of their names.
-        int first = fcntl(upcall, F_DUPFD, 10), second = fcntl(request, F_DUPFD, 10);
-        if (first < 0 || second < 0 || dup2(first, 3) != 3 || dup2(second, 4) != 4)
-            _exit(126);
-        snprintf(listenPID, sizeof listenPID, "LISTEN_PID=%d", getpid());
-        execle(STOWLYD_PATH, "stowlyd", "--root", root.c_str(), "--idle-timeout", "1", nullptr, envp.data());
-        _exit(127);
-    }
-    close(upcall);
-    close(request);
+    auto activate = [&] {
+        pid_t pid = fork();
+        if (pid == 0) {
+            // Passed sockets start at descriptor 3, in the order of their names.
+            int first = fcntl(upcall, F_DUPFD, 10), second = fcntl(request, F_DUPFD, 10);
+            if (first < 0 || second < 0 || dup2(first, 3) != 3 || dup2(second, 4) != 4)
+                _exit(126);
+            snprintf(listenPID, sizeof listenPID, "LISTEN_PID=%d", getpid());
+            execle(STOWLYD_PATH, "stowlyd", "--root", root.c_str(), "--idle-timeout", "1", nullptr, envp.data());
+            _exit(127);
+        }
+        return pid;
+    };
+    pid_t pid = activate();
     auto client = STWClient::connect(root / "activated.sock", nullptr);
     ASSERT_NE(client, nullptr);
     EXPECT_NE(STWDaemonProcess::replyError(*client, 0), 0u) << "no answer on the passed request socket";
@@ -85,4 +89,16 @@ TEST(STWIdleExit, LeavesOnlyWhenNoConnectionIsLeft) {
     EXPECT_EQ(waitForExit(pid, 10s), 0);
     kill(pid, SIGKILL);
     waitpid(pid, nullptr, WNOHANG);
+
+    // The next client connects while no daemon runs and waits in the socket's backlog.
+    client = STWClient::connect(root / "activated.sock", nullptr);
+    ASSERT_NE(client, nullptr) << "the socket did not outlive the daemon";
+    pid = activate();
+    EXPECT_NE(STWDaemonProcess::replyError(*client, 0), 0u) << "no answer after the second activation";
+    client.reset();
+    EXPECT_EQ(waitForExit(pid, 10s), 0) << "the second activation did not leave when idle";
+    kill(pid, SIGKILL);
+    waitpid(pid, nullptr, WNOHANG);
+    close(upcall);
+    close(request);
 }
