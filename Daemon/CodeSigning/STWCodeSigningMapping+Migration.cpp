@@ -100,7 +100,8 @@ void STWCodeSigningMapping::_onQueue_migrateFromMappingFileToDBIfNecessary() {
             error = STW_ERROR_NOLOG(STWErrorInvalidContent, nullptr, "Serialized entry is not a dictionary: %@",
                                     value.description());
         } else {
-            auto entry = std::make_shared<STWCodeSigningEntry>(STWCodeSigningEntry::initWithSerializedDictionary(*serialized));
+            auto entry = std::make_shared<STWCodeSigningEntry>(
+                STWCodeSigningEntry::initWithSerializedDictionary(*serialized));
             if (_codeSigningMappingDB->addCodeSigningEntry(entry, identifier, &error)) {
                 ++migrated;
                 continue;
@@ -181,8 +182,9 @@ void STWCodeSigningMapping::performAllCodeSigningMigrationAndReconciliationWithC
         if (!multiUser)
             STWGroupManager::defaultManager()->reconcileGroupContainersOfType(STWGroupTypeApplication, commandQueue);
     } catch (...) {
-        STWErrorForCurrentException(
-            __func__, __LINE__, STWExceptionReportForImage(STWGlobalConfiguration::sharedInstance()->isInternalImage()));
+        STWErrorForCurrentException(__func__, __LINE__,
+                                    STWExceptionReportForImage(
+                                        STWGlobalConfiguration::sharedInstance()->isInternalImage()));
     }
 }
 
@@ -222,13 +224,15 @@ void STWCodeSigningMapping::_onQueue_migrateAppGroupIdsFromDataContainersToFileU
     const std::vector<STWMetadataRef>& containers) {
     _assertOnQueue(__func__);
     for (const STWMetadataRef& container : containers) {
-        const STWValue* value = container->info() ? STWDictionaryFind(*container->info(), kGroupContainerIDsKey) : nullptr;
+        const STWValue* value =
+            container->info() ? STWDictionaryFind(*container->info(), kGroupContainerIDsKey) : nullptr;
         if (!value)
             continue;
         const std::string& identifier = container->identifier();
         std::optional<std::vector<std::string>> groups = stringsOf(*value);
         if (!groups) {
-            STW_LOG_ERROR(kCategory, "Ignoring group container IDs of data container for %@: not an array of strings: %@",
+            STW_LOG_ERROR(kCategory,
+                          "Ignoring group container IDs of data container for %@: not an array of strings: %@",
                           identifier, value->description());
             continue;
         }
@@ -295,7 +299,8 @@ STWCodeSigningMapping::_codeSigningEntriesFromLegacyEntitlements(const STWValue:
 
 void STWCodeSigningMapping::_onQueue_migrateDataFromLegacyEntitlementsFileToCodeSigningFile() {
     _assertOnQueue(__func__);
-    std::filesystem::path url = STWGlobalConfiguration::sharedInstance()->libraryDirectory() / legacyEntitlementsFileName;
+    std::filesystem::path url =
+        STWGlobalConfiguration::sharedInstance()->libraryDirectory() / legacyEntitlementsFileName;
     auto fileManager = STWFileManager::defaultManager();
     if (fileManager->itemDoesNotExistAtURL(url))
         return;
@@ -374,7 +379,8 @@ void STWCodeSigningMapping::_onQueue_migrateCachedCodeSigningInfoFromBundleConta
         std::optional<STWValue::Dictionary> info = _codeSigningInfoFromCachedInfoOfContainer(*container);
         if (!info) {
             if (container->info() && STWDictionaryFind(*container->info(), kCachedCodeSigningInfoKey))
-                STW_LOG_ERROR(kCategory, "Ignoring cached code signing info of bundle container for %@: not a dictionary",
+                STW_LOG_ERROR(kCategory,
+                              "Ignoring cached code signing info of bundle container for %@: not a dictionary",
                               container->identifier());
             continue;
         }

@@ -37,11 +37,14 @@ constexpr std::pair<const char*, const char*> markerFiles[] = {
 const fs::path& scratch() {
     static const fs::path path = [] {
         std::string templ = fs::is_directory("/dev/shm") ? "/dev/shm/stowly-fuzz-migration-XXXXXX"
-                                                          : "/tmp/stowly-fuzz-migration-XXXXXX";
+                                                         : "/tmp/stowly-fuzz-migration-XXXXXX";
         if (!mkdtemp(templ.data()))
             abort();
         static fs::path cleanup = templ;
-        atexit([] { std::error_code ec; fs::remove_all(cleanup, ec); });
+        atexit([] {
+            std::error_code ec;
+            fs::remove_all(cleanup, ec);
+        });
         return fs::path(templ);
     }();
     return path;
@@ -154,7 +157,8 @@ void entitlementsFile(std::string_view bytes) {
         const STWValue* original = STWDictionaryFind(*file, identifier);
         if (!entry.codeSigningInfo() || entry.codeSigningInfo()->size() != 1 || !original ||
             !STWDictionaryDictionary(*entry.codeSigningInfo(), STWEntitlementKey::entitlements) ||
-            !STWDictionaryFind(*entry.codeSigningInfo(), STWEntitlementKey::entitlements)->isIdenticalTo(*original))
+            !STWDictionaryFind(*entry.codeSigningInfo(), STWEntitlementKey::entitlements)
+                 ->isIdenticalTo(*original))
             fail("an entry's info is not the file's entitlements dictionary");
         if (entry.dataContainerClass() != 0 || entry.advanceCopy())
             fail("an entry with a class or as an advance copy");

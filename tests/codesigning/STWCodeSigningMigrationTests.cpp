@@ -27,13 +27,17 @@ using Strings = std::vector<std::string>;
 constexpr const char* kCachedInfoKey = "com.vorlane.Setwright.CachedCodeSigningInfo";
 constexpr const char* kGroupIDsKey = "com.vorlane.Setwright.GroupContainerIDs";
 
-STWValue strings(const Strings& values) { return STWValue(STWValue::Array(values.begin(), values.end())); }
+STWValue strings(const Strings& values) {
+    return STWValue(STWValue::Array(values.begin(), values.end()));
+}
 
 STWValue::Dictionary entitlementsInfo(STWValue::Dictionary entitlements) {
     return {{STWEntitlementKey::entitlements, STWValue(std::move(entitlements))}};
 }
 
-fs::path library() { return STWGlobalConfiguration::sharedInstance()->libraryDirectory(); }
+fs::path library() {
+    return STWGlobalConfiguration::sharedInstance()->libraryDirectory();
+}
 
 void writePlist(const fs::path& url, const STWValue::Dictionary& dictionary) {
     STWErrorRef error;
@@ -101,10 +105,13 @@ TEST_F(STWCodeSigningMigrationTest, EachLegacyCopyIsTakenInOnceAndTheDatabaseWin
 
     // Cached code-signing info in bundle containers.
     STWValue::Dictionary cachedEntitlements{{"cached", STWValue(true)}};
-    STWValue cached(STWValue::Dictionary{{"Entitlements", STWValue(cachedEntitlements)}, {"Other", STWValue(1)}});
+    STWValue cached(
+        STWValue::Dictionary{{"Entitlements", STWValue(cachedEntitlements)}, {"Other", STWValue(1)}});
     auto user = STWUserIdentityCache::defaultUserIdentity();
-    auto framework = containerWithInfo(user, "com.t.framework", STWContainerClassBundleFramework, kCachedInfoKey, cached);
-    auto app = containerWithInfo(user, "com.t.app", STWContainerClassBundleApplication, kCachedInfoKey, cached);
+    auto framework =
+        containerWithInfo(user, "com.t.framework", STWContainerClassBundleFramework, kCachedInfoKey, cached);
+    auto app =
+        containerWithInfo(user, "com.t.app", STWContainerClassBundleApplication, kCachedInfoKey, cached);
     auto later = STWMakeTestContainer(user, "com.t.later", STWContainerClassBundleApplication);
 
     // Group identifiers of the legacy mobile user's data containers.
@@ -157,8 +164,8 @@ TEST_F(STWCodeSigningMigrationTest, EachLegacyCopyIsTakenInOnceAndTheDatabaseWin
     // Legacy data that shows up after a recorded migration stays where it is.
     auto connection = STWClientConnection::privilegedClientConnectionWithUserIdentity(user);
     uint64_t code = STWErrorSuccess;
-    ASSERT_TRUE(connection->setInfoValue(cached, STWValue(kCachedInfoKey), later.metadata->containerIdentity(), true,
-                                         &code));
+    ASSERT_TRUE(connection->setInfoValue(cached, STWValue(kCachedInfoKey),
+                                         later.metadata->containerIdentity(), true, &code));
     ASSERT_TRUE(STWClientConnection::privilegedClientConnectionWithUserIdentity(mobile)->setInfoValue(
         strings({"DG2"}), STWValue(kGroupIDsKey), laterData.metadata->containerIdentity(), true, &code));
     migrate();

@@ -60,7 +60,8 @@ TEST(STWPropertyList, EveryTypeRoundTripsThroughBinaryAndXML) {
     EXPECT_EQ(STWPropertyList::parse(STWPropertyList::serializeBinary(precise)),
               STWValue(STWValue::Dictionary{{"d", STWValue(STWDate{1700000000, 250000000})}, {"u", STWValue(u.string())}}));
     // A date beyond what libplist holds (-4.8e216 s) is read as one that a write keeps.
-    std::string far = STWPropertyList::serializeBinary(STWValue(STWValue::Dictionary{{"d", STWValue(STWDate{978307200, 0})}}));
+    std::string far =
+        STWPropertyList::serializeBinary(STWValue(STWValue::Dictionary{{"d", STWValue(STWDate{978307200, 0})}}));
     far.replace(far.find(std::string("\x33\0\0\0\0\0\0\0\0", 9)) + 1, 8, "\xec\xeb\xa0\xef\xd8\x9c\x90\x6d");
     auto farRead = STWPropertyList::parse(far);
     ASSERT_TRUE(farRead);
