@@ -108,6 +108,11 @@ std::optional<STWValue> fromPlist(plist_t node, int depth) {
     case PLIST_DATE: {
         int32_t sec = 0, usec = 0;
         plist_get_date_val(node, &sec, &usec);
+        // libplist keeps int32 seconds since 2001: a date beyond that range reaches us as
+        // the overflowed conversion of its seconds and microseconds. It is read as the
+        // earliest date there is, which the writer gives back as it is.
+        if (usec <= -1000000 || usec >= 1000000 || (sec == INT32_MIN && usec < 0))
+            return STWValue(STWDate{int64_t(INT32_MIN) + kPlistEpochOffset, 0});
         int64_t total = static_cast<int64_t>(sec) + kPlistEpochOffset;
         int64_t micro = usec;
         if (micro < 0) {

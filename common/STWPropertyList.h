@@ -19,7 +19,9 @@ namespace STWPropertyList {
 // hold a string or key that is not UTF-8.
 // Binary property lists of the common kinds are read directly; everything else goes
 // through libplist, whose answer is the reference, except binary ones with a malformed
-// trailer or a string that holds a NUL, which could abort libplist and are refused.
+// trailer or a string that holds a NUL, which could abort libplist and are refused. A
+// string or key that holds a NUL is refused on either route: it would not survive being
+// written back.
 std::optional<STWValue> parse(std::string_view bytes);
 // The two routes of parse(), for the tests and the fuzzer that hold them to each other:
 // the direct reader of binary property lists (nullopt when it declines the bytes) and

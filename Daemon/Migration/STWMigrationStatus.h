@@ -66,13 +66,14 @@ public:
 
 private:
     // Takes the marker files of older daemons into the store, writes it, then removes them.
-    void _foldMarkerFiles();
+    void _foldMarkerFiles() STW_REQUIRES(_fileLock);
     // Takes in what the file holds now (another store object may have written it), applies
     // `change` and writes; under the process-wide lock.
     template <class Change>
     void _update(const std::string& what, Change&& change);
 
     std::filesystem::path _migrationFileURL;
-    STWMutex _lock;
-    std::optional<STWValue::Dictionary> _migrationInfo STW_GUARDED_BY(_lock);
+    // Process-wide: every store object reads and writes its file under it.
+    static STWMutex _fileLock;
+    std::optional<STWValue::Dictionary> _migrationInfo STW_GUARDED_BY(_fileLock);
 };

@@ -59,6 +59,13 @@ TEST(STWPropertyList, EveryTypeRoundTripsThroughBinaryAndXML) {
     STWValue precise(STWValue::Dictionary{{"d", STWValue(STWDate{1700000000, 250000000})}, {"u", STWValue(u)}});
     EXPECT_EQ(STWPropertyList::parse(STWPropertyList::serializeBinary(precise)),
               STWValue(STWValue::Dictionary{{"d", STWValue(STWDate{1700000000, 250000000})}, {"u", STWValue(u.string())}}));
+    // A date beyond what libplist holds (-4.8e216 s) is read as one that a write keeps.
+    std::string far =
+        STWPropertyList::serializeBinary(STWValue(STWValue::Dictionary{{"d", STWValue(STWDate{978307200, 0})}}));
+    far.replace(far.find(std::string("\x33\0\0\0\0\0\0\0\0", 9)) + 1, 8, "\xec\xeb\xa0\xef\xd8\x9c\x90\x6d");
+    auto farRead = STWPropertyList::parse(far);
+    ASSERT_TRUE(farRead);
+    EXPECT_EQ(STWPropertyList::parse(STWPropertyList::serializeBinary(*farRead)), farRead);
 }
 
 TEST(STWPropertyList, CorruptAndTruncatedBytesAreRefused) {
@@ -70,17 +77,17 @@ TEST(STWPropertyList, CorruptAndTruncatedBytesAreRefused) {
     for (size_t cut : {binary.size() / 2, binary.size() - 1, size_t(9)})
         EXPECT_FALSE(STWPropertyList::parse(binary.substr(0, cut))) << cut;
     EXPECT_FALSE(STWPropertyList::parse(xml.substr(0, xml.size() / 2)));
-
-    // Text that is not UTF-8 could not be written back as it was read: high bytes in an
-    // ASCII string or key.
-    auto patched = [](const STWValue::Dictionary& d, const std::string& from, const std::string& to) {
-        std::string bytes = STWPropertyList::serializeBinary(STWValue(d));
-        size_t at = bytes.find(from);
-        EXPECT_NE(at, std::string::npos);
-        return at == std::string::npos ? bytes : bytes.replace(at, from.size(), to);
-    };
-    EXPECT_FALSE(STWPropertyList::parse(patched({{"k", STWValue("/a/abcd")}}, "abcd", "\xc8\xbd\xd2\xc8")));
-    EXPECT_FALSE(STWPropertyList::parse(patched({{"abcd", STWValue(1)}}, "abcd", "ab\xff\xfe")));
+    // A string (value or key) that is not UTF-8 or holds a NUL would not come back the same
+    // from the next write of the file.
+    for (bool inKey : {false, true}) {
+        std::string patched = STWPropertyList::serializeBinary(STWValue(
+            STWValue::Dictionary{{inKey ? "qqqq" : "k", STWValue(inKey ? "v" : "qqqq")}}));
+        patched.replace(patched.find("qqqq"), 4, "\xffq\xfeq");
+        EXPECT_FALSE(STWPropertyList::parse(patched)) << inKey;
+    }
+    std::string withNul = STWPropertyList::serializeXML(STWValue(STWValue::Dictionary{{"k", STWValue("aqqqqb")}}));
+    withNul.replace(withNul.find("qqqq"), 4, std::string("\0\0\0\0", 4));
+    EXPECT_FALSE(STWPropertyList::parse(withNul));
 }
 
 // An atomic write replaces the file whole or, failing (here no file may grow past 0 bytes
