@@ -16,9 +16,6 @@ namespace {
 
 constexpr auto kCategory = STWLogCategory::Lifecycle;
 
-// Every store object of the process reads and writes its file under this lock.
-STWMutex fileLock;
-
 constexpr std::pair<const char*, const char*> markerFiles[] = {
     {"stw_bundle_migration_complete.plist", STWMigrationType::bundle},
     {"stw_acl2_migration_complete.plist", STWMigrationType::acl},
@@ -31,6 +28,8 @@ const STWValue::Dictionary& currentBuildInfo() {
 }
 
 } // namespace
+
+STWMutex STWMigrationStatus::_fileLock;
 
 std::shared_ptr<STWMigrationStatus> STWMigrationStatus::initForSystemMigration() {
     auto status = std::make_shared<STWMigrationStatus>(
@@ -50,7 +49,7 @@ std::shared_ptr<STWMigrationStatus> STWMigrationStatus::initForMobileUserMigrati
 }
 
 STWMigrationStatus::STWMigrationStatus(fs::path url, bool foldMarkerFiles) : _migrationFileURL(std::move(url)) {
-    STWLockGuard guard(fileLock);
+    STWLockGuard guard(_fileLock);
     _migrationInfo = readMigrationInfo(_migrationFileURL);
     if (foldMarkerFiles && _migrationInfo && _migrationInfo->empty())
         _foldMarkerFiles();
@@ -68,7 +67,7 @@ std::optional<STWValue::Dictionary> STWMigrationStatus::readMigrationInfo(const 
 }
 
 void STWMigrationStatus::_foldMarkerFiles() {
-    fileLock.assertHeld();
+    _fileLock.assertHeld();
     STW_LOG_NOTICE(kCategory, "Migrating from many marker files down to one");
     fs::path directory = _migrationFileURL.parent_path();
     for (const auto& [name, type] : markerFiles) {
@@ -97,18 +96,18 @@ void STWMigrationStatus::_foldMarkerFiles() {
 }
 
 std::optional<STWValue::Dictionary> STWMigrationStatus::migrationInfo() {
-    STWLockGuard guard(fileLock);
+    STWLockGuard guard(_fileLock);
     return _migrationInfo;
 }
 
 bool STWMigrationStatus::hasMigrationOccurredForType(const std::string& type) {
-    STWLockGuard guard(fileLock);
+    STWLockGuard guard(_fileLock);
     return _migrationInfo && STWDictionaryFind(*_migrationInfo, type);
 }
 
 template <class Change>
 void STWMigrationStatus::_update(const std::string& what, Change&& change) {
-    STWLockGuard guard(fileLock);
+    STWLockGuard guard(_fileLock);
     // Another store object over the same file may have recorded something since we read.
     if (auto current = readMigrationInfo(_migrationFileURL))
         _migrationInfo = std::move(current);
@@ -142,7 +141,7 @@ void STWMigrationStatus::writeCurrentBuildInfoToDisk() {
 bool STWMigrationStatus::isBuildUpgrade() {
     std::optional<STWValue::Dictionary> lastInfo;
     {
-        STWLockGuard guard(fileLock);
+        STWLockGuard guard(_fileLock);
         if (_migrationInfo)
             if (const STWValue::Dictionary* last = STWDictionaryDictionary(*_migrationInfo, lastBuildInfoKey))
                 lastInfo = *last;

@@ -66,13 +66,15 @@ public:
 
 private:
     // Takes the marker files of older daemons into the store, writes it, then removes them.
-    void _foldMarkerFiles();
+    void _foldMarkerFiles() STW_REQUIRES(_fileLock);
     // Takes in what the file holds now (another store object may have written it), applies
     // `change` and writes; under the process-wide lock.
     template <class Change>
     void _update(const std::string& what, Change&& change);
 
+    // One lock for every store object of the process: two objects may share a file.
+    static STWMutex _fileLock;
+
     std::filesystem::path _migrationFileURL;
-    STWMutex _lock;
-    std::optional<STWValue::Dictionary> _migrationInfo STW_GUARDED_BY(_lock);
+    std::optional<STWValue::Dictionary> _migrationInfo STW_GUARDED_BY(_fileLock);
 };
