@@ -20,6 +20,7 @@
 
 #include "Daemon/CodeSigning/STWCodeSigningEntry.h"
 #include "Daemon/CodeSigning/STWSQLiteDB.h"
+#include "Daemon/Model/STWContainerClass.h"
 #include "Daemon/Model/STWUserIdentityCache.h"
 #include "common/STWError.h"
 #include "common/STWThreadSafety.h"
@@ -31,9 +32,11 @@
 #include <optional>
 #include <string>
 #include <unordered_map>
+#include <utility>
 #include <vector>
 
 class STWCommandQueue;
+class STWMetadata;
 class STWQueue;
 
 // Group types: 0 application groups (class 7), 1 system groups (class 13).
@@ -161,8 +164,41 @@ public:
     void _onQueue_migrateFromMappingFileToDBIfNecessary();
     static std::optional<STWValue::Dictionary> _readCodeSigningMappingFromDiskAtURL(const std::filesystem::path& url);
 
-    // The legacy mapping file in the library directory.
+    // MARK: Migrations of what older daemons kept elsewhere
+
+    // Takes in, once each, the group identifiers of data containers (single-user devices
+    // only), the legacy entitlements file and the code-signing info cached in bundle
+    // containers, then sweeps the application group containers that no entry references
+    // (single-user devices only) through `commandQueue`. Holds the daemon-wide identifier
+    // lock for writing throughout; every failure is logged and the work goes on. Never
+    // call from the queue.
+    void performAllCodeSigningMigrationAndReconciliationWithCommandQueue(STWCommandQueue& commandQueue);
+    // The steps of the above, each recorded in the system migration status store (the
+    // legacy file goes once migrated). Called with the daemon-wide write lock held.
+    void migrateAppGroupIdsFromDataContainersToFile();
+    void _onQueue_migrateAppGroupIdsFromDataContainersToFileUsingContainers(
+        const std::vector<std::shared_ptr<const STWMetadata>>& containers);
+    void _onQueue_migrateDataFromLegacyEntitlementsFileToCodeSigningFile();
+    void migrateCachedCodeSigningInfoFromBundleContainersToMapping();
+    void _onQueue_migrateCachedCodeSigningInfoFromBundleContainersToMappingWithContainers(
+        const std::vector<std::shared_ptr<const STWMetadata>>& containers, STWContainerClass containerClass);
+
+    // The entries a legacy entitlements file stands for, one per identifier, in key order:
+    // its entitlements as the info, class 0, the children, placeholder and registered-by-
+    // caller flags of the bookkeeping dictionaries, invalid unless registered by a caller.
+    // Malformed parts are logged and skipped: an identifier whose entitlements are not a
+    // dictionary, a bookkeeping key that is not one, a child list that is not an array of
+    // strings. Pure: no database, no files.
+    static std::vector<std::pair<std::string, STWCodeSigningEntry>>
+    _codeSigningEntriesFromLegacyEntitlements(const STWValue::Dictionary& legacyEntitlements);
+    // The code-signing info an older daemon cached in a bundle container's metadata, with
+    // its "Entitlements" under the key the mapping reads; nullopt when the container has
+    // none or it is not a dictionary.
+    static std::optional<STWValue::Dictionary> _codeSigningInfoFromCachedInfoOfContainer(const STWMetadata& container);
+
+    // The legacy files in the library directory.
     static constexpr const char* legacyMappingFileName = "stw_code_signing_info.plist";
+    static constexpr const char* legacyEntitlementsFileName = "stw_entitlements.plist";
 
 private:
     // What a caller registration found last time, so that an unchanged one costs no

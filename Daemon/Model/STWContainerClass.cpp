@@ -45,6 +45,10 @@ bool STWContainerClassRegistersOnlyForEntitledUsers(STWContainerClass c) {
     return inSet(c, bit(2) | bit(4) | bit(6) | bit(9) | bit(10) | bit(11));
 }
 
+STWContainerClass STWContainerClassDataClassForBundleClass(STWContainerClass c) {
+    return inSet(c, bit(1) | bit(3) | bit(5)) ? c + 1 : STWContainerClassUndefined;
+}
+
 std::string_view STWContainerClassDirectoryName(STWContainerClass c) {
     return c < std::size(directoryNames) ? directoryNames[c] : std::string_view();
 }

@@ -42,6 +42,9 @@ bool STWContainerClassTakesContainerExtension(STWContainerClass c); // {2, 4, 6,
 // Data classes whose sandbox mapping is pushed only for the user identities entitled to
 // the bundle: {2, 4, 6, 9, 10, 11}.
 bool STWContainerClassRegistersOnlyForEntitledUsers(STWContainerClass c);
+// The data class that goes with a bundle class: 1 -> 2, 3 -> 4, 5 -> 6; 0 for every other
+// class (a framework has no data container).
+STWContainerClass STWContainerClassDataClassForBundleClass(STWContainerClass c);
 
 // "Data/Application" and so on; "Undefined" and "MAX" for the end markers, empty beyond.
 std::string_view STWContainerClassDirectoryName(STWContainerClass c);
