@@ -40,8 +40,14 @@ bool STWContainerMigrator::performDataMigratorMigrationForClientConnection(STWCl
             STW_LOG_ERROR(kCategory, "Failed to migrate ACLs on system containers : %@", aclError);
         if (!_performBundleOwnershipMigration(*status, &ownershipError))
             STW_LOG_ERROR(kCategory, "Failed to migrate bundle containers to system location : %@", ownershipError);
-        (void)connection;
-        STW_LOG_DEBUG(kCategory, "The code-signing migrations are not part of this build");
+        // Group containers that no entry references any more are staged for deletion on the
+        // request's command queue, which runs once the reply is decided.
+        auto mapping = STWCodeSigningMapping::sharedInstance();
+        if (mapping && connection.commandQueue())
+            mapping->performAllCodeSigningMigrationAndReconciliationWithCommandQueue(*connection.commandQueue());
+        else
+            STW_LOG_ERROR(kCategory, "Cannot run the code signing migrations: %s",
+                          mapping ? "no command queue" : "no code signing mapping");
         if (aclError || ownershipError) {
             STWSetError(error, aclError ? aclError : ownershipError);
             return false;
