@@ -149,6 +149,8 @@ void STWContainerMigrator::_migrateOldLogFiles() {
     auto userConfiguration =
         configuration->getPerUserConfigurationForUserIdentity(STWUserIdentityCache::defaultUserIdentity());
     fs::path oldDirectory = userConfiguration->oldLoggingPath();
+    if (fileManager->itemDoesNotExistAtURL(oldDirectory))
+        return; // the usual case: nothing of an older release's logs
     STWErrorRef error;
     STWFileDescriptor parent =
         fileManager->openDirectoryAtURL(oldDirectory.parent_path(), userConfiguration->userHomeDirectory(), &error);
@@ -199,6 +201,8 @@ void STWContainerMigrator::_migrateOldLogFiles() {
 bool STWContainerMigrator::_moveLegacyBundleDirectoryWithError(STWErrorRef* error) {
     auto fileManager = STWFileManager::defaultManager();
     fs::path legacy = STWPlatformConfiguration::sharedInstance()->resolve(kLegacyBundleDirectory);
+    if (fileManager->itemDoesNotExistAtURL(legacy))
+        return true; // moved long ago, or never there
     STWErrorRef openError;
     STWFileDescriptor legacyParent = fileManager->openDirectoryAtURLWithoutForeignLinks(legacy.parent_path(), &openError);
     STWFileDescriptor bundle;
