@@ -106,36 +106,40 @@ bool STWMigrationStatus::hasMigrationOccurredForType(const std::string& type) {
 }
 
 template <class Change>
-void STWMigrationStatus::_update(const std::string& what, Change&& change) {
+bool STWMigrationStatus::_update(const std::string& what, Change&& change) {
     STWLockGuard guard(_fileLock);
     // Another store object over the same file may have recorded something since we read.
-    if (auto current = readMigrationInfo(_migrationFileURL))
-        _migrationInfo = std::move(current);
-    if (!_migrationInfo) {
+    auto current = readMigrationInfo(_migrationFileURL);
+    if (!current) {
         // An unreadable store is left as it is for someone to look at; the migrations it
         // should have recorded run again next time, which they are made to survive.
         STW_LOG_ERROR(kCategory, "Failed to write migration status on %@ for %@ : %@", currentBuildVersion(), what,
                       "the status file is unreadable");
-        return;
+        return false;
     }
+    _migrationInfo = std::move(current);
     change(*_migrationInfo);
     STWErrorRef error;
-    if (!STW_writeToURL(*_migrationInfo, _migrationFileURL, STWWriteAtomic | STWWriteDurable, &error))
+    if (!STW_writeToURL(*_migrationInfo, _migrationFileURL, STWWriteAtomic | STWWriteDurable, &error)) {
         STW_LOG_ERROR(kCategory, "Failed to write migration status on %@ for %@ : %@", currentBuildVersion(), what,
                       error);
+        return false;
+    }
+    return true;
 }
 
 void STWMigrationStatus::setMigrationCompleteForType(const std::string& type) {
     std::string build = currentBuildVersion();
-    _update(type, [&](STWValue::Dictionary& info) {
+    bool written = _update(type, [&](STWValue::Dictionary& info) {
         info[type] = STWValue::Dictionary{{versionNumberKey, build}, {timeKey, STWDate::now().description()}};
     });
-    STW_LOG_NOTICE(kCategory, "Migration completed on %@ for %@", build, type);
+    if (written)
+        STW_LOG_NOTICE(kCategory, "Migration completed on %@ for %@", build, type);
 }
 
 void STWMigrationStatus::writeCurrentBuildInfoToDisk() {
-    _update(lastBuildInfoKey, [](STWValue::Dictionary& info) { info[lastBuildInfoKey] = currentBuildInfo(); });
-    STW_LOG_NOTICE(kCategory, "Saved last build version of %@", currentBuildVersion());
+    if (_update(lastBuildInfoKey, [](STWValue::Dictionary& info) { info[lastBuildInfoKey] = currentBuildInfo(); }))
+        STW_LOG_NOTICE(kCategory, "Saved last build version of %@", currentBuildVersion());
 }
 
 bool STWMigrationStatus::isBuildUpgrade() {

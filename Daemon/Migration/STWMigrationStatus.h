@@ -68,9 +68,10 @@ private:
     // Takes the marker files of older daemons into the store, writes it, then removes them.
     void _foldMarkerFiles() STW_REQUIRES(_fileLock);
     // Takes in what the file holds now (another store object may have written it), applies
-    // `change` and writes; under the process-wide lock.
+    // `change` and writes; under the process-wide lock. False (logged) when the file could
+    // not be read, which leaves it untouched, or not be written.
     template <class Change>
-    void _update(const std::string& what, Change&& change);
+    bool _update(const std::string& what, Change&& change);
 
     // One lock for every store object of the process: two objects may share a file.
     static STWMutex _fileLock;
