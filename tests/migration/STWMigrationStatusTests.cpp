@@ -6,6 +6,7 @@
 #include <gtest/gtest.h>
 
 #include <fstream>
+#include <sys/stat.h>
 
 namespace fs = std::filesystem;
 
@@ -82,4 +83,24 @@ TEST(STWMigrationStatus, ACorruptStatusFileIsNeverOverwritten) {
     std::string contents;
     ASSERT_EQ(STWReadFileContents(file, &contents), 0);
     EXPECT_EQ(contents, "bplist00 broken");
+}
+
+// The user's store lies in a directory its apps own: a FIFO in place of the file is not
+// waited for, and a link in place of a directory is not followed, for reading or writing.
+TEST(STWMigrationStatus, AStoreAnAppTamperedWithIsNeitherWaitedForNorFollowed) {
+    fs::path home = storeDirectory("home");
+    fs::create_directories(home / "Library/Stowly");
+    fs::path fifo = home / "Library/Stowly" / STWMigrationStatus::userFileName;
+    ASSERT_EQ(mkfifo(fifo.c_str(), 0666), 0);
+    STWMigrationStatus planted(fifo, false, home);
+    EXPECT_FALSE(planted.migrationInfo());
+    planted.setMigrationCompleteForType(STWMigrationType::subdirectory);
+    EXPECT_TRUE(fs::is_fifo(fifo));
+
+    fs::path elsewhere = storeDirectory("elsewhere");
+    fs::create_directories(home / "Other");
+    fs::create_directory_symlink(elsewhere, home / "Other/Stowly");
+    STWMigrationStatus linked(home / "Other/Stowly" / STWMigrationStatus::userFileName, false, home);
+    linked.setMigrationCompleteForType(STWMigrationType::subdirectory);
+    EXPECT_FALSE(fs::exists(elsewhere / STWMigrationStatus::userFileName));
 }
