@@ -116,7 +116,8 @@ void expectCurrentLayout(STWDaemonProcess& daemon, const Layout& layout) {
 
 } // namespace
 
-// An older release's device: the layout of makeOlderRelease(), a marker file, a legacy
+// An older release's device: the layout of makeOlderRelease() beside a well-known
+// container already at its name, a marker file, a legacy
 // mapping file, code-signing info cached in a bundle container, group identifiers in a data
 // container, old log files (and a link an app planted among them), another build. One
 // power cycle and the two commands bring everything where this build keeps it; a second
@@ -143,7 +144,15 @@ TEST(STWMigration, AnOlderReleasesDeviceIsBroughtUpToDateOnce) {
         ASSERT_EQ(code(STWDaemonProcess::send(*client, 5, setCached)), STWErrorSuccess);
         ASSERT_EQ(code(STWDaemonProcess::send(*client, 5, setGroups)), STWErrorSuccess);
     }
+    fs::path oak;
+    {
+        auto client = daemon.connectAs("com.example.installer", migrator);
+        oak = path(STWDaemonProcess::send(*client, 15, {{"Identifier", STWValue("com.vorlane.oak")}}));
+        ASSERT_EQ(oak, layout.system() / "com.vorlane.oak");
+    }
     makeOlderRelease(daemon, layout);
+    struct stat before {};
+    ASSERT_EQ(stat(oak.c_str(), &before), 0);
     writePlist(layout.library() / "stw_acl2_migration_complete.plist",
                {{"STWMigrationVersionNumber", STWValue("A0")}, {"STWMigrationTime", STWValue("then")}});
     STWValue::Dictionary legacyEntry{
@@ -161,6 +170,11 @@ TEST(STWMigration, AnOlderReleasesDeviceIsBroughtUpToDateOnce) {
     ASSERT_TRUE(daemon.start());
     ASSERT_TRUE(daemon.waitForCleanups(true));
     expectCurrentLayout(daemon, layout);
+    // A well-known container already at its name is left alone (a rename would change it).
+    struct stat after {};
+    ASSERT_EQ(stat(oak.c_str(), &after), 0);
+    EXPECT_EQ(after.st_ctim.tv_nsec, before.st_ctim.tv_nsec);
+    EXPECT_EQ(after.st_ctim.tv_sec, before.st_ctim.tv_sec);
     // Only what the disk-log level of this (non-internal) build keeps moves; the link is
     // not followed, and the old directory goes.
     std::string moved;
