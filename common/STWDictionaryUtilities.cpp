@@ -50,43 +50,8 @@ bool containsDotDotPathComponents(std::string_view path) {
 }
 
 std::optional<std::string> stringWithFileSystemRepresentation(const char* bytes, size_t length) {
-    if (!bytes)
+    if (!bytes || memchr(bytes, 0, length) || !STWIsValidUTF8(std::string_view(bytes, length)))
         return std::nullopt;
-    const auto* p = reinterpret_cast<const unsigned char*>(bytes);
-    size_t i = 0;
-    while (i < length) {
-        unsigned char c = p[i];
-        if (c == 0)
-            return std::nullopt;
-        size_t extra;
-        uint32_t min;
-        if (c < 0x80) {
-            ++i;
-            continue;
-        } else if ((c & 0xe0) == 0xc0) {
-            extra = 1;
-            min = 0x80;
-        } else if ((c & 0xf0) == 0xe0) {
-            extra = 2;
-            min = 0x800;
-        } else if ((c & 0xf8) == 0xf0) {
-            extra = 3;
-            min = 0x10000;
-        } else {
-            return std::nullopt;
-        }
-        if (length - i <= extra)
-            return std::nullopt;
-        uint32_t cp = c & (0x3f >> extra);
-        for (size_t k = 1; k <= extra; ++k) {
-            if ((p[i + k] & 0xc0) != 0x80)
-                return std::nullopt;
-            cp = cp << 6 | (p[i + k] & 0x3f);
-        }
-        if (cp < min || cp > 0x10ffff || (cp >= 0xd800 && cp <= 0xdfff))
-            return std::nullopt;
-        i += extra + 1;
-    }
     return std::string(bytes, length);
 }
 

@@ -421,6 +421,25 @@ std::string serialize(const STWValue& value) {
     return out;
 }
 
+// Text that a write gives back unchanged: UTF-8 (libplist's writer re-encodes every
+// non-ASCII string as UTF-16) without a NUL (strings are handed to it as C strings).
+bool isWritableText(std::string_view text) {
+    return text.find('\0') == std::string_view::npos && STWIsValidUTF8(text);
+}
+
+// Every string and dictionary key below `value`. The depth is what the readers allowed.
+bool isAllWritableText(const STWValue& value) {
+    if (const std::string* text = value.string())
+        return isWritableText(*text);
+    if (const STWValue::Array* array = value.array())
+        return std::all_of(array->begin(), array->end(), isAllWritableText);
+    if (const STWValue::Dictionary* dictionary = value.dictionary())
+        return std::all_of(dictionary->begin(), dictionary->end(), [](const auto& item) {
+            return isWritableText(item.first) && isAllWritableText(item.second);
+        });
+    return true;
+}
+
 } // namespace
 
 namespace STWPropertyList {
@@ -428,11 +447,15 @@ namespace STWPropertyList {
 std::optional<STWValue> parse(std::string_view bytes) {
     if (bytes.empty() || bytes.size() > UINT32_MAX)
         return std::nullopt;
-    if (auto value = _parseBinaryDirectly(bytes))
-        return value;
-    if (BinaryReader().isUnsafeForLibplist(bytes))
+    std::optional<STWValue> value = _parseBinaryDirectly(bytes);
+    if (!value && !BinaryReader().isUnsafeForLibplist(bytes))
+        value = _parseWithLibplist(bytes);
+    // Both routes hand over the bytes of a string as they are (an "ASCII" one with any
+    // bytes, an XML one with NULs): such a string would come back changed from the next
+    // write of the file, so the file is no property list of ours.
+    if (value && !isAllWritableText(*value))
         return std::nullopt;
-    return _parseWithLibplist(bytes);
+    return value;
 }
 
 std::optional<STWValue> _parseBinaryDirectly(std::string_view bytes) {

@@ -18,7 +18,9 @@ namespace STWPropertyList {
 // Parses XML or binary property-list bytes; nullopt when they are not a property list.
 // Binary property lists of the common kinds are read directly; everything else goes
 // through libplist, whose answer is the reference, except binary ones with a malformed
-// trailer or a string that holds a NUL, which could abort libplist and are refused.
+// trailer or a string that holds a NUL, which could abort libplist and are refused. A
+// string or key that is not UTF-8 or holds a NUL makes the whole list refused: it would
+// not survive being written back.
 std::optional<STWValue> parse(std::string_view bytes);
 // The two routes of parse(), for the tests and the fuzzer that hold them to each other:
 // the direct reader of binary property lists (nullopt when it declines the bytes) and

@@ -367,3 +367,41 @@ const STWValue::Dictionary* STWDictionaryDictionary(const STWValue::Dictionary& 
     const STWValue* v = STWDictionaryFind(dictionary, key);
     return v ? v->dictionary() : nullptr;
 }
+
+bool STWIsValidUTF8(std::string_view text) {
+    const auto* p = reinterpret_cast<const unsigned char*>(text.data());
+    size_t length = text.size();
+    size_t i = 0;
+    while (i < length) {
+        unsigned char c = p[i];
+        size_t extra;
+        uint32_t min;
+        if (c < 0x80) {
+            ++i;
+            continue;
+        } else if ((c & 0xe0) == 0xc0) {
+            extra = 1;
+            min = 0x80;
+        } else if ((c & 0xf0) == 0xe0) {
+            extra = 2;
+            min = 0x800;
+        } else if ((c & 0xf8) == 0xf0) {
+            extra = 3;
+            min = 0x10000;
+        } else {
+            return false;
+        }
+        if (length - i <= extra)
+            return false;
+        uint32_t cp = c & (0x3f >> extra);
+        for (size_t k = 1; k <= extra; ++k) {
+            if ((p[i + k] & 0xc0) != 0x80)
+                return false;
+            cp = cp << 6 | (p[i + k] & 0x3f);
+        }
+        if (cp < min || cp > 0x10ffff || (cp >= 0xd800 && cp <= 0xdfff))
+            return false;
+        i += extra + 1;
+    }
+    return true;
+}

@@ -143,6 +143,10 @@ const std::string* STWDictionaryString(const STWValue::Dictionary& dictionary, s
 const STWValue::Dictionary* STWDictionaryDictionary(const STWValue::Dictionary& dictionary,
                                                     std::string_view key);
 
+// Text is UTF-8 throughout the daemon: true when `text` is well-formed UTF-8 (shortest
+// forms, no surrogates, nothing above U+10FFFF).
+bool STWIsValidUTF8(std::string_view text);
+
 template <>
 struct std::hash<STWValue> {
     size_t operator()(const STWValue& v) const { return v.hash(); }

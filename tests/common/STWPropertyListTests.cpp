@@ -70,6 +70,17 @@ TEST(STWPropertyList, CorruptAndTruncatedBytesAreRefused) {
     for (size_t cut : {binary.size() / 2, binary.size() - 1, size_t(9)})
         EXPECT_FALSE(STWPropertyList::parse(binary.substr(0, cut))) << cut;
     EXPECT_FALSE(STWPropertyList::parse(xml.substr(0, xml.size() / 2)));
+    // A string (value or key) that is not UTF-8 or holds a NUL would not come back the same
+    // from the next write of the file.
+    for (bool inKey : {false, true}) {
+        std::string patched = STWPropertyList::serializeBinary(STWValue(
+            STWValue::Dictionary{{inKey ? "qqqq" : "k", STWValue(inKey ? "v" : "qqqq")}}));
+        patched.replace(patched.find("qqqq"), 4, "\xffq\xfeq");
+        EXPECT_FALSE(STWPropertyList::parse(patched)) << inKey;
+    }
+    std::string withNul = STWPropertyList::serializeXML(STWValue(STWValue::Dictionary{{"k", STWValue("aqqqqb")}}));
+    withNul.replace(withNul.find("qqqq"), 4, std::string("\0\0\0\0", 4));
+    EXPECT_FALSE(STWPropertyList::parse(withNul));
 }
 
 // An atomic write replaces the file whole or, failing (here no file may grow past 0 bytes
