@@ -52,11 +52,19 @@ inline constexpr const char* protectionAfterRecord = "protection.after-record";
 inline constexpr std::array<std::string_view, 3> protection = {protectionAfterUpdateFile, protectionAfterWalk,
                                                                protectionAfterRecord};
 
-inline constexpr std::array<std::string_view, 13> all = {
+// The build-upgrade migration of the first start after power-on: the old bundle directory
+// renamed into the global layout; a well-known system container renamed to its well-known
+// name, the cache not yet told.
+inline constexpr const char* migrationAfterBundleMove = "migration.after-bundle-move";
+inline constexpr const char* migrationAfterWellKnownMove = "migration.after-well-known-move";
+
+inline constexpr std::array<std::string_view, 2> migration = {migrationAfterBundleMove, migrationAfterWellKnownMove};
+
+inline constexpr std::array<std::string_view, 15> all = {
     createAfterStaging, createAfterRename,   createBeforeCacheAdd, deathRowAfterTemporaryDirectory,
     deathRowAfterFirstItem, deleteAfterStaging, replaceAfterJournal, replaceAfterPark,
     replaceAfterMove,   replaceBeforeCleanup, protectionAfterUpdateFile, protectionAfterWalk,
-    protectionAfterRecord};
+    protectionAfterRecord, migrationAfterBundleMove, migrationAfterWellKnownMove};
 
 extern std::atomic<bool> armed;
 void _reached(const char* name);

@@ -2,11 +2,13 @@
 // system's build changed since the daemon last recorded it, the migration that runs once
 // it did, and the record of the current build.
 //
-// Migration installs its implementation at start (install()); the first-boot setup of
-// STWClientConnection calls installed(). Until one is installed nothing can tell an
-// upgrade, so every start counts as none (said once at debug level). install() runs before
-// the first-boot setup and installed() from it, on the main thread during start-up;
-// both are safe from any thread.
+// Lifecycle sits below Migration, so the migrator fills this seam rather than being called
+// by name: stowlyd's start-up installs its implementation
+// (STWContainerMigrator::installBuildUpgrade(), which answers from the system migration
+// status store) before the first-boot setup of STWClientConnection calls installed().
+// Where none is installed (a process that runs the setup without the migrator) nothing can
+// tell an upgrade, so every start counts as none (said at debug level). install() and
+// installed() are safe from any thread.
 #pragma once
 
 #include "common/STWError.h"

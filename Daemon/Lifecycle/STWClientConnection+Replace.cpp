@@ -38,21 +38,6 @@ STWFormatArg pathOrNil(const std::filesystem::path& path) {
     return path.empty() ? STWFormatArg(nullptr) : STWFormatArg(path);
 }
 
-// Moves the container directory of `record` to `to`: only the directory that holds the
-// record's own metadata file, and nothing on the way followed.
-bool moveContainerDirectory(const STWMetadata& record, const std::filesystem::path& to,
-                            STWFileManagerMoveOptions options, STWErrorRef* error) {
-    auto fileManager = STWFileManager::defaultManager();
-    STWFileDescriptor fromParent;
-    STWFileDescriptor directory = record.openContainerDirectory(error, &fromParent);
-    if (!directory)
-        return false;
-    STWFileDescriptor toParent = fileManager->openDirectoryAtURL(
-        to.parent_path(), STWTrustedAncestorForClass(record.userIdentity(), record.containerClass()), error);
-    return toParent && fileManager->moveDirectoryAt(fromParent.get(), record.url().filename(), toParent.get(),
-                                                    to.filename(), directory.get(), options, record.url(), to, error);
-}
-
 } // namespace
 
 bool STWClientConnection::replaceContainerIdentity(const STWConcreteContainerIdentityRef& oldIdentity,
@@ -153,7 +138,7 @@ bool STWClientConnection::replaceContainerIdentity(const STWConcreteContainerIde
                 return fail(_codeOfError(stepError));
             }
             STW_CRASH_POINT(STWCrashPoint::replaceAfterJournal);
-            if (!moveContainerDirectory(*oldRecord, staging, STWFileManagerMoveSyncDirectories, &stepError)) {
+            if (!oldRecord->moveContainerDirectory(staging, STWFileManagerMoveSyncDirectories, &stepError)) {
                 STW_ERROR(STWErrorMoveToStagingFailed, stepError, "Failed to move old %@ to staging %@",
                           oldRecord->url(), staging);
                 return fail(STWErrorMoveToStagingFailed);
@@ -185,7 +170,7 @@ bool STWClientConnection::replaceContainerIdentity(const STWConcreteContainerIde
             rewritten = directory && replacement->writeMetadataToContainerDirectory(directory.get(), &stepError);
         }
         if (!rewritten ||
-            !moveContainerDirectory(*replacement, destination, STWFileManagerMoveSyncDirectories, &stepError)) {
+            !replacement->moveContainerDirectory(destination, STWFileManagerMoveSyncDirectories, &stepError)) {
             STW_ERROR(STWErrorReplaceFailed, stepError, "Failed to replace: %@ with: %@ at: %@",
                       oldRecord ? STWFormatArg(oldRecord->url()) : STWFormatArg(nullptr), newRecord->url(),
                       destination);

@@ -4,10 +4,14 @@
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Model/STWUserIdentityCache.h"
 #include "common/STWDictionaryUtilities.h"
+#include "common/STWFileIO.h"
 #include "common/STWLog.h"
+#include "common/STWPropertyList.h"
 #include "platform/STWPlatformConfiguration.h"
 
 #include <cerrno>
+#include <fcntl.h>
+#include <sys/stat.h>
 #include <utility>
 
 namespace fs = std::filesystem;
@@ -42,28 +46,65 @@ std::shared_ptr<STWMigrationStatus> STWMigrationStatus::initForSystemMigration()
 std::shared_ptr<STWMigrationStatus> STWMigrationStatus::initForMobileUserMigration() {
     auto userConfiguration = STWGlobalConfiguration::sharedInstance()->getPerUserConfigurationForUserIdentity(
         STWUserIdentityCache::defaultUserIdentity());
-    auto status = std::make_shared<STWMigrationStatus>(userConfiguration->libraryDirectory() / userFileName, false);
+    auto status = std::make_shared<STWMigrationStatus>(userConfiguration->libraryDirectory() / userFileName, false,
+                                                       userConfiguration->userHomeDirectory());
     if (!status->migrationInfo())
         STW_LOG_ERROR(kCategory, "Error reading user migration file from disk.  This is bad");
     return status;
 }
 
-STWMigrationStatus::STWMigrationStatus(fs::path url, bool foldMarkerFiles) : _migrationFileURL(std::move(url)) {
+STWMigrationStatus::STWMigrationStatus(fs::path url, bool foldMarkerFiles, fs::path trustedAncestor)
+    : _migrationFileURL(std::move(url)), _trustedAncestor(std::move(trustedAncestor)) {
     STWLockGuard guard(_fileLock);
-    _migrationInfo = readMigrationInfo(_migrationFileURL);
+    _migrationInfo = readMigrationInfo(_migrationFileURL, _trustedAncestor);
     if (foldMarkerFiles && _migrationInfo && _migrationInfo->empty())
         _foldMarkerFiles();
 }
 
-std::optional<STWValue::Dictionary> STWMigrationStatus::readMigrationInfo(const fs::path& url) {
+std::optional<STWValue::Dictionary> STWMigrationStatus::readMigrationInfo(const fs::path& url,
+                                                                          const fs::path& trustedAncestor) {
+    // The directory is opened without following a link below the ancestor, the file
+    // without following one or blocking on a FIFO, and only a regular file is read.
+    auto fileManager = STWFileManager::defaultManager();
     STWErrorRef error;
-    auto info = STW_dictionaryWithContentsOfURL(url, 0, &error);
-    if (info)
-        return info;
-    if (error && error->isPOSIX(ENOENT))
+    std::string bytes;
+    if (fileManager->itemDoesNotExistAtURL(url))
         return STWValue::Dictionary{};
+    STWFileDescriptor directory = fileManager->openDirectoryAtURL(url.parent_path(), trustedAncestor, &error);
+    if (directory) {
+        STWFileDescriptor file(
+            openat(directory.get(), url.filename().c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+        struct stat st;
+        int e = !file                           ? errno
+                : fstat(file.get(), &st) != 0   ? errno
+                : !S_ISREG(st.st_mode)          ? EINVAL
+                                                : STWReadDescriptorContents(file.get(), st.st_size, &bytes);
+        if (e == ENOENT)
+            return STWValue::Dictionary{};
+        if (e)
+            error = STW_POSIX_ERROR_NOLOG(e, "Could not read property list at %@", url);
+    }
+    std::optional<STWValue> root = error ? std::nullopt : STWPropertyList::parse(bytes);
+    if (root && root->isDictionary())
+        return std::move(*root->mutableDictionary());
+    if (!error)
+        error = STWErrorCreate(STWGenericErrorDomain, STWGenericErrorCorruptFile, __func__, __LINE__, nullptr, false,
+                               "Property list at %@ is corrupt", url);
     STW_LOG_ERROR(kCategory, "Failed to read migration status file at %@ : %@", url, error);
     return std::nullopt;
+}
+
+bool STWMigrationStatus::_writeMigrationInfo(STWErrorRef* error) {
+    auto fileManager = STWFileManager::defaultManager();
+    fs::path parent = _migrationFileURL.parent_path();
+    STWFileDescriptor directory = fileManager->openDirectoryAtURL(parent, _trustedAncestor, error);
+    if (!directory)
+        return false;
+    // Written beside the file, synced, and renamed over it: a power cut leaves one or the other.
+    auto temporary = fileManager->writeTemporaryFileAt(
+        directory.get(), STWPropertyList::serializeBinary(STWValue(*_migrationInfo)), 0644, parent, error);
+    return temporary && fileManager->replaceFileAt(directory.get(), *temporary, _migrationFileURL.filename(), false,
+                                                   nullptr, _migrationFileURL, error);
 }
 
 void STWMigrationStatus::_foldMarkerFiles() {
@@ -79,7 +120,7 @@ void STWMigrationStatus::_foldMarkerFiles() {
             STW_LOG_ERROR(kCategory, "Failed to read migration marker file at %@ : %@", directory / name, error);
     }
     STWErrorRef writeError;
-    if (!STW_writeToURL(*_migrationInfo, _migrationFileURL, STWWriteAtomic | STWWriteDurable, &writeError)) {
+    if (!_writeMigrationInfo(&writeError)) {
         // The markers stay: the next start folds them again.
         STW_LOG_ERROR(kCategory, "Failed to write migration status on %@ for %@ : %@", currentBuildVersion(),
                       "marker files", writeError);
@@ -106,36 +147,40 @@ bool STWMigrationStatus::hasMigrationOccurredForType(const std::string& type) {
 }
 
 template <class Change>
-void STWMigrationStatus::_update(const std::string& what, Change&& change) {
+bool STWMigrationStatus::_update(const std::string& what, Change&& change) {
     STWLockGuard guard(_fileLock);
     // Another store object over the same file may have recorded something since we read.
-    if (auto current = readMigrationInfo(_migrationFileURL))
-        _migrationInfo = std::move(current);
-    if (!_migrationInfo) {
+    auto current = readMigrationInfo(_migrationFileURL, _trustedAncestor);
+    if (!current) {
         // An unreadable store is left as it is for someone to look at; the migrations it
         // should have recorded run again next time, which they are made to survive.
         STW_LOG_ERROR(kCategory, "Failed to write migration status on %@ for %@ : %@", currentBuildVersion(), what,
                       "the status file is unreadable");
-        return;
+        return false;
     }
+    _migrationInfo = std::move(current);
     change(*_migrationInfo);
     STWErrorRef error;
-    if (!STW_writeToURL(*_migrationInfo, _migrationFileURL, STWWriteAtomic | STWWriteDurable, &error))
+    if (!_writeMigrationInfo(&error)) {
         STW_LOG_ERROR(kCategory, "Failed to write migration status on %@ for %@ : %@", currentBuildVersion(), what,
                       error);
+        return false;
+    }
+    return true;
 }
 
 void STWMigrationStatus::setMigrationCompleteForType(const std::string& type) {
     std::string build = currentBuildVersion();
-    _update(type, [&](STWValue::Dictionary& info) {
+    bool written = _update(type, [&](STWValue::Dictionary& info) {
         info[type] = STWValue::Dictionary{{versionNumberKey, build}, {timeKey, STWDate::now().description()}};
     });
-    STW_LOG_NOTICE(kCategory, "Migration completed on %@ for %@", build, type);
+    if (written)
+        STW_LOG_NOTICE(kCategory, "Migration completed on %@ for %@", build, type);
 }
 
 void STWMigrationStatus::writeCurrentBuildInfoToDisk() {
-    _update(lastBuildInfoKey, [](STWValue::Dictionary& info) { info[lastBuildInfoKey] = currentBuildInfo(); });
-    STW_LOG_NOTICE(kCategory, "Saved last build version of %@", currentBuildVersion());
+    if (_update(lastBuildInfoKey, [](STWValue::Dictionary& info) { info[lastBuildInfoKey] = currentBuildInfo(); }))
+        STW_LOG_NOTICE(kCategory, "Saved last build version of %@", currentBuildVersion());
 }
 
 bool STWMigrationStatus::isBuildUpgrade() {

@@ -217,6 +217,8 @@ bool STWGlobalConfiguration::isInternalImage() {
     return *_isInternalImage;
 }
 
+int STWGlobalConfiguration::diskLogLevel() { return isInternalImage() ? 4 : 1; }
+
 void STWGlobalConfiguration::setIsInternalImage(bool internal) {
     std::lock_guard guard(_lock);
     _isInternalImage = internal;

@@ -55,6 +55,8 @@ public:
 
     bool isInternalImage();
     void setIsInternalImage(bool internal);
+    // How many rotated log files are kept beside stowlyd.log: 1, or 4 on internal builds.
+    int diskLogLevel();
     uid_t currentMobileUserId() const { return _currentMobileUserId; }
     gid_t currentMobileGroupId() const { return _currentMobileGroupId; }
 

@@ -135,6 +135,19 @@ STWFileDescriptor STWMetadata::openContainerDirectory(STWErrorRef* error, STWFil
     return fd;
 }
 
+bool STWMetadata::moveContainerDirectory(const std::filesystem::path& to, unsigned options, STWErrorRef* error) const {
+    auto fileManager = STWFileManager::defaultManager();
+    STWFileDescriptor fromParent;
+    STWFileDescriptor directory = openContainerDirectory(error, &fromParent);
+    if (!directory)
+        return false;
+    STWFileDescriptor toParent = fileManager->openDirectoryAtURL(
+        to.parent_path(), STWTrustedAncestorForClass(_userIdentity, _containerClass), error);
+    return toParent && fileManager->moveDirectoryAt(fromParent.get(), url().filename(), toParent.get(), to.filename(),
+                                                    directory.get(), static_cast<STWFileManagerMoveOptions>(options),
+                                                    url(), to, error);
+}
+
 bool STWMetadata::writeMetadataToDiskWithError(STWErrorRef* error) {
     if (_fileInode == 0)
         return writeMetadataToFileURL(url() / fileName, error);

@@ -78,6 +78,10 @@ public:
     // record was read from (the app replaced its container). `classDirectory`, when given,
     // gets the descriptor of the directory that holds it.
     STWFileDescriptor openContainerDirectory(STWErrorRef* error, STWFileDescriptor* classDirectory = nullptr) const;
+    // Renames the container directory to `to`, never over an existing item: only the
+    // directory that holds this record's own file, and nothing on the way followed.
+    // `options` are STWFileManagerMoveOptions (the rename's durability).
+    bool moveContainerDirectory(const std::filesystem::path& to, unsigned options, STWErrorRef* error) const;
 
     static std::shared_ptr<STWMetadata> readAndValidateMetadataAtUrl(const std::filesystem::path& containerURL,
                                                                      const STWUserIdentityRef& forUserIdentity,

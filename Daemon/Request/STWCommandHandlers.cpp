@@ -15,28 +15,6 @@
 
 namespace STWCommandHandlers {
 
-namespace {
-
-// The operation behind a command that this build does not carry yet: the caller gets
-// "unsupported", never a pretended success.
-void _operationNotInThisBuild(const char* command, uint64_t* error) {
-    STW_LOG_DEBUG(STWLogCategory::Tolvan, "%s: the operation is not part of this build", command);
-    *error = STWErrorUnsupportedCommand;
-}
-
-} // namespace
-
-#define STW_COMMAND_NOT_IN_THIS_BUILD(name)                                                                  \
-    STW_COMMAND_HANDLER(name) {                                                                              \
-        (void)request;                                                                                       \
-        (void)reply;                                                                                         \
-        (void)connection;                                                                                    \
-        _operationNotInThisBuild(#name, error);                                                              \
-    }
-
-STW_COMMAND_NOT_IN_THIS_BUILD(performDataMigration)
-STW_COMMAND_NOT_IN_THIS_BUILD(performPerUserDataMigration)
-
 STW_COMMAND_HANDLER(createOrLookupContainer) {
     auto identity = STWRequestDecoder::classValidatedIdentity(request, connection, true, error);
     if (!identity)

@@ -3,6 +3,7 @@
 #include "Daemon/FileSystem/STWFaultInjection.h"
 #include "Daemon/Lifecycle/STWDaemonQueues.h"
 #include "Daemon/Lifecycle/STWTestLocks.h"
+#include "Daemon/Migration/STWContainerMigrator.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Request/STWClientConnection.h"
 #include "Daemon/Request/STWRequestDispatcher.h"
@@ -140,13 +141,14 @@ void STWDaemon::_onceInitialization() {
     std::filesystem::path logFile = globalConfiguration->logDirectory() / "stowlyd.log";
     STWLog::openLogFile(logFile, "com.vorlane.stowlyd", STWLogLevel::Notice);
     bool internal = globalConfiguration->isInternalImage();
-    STWLog::enableFileWriting(internal ? 4 : 1, internal ? 262144 : 102400);
+    STWLog::enableFileWriting(globalConfiguration->diskLogLevel(), internal ? 262144 : 102400);
     STW_LOG_FN("stowlyd_init", STWLogLevel::Debug, STWLogCategory::Startup, "stowlyd built at %s %s started", __DATE__,
                __TIME__);
 
     if (!STWDaemonQueues::deathRow() || !STWDaemonQueues::lockState())
         STW_FATAL("Can't create dispatch queues.");
     const auto& connection = STWClientConnection::sharedClientConnection();
+    STWContainerMigrator::installBuildUpgrade();
 
     std::string semaphoreName = STWPlatformConfiguration::sharedInstance()->firstBootSemaphoreName();
     sem_t* semaphore = sem_open(semaphoreName.c_str(), 0);
@@ -164,6 +166,7 @@ void STWDaemon::_onceInitialization() {
     signpost("BootSetup", true);
     connection->stowlySetup();
     signpost("BootSetup", false);
+    STWContainerMigrator::logRecordedMigrations();
 
     bool upcallServerStarted = false;
     std::call_once(upcallServerToken, [&] { upcallServerStarted = STWKernServerStart(); });

@@ -176,6 +176,9 @@ TEST(STWBootCrash, EveryCrashPointIsRepairedByTheNextStart) {
     std::set<std::string> acknowledged;
     unsigned n = 0;
     for (std::string_view point : STWCrashPoint::all) {
+        // Only a build upgrade reaches those (STWMigrationTests).
+        if (point.starts_with("migration."))
+            continue;
         SCOPED_TRACE(std::string(point));
         ASSERT_TRUE(daemon.stop());
         ASSERT_TRUE(daemon.startWith("STOWLY_CRASH_AT", std::string(point)));

@@ -63,6 +63,8 @@ STWDaemonProcess::STWDaemonProcess(STWValue::Dictionary settings, STWValue::Arra
     std::ofstream(_root / "etc/passwd") << "root:x:0:0:root:/private/var/root:/bin/sh\n"
                                            "mobile:x:501:501:Mobile:/private/var/mobile:/bin/sh\n";
     std::ofstream(_root / "etc/group") << "root:x:0:\nmobile:x:501:\nsystemusers:x:950:mobile\n";
+    // A system that names no build is taken to be upgraded at every power-on.
+    std::ofstream(_root / "etc/os-release") << "BUILD_ID=stowly-test\n";
     if (!STW_writeToURL(settings, _root / "etc/stowly/stowlyd.plist", STWWriteAtomic, nullptr))
         abort();
     if (!personas.empty() && STWWriteFileAtomically(_root / "etc/stowly/personas.plist",

@@ -1,6 +1,7 @@
 // A real stowlyd on a private root prefix of its own, for the end-to-end tests and the
 // benchmarks, which talk to it over its socket as a client would. The root has an
-// etc/passwd with the "mobile" user (501) and a "systemusers" group; the daemon is stopped
+// etc/passwd with the "mobile" user (501), a "systemusers" group and an etc/os-release
+// naming one build (so that only the first power-on is a build upgrade); the daemon is stopped
 // with SIGTERM, its first-boot semaphore unlinked and the root removed at the end.
 //
 // The root outlives the daemon, so a caller can lay out containers before the first start
