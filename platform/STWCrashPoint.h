@@ -52,11 +52,15 @@ inline constexpr const char* protectionAfterRecord = "protection.after-record";
 inline constexpr std::array<std::string_view, 3> protection = {protectionAfterUpdateFile, protectionAfterWalk,
                                                                protectionAfterRecord};
 
-inline constexpr std::array<std::string_view, 13> all = {
+// A code-signing update: the entry stored, the group containers it no longer names not yet
+// sent to death row.
+inline constexpr const char* codeSigningAfterUpdate = "codesigning.after-update";
+
+inline constexpr std::array<std::string_view, 14> all = {
     createAfterStaging, createAfterRename,   createBeforeCacheAdd, deathRowAfterTemporaryDirectory,
     deathRowAfterFirstItem, deleteAfterStaging, replaceAfterJournal, replaceAfterPark,
     replaceAfterMove,   replaceBeforeCleanup, protectionAfterUpdateFile, protectionAfterWalk,
-    protectionAfterRecord};
+    protectionAfterRecord, codeSigningAfterUpdate};
 
 extern std::atomic<bool> armed;
 void _reached(const char* name);
