@@ -430,10 +430,19 @@ void STWTortureWorker::_setCodeSigning(STWClient& client, const std::string& own
 void STWTortureWorker::_groups(STWClient& client, const std::string& owner) {
     STWValue::Dictionary reply;
     uint64_t code = 0;
-    if (_send("groups", client, {{"Command", STWValue(13u)}, {"Identifier", STWValue(owner)}}, &reply, &code) !=
-        Outcome::Acknowledged)
-        return;
     const auto& entry = model.owners[owner];
+    if (_send("groups", client, {{"Command", STWValue(13u)}, {"Identifier", STWValue(owner)}}, &reply, &code) !=
+        Outcome::Acknowledged) {
+        // Any group the entry names may have been made.
+        std::set<std::string> named = entry.groups;
+        named.insert(entry.possible.begin(), entry.possible.end());
+        for (const auto& group : named) {
+            _note({7, group}, "groups of " + owner + ": no answer");
+            model.containers.emplace(STWTortureIdentity{7, group}, STWTortureExpectation::absent())
+                .first->second.mayBePresent = true;
+        }
+        return;
+    }
     const STWValue::Dictionary* paths = STWDictionaryDictionary(reply, "ReplyGroupContainerDict");
     std::set<std::string> answered;
     for (const auto& [group, path] : paths ? *paths : STWValue::Dictionary{}) {
@@ -473,8 +482,10 @@ void STWTortureWorker::_upcall(STWUpcallClient& upcalls, const std::string& app)
             _connectionDead = _connectionDead || !error || !error->isPOSIX(ETIMEDOUT);
         ++uncertain["upcall"];
         // Each container named may have been made; none was removed.
-        for (const auto& identity : named)
+        for (const auto& identity : named) {
+            _note(identity, "upcall: no answer");
             model.containers.emplace(identity, STWTortureExpectation::absent()).first->second.mayBePresent = true;
+        }
         return;
     }
     ++acknowledged["upcall"];
