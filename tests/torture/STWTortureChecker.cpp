@@ -8,6 +8,7 @@
 #include <plist/plist.h>
 #include <sstream>
 #include <sys/stat.h>
+#include <sys/xattr.h>
 #include <thread>
 #include <unistd.h>
 
@@ -178,6 +179,10 @@ STWTortureChecker::_readContainer(uint64_t containerClass, const std::string& di
         c.info = integerOf(info, infoKey).value_or(-1);
         c.protection = integerOf(info, protectionInfoKey).value_or(-1);
     }
+    int32_t documentsClass = 0;
+    if (getxattr((path + "/Documents").c_str(), "trusted.stowly.protection-class", &documentsClass,
+                 sizeof documentsClass) == sizeof documentsClass)
+        c.documentsClass = documentsClass;
     return c;
 }
 
@@ -240,6 +245,13 @@ std::vector<std::string> STWTortureChecker::check(const std::vector<STWTortureMo
     std::vector<std::string> violations = _scan();
     for (auto& v : _leftovers(deathRowWait))
         violations.push_back(std::move(v));
+
+    // A recorded class is the one its data was given: a change records it only after the walk.
+    for (const auto& [identity, c] : _found)
+        if (identity.first == 2 && c.protection >= 0 && c.documentsClass != c.protection)
+            violations.push_back(identityText(identity) + " records protection class " +
+                                 std::to_string(c.protection) + ", its Documents has class " +
+                                 std::to_string(c.documentsClass));
 
     for (STWTortureModel* model : models) {
         for (auto& [identity, expected] : model->containers) {

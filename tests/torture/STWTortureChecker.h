@@ -27,6 +27,7 @@ public:
         std::string path;
         int64_t info = -1;       // the torture's info value, -1 when none
         int64_t protection = -1; // the recorded protection class, -1 when none
+        int64_t documentsClass = -1; // the protection class of its Documents, -1 when none
     };
 
     explicit STWTortureChecker(std::filesystem::path root) : _root(std::move(root)) {}

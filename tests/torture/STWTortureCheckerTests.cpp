@@ -22,7 +22,7 @@ struct Root {
     // A container directory with a metadata file as the daemon writes it; its directory is
     // named by the container's UUID unless told otherwise.
     std::string container(uint64_t containerClass, const std::string& identifier, const std::string& uuid,
-                          int64_t info = -1, std::string directoryName = {}) {
+                          int64_t info = -1, std::string directoryName = {}, int64_t protection = -1) {
         fs::path directory = path / STWTortureChecker::classDirectory(containerClass) /
                              (directoryName.empty() ? uuid : directoryName);
         fs::create_directories(directory);
@@ -30,9 +30,13 @@ struct Root {
         plist_dict_set_item(dict, "STWMetadataIdentifier", plist_new_string(identifier.c_str()));
         plist_dict_set_item(dict, "STWMetadataUUID", plist_new_string(uuid.c_str()));
         plist_dict_set_item(dict, "STWMetadataContentClass", plist_new_uint(containerClass));
-        if (info >= 0) {
+        if (info >= 0 || protection >= 0) {
             plist_t infoDict = plist_new_dict();
-            plist_dict_set_item(infoDict, STWTortureChecker::infoKey, plist_new_uint(info));
+            if (info >= 0)
+                plist_dict_set_item(infoDict, STWTortureChecker::infoKey, plist_new_uint(info));
+            if (protection >= 0)
+                plist_dict_set_item(infoDict, "com.vorlane.Setwright.ContentProtectionClass",
+                                    plist_new_uint(protection));
             plist_dict_set_item(dict, "STWMetadataInfo", infoDict);
         }
         char* xml = nullptr;
@@ -91,6 +95,8 @@ TEST(STWTortureChecker, ReportsEveryKindOfDamage) {
     fs::create_directories(root.path / STWTortureChecker::classDirectory(2) / "66666666-6666-6666-6666-666666666666");
     root.container(7, "group.orphan", A);
     std::string deleted = root.container(1, "com.example.deleted", C);
+    // A class recorded while the data still has another (no class at all, here).
+    root.container(2, "com.example.protected", "77777777-7777-7777-7777-777777777777", -1, {}, 3);
     fs::create_directories(root.path / "private/var/root/Library/Stowly/Replace");
     std::ofstream(root.path / "private/var/root/Library/Stowly/Replace/journal") << "x";
     fs::create_directories(root.path / "private/var/root/Library/Caches/com.vorlane.stowlyd/Dead/temp.1");
@@ -116,7 +122,8 @@ TEST(STWTortureChecker, ReportsEveryKindOfDamage) {
     EXPECT_TRUE(mentions(violations, "group container"));
     EXPECT_TRUE(mentions(violations, "replace journal left"));
     EXPECT_TRUE(mentions(violations, "death row entry left"));
+    EXPECT_TRUE(mentions(violations, "records protection class 3, its Documents has class -1"));
     auto mappings = checker.checkMappings({{2, "com.example.moved"}, {12, "com.example.system"}});
     EXPECT_TRUE(mentions(mappings, "points at /elsewhere"));
-    EXPECT_EQ(violations.size(), 10u);
+    EXPECT_EQ(violations.size(), 11u);
 }
