@@ -5,6 +5,7 @@
 
 #include <cerrno>
 #include <cstdlib>
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -108,6 +109,25 @@ int STWWriteFileAtomically(const std::filesystem::path& path, std::string_view c
         return e;
     }
     return syncDirectory ? STWSyncDirectory(directory) : 0;
+}
+
+int STWRemoveAbandonedAtomicWrites(const std::filesystem::path& directory) {
+    DIR* listing = opendir(directory.c_str());
+    if (!listing)
+        return errno == ENOENT ? 0 : -errno;
+    int removed = 0;
+    while (dirent* entry = readdir(listing)) {
+        // "." + the name it was to get + "." + mkostemp's six characters.
+        std::string_view name = entry->d_name;
+        if (name.size() < 9 || name[0] != '.' || name[name.size() - 7] != '.')
+            continue;
+        struct stat st;
+        if (fstatat(dirfd(listing), entry->d_name, &st, AT_SYMLINK_NOFOLLOW) == 0 && S_ISREG(st.st_mode) &&
+            unlinkat(dirfd(listing), entry->d_name, 0) == 0)
+            ++removed;
+    }
+    closedir(listing);
+    return removed;
 }
 
 int STWSyncDirectory(const std::filesystem::path& directory) {

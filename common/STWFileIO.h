@@ -34,6 +34,13 @@ int STWWriteAll(int fd, std::string_view contents);
 int STWWriteFileAtomically(const std::filesystem::path& path, std::string_view contents, mode_t mode,
                            bool syncDirectory);
 
+// Removes what writes through STWWriteFileAtomically left in `directory` when their process
+// died between making the temporary file and renaming it: regular files named
+// ".NAME.XXXXXX". Only for a directory whose writers are not running (a start sweeping the
+// markers of the last run). Answers how many went, or -errno when the directory cannot be
+// read; one that does not exist holds none.
+int STWRemoveAbandonedAtomicWrites(const std::filesystem::path& directory);
+
 // Writes in place (create or truncate); fsyncs the file when `sync` is set.
 int STWWriteFile(const std::filesystem::path& path, std::string_view contents, mode_t mode, bool sync);
 

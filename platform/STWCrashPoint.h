@@ -60,11 +60,15 @@ inline constexpr const char* migrationAfterWellKnownMove = "migration.after-well
 
 inline constexpr std::array<std::string_view, 2> migration = {migrationAfterBundleMove, migrationAfterWellKnownMove};
 
-inline constexpr std::array<std::string_view, 15> all = {
+// A code-signing update: the entry stored, the group containers it no longer names not yet
+// sent to death row.
+inline constexpr const char* codeSigningAfterUpdate = "codesigning.after-update";
+
+inline constexpr std::array<std::string_view, 16> all = {
     createAfterStaging, createAfterRename,   createBeforeCacheAdd, deathRowAfterTemporaryDirectory,
     deathRowAfterFirstItem, deleteAfterStaging, replaceAfterJournal, replaceAfterPark,
     replaceAfterMove,   replaceBeforeCleanup, protectionAfterUpdateFile, protectionAfterWalk,
-    protectionAfterRecord, migrationAfterBundleMove, migrationAfterWellKnownMove};
+    protectionAfterRecord, migrationAfterBundleMove, migrationAfterWellKnownMove, codeSigningAfterUpdate};
 
 extern std::atomic<bool> armed;
 void _reached(const char* name);

@@ -6,6 +6,7 @@
 #include "Daemon/Lifecycle/STWContainerCache.h"
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Request/STWClientConnection.h"
+#include "common/STWFileIO.h"
 #include "common/STWLog.h"
 #include "platform/STWCrashPoint.h"
 
@@ -135,6 +136,9 @@ void STWDataProtectionManager::_startDataProtectionChangeOperation(
 
 bool STWDataProtectionManager::restartPendingDataProtectionOperationsWithError(STWErrorRef* error) {
     std::filesystem::path directory = STWGlobalConfiguration::sharedInstance()->pendingUpdatesDirectory();
+    // An update file cut short while it was being written: its change never began.
+    if (int removed = STWRemoveAbandonedAtomicWrites(directory); removed > 0)
+        STW_LOG_NOTICE(STWLogCategory::Lifecycle, "Removed %d unfinished update files in %@", removed, directory);
     STWErrorRef listError;
     auto files = STWFileManager::defaultManager()->urlsForItemsInDirectoryAtURL(directory, &listError);
     if (!files) {

@@ -12,6 +12,7 @@
 #include "Daemon/STWLocks.h"
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWException.h"
+#include "common/STWFileIO.h"
 #include "common/STWFormat.h"
 #include "common/STWLog.h"
 #include "platform/STWCrashPoint.h"
@@ -293,6 +294,10 @@ STWClientConnection::_readAndValidateReplaceFileAtUrl(const std::filesystem::pat
 bool STWClientConnection::_recoverFromReplaceOperationsWithError(STWErrorRef* error) {
     auto fileManager = STWFileManager::defaultManager();
     std::filesystem::path directory = STWGlobalConfiguration::sharedInstance()->replaceDirectory();
+    // A journal cut short while it was being written never named anything that moved; its
+    // temporary file is hidden from the listing below and would stay for good.
+    if (int removed = STWRemoveAbandonedAtomicWrites(directory); removed > 0)
+        STW_LOG_NOTICE(STWLogCategory::Lifecycle, "Removed %d unfinished replace journals in %@", removed, directory);
     STWErrorRef listError;
     auto files = fileManager->urlsForItemsInDirectoryAtURL(directory, &listError);
     if (!files) {

@@ -13,7 +13,6 @@
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/STWLocks.h"
 #include "common/STWLog.h"
-#include "platform/STWPlatformConfiguration.h"
 #include "platform/STWTransaction.h"
 
 #include <cerrno>
@@ -53,6 +52,18 @@ void STWClientConnection::stowlySetup() {
             &protectionError))
         STW_LOG_ERROR(STWLogCategory::Startup, "Failed restarting pending data protection operations: %@",
                       protectionError);
+    // Application groups that no stored entry names any more leave. A code-signing update
+    // stores its entry before it sends the groups it dropped to death row, so a stop in
+    // between leaves them for this sweep. Before the first request, so that no entry can
+    // name a group again while it goes; the commands take the daemon-wide lock themselves,
+    // so the queue runs after it is released.
+    auto commandQueue = STWCommandQueue::init();
+    {
+        STWAllIdentifiersLockGuard lock(STWLockMode::Writing);
+        STWGroupManager::defaultManager()->reconcileGroupContainersOfType(STWGroupTypeApplication, *commandQueue);
+    }
+    uint64_t code = STWErrorSuccess;
+    commandQueue->executeAllUntilExhaustedOrError(&code);
 }
 
 void STWClientConnection::rebootStowlySetup() {
@@ -71,19 +82,6 @@ void STWClientConnection::rebootStowlySetup() {
     }
 
     _moveSystemContainersIntoPlace();
-
-    if (STWPlatformConfiguration::sharedInstance()->isMultiUser()) {
-        // Application groups that no stored entry references any more leave; the commands
-        // take the daemon-wide lock themselves, so the queue runs after it is released.
-        auto commandQueue = STWCommandQueue::init();
-        {
-            STWAllIdentifiersLockGuard lock(STWLockMode::Writing);
-            STWGroupManager::defaultManager()->reconcileGroupContainersOfType(STWGroupTypeApplication,
-                                                                              *commandQueue);
-        }
-        uint64_t code = STWErrorSuccess;
-        commandQueue->executeAllUntilExhaustedOrError(&code);
-    }
 }
 
 // MARK: - Cleanup

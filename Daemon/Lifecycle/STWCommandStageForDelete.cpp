@@ -40,8 +40,21 @@ bool STWCommandStageForDelete::fromQueue(STWCommandQueue& queue, uint64_t* error
                 continue;
             if (STWContainerClassIsBundle(record->containerClass()))
                 _removeCodeSigningDictionariesForIdentifierAndItsChildren(record->identifier(), queue);
-            if (!_stageContainer(*record))
+            // The sandbox's mapping goes before the container does: cut short in between, a
+            // start finds a container whose mapping its rebuild pushes again, never a
+            // mapping to a container that is gone.
+            bool mapped = !record->transient() && cache->shouldRegisterSandboxMappingWithUserIdentity(
+                                                      record->userIdentity(), record->identifier(),
+                                                      record->containerClass());
+            if (mapped)
+                cache->setSandboxContainerMappingForUserIdentity(record->userIdentity(), record->identifier(),
+                                                                 record->containerClass(), std::nullopt);
+            if (!_stageContainer(*record)) {
+                if (mapped)
+                    cache->setSandboxContainerMappingForUserIdentity(record->userIdentity(), record->identifier(),
+                                                                     record->containerClass(), record->url());
                 continue;
+            }
             STW_CRASH_POINT(STWCrashPoint::deleteAfterStaging);
             STWErrorRef removeError;
             if (!cache->removeContainerForUserIdentity(record->userIdentity(), record->containerClass(),

@@ -7,6 +7,7 @@
 #include "Daemon/Request/STWClientConnection.h"
 #include "Daemon/Request/STWRequestDecoder.h"
 #include "common/STWLog.h"
+#include "platform/STWCrashPoint.h"
 
 #include <algorithm>
 
@@ -190,6 +191,8 @@ STW_COMMAND_HANDLER(processCodeSigningInfo) {
                                                     *connection.commandQueue());
     if (code != STWErrorSuccess)
         *error = code;
+    else
+        STW_CRASH_POINT(STWCrashPoint::codeSigningAfterUpdate);
 }
 
 STW_COMMAND_HANDLER(codeSigningInfo) {

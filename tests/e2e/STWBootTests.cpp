@@ -46,6 +46,15 @@ std::set<std::string> names(const fs::path& directory) {
 bool isEmpty(const fs::path& directory) {
     return names(directory).empty();
 }
+// Links of the sandbox mapping store whose container is gone.
+std::set<std::string> staleMappings(const fs::path& root) {
+    std::set<std::string> stale;
+    std::error_code ec;
+    for (fs::recursive_directory_iterator it(root / "run/stowly/sandbox", ec), end; !ec && it != end; it.increment(ec))
+        if (it->is_symlink() && !fs::is_directory(fs::read_symlink(it->path())))
+            stale.insert(it->path().filename());
+    return stale;
+}
 
 struct Layout {
     fs::path root;
@@ -54,6 +63,9 @@ struct Layout {
     fs::path caches() const { return root / "private/var/root/Library/Caches/com.vorlane.stowlyd"; }
     fs::path deathRow() const { return caches() / "Dead"; }
     fs::path backup() const { return root / "private/var/mobile/Library/Backup/SystemContainers"; }
+    fs::path journals() const { return root / "private/var/root/Library/Stowly/Replace"; }
+    fs::path pendingUpdates() const { return root / "private/var/root/Library/Stowly/PendingUpdates"; }
+    fs::path groups() const { return root / "private/var/mobile/Containers/Shared/AppGroup"; }
 };
 
 // Entries even root cannot remove while it lives; the flag goes before the root does.
@@ -103,9 +115,16 @@ TEST(STWBoot, ARestartSweepsStagingAndAPowerCycleSweepsTransientsAndStrays) {
     fs::create_directory_symlink(outside, layout.userStaging() / "planted");
     fs::create_directories(layout.backup() / "Data/com.example.restored/Library");
     std::set<std::string> planted{live.filename(), orphan, withMetadata, "not-a-uuid", link, fifo};
+    // A journal and an update file whose writes a stop cut short before their renames.
+    for (fs::path markers : {layout.journals(), layout.pendingUpdates()}) {
+        fs::create_directories(markers);
+        std::ofstream(markers / ".interrupted.plist.Ab12Cd") << "half";
+    }
 
     ASSERT_TRUE(daemon.start());
     ASSERT_TRUE(daemon.waitForCleanups());
+    EXPECT_TRUE(isEmpty(layout.journals()));
+    EXPECT_TRUE(isEmpty(layout.pendingUpdates()));
     EXPECT_TRUE(isEmpty(layout.userStaging()));
     EXPECT_TRUE(isEmpty(layout.caches() / "Staging"));
     EXPECT_TRUE(fs::is_directory(transient));
@@ -165,11 +184,12 @@ TEST(STWBoot, RestoredSystemContainersAreInstalledThroughInprogress) {
     EXPECT_TRUE(fs::exists(layout.backup() / "Shared.inprogress/stale"));
 }
 
-// The crash points of creation, deletion, death row, replace and protection changes, one
-// after the other on one root: after each killed daemon the next start and its cleanups
-// leave only whole containers in the class directory, nothing in staging, death row, the
-// replace journals or the pending protection changes, and every acknowledged container
-// is found.
+// The crash points of creation, deletion, death row, replace, protection changes and
+// code-signing updates, one after the other on one root: after each killed daemon the next
+// start and its cleanups leave only whole containers in the class directory, nothing in
+// staging, death row, the replace journals or the pending protection changes, no group
+// container that no entry names and no sandbox mapping of a container that is gone, and
+// every acknowledged container is found.
 TEST(STWBootCrash, EveryCrashPointIsRepairedByTheNextStart) {
     STWDaemonProcess daemon(internal);
     Layout layout{daemon.root()};
@@ -181,7 +201,10 @@ TEST(STWBootCrash, EveryCrashPointIsRepairedByTheNextStart) {
             continue;
         SCOPED_TRACE(std::string(point));
         ASSERT_TRUE(daemon.stop());
-        ASSERT_TRUE(daemon.startWith("STOWLY_CRASH_AT", std::string(point)));
+        // A code-signing update first names a group, which is made, and is killed when the
+        // next update drops it.
+        bool codeSigning = point.starts_with("codesigning.");
+        ASSERT_TRUE(daemon.startWith("STOWLY_CRASH_AT", std::string(point) + (codeSigning ? ":2" : "")));
         auto client = daemon.connectAs("com.example.installer", allowed);
         ASSERT_NE(client, nullptr);
         std::string identifier = STWFormat("com.example.c%u", ++n);
@@ -210,6 +233,20 @@ TEST(STWBootCrash, EveryCrashPointIsRepairedByTheNextStart) {
             message["Command"] = STWValue(21u);
             message["DataProtectionClass"] = STWValue(int64_t{1});
             client->sendMessage(message, std::chrono::seconds(5), nullptr);
+        } else if (codeSigning) {
+            auto entry = [&](STWValue::Array groups) {
+                STWValue::Dictionary entitlements{{"com.vorlane.security.application-groups", STWValue(groups)}};
+                return STWValue::Dictionary{
+                    {"Identifier", STWValue(identifier)},
+                    {"CodeSigningInfo", STWValue(STWValue::Dictionary{
+                                            {"com.vorlane.Stowly.Entitlements", STWValue(entitlements)}})}};
+            };
+            ASSERT_EQ(STWDaemonProcess::replyError(*client, 18, entry({STWValue("group.example.dropped")})),
+                      STWErrorSuccess);
+            ASSERT_EQ(STWDaemonProcess::replyError(*client, 13, {{"Identifier", STWValue(identifier)}}),
+                      STWErrorSuccess);
+            ASSERT_FALSE(isEmpty(layout.groups()));
+            STWDaemonProcess::send(*client, 18, entry({}));
         }
         ASSERT_TRUE(daemon.killedItself());
 
@@ -222,8 +259,10 @@ TEST(STWBootCrash, EveryCrashPointIsRepairedByTheNextStart) {
         EXPECT_TRUE(isEmpty(layout.deathRow()));
         EXPECT_TRUE(isEmpty(daemon.root() / "private/var/root/Library/Stowly/Replace"));
         EXPECT_TRUE(isEmpty(daemon.root() / "private/var/root/Library/Stowly/PendingUpdates"));
+        EXPECT_TRUE(isEmpty(layout.groups()));
         client = daemon.connectAs("com.example.installer", allowed);
         for (const auto& found : acknowledged)
             EXPECT_EQ(code(STWDaemonProcess::send(*client, 0, keys(found, false))), STWErrorSuccess) << found;
+        EXPECT_EQ(staleMappings(daemon.root()), std::set<std::string>());
     }
 }

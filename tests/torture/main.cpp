@@ -1,0 +1,331 @@
+// stowly_torture: a real stowlyd on a private root, driven by several client threads while
+// it is killed again and again (at random moments, and in turn at every crash point), with
+// a power cycle now and then; after each restart, once the start's cleanups are done, the
+// independent checker compares the disk and the daemon's answers with every acknowledged
+// reply. Prints "kills: N, violations: M" and a summary; exits 1 when M > 0.
+//
+//   stowly_torture [--kills N] [--seed S] [--threads T] [--state FILE] [--verbose]
+//
+// FILE, when given, holds the root, the first-boot semaphore and the daemon's pid, so that
+// a script can clean up after a driver that was itself killed.
+#include "common/STWFileIO.h"
+#include "common/STWLog.h"
+#include "platform/STWCrashPoint.h"
+#include "platform/STWPlatformConfiguration.h"
+#include "tests/support/STWDaemonProcess.h"
+#include "tests/torture/STWTortureChecker.h"
+#include "tests/torture/STWTortureWorkload.h"
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <csignal>
+#include <cstdio>
+#include <cstring>
+#include <fstream>
+#include <memory>
+#include <random>
+#include <semaphore.h>
+#include <string>
+#include <thread>
+#include <vector>
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+using std::chrono::milliseconds;
+
+std::atomic<bool> interrupted{false};
+
+const STWValue::Dictionary installerEntitlements{{"com.vorlane.private.Stowly.allowed", STWValue(true)}};
+
+struct Options {
+    unsigned kills = 1000;
+    uint64_t seed = 0;
+    unsigned threads = 4;
+    std::string stateFile;
+    bool verbose = false;
+};
+
+bool parse(int argc, char** argv, Options* options) {
+    options->seed = std::random_device()();
+    for (int i = 1; i < argc; ++i) {
+        std::string arg = argv[i];
+        auto next = [&](unsigned long long* value) {
+            if (i + 1 >= argc)
+                return false;
+            char* end = nullptr;
+            *value = strtoull(argv[++i], &end, 10);
+            return end && *end == 0;
+        };
+        unsigned long long value = 0;
+        if (arg == "--kills" && next(&value) && value > 0)
+            options->kills = unsigned(value);
+        else if (arg == "--seed" && next(&value))
+            options->seed = value;
+        else if (arg == "--threads" && next(&value) && value > 0 && value <= 16)
+            options->threads = unsigned(value);
+        else if (arg == "--state" && i + 1 < argc)
+            options->stateFile = argv[++i];
+        else if (arg == "--verbose")
+            options->verbose = true;
+        else
+            return false;
+    }
+    return true;
+}
+
+class Torture {
+public:
+    explicit Torture(const Options& options)
+        : _options(options), _random(options.seed),
+          _daemon({{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}}, {}, false),
+          _checker(_daemon.root()) {
+        _daemon.setStandardErrorFile(_daemon.root() / "stowlyd.stderr");
+        for (unsigned t = 0; t < options.threads; ++t)
+            _workers.push_back(std::make_unique<STWTortureWorker>(t, options.seed, _daemon.root().string()));
+    }
+
+    int run();
+
+private:
+    // Starts the daemon (armed at `point` unless empty) and waits for its cleanups; a daemon
+    // that kills itself on the way counts as a kill and is started again unarmed.
+    bool _restart(std::string point, bool firstBoot);
+    void _window(const std::string& point);
+    void _check();
+    void _violation(const std::string& text);
+    void _writeState();
+    std::unique_ptr<STWClient> _installer() { return _daemon.connectAs("com.torture.installer", installerEntitlements); }
+
+    Options _options;
+    std::mt19937_64 _random;
+    STWDaemonProcess _daemon;
+    STWTortureChecker _checker;
+    std::vector<std::unique_ptr<STWTortureWorker>> _workers;
+    unsigned _kills = 0, _pointKills = 0, _startKills = 0, _reboots = 0, _checks = 0;
+    std::vector<std::string> _violations;
+};
+
+void Torture::_violation(const std::string& text) {
+    _violations.push_back(text);
+    std::string history;
+    for (auto& worker : _workers)
+        history += worker->historyFor(text);
+    if (_violations.size() <= 50)
+        fprintf(stderr, "VIOLATION after kill %u (reproduce with --seed %llu): %s%s\n", _kills,
+                static_cast<unsigned long long>(_options.seed), text.c_str(), history.c_str());
+}
+
+void Torture::_writeState() {
+    if (_options.stateFile.empty())
+        return;
+    std::ofstream(_options.stateFile) << _daemon.root().string() << "\n/dev/shm/sem."
+                                      << STWPlatformConfiguration(_daemon.root()).firstBootSemaphoreName().substr(1)
+                                      << "\n" << _daemon.pid() << "\n";
+}
+
+bool Torture::_restart(std::string point, bool firstBoot) {
+    for (int attempt = 0; attempt < 5; ++attempt) {
+        bool started = point.empty() ? _daemon.start() : _daemon.startWith("STOWLY_CRASH_AT", point);
+        _writeState();
+        if (started && _daemon.waitForCleanups(firstBoot))
+            return true;
+        // A start or its cleanups reached the armed point: a crash during repair.
+        auto status = _daemon.waitForExit(STWDaemonProcess::timeout);
+        if (!status || point.empty()) {
+            _violation("stowlyd did not start" + std::string(point.empty() ? "" : " armed at " + point) +
+                       (status ? " (wait status " + std::to_string(*status) + ")" : ""));
+            return false;
+        }
+        ++_kills, ++_pointKills, ++_startKills;
+        if (_options.verbose)
+            fprintf(stderr, "kill %u: at %s during the start\n", _kills, point.c_str());
+        point.clear();
+        // A daemon that finished its first-boot cleanup before it died left its marker, and
+        // the next start is no first one.
+        sem_t* marker = sem_open(STWPlatformConfiguration(_daemon.root()).firstBootSemaphoreName().c_str(), 0);
+        if (marker != SEM_FAILED) {
+            sem_close(marker);
+            firstBoot = false;
+        }
+    }
+    return false;
+}
+
+void Torture::_window(const std::string& point) {
+    std::atomic<bool> stop{false};
+    std::vector<std::unique_ptr<STWClient>> clients;
+    std::vector<std::unique_ptr<STWUpcallClient>> upcalls;
+    std::vector<std::thread> threads;
+    for (auto& worker : _workers) {
+        clients.push_back(_installer());
+        upcalls.push_back(STWUpcallClient::connect(STWUpcallClient::socketPathForRoot(_daemon.root()), nullptr));
+        if (!clients.back())
+            continue;
+        threads.emplace_back([&, w = worker.get(), c = clients.back().get(), u = upcalls.back().get()] {
+            w->run(*c, u, stop, point);
+        });
+    }
+    // Armed, the daemon is given a while to reach its point; otherwise it is killed after
+    // a short random stretch of work, so kills land at every stage of every request.
+    milliseconds window = point.empty() ? milliseconds(20 + _random() % 300) : milliseconds(1500);
+    std::optional<int> status = _daemon.waitForExit(window);
+    bool reached = status.has_value();
+    if (!status) {
+        kill(_daemon.pid(), SIGKILL);
+        status = _daemon.waitForExit(STWDaemonProcess::timeout);
+    }
+    stop = true;
+    for (auto& thread : threads)
+        thread.join();
+    ++_kills;
+    if (!point.empty() && reached)
+        ++_pointKills;
+    if (!status || !WIFSIGNALED(*status) || WTERMSIG(*status) != SIGKILL)
+        _violation("stowlyd ended otherwise than by SIGKILL" +
+                   (status ? " (wait status " + std::to_string(*status) + ")" : std::string(" (still running)")));
+    if (_options.verbose)
+        fprintf(stderr, "kill %u: %s\n", _kills,
+                point.empty() ? "at random" : (point + (reached ? " reached" : " not reached")).c_str());
+}
+
+void Torture::_check() {
+    ++_checks;
+    std::vector<STWTortureModel*> models;
+    for (auto& worker : _workers)
+        models.push_back(&worker->model);
+    std::vector<std::string> found = _checker.check(models);
+
+    std::map<STWTortureIdentity, std::pair<std::string, std::string>> disk;
+    for (const auto& [identity, container] : _checker.found())
+        disk[identity] = {container.uuid, container.path};
+    auto client = _installer();
+    std::vector<STWTortureIdentity> mapped;
+    for (auto& worker : _workers) {
+        if (client) {
+            worker->violations.clear();
+            worker->compareWithDaemon(*client, disk);
+            found.insert(found.end(), worker->violations.begin(), worker->violations.end());
+            worker->violations.clear();
+        }
+        auto more = worker->mappedIdentities();
+        mapped.insert(mapped.end(), more.begin(), more.end());
+    }
+    // Before the resent updates, which may send groups away (and reach an armed point).
+    for (auto& v : _checker.checkMappings(mapped))
+        found.push_back(std::move(v));
+    for (auto& worker : _workers)
+        if (client)
+            worker->resolve(*client);
+    // A daemon armed at a point that its own death-row pass or a resent update reached
+    // died during the check: what it left unfinished is the next start's to repair.
+    bool died = !_daemon.isRunning();
+    // A connection reset comes a moment before the daemon that closed it can be reaped.
+    bool unanswered = std::any_of(found.begin(), found.end(),
+                                  [](const std::string& v) { return v.find("no reply") != std::string::npos; });
+    if (!died && unanswered)
+        died = _daemon.waitForExit(milliseconds(500)).has_value();
+    for (auto& v : found)
+        if (!died || (v.find("death row entry") == std::string::npos && v.find("no reply") == std::string::npos))
+            _violation(v);
+    if (died) {
+        ++_kills, ++_pointKills;
+        _daemon.waitForExit(STWDaemonProcess::timeout);
+    }
+}
+
+int Torture::run() {
+    auto began = Clock::now();
+    printf("stowly_torture: root %s, seed %llu, %u threads, %u kills\n", _daemon.root().c_str(),
+           static_cast<unsigned long long>(_options.seed), _options.threads, _options.kills);
+    fflush(stdout);
+    if (!_restart("", true))
+        return 1;
+    size_t nextPoint = 0;
+    std::string point;
+    while (_kills < _options.kills && !interrupted.load()) {
+        if (_daemon.isRunning())
+            _window(point);
+        // Every few kills the power goes too, and the next start is the first since power-on.
+        bool firstBoot = _random() % 5 == 0;
+        if (firstBoot) {
+            _daemon.reboot();
+            ++_reboots;
+        }
+        // Clients find the device unlocked after a restart, so waiting changes can finish.
+        STWWriteFileAtomically(_daemon.root() / "run/stowly/keybag", "unlocked", 0644, false);
+        // Every second start is armed, at each crash point in turn (a later pass of it now
+        // and then); the list is walked as it stands, so new points join by themselves.
+        point.clear();
+        if (_kills % 2 == 1) {
+            point = std::string(STWCrashPoint::all[nextPoint++ % STWCrashPoint::all.size()]);
+            if (_random() % 3 == 0)
+                point += ":" + std::to_string(2 + _random() % 2);
+        }
+        if (!_restart(point, firstBoot))
+            break;
+        _check();
+        if (_violations.size() > 200)
+            break;
+    }
+    double seconds = std::chrono::duration<double>(Clock::now() - began).count();
+    uint64_t acknowledged = 0, uncertain = 0;
+    std::map<std::string, std::pair<uint64_t, uint64_t>> kinds;
+    for (auto& worker : _workers) {
+        for (auto& [kind, n] : worker->acknowledged)
+            acknowledged += n, kinds[kind].first += n;
+        for (auto& [kind, n] : worker->uncertain)
+            uncertain += n, kinds[kind].second += n;
+    }
+    printf("requests acknowledged: %llu, without reply: %llu\n", static_cast<unsigned long long>(acknowledged),
+           static_cast<unsigned long long>(uncertain));
+    for (auto& [kind, counts] : kinds)
+        printf("  %-16s %8llu acknowledged %6llu without reply\n", kind.c_str(),
+               static_cast<unsigned long long>(counts.first), static_cast<unsigned long long>(counts.second));
+    printf("crash points reached: %u (during a start or its check: %u), power cycles: %u, checks: %u\n", _pointKills,
+           _startKills, _reboots, _checks);
+    printf("wall time: %.1f s, seed %llu\n", seconds, static_cast<unsigned long long>(_options.seed));
+    if (!_violations.empty()) {
+        // The root goes with the driver; the daemon's log stays for whoever looks into it.
+        std::string kept = "/tmp/stowly-torture-" + std::to_string(_options.seed) + ".log";
+        std::error_code ec;
+        std::filesystem::copy_file(_daemon.root() / "stowlyd.stderr", kept,
+                                   std::filesystem::copy_options::overwrite_existing, ec);
+        if (!ec)
+            printf("the daemon's log: %s\n", kept.c_str());
+    }
+    printf("kills: %u, violations: %zu\n", _kills, _violations.size());
+    return _violations.empty() && !interrupted.load() ? 0 : 1;
+}
+
+} // namespace
+
+int main(int argc, char** argv) {
+    Options options;
+    if (!parse(argc, argv, &options)) {
+        fprintf(stderr, "usage: %s [--kills N] [--seed S] [--threads T] [--state FILE] [--verbose]\n", argv[0]);
+        return 2;
+    }
+    // Stopped from outside, the driver still stops its daemon and removes its root.
+    struct sigaction action{};
+    action.sa_handler = [](int) { interrupted = true; };
+    for (int signal : {SIGINT, SIGTERM, SIGHUP})
+        sigaction(signal, &action, nullptr);
+    signal(SIGPIPE, SIG_IGN);
+    // The file layer that removes the root at the end logs every immutable flag it clears.
+    if (!options.verbose)
+        STWLog::setSystemLogLevel(STWLogLevel::Fault);
+    STWDaemonProcess::setFailureHandler([verbose = options.verbose](const std::string& message) {
+        if (verbose)
+            fprintf(stderr, "stowly_torture: %s\n", message.c_str());
+    });
+    int status;
+    {
+        Torture torture(options);
+        status = torture.run();
+    }
+    if (!options.stateFile.empty())
+        unlink(options.stateFile.c_str());
+    return status;
+}
