@@ -16,7 +16,10 @@
 #include "common/STWLog.h"
 #include "platform/STWCrashPoint.h"
 
+#include <cerrno>
 #include <cstdlib>
+#include <cstring>
+#include <fcntl.h>
 
 namespace {
 
@@ -38,10 +41,16 @@ STWFormatArg pathOrNil(const std::filesystem::path& path) {
     return path.empty() ? STWFormatArg(nullptr) : STWFormatArg(path);
 }
 
+// A container directory where a move left it: the directory it is in and itself, open.
+struct MovedDirectory {
+    STWFileDescriptor parent, directory;
+};
+
 // Moves the container directory of `record` to `to`: only the directory that holds the
-// record's own metadata file, and nothing on the way followed.
+// record's own metadata file, and nothing on the way followed. `moved` (when given) keeps
+// the directory and its new parent open, so that it can be moved on without a look-up.
 bool moveContainerDirectory(const STWMetadata& record, const std::filesystem::path& to,
-                            STWFileManagerMoveOptions options, STWErrorRef* error) {
+                            STWFileManagerMoveOptions options, STWErrorRef* error, MovedDirectory* moved = nullptr) {
     auto fileManager = STWFileManager::defaultManager();
     STWFileDescriptor fromParent;
     STWFileDescriptor directory = record.openContainerDirectory(error, &fromParent);
@@ -49,8 +58,12 @@ bool moveContainerDirectory(const STWMetadata& record, const std::filesystem::pa
         return false;
     STWFileDescriptor toParent = fileManager->openDirectoryAtURL(
         to.parent_path(), STWTrustedAncestorForClass(record.userIdentity(), record.containerClass()), error);
-    return toParent && fileManager->moveDirectoryAt(fromParent.get(), record.url().filename(), toParent.get(),
-                                                    to.filename(), directory.get(), options, record.url(), to, error);
+    if (!toParent || !fileManager->moveDirectoryAt(fromParent.get(), record.url().filename(), toParent.get(),
+                                                   to.filename(), directory.get(), options, record.url(), to, error))
+        return false;
+    if (moved)
+        *moved = {std::move(toParent), std::move(directory)};
+    return true;
 }
 
 } // namespace
@@ -92,6 +105,7 @@ bool STWClientConnection::replaceContainerIdentity(const STWConcreteContainerIde
     // Kept outside the body: the exception path puts the old container back from staging,
     // and the clean-up sends staging and journal to death row whatever happened.
     std::filesystem::path destination, staging, replaceFile;
+    MovedDirectory parked; // the old container in staging, while it is there
     auto fail = [&](uint64_t failure) {
         code = failure;
         return false;
@@ -153,7 +167,7 @@ bool STWClientConnection::replaceContainerIdentity(const STWConcreteContainerIde
                 return fail(_codeOfError(stepError));
             }
             STW_CRASH_POINT(STWCrashPoint::replaceAfterJournal);
-            if (!moveContainerDirectory(*oldRecord, staging, STWFileManagerMoveSyncDirectories, &stepError)) {
+            if (!moveContainerDirectory(*oldRecord, staging, STWFileManagerMoveSyncDirectories, &stepError, &parked)) {
                 STW_ERROR(STWErrorMoveToStagingFailed, stepError, "Failed to move old %@ to staging %@",
                           oldRecord->url(), staging);
                 return fail(STWErrorMoveToStagingFailed);
@@ -233,14 +247,37 @@ bool STWClientConnection::replaceContainerIdentity(const STWConcreteContainerIde
     if (!replaceFile.empty()) {
         STWErrorRef cleanupError;
         // The parked container need not leave staging durably: should a power cut bring it
-        // back there, it is garbage that no class directory lists.
-        if (!_moveItemAtURLToDeathRow(staging, true, false, &cleanupError, STWFileManagerMoveDefault)) {
+        // back there, it is garbage that no class directory lists. It is moved by the
+        // descriptors the park left open; never parked (or put back since), there is nothing
+        // to move.
+        if (parked.directory &&
+            !_moveItemAtToDeathRow(parked.parent.get(), staging.filename(), parked.directory.get(), staging,
+                                   &cleanupError, STWFileManagerMoveDefault)) {
             STW_ERROR(STWErrorRemovePendingFileFailed, cleanupError, "Failed to remove staging dir: %@", staging);
             code = STWErrorRemovePendingFileFailed;
         }
-        if (!_moveItemAtURLToDeathRow(replaceFile, false, startDeletionThread, &cleanupError)) {
-            STW_ERROR(STWErrorRemovePendingFileFailed, cleanupError, "Failed to remove replace file: %@", replaceFile);
+        // The journal lies in the daemon's own replace directory, root's below root's: it is
+        // opened as its path says, with none of the checks a path of unknown owners needs.
+        // A journal that is gone counts as moved, as for any move into death row.
+        std::string name = replaceFile.filename();
+        STWErrorRef journalError;
+        STWFileDescriptor journalDirectory =
+            STWFileManager::defaultManager()->openDirectoryAtURL(replaceFile.parent_path(), &journalError);
+        STWFileDescriptor journal;
+        if (journalDirectory) {
+            journal.reset(openat(journalDirectory.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+            if (int e = journal ? 0 : errno; e && e != ENOENT)
+                journalError = STW_POSIX_ERROR(e, "Could not open %@ to move it to death row: %s", replaceFile,
+                                               strerror(e));
+        }
+        bool removed = journal ? _moveItemAtToDeathRow(journalDirectory.get(), name, journal.get(), replaceFile,
+                                                       &journalError)
+                               : !journalError;
+        if (!removed) {
+            STW_ERROR(STWErrorRemovePendingFileFailed, journalError, "Failed to remove replace file: %@", replaceFile);
             code = STWErrorRemovePendingFileFailed;
+        } else if (journal && startDeletionThread) {
+            deleteContainersOnDeathRowWithCompletion(nullptr);
         }
     }
     if (code != STWErrorSuccess) {
