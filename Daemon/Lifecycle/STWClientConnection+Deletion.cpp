@@ -58,8 +58,12 @@ bool moveIntoDeathRow(const std::filesystem::path& url,
             return true;
         }
         bool missing = stepError && stepError->isPOSIX(ENOENT);
-        if (missing && isGone())
-            return true; // nothing to move; the empty directory goes with the next pass
+        if (missing && isGone()) {
+            // Nothing to move, and no pass is started for nothing: the empty directory goes
+            // now rather than stay in death row until some later pass.
+            fileManager->removeItemAt(deathRow->fd.get(), unique->name, slot.url);
+            return true;
+        }
         if (!missing || attempt == 8) {
             STWSetError(error, STW_ERROR(STWErrorItemOperationFailed, stepError, "Failed to move item at: %@ to: %@",
                                          url, slot.url / url.filename()));
