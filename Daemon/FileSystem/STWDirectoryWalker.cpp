@@ -21,13 +21,14 @@ struct STWDirectoryWalker::Frame {
 };
 
 STWDirectoryWalker::STWDirectoryWalker(size_t openDirectoryLimit)
-    : _openDirectoryLimit(openDirectoryLimit < 2 ? 2 : openDirectoryLimit), _buffer(64 * 1024) {}
+    : _openDirectoryLimit(openDirectoryLimit < 2 ? 2 : openDirectoryLimit),
+      _buffer(std::make_unique_for_overwrite<char[]>(_bufferSize)) {}
 
 int STWDirectoryWalker::_readEntries(int fd, std::vector<Entry>* entries) {
     // The whole directory is read before anything in it changes, so removing entries
     // never makes the read skip or repeat one.
     for (;;) {
-        ssize_t n = STWRetryOnEINTR([&] { return getdents64(fd, _buffer.data(), _buffer.size()); });
+        ssize_t n = STWRetryOnEINTR([&] { return getdents64(fd, _buffer.get(), _bufferSize); });
         if (n < 0)
             return errno;
         if (n == 0)
@@ -35,8 +36,8 @@ int STWDirectoryWalker::_readEntries(int fd, std::vector<Entry>* entries) {
         for (ssize_t offset = 0; offset < n;) {
             dirent64 record;
             // The buffer holds packed records; copy the fixed part out to read it aligned.
-            std::memcpy(&record, _buffer.data() + offset, offsetof(dirent64, d_name));
-            const char* name = _buffer.data() + offset + offsetof(dirent64, d_name);
+            std::memcpy(&record, _buffer.get() + offset, offsetof(dirent64, d_name));
+            const char* name = _buffer.get() + offset + offsetof(dirent64, d_name);
             offset += record.d_reclen;
             if (name[0] == '.' && (name[1] == 0 || (name[1] == '.' && name[2] == 0)))
                 continue;

@@ -10,6 +10,7 @@
 #pragma once
 
 #include <cstddef>
+#include <memory>
 #include <string>
 #include <sys/types.h>
 #include <vector>
@@ -58,5 +59,7 @@ private:
     void _visit(Frame& frame, Delegate& delegate);
 
     size_t _openDirectoryLimit;
-    std::vector<char> _buffer;
+    // For getdents64; left uninitialized, as a walker is made for every tree removed.
+    static constexpr size_t _bufferSize = 64 * 1024;
+    std::unique_ptr<char[]> _buffer;
 };

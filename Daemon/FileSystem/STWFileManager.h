@@ -81,6 +81,10 @@ public:
     // unflagged and removed. One item that cannot be removed does not stop the removal of
     // the rest; the error is the first one met.
     bool removeItemAtURL(const std::filesystem::path& url, STWErrorRef* error = nullptr) const;
+    // The same for the entry `name` of the directory open as `dirfd`, a directory whose
+    // ancestors the daemon trusts (death row); `path` names the item in errors and logs.
+    bool removeItemAt(int dirfd, const std::string& name, const std::filesystem::path& path,
+                      STWErrorRef* error = nullptr) const;
 
     // Creates the directory (and, with `withIntermediateDirectories`, its missing parents,
     // which get `mode` plus owner write and search). An existing directory is fine: its mode
@@ -237,6 +241,11 @@ public:
     // when nothing is at `from`.
     bool moveItemAtURLWithoutForeignLinks(const std::filesystem::path& from, const std::filesystem::path& to,
                                           STWFileManagerMoveOptions options, STWErrorRef* error = nullptr) const;
+    // The same into the directory open as `tofd`, as `toName`; `to` names the destination in
+    // errors.
+    bool moveItemAtURLWithoutForeignLinks(const std::filesystem::path& from, int tofd, const std::string& toName,
+                                          const std::filesystem::path& to, STWFileManagerMoveOptions options,
+                                          STWErrorRef* error = nullptr) const;
     // Removes the directory open as `directoryfd`, the entry `name` of `parentfd`: what it
     // holds through its descriptor, then the entry itself while it is still that directory
     // (ESTALE when something else took its place; that is left alone). A directory that is
@@ -261,6 +270,17 @@ public:
     STWFileDescriptor createNewDirectoryAt(int dirfd, const std::string& name, mode_t mode, uid_t owner,
                                            int32_t dataProtectionClass, const std::filesystem::path& path,
                                            STWErrorRef* error = nullptr) const;
+
+    // A new directory `namePrefix` + six random characters in the directory open as `dirfd`
+    // (`directory` names it in errors), made as createNewDirectoryAt() makes one, mode 0700:
+    // createTemporaryDirectoryInDirectoryURL() for a directory the caller holds open.
+    struct TemporaryDirectory {
+        STWFileDescriptor fd;
+        std::string name;
+    };
+    std::optional<TemporaryDirectory> createTemporaryDirectoryAt(int dirfd, const std::string& namePrefix,
+                                                                 const std::filesystem::path& directory,
+                                                                 STWErrorRef* error = nullptr) const;
 
     // Renames `name` of `fromfd` to `toName` of `tofd`, never over an existing item, and
     // checks that what arrived is the directory open as `directoryfd`: if an item swapped

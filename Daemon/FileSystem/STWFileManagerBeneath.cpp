@@ -218,6 +218,32 @@ STWFileDescriptor STWFileManager::createNewDirectoryAt(int dirfd, const std::str
     return fd;
 }
 
+std::optional<STWFileManager::TemporaryDirectory>
+STWFileManager::createTemporaryDirectoryAt(int dirfd, const std::string& namePrefix, const fs::path& directory,
+                                           STWErrorRef* error) const {
+    static constexpr char kCharacters[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789";
+    STWErrorRef makeError;
+    for (int attempt = 0; attempt < kSwapRetries; ++attempt) {
+        unsigned char random[6];
+        if (getrandom(random, sizeof random, 0) != static_cast<ssize_t>(sizeof random)) {
+            int e = errno;
+            STWSetError(error, STW_POSIX_ERROR(e, "Failed to create temp dir in %@: %s", directory, strerror(e)));
+            return std::nullopt;
+        }
+        std::string name = namePrefix;
+        for (unsigned char byte : random)
+            name += kCharacters[byte % (sizeof kCharacters - 1)];
+        STWFileDescriptor fd = createNewDirectoryAt(dirfd, name, 0700, STWFileManagerOwnerUnchanged,
+                                                    STWFileManagerClassUnchanged, directory / name, &makeError);
+        if (fd)
+            return TemporaryDirectory{std::move(fd), std::move(name)};
+        if (!makeError || !makeError->isPOSIX(EEXIST))
+            break;
+    }
+    STWSetError(error, makeError);
+    return std::nullopt;
+}
+
 bool STWFileManager::moveDirectoryAt(int fromfd, const std::string& name, int tofd, const std::string& toName,
                                      int directoryfd, STWFileManagerMoveOptions options, const fs::path& from,
                                      const fs::path& to, STWErrorRef* error) const {
@@ -394,6 +420,15 @@ STWFileDescriptor STWFileManager::openDirectoryAtURLWithoutForeignLinks(const fs
 
 bool STWFileManager::moveItemAtURLWithoutForeignLinks(const fs::path& from, const fs::path& to,
                                                       STWFileManagerMoveOptions options, STWErrorRef* error) const {
+    fs::path destination(pathString(to));
+    STWFileDescriptor toParent = openDirectoryAtURLWithoutForeignLinks(destination.parent_path(), error);
+    return toParent && moveItemAtURLWithoutForeignLinks(from, toParent.get(), destination.filename(), destination,
+                                                        options, error);
+}
+
+bool STWFileManager::moveItemAtURLWithoutForeignLinks(const fs::path& from, int tofd, const std::string& toName,
+                                                      const fs::path& to, STWFileManagerMoveOptions options,
+                                                      STWErrorRef* error) const {
     fs::path source(pathString(from)), destination(pathString(to));
     STWFileDescriptor fromParent = openDirectoryAtURLWithoutForeignLinks(source.parent_path(), error);
     if (!fromParent)
@@ -413,7 +448,5 @@ bool STWFileManager::moveItemAtURLWithoutForeignLinks(const fs::path& from, cons
                                            strerror(e)));
         return false;
     }
-    STWFileDescriptor toParent = openDirectoryAtURLWithoutForeignLinks(destination.parent_path(), error);
-    return toParent && moveDirectoryAt(fromParent.get(), name, toParent.get(), destination.filename(), item.get(),
-                                       options, source, destination, error);
+    return moveDirectoryAt(fromParent.get(), name, tofd, toName, item.get(), options, source, destination, error);
 }

@@ -25,10 +25,12 @@ public:
 
     void itemFailed(int dirfd, const std::string& directoryPath, const std::string& name, int e) {
         std::string path = joinPath(directoryPath, name);
-        if (e != ENOENT)
-            STW_LOG_ERROR(STWLogCategory::FS, "removefile hit error for %s : %s", path, strerror(e));
+        // Every container's metadata file is immutable: EPERM is the common case, and only
+        // an item that will not go even then is worth a line in the log.
         if (e == EPERM && _removeImmutableItem(dirfd, name, path))
             return;
+        if (e != ENOENT)
+            STW_LOG_ERROR(STWLogCategory::FS, "removefile hit error for %s : %s", path, strerror(e));
         if (recordedError == 0)
             recordedError = e;
     }
@@ -86,7 +88,7 @@ private:
             return false;
         }
         fd.reset();
-        STW_LOG_NOTICE(STWLogCategory::FS, "Unset UF_IMMUTABLE on %s", path);
+        STW_LOG_DEBUG(STWLogCategory::FS, "Unset UF_IMMUTABLE on %s", path);
         if (disk::unlinkat(dirfd, name.c_str(), S_ISDIR(st.st_mode) ? AT_REMOVEDIR : 0) != 0) {
             STW_LOG_ERROR(STWLogCategory::FS, "unlink of %s failed: %s", path, strerror(errno));
             return false;
@@ -95,27 +97,36 @@ private:
     }
 };
 
-// The recursive-remove routine: answers its own failure (the root cannot be examined);
-// failures of single items go to the context.
-int removeTree(const std::string& path, RemovalContext& context) {
-    struct stat st;
-    if (lstat(path.c_str(), &st) != 0)
-        return errno;
-    if (!S_ISDIR(st.st_mode)) {
-        if (disk::unlinkat(AT_FDCWD, path.c_str(), 0) != 0)
-            context.itemFailed(AT_FDCWD, "", path, errno);
-        return 0;
-    }
-    STWFileDescriptor fd(open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+// The recursive-remove routine for the entry `name` of `dirfd` (AT_FDCWD and a whole path
+// for the path form), which `path` names: answers its own failure (ENOENT when nothing is
+// there); failures of single items go to the context. A directory is opened without
+// following a link; anything else fails that open and is unlinked as the entry it is, so
+// the common case costs no stat.
+int removeTree(int dirfd, const std::string& name, const std::string& path, RemovalContext& context) {
+    std::string directoryPath = dirfd == AT_FDCWD ? std::string() : parentPath(path);
+    STWFileDescriptor fd(openat(dirfd, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
     if (!fd) {
-        context.openFailed(AT_FDCWD, "", path, errno);
+        int e = errno;
+        if (e == ENOENT)
+            return e;
+        context.openFailed(dirfd, directoryPath, name, e);
         return 0;
     }
     STWDirectoryWalker().walk(fd.get(), path, context);
     fd.reset();
-    if (disk::unlinkat(AT_FDCWD, path.c_str(), AT_REMOVEDIR) != 0)
-        context.itemFailed(AT_FDCWD, "", path, errno);
+    if (disk::unlinkat(dirfd, name.c_str(), AT_REMOVEDIR) != 0)
+        context.itemFailed(dirfd, directoryPath, name, errno);
     return 0;
+}
+
+// The result of removeTree as removeItemAtURL answers it.
+bool removalResult(int e, const RemovalContext& context, const std::string& path, STWErrorRef* error) {
+    if (!e || e == ENOENT)
+        e = context.recordedError;
+    if (!e || e == ENOENT) // gone already is removed
+        return true;
+    STWSetError(error, STW_POSIX_ERROR(e, "removefile of %@ failed: %s", path, strerror(e)));
+    return false;
 }
 
 } // namespace
@@ -127,16 +138,15 @@ bool STWFileManager::removeItemAtURL(const fs::path& url, STWErrorRef* error) co
     }
     std::string path = pathString(url);
     RemovalContext context;
-    int e = removeTree(path, context);
-    if (e && e != ENOENT) {
-        STWSetError(error, STW_POSIX_ERROR(e, "removefile of %@ failed: %s", path, strerror(e)));
-        return false;
-    }
-    if (context.recordedError == 0 || context.recordedError == ENOENT)
-        return true;
-    e = context.recordedError;
-    STWSetError(error, STW_POSIX_ERROR(e, "removefile of %@ failed: %s", path, strerror(e)));
-    return false;
+    int e = removeTree(AT_FDCWD, path, path, context);
+    return removalResult(e, context, path, error);
+}
+
+bool STWFileManager::removeItemAt(int dirfd, const std::string& name, const fs::path& path, STWErrorRef* error) const {
+    std::string pathText = pathString(path);
+    RemovalContext context;
+    int e = removeTree(dirfd, name, pathText, context);
+    return removalResult(e, context, pathText, error);
 }
 
 bool STWFileManager::removeDirectoryAt(int parentfd, const std::string& name, int directoryfd, const fs::path& path,

@@ -19,35 +19,54 @@
 
 namespace {
 
+// Where an item is moved into death row: a fresh "temp." directory there, open.
+struct DeathRowSlot {
+    STWFileDescriptor fd;
+    std::filesystem::path url;
+};
+
 // Moves an item into a fresh "temp." directory of death row with `move` (given that
-// directory). A deletion pass running meanwhile may remove the fresh, still empty directory
-// before the item is renamed into it; the rename's ENOENT then means that, not a missing
-// item (`isGone` tells), and the move is tried again in a new one.
+// directory). The directory is made in death row's held descriptor, which the layout
+// reopens once death row was removed. A deletion pass running meanwhile may remove the
+// fresh, still empty directory before the item is renamed into it; the rename's ENOENT then
+// means that, not a missing item (`isGone` tells), and the move is tried again in a new one.
 bool moveIntoDeathRow(const std::filesystem::path& url,
-                      const std::function<bool(const std::filesystem::path& unique, STWErrorRef* error)>& move,
+                      const std::function<bool(const DeathRowSlot& unique, STWErrorRef* error)>& move,
                       const std::function<bool()>& isGone, bool* moved, STWErrorRef* error) {
     auto fileManager = STWFileManager::defaultManager();
-    auto deathRow = STWGlobalConfiguration::sharedInstance()->deathrowDirectory();
+    auto configuration = STWGlobalConfiguration::sharedInstance();
     *moved = false;
     for (int attempt = 0;; ++attempt) {
         STWErrorRef stepError;
-        auto unique = fileManager->createTemporaryDirectoryInDirectoryURL(deathRow, "temp.", &stepError);
+        auto deathRow = configuration->openDeathrowDirectory(&stepError);
+        auto unique = deathRow ? fileManager->createTemporaryDirectoryAt(deathRow->fd.get(), "temp.", deathRow->url,
+                                                                         &stepError)
+                               : std::nullopt;
         if (!unique) {
-            STWSetError(error, STW_ERROR(STWErrorItemOperationFailed, stepError,
-                                         "Failed to create unique directory at: %@", deathRow));
+            // Death row removed between the check of its descriptor and the new directory:
+            // the next attempt reopens it.
+            if (stepError && stepError->isPOSIX(ENOENT) && attempt < 8)
+                continue;
+            STWSetError(error, STW_ERROR(STWErrorItemOperationFailed, stepError, "Failed to create unique directory at: %@",
+                                         deathRow ? deathRow->url : configuration->deathrowDirectory()));
             return false;
         }
+        DeathRowSlot slot{std::move(unique->fd), deathRow->url / unique->name};
         STW_CRASH_POINT(STWCrashPoint::deathRowAfterTemporaryDirectory);
-        if (move(*unique, &stepError)) {
+        if (move(slot, &stepError)) {
             *moved = true;
             return true;
         }
         bool missing = stepError && stepError->isPOSIX(ENOENT);
-        if (missing && isGone())
-            return true; // nothing to move; the empty directory goes with the next pass
+        if (missing && isGone()) {
+            // Nothing to move, and no pass is started for nothing: the empty directory goes
+            // now rather than stay in death row until some later pass.
+            fileManager->removeItemAt(deathRow->fd.get(), unique->name, slot.url);
+            return true;
+        }
         if (!missing || attempt == 8) {
             STWSetError(error, STW_ERROR(STWErrorItemOperationFailed, stepError, "Failed to move item at: %@ to: %@",
-                                         url, *unique / url.filename()));
+                                         url, slot.url / url.filename()));
             return false;
         }
     }
@@ -61,11 +80,13 @@ bool STWClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& 
     (void)isDir; // the move takes whatever is there, and checks that it took that
     auto fileManager = STWFileManager::defaultManager();
     bool moved = false;
+    std::string name = url.filename();
     bool ok = moveIntoDeathRow(
         url,
-        [&](const std::filesystem::path& unique, STWErrorRef* stepError) {
+        [&](const DeathRowSlot& unique, STWErrorRef* stepError) {
             // The item may sit in a directory an app owns: nothing on the way is followed.
-            return fileManager->moveItemAtURLWithoutForeignLinks(url, unique / url.filename(), options, stepError);
+            return fileManager->moveItemAtURLWithoutForeignLinks(url, unique.fd.get(), name, unique.url / name,
+                                                                 options, stepError);
         },
         [&] { return fileManager->itemDoesNotExistAtURL(url); }, &moved, error);
     if (ok && moved && startDeletionThread)
@@ -80,10 +101,9 @@ bool STWClientConnection::_moveItemAtToDeathRow(int parentfd, const std::string&
     bool moved = false;
     return moveIntoDeathRow(
         url,
-        [&](const std::filesystem::path& unique, STWErrorRef* stepError) {
-            STWFileDescriptor uniquefd = fileManager->openDirectoryAtURLWithoutForeignLinks(unique, stepError);
-            return uniquefd && fileManager->moveDirectoryAt(parentfd, name, uniquefd.get(), name, itemfd, options,
-                                                            url, unique / name, stepError);
+        [&](const DeathRowSlot& unique, STWErrorRef* stepError) {
+            return fileManager->moveDirectoryAt(parentfd, name, unique.fd.get(), name, itemfd, options, url,
+                                                unique.url / name, stepError);
         },
         [&] {
             struct stat st;
@@ -93,9 +113,14 @@ bool STWClientConnection::_moveItemAtToDeathRow(int parentfd, const std::string&
 }
 
 bool STWClientConnection::_removeItemOrMoveToTempAtURL(const std::filesystem::path& url, STWErrorRef* error) {
+    return _removeItemOrMoveToTempAt(AT_FDCWD, url, url, error);
+}
+
+bool STWClientConnection::_removeItemOrMoveToTempAt(int dirfd, const std::string& name,
+                                                    const std::filesystem::path& url, STWErrorRef* error) {
     auto fileManager = STWFileManager::defaultManager();
     STWErrorRef removeError;
-    if (fileManager->removeItemAtURL(url, &removeError) || (removeError && removeError->isPOSIX(ENOENT)))
+    if (fileManager->removeItemAt(dirfd, name, url, &removeError) || (removeError && removeError->isPOSIX(ENOENT)))
         return true;
     STW_LOG_DEBUG(STWLogCategory::Lifecycle, "Couldn't remove, so moving item to /tmp: %@ : %@", url, removeError);
     std::filesystem::path temporary = STWPlatformConfiguration::sharedInstance()->resolve("/tmp");
@@ -116,20 +141,25 @@ void STWClientConnection::deleteContainersOnDeathRowWithCompletion(std::function
     // The queue holds a transaction for the pass until it ran, so idle exit waits for it.
     STWDaemonQueues::deathRow()->async([completion = std::move(completion)] {
         auto fileManager = STWFileManager::defaultManager();
-        auto deathRow = STWGlobalConfiguration::sharedInstance()->deathrowDirectory();
+        auto configuration = STWGlobalConfiguration::sharedInstance();
         uint64_t result = STWErrorSuccess;
+        // Listed and emptied through its held descriptor: no item costs a look-up of the
+        // whole path.
         STWErrorRef listError;
-        auto items = fileManager->urlsForItemsInDirectoryAtURL(deathRow, &listError);
+        auto open = configuration->openDeathrowDirectory(&listError);
+        std::filesystem::path deathRow = open ? open->url : configuration->deathrowDirectory();
+        auto items = open ? fileManager->itemsInDirectoryAt(open->fd.get(), deathRow, &listError) : std::nullopt;
         if (!items && !(listError && listError->isPOSIX(ENOENT))) {
             STW_ERROR(STWErrorDeleteFailed, listError, "Failed to get items for deletion: %@ : %@", deathRow,
                       listError);
             result = STWErrorDeleteFailed;
         }
         bool first = true;
-        for (const auto& item : items ? *items : std::vector<std::filesystem::path>{}) {
+        for (const auto& item : items ? *items : std::vector<STWFileManager::DirectoryItem>{}) {
             STWErrorRef itemError;
-            if (!_removeItemOrMoveToTempAtURL(item, &itemError)) {
-                STW_ERROR(STWErrorDestroyFailed, itemError, "Failed to destroy item at: %@", item);
+            std::filesystem::path url = deathRow / item.name;
+            if (!_removeItemOrMoveToTempAt(open->fd.get(), item.name, url, &itemError)) {
+                STW_ERROR(STWErrorDestroyFailed, itemError, "Failed to destroy item at: %@", url);
                 result = STWErrorDestroyFailed;
             }
             if (std::exchange(first, false))

@@ -17,7 +17,10 @@
 #include "common/STWLog.h"
 #include "platform/STWCrashPoint.h"
 
+#include <cerrno>
 #include <cstdlib>
+#include <cstring>
+#include <fcntl.h>
 
 namespace {
 
@@ -78,6 +81,10 @@ bool STWClientConnection::replaceContainerIdentity(const STWConcreteContainerIde
     // Kept outside the body: the exception path puts the old container back from staging,
     // and the clean-up sends staging and journal to death row whatever happened.
     std::filesystem::path destination, staging, replaceFile;
+    // The old container in staging, while it is there: the directory it is in and itself.
+    struct {
+        STWFileDescriptor parent, directory;
+    } parked;
     auto fail = [&](uint64_t failure) {
         code = failure;
         return false;
@@ -139,7 +146,8 @@ bool STWClientConnection::replaceContainerIdentity(const STWConcreteContainerIde
                 return fail(_codeOfError(stepError));
             }
             STW_CRASH_POINT(STWCrashPoint::replaceAfterJournal);
-            if (!oldRecord->moveContainerDirectory(staging, STWFileManagerMoveSyncDirectories, &stepError)) {
+            if (!oldRecord->moveContainerDirectory(staging, STWFileManagerMoveSyncDirectories, &stepError,
+                                                   &parked.parent, &parked.directory)) {
                 STW_ERROR(STWErrorMoveToStagingFailed, stepError, "Failed to move old %@ to staging %@",
                           oldRecord->url(), staging);
                 return fail(STWErrorMoveToStagingFailed);
@@ -213,20 +221,44 @@ bool STWClientConnection::replaceContainerIdentity(const STWConcreteContainerIde
                           oldRecord->url());
                 abort();
             }
+            parked = {};
         }
     }
 
     if (!replaceFile.empty()) {
         STWErrorRef cleanupError;
         // The parked container need not leave staging durably: should a power cut bring it
-        // back there, it is garbage that no class directory lists.
-        if (!_moveItemAtURLToDeathRow(staging, true, false, &cleanupError, STWFileManagerMoveDefault)) {
+        // back there, it is garbage that no class directory lists. It is moved by the
+        // descriptors the park left open; never parked (or put back since), there is nothing
+        // to move.
+        if (parked.directory &&
+            !_moveItemAtToDeathRow(parked.parent.get(), staging.filename(), parked.directory.get(), staging,
+                                   &cleanupError, STWFileManagerMoveDefault)) {
             STW_ERROR(STWErrorRemovePendingFileFailed, cleanupError, "Failed to remove staging dir: %@", staging);
             code = STWErrorRemovePendingFileFailed;
         }
-        if (!_moveItemAtURLToDeathRow(replaceFile, false, startDeletionThread, &cleanupError)) {
-            STW_ERROR(STWErrorRemovePendingFileFailed, cleanupError, "Failed to remove replace file: %@", replaceFile);
+        // The journal lies in the daemon's own replace directory, root's below root's: it is
+        // opened as its path says, with none of the checks a path of unknown owners needs.
+        // A journal that is gone counts as moved, as for any move into death row.
+        std::string name = replaceFile.filename();
+        STWErrorRef journalError;
+        STWFileDescriptor journalDirectory =
+            STWFileManager::defaultManager()->openDirectoryAtURL(replaceFile.parent_path(), &journalError);
+        STWFileDescriptor journal;
+        if (journalDirectory) {
+            journal.reset(openat(journalDirectory.get(), name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+            if (int e = journal ? 0 : errno; e && e != ENOENT)
+                journalError = STW_POSIX_ERROR(e, "Could not open %@ to move it to death row: %s", replaceFile,
+                                               strerror(e));
+        }
+        bool removed = journal ? _moveItemAtToDeathRow(journalDirectory.get(), name, journal.get(), replaceFile,
+                                                       &journalError)
+                               : !journalError;
+        if (!removed) {
+            STW_ERROR(STWErrorRemovePendingFileFailed, journalError, "Failed to remove replace file: %@", replaceFile);
             code = STWErrorRemovePendingFileFailed;
+        } else if (journal && startDeletionThread) {
+            deleteContainersOnDeathRowWithCompletion(nullptr);
         }
     }
     if (code != STWErrorSuccess) {

@@ -102,8 +102,8 @@ bool STWCommandStageForDelete::_stageContainer(const STWMetadata& record) {
         STW_ERROR(STWErrorDeleteFailed, stepError, "Failed to delete container at %@: %@", url, stepError);
         return false;
     }
-    STWFileDescriptor deathRow = fileManager->openDirectoryAtURLWithoutForeignLinks(destination.parent_path(), &stepError);
-    if (deathRow && fileManager->moveDirectoryAt(classfd.get(), name, deathRow.get(), name, containerfd.get(),
+    auto deathRow = STWGlobalConfiguration::sharedInstance()->openDeathrowDirectory(&stepError);
+    if (deathRow && fileManager->moveDirectoryAt(classfd.get(), name, deathRow->fd.get(), name, containerfd.get(),
                                                  STWFileManagerMoveSyncSourceDirectory, url, destination, &stepError))
         return true;
     STW_LOG_DEBUG(STWLogCategory::Lifecycle, "Couldn't stage for deletion from %@ to %@: %@", url, destination,

@@ -2,8 +2,12 @@
 
 #include "Daemon/FileSystem/STWFileManager.h"
 #include "common/STWLog.h"
+#include "common/STWThreadSafety.h"
 #include "platform/STWPlatformConfiguration.h"
 #include "platform/STWUserDatabase.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
 
 namespace {
 
@@ -18,27 +22,110 @@ std::filesystem::path underRoot(const char* absolute) {
 uid_t installationUID() { return STWPlatformConfiguration::sharedInstance()->installationUID(); }
 uid_t systemContainerUID() { return STWPlatformConfiguration::sharedInstance()->systemContainerUID(); }
 
+// The layout directories STWCreateLayoutDirectory made, by path: which directory it was and
+// the owner and class it was given. Process-wide, as the directories are; bounded, since
+// per-user entries come and go with personas.
+struct MadeDirectory {
+    dev_t device;
+    ino_t inode;
+    uid_t owner;
+    int32_t protectionClass;
+};
+
+class MadeDirectories {
+public:
+    static MadeDirectories& shared() {
+        static MadeDirectories* made = new MadeDirectories; // used by detached queue threads at exit
+        return *made;
+    }
+    std::optional<MadeDirectory> find(const std::string& path) {
+        STWLockGuard guard(_mutex);
+        auto found = _made.find(path);
+        return found == _made.end() ? std::nullopt : std::optional<MadeDirectory>(found->second);
+    }
+    void remember(const std::string& path, const MadeDirectory& made) {
+        STWLockGuard guard(_mutex);
+        if (_made.size() >= kLimit)
+            _made.clear(); // everything is made again once, at one check's cost more
+        _made[path] = made;
+    }
+    void forget(const std::string& path) {
+        STWLockGuard guard(_mutex);
+        _made.erase(path);
+    }
+
+private:
+    static constexpr size_t kLimit = 4096;
+    STWMutex _mutex;
+    std::unordered_map<std::string, MadeDirectory> _made STW_GUARDED_BY(_mutex);
+};
+
+// `path` relative to `trustedAncestor` when it lies below it, else empty.
+std::filesystem::path relativeBelow(const std::filesystem::path& path, const std::filesystem::path& trustedAncestor) {
+    std::filesystem::path relative =
+        trustedAncestor.empty() ? std::filesystem::path() : path.lexically_relative(trustedAncestor);
+    if (relative.empty() || *relative.begin() == "..")
+        return {};
+    return relative;
+}
+
 } // namespace
 
 void STWCreateLayoutDirectory(const std::filesystem::path& path, uint16_t mode, uid_t owner, int32_t protectionClass,
                               const char* failureMessage, const std::filesystem::path& trustedAncestor) {
     auto fileManager = STWFileManager::defaultManager();
     STWErrorRef error;
-    std::filesystem::path relative =
-        trustedAncestor.empty() ? std::filesystem::path() : path.lexically_relative(trustedAncestor);
+    std::filesystem::path relative = relativeBelow(path, trustedAncestor);
     bool created;
-    if (relative.empty() || *relative.begin() == "..") {
+    struct stat made {};
+    bool identified = false;
+    if (relative.empty()) {
         created = fileManager->createDirectoryAtURL(path, true, mode, owner, protectionClass, &error);
+        // Only root can change what lies above it: the path names what was made.
+        identified = created && lstat(path.c_str(), &made) == 0;
     } else {
         // The ancestor itself is made as the path says, as any layout directory is.
-        STWFileDescriptor ancestor;
+        STWFileDescriptor ancestor, directory;
         if (fileManager->createDirectoryAtURL(trustedAncestor, true, mode, &error))
             ancestor = fileManager->openDirectoryAtURL(trustedAncestor, &error);
-        created = ancestor &&
-                  fileManager->createDirectoryBeneath(ancestor.get(), relative, mode, owner, protectionClass, path, &error);
+        if (ancestor)
+            directory =
+                fileManager->createDirectoryBeneath(ancestor.get(), relative, mode, owner, protectionClass, path, &error);
+        created = static_cast<bool>(directory);
+        identified = created && fstat(directory.get(), &made) == 0;
     }
+    if (identified)
+        MadeDirectories::shared().remember(path.native(), {made.st_dev, made.st_ino, owner, protectionClass});
+    else
+        MadeDirectories::shared().forget(path.native());
     if (!created)
         STW_LOG_ERROR(STWLogCategory::Unspecified, failureMessage, path, error);
+}
+
+bool STWLayoutDirectoryIsInPlace(const std::filesystem::path& path, uid_t owner, int32_t protectionClass,
+                                 const std::filesystem::path& trustedAncestor) {
+    auto made = MadeDirectories::shared().find(path.native());
+    if (!made || made->owner != owner || made->protectionClass != protectionClass)
+        return false;
+    std::filesystem::path relative = relativeBelow(path, trustedAncestor);
+    struct stat st;
+    if (relative.empty()) {
+        if (lstat(path.c_str(), &st) != 0)
+            return false;
+    } else {
+        // Below the ancestor its owner may have put a link anywhere on the way, also where
+        // it leads back to the directory made: the check does not follow one either.
+        STWFileDescriptor ancestor(open(trustedAncestor.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+        STWFileDescriptor directory;
+        if (ancestor)
+            directory = STWFileManager::defaultManager()->openBeneath(ancestor.get(), relative.native(),
+                                                                      O_PATH | O_DIRECTORY, 0,
+                                                                      STWOpenBeneathNoSymlinks);
+        if (!directory || fstat(directory.get(), &st) != 0)
+            return false;
+    }
+    return S_ISDIR(st.st_mode) && st.st_dev == made->device && st.st_ino == made->inode &&
+           (owner == STWFileManagerOwnerUnchanged || (st.st_uid == owner && st.st_gid == owner));
 }
 
 std::filesystem::path STWTrustedAncestorForClass(const STWUserIdentityRef& userIdentity,
@@ -72,8 +159,9 @@ std::filesystem::path STWGlobalConfiguration::_directory(std::optional<std::file
                                                          const char* failureMessage) {
     // The lock is recursive: computing a path asks the parent accessor, which takes it again.
     std::lock_guard guard(_lock);
-    if (!slot)
-        slot = compute();
+    if (slot && STWLayoutDirectoryIsInPlace(*slot, owner, protectionClass))
+        return *slot;
+    slot = compute();
     STWCreateLayoutDirectory(*slot, mode, owner, protectionClass, failureMessage);
     return *slot;
 }
@@ -146,8 +234,25 @@ std::filesystem::path STWGlobalConfiguration::pendingUpdatesDirectory() {
 std::filesystem::path STWGlobalConfiguration::logDirectory() {
     std::lock_guard guard(_lock);
     std::filesystem::path path = homeDirectory() / "Library/Logs/Stowly";
-    STWCreateLayoutDirectory(path, kDirectoryMode, 0, kNoProtectionClass, "Failed to create log directory at \"%@\": %@");
+    if (!STWLayoutDirectoryIsInPlace(path, 0, kNoProtectionClass))
+        STWCreateLayoutDirectory(path, kDirectoryMode, 0, kNoProtectionClass,
+                                 "Failed to create log directory at \"%@\": %@");
     return path;
+}
+
+std::shared_ptr<const STWGlobalConfiguration::OpenDirectory>
+STWGlobalConfiguration::openDeathrowDirectory(STWErrorRef* error) {
+    std::lock_guard guard(_lock);
+    struct stat st;
+    if (_openDeathrowDirectory && fstat(_openDeathrowDirectory->fd.get(), &st) == 0 && st.st_nlink > 0)
+        return _openDeathrowDirectory;
+    // Root's own directory below root's: opened as its path says.
+    std::filesystem::path url = deathrowDirectory();
+    STWFileDescriptor fd = STWFileManager::defaultManager()->openDirectoryAtURL(url, error);
+    if (!fd)
+        return nullptr;
+    _openDeathrowDirectory = std::make_shared<const OpenDirectory>(OpenDirectory{url, std::move(fd)});
+    return _openDeathrowDirectory;
 }
 
 std::optional<std::filesystem::path> STWGlobalConfiguration::legacyTransientBundleDirectory() {
@@ -181,8 +286,9 @@ std::optional<std::filesystem::path> STWGlobalConfiguration::containerDirectoryU
     std::lock_guard guard(_lock); // global before per-user
     if (auto base = globalContainerBaseURLWithContentClass(contentClass, transient)) {
         uid_t owner = STWContainerClassIsBundle(contentClass) ? installationUID() : systemContainerUID();
-        STWCreateLayoutDirectory(*base, kDirectoryMode, owner, kLeaveProtectionClass,
-                                 "Failed to create container dir at \"%@\": %@");
+        if (!STWLayoutDirectoryIsInPlace(*base, owner, kLeaveProtectionClass))
+            STWCreateLayoutDirectory(*base, kDirectoryMode, owner, kLeaveProtectionClass,
+                                     "Failed to create container dir at \"%@\": %@");
         return base;
     }
     return getPerUserConfigurationForUserIdentity(identity)->containerDirectoryURLForContentClass(contentClass,

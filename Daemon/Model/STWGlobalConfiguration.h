@@ -1,13 +1,18 @@
 // The daemon's directory layout: its own state directories and the global container
 // directories, plus the per-user configuration of every user identity. Every directory
-// accessor creates what it returns, with its mode, owner and data-protection class, on
-// every call, so a base directory removed behind the daemon's back comes back on next use;
-// creation failures are logged and the path is still returned.
+// accessor answers a directory that is there, with its mode, owner and data-protection
+// class: the first call makes it, and later calls check with one look-up that the very
+// directory made then is still there as it was made (STWLayoutDirectoryIsInPlace), making
+// it and its parents again when not, so a base directory removed or replaced behind the
+// daemon's back comes back on next use. Creation failures are logged and the path is still
+// returned.
 #pragma once
 
 #include "Daemon/Model/STWContainerClass.h"
 #include "Daemon/Model/STWPerUserConfiguration.h"
 #include "Daemon/Model/STWUserIdentity.h"
+#include "common/STWError.h"
+#include "common/STWFileDescriptor.h"
 
 #include <filesystem>
 #include <memory>
@@ -34,6 +39,16 @@ public:
     std::filesystem::path replaceDirectory();
     std::filesystem::path pendingUpdatesDirectory();
     std::filesystem::path logDirectory();
+    // A layout directory held open, with the path it was opened at.
+    struct OpenDirectory {
+        std::filesystem::path url;
+        STWFileDescriptor fd;
+    };
+    // deathrowDirectory() held open, for the moves into death row and the passes over it:
+    // opened on first use and again once the directory was removed (a descriptor of a
+    // removed directory has no links left), so a use costs one fstat. Shared, so that a
+    // caller reopening it never closes it under another.
+    std::shared_ptr<const OpenDirectory> openDeathrowDirectory(STWErrorRef* error = nullptr);
     // Never created: the path when it exists, else nullopt.
     std::optional<std::filesystem::path> legacyTransientBundleDirectory();
 
@@ -61,8 +76,9 @@ public:
     gid_t currentMobileGroupId() const { return _currentMobileGroupId; }
 
 private:
-    // Under the lock: computes the path once from its parent accessor (`compute`), then
-    // creates it with the given attributes, as on every call.
+    // Under the lock: the path when the directory made there is still in place; otherwise
+    // the path computed from its parent accessor (`compute`, which puts the parent in place
+    // first) with the directory made again.
     template <class Compute>
     std::filesystem::path _directory(std::optional<std::filesystem::path>& slot, Compute&& compute, uint16_t mode,
                                      uid_t owner, int32_t protectionClass, const char* failureMessage);
@@ -75,14 +91,22 @@ private:
     std::unordered_map<std::string, std::shared_ptr<STWPerUserConfiguration>> _perUserConfigurations;
     std::optional<bool> _isInternalImage;
     gid_t _currentMobileGroupId = 0;
+    std::shared_ptr<const OpenDirectory> _openDeathrowDirectory;
 };
 
 // Creates `path` with intermediate directories and the given attributes, logging
 // `failureMessage` (with the path and the error) when that fails. Shared by the global and
 // the per-user layout. Below a `trustedAncestor` (a user's home, whose contents the user
-// owns) nothing is followed: a link in place of a directory is removed.
+// owns) nothing is followed: a link in place of a directory is removed. What it made is
+// remembered for STWLayoutDirectoryIsInPlace.
 void STWCreateLayoutDirectory(const std::filesystem::path& path, uint16_t mode, uid_t owner, int32_t protectionClass,
                               const char* failureMessage, const std::filesystem::path& trustedAncestor = {});
+// Whether the directory that STWCreateLayoutDirectory last made at `path` with this owner
+// and class is still there, the same directory (device and inode) with that owner, reached
+// from `trustedAncestor` without following any link: one stat (five calls below an
+// ancestor). A directory removed, replaced, re-owned or swapped for a link is not.
+bool STWLayoutDirectoryIsInPlace(const std::filesystem::path& path, uid_t owner, int32_t protectionClass,
+                                 const std::filesystem::path& trustedAncestor = {});
 
 // The directory below which the layout of a class is the user's to change: the user's
 // home for per-user classes, nothing (empty) for the global ones.

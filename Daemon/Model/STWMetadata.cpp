@@ -135,7 +135,8 @@ STWFileDescriptor STWMetadata::openContainerDirectory(STWErrorRef* error, STWFil
     return fd;
 }
 
-bool STWMetadata::moveContainerDirectory(const std::filesystem::path& to, unsigned options, STWErrorRef* error) const {
+bool STWMetadata::moveContainerDirectory(const std::filesystem::path& to, unsigned options, STWErrorRef* error,
+                                         STWFileDescriptor* movedParent, STWFileDescriptor* movedDirectory) const {
     auto fileManager = STWFileManager::defaultManager();
     STWFileDescriptor fromParent;
     STWFileDescriptor directory = openContainerDirectory(error, &fromParent);
@@ -143,9 +144,15 @@ bool STWMetadata::moveContainerDirectory(const std::filesystem::path& to, unsign
         return false;
     STWFileDescriptor toParent = fileManager->openDirectoryAtURL(
         to.parent_path(), STWTrustedAncestorForClass(_userIdentity, _containerClass), error);
-    return toParent && fileManager->moveDirectoryAt(fromParent.get(), url().filename(), toParent.get(), to.filename(),
-                                                    directory.get(), static_cast<STWFileManagerMoveOptions>(options),
-                                                    url(), to, error);
+    if (!toParent || !fileManager->moveDirectoryAt(fromParent.get(), url().filename(), toParent.get(), to.filename(),
+                                                   directory.get(), static_cast<STWFileManagerMoveOptions>(options),
+                                                   url(), to, error))
+        return false;
+    if (movedParent)
+        *movedParent = std::move(toParent);
+    if (movedDirectory)
+        *movedDirectory = std::move(directory);
+    return true;
 }
 
 bool STWMetadata::writeMetadataToDiskWithError(STWErrorRef* error) {

@@ -80,8 +80,12 @@ public:
     STWFileDescriptor openContainerDirectory(STWErrorRef* error, STWFileDescriptor* classDirectory = nullptr) const;
     // Renames the container directory to `to`, never over an existing item: only the
     // directory that holds this record's own file, and nothing on the way followed.
-    // `options` are STWFileManagerMoveOptions (the rename's durability).
-    bool moveContainerDirectory(const std::filesystem::path& to, unsigned options, STWErrorRef* error) const;
+    // `options` are STWFileManagerMoveOptions (the rename's durability). `movedParent` and
+    // `movedDirectory`, when given, keep the new parent and the directory open, so that the
+    // directory can be moved on without a look-up.
+    bool moveContainerDirectory(const std::filesystem::path& to, unsigned options, STWErrorRef* error,
+                                STWFileDescriptor* movedParent = nullptr,
+                                STWFileDescriptor* movedDirectory = nullptr) const;
 
     static std::shared_ptr<STWMetadata> readAndValidateMetadataAtUrl(const std::filesystem::path& containerURL,
                                                                      const STWUserIdentityRef& forUserIdentity,

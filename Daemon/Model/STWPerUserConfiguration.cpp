@@ -15,9 +15,11 @@ template <class Compute>
 std::filesystem::path STWPerUserConfiguration::_created(std::optional<std::filesystem::path>& slot, Compute&& compute,
                                                         const char* failureMessage) {
     std::lock_guard guard(_lock);
-    if (!slot)
-        slot = compute();
-    STWCreateLayoutDirectory(*slot, 0755, _userIdentity->posixUID(), -1, failureMessage, _userHomeDirectory);
+    uid_t owner = _userIdentity->posixUID();
+    if (slot && STWLayoutDirectoryIsInPlace(*slot, owner, -1, _userHomeDirectory))
+        return *slot;
+    slot = compute();
+    STWCreateLayoutDirectory(*slot, 0755, owner, -1, failureMessage, _userHomeDirectory);
     return *slot;
 }
 
@@ -67,11 +69,13 @@ std::optional<std::filesystem::path> STWPerUserConfiguration::containerDirectory
         return std::nullopt;
     }
     std::lock_guard guard(_lock);
-    std::filesystem::path path = (transient ? transientDirectory() : userBaseDirectory()) /
-                                 STWContainerClassDirectoryName(contentClass);
-    STWCreateLayoutDirectory(path, 0755, _userIdentity->posixUID(), -1, "Failed to create container dir at \"%@\": %@",
-                             _userHomeDirectory);
-    return path;
+    return _created(
+        _containerDirectories[{contentClass, transient}],
+        [&] {
+            return (transient ? transientDirectory() : userBaseDirectory()) /
+                   STWContainerClassDirectoryName(contentClass);
+        },
+        "Failed to create container dir at \"%@\": %@");
 }
 
 bool STWPerUserConfiguration::existsUserBaseDirectory() {

@@ -6,6 +6,7 @@
 #include "Daemon/Model/STWUserIdentity.h"
 
 #include <filesystem>
+#include <map>
 #include <mutex>
 #include <optional>
 
@@ -31,8 +32,9 @@ public:
     bool existsUserBaseDirectory();
 
 private:
-    // Under the lock: computes the path once (`compute` may ask a parent accessor), then
-    // creates it, as on every call.
+    // Under the lock: the path when the directory made there is still in place; otherwise
+    // the path computed (`compute` may ask a parent accessor, which puts the parent in
+    // place first) with the directory made again.
     template <class Compute>
     std::filesystem::path _created(std::optional<std::filesystem::path>& slot, Compute&& compute,
                                    const char* failureMessage);
@@ -40,5 +42,7 @@ private:
     std::recursive_mutex _lock;
     STWUserIdentityRef _userIdentity;
     std::optional<std::filesystem::path> _userBaseDirectory, _transientDirectory, _stagingDirectory, _libraryDirectory;
+    // The class directories, by class and transient.
+    std::map<std::pair<STWContainerClass, bool>, std::optional<std::filesystem::path>> _containerDirectories;
     std::filesystem::path _userHomeDirectory;
 };

@@ -105,6 +105,10 @@ public:
                                STWErrorRef* error,
                                STWFileManagerMoveOptions options = STWFileManagerMoveSyncSourceDirectory);
     static bool _removeItemOrMoveToTempAtURL(const std::filesystem::path& url, STWErrorRef* error);
+    // The same for the entry `name` of the directory open as `dirfd` (death row's), which
+    // `url` names.
+    static bool _removeItemOrMoveToTempAt(int dirfd, const std::string& name, const std::filesystem::path& url,
+                                          STWErrorRef* error);
     // Empties death row on the death-row queue; the completion gets 1 or the last error's code.
     static void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
 

@@ -6,6 +6,7 @@
 #include <gtest/gtest.h>
 
 #include <sys/stat.h>
+#include <unistd.h>
 
 namespace {
 
@@ -67,6 +68,42 @@ TEST_F(STWLayoutTest, ARemovedBaseDirectoryIsRepairedByTheNextCall) {
     EXPECT_FALSE(std::filesystem::exists(staging));
     EXPECT_EQ(global->stagingDirectory(), staging);
     EXPECT_TRUE(std::filesystem::is_directory(staging));
+}
+
+// A directory is made once and then only checked; what replaced it behind the daemon's back
+// is noticed by that check: a link in its place, a link on the way back to the very directory
+// made (nothing is followed below the user's home), another owner, and for death row's held
+// descriptor the directory's removal.
+TEST_F(STWLayoutTest, ADirectoryReplacedAfterItWasMadeIsMadeAgainNotFollowed) {
+    namespace fs = std::filesystem;
+    fs::path home = root->resolve("/private/var/relinked-layout"), outside = root->resolve("/private/var/outside");
+    auto user = STWUserIdentity::initWithUID(503, 503, home, "RELINKED", STWPersonaTypeEnterprise, 2001);
+    fs::path classDirectory = *global->containerDirectoryURLForUserIdentity(user, 2, false);
+    fs::create_directories(outside);
+    fs::rename(classDirectory, outside / "Application");
+    fs::create_directory_symlink(outside / "Application", classDirectory);
+    EXPECT_EQ(*global->containerDirectoryURLForUserIdentity(user, 2, false), classDirectory);
+    EXPECT_TRUE(fs::is_directory(fs::symlink_status(classDirectory)));
+    EXPECT_TRUE(fs::is_directory(fs::symlink_status(outside / "Application"))) << "nothing was followed";
+
+    fs::rename(home / "Containers/Data", home / "Containers/Moved");
+    fs::create_directory_symlink(home / "Containers/Moved", home / "Containers/Data");
+    global->containerDirectoryURLForUserIdentity(user, 2, false);
+    EXPECT_TRUE(fs::is_directory(fs::symlink_status(home / "Containers/Data")));
+
+    ASSERT_EQ(chown(classDirectory.c_str(), 0, 0), 0);
+    global->containerDirectoryURLForUserIdentity(user, 2, false);
+    EXPECT_EQ(statOf(classDirectory).st_uid, 503u);
+
+    auto deathRow = global->openDeathrowDirectory();
+    ASSERT_TRUE(deathRow);
+    fs::remove_all(deathRow->url);
+    deathRow = global->openDeathrowDirectory();
+    struct stat held {};
+    ASSERT_EQ(fstat(deathRow->fd.get(), &held), 0);
+    EXPECT_EQ(held.st_ino, statOf(deathRow->url).st_ino) << "reopened where the path now leads";
+    fs::remove_all(home);
+    fs::remove_all(outside);
 }
 
 TEST_F(STWLayoutTest, StateDirectoriesCarryNoProtectionClassAndBackupsAreNeverCreated) {
