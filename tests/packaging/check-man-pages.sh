@@ -18,7 +18,7 @@ for page in "$@"; do
         failed=1
     fi
     # A page that renders to nothing would pass the above.
-    MANWIDTH=80 man -l "$page" 2>/dev/null | grep -q "NAME" || { echo "FAIL: $page has no NAME section"; failed=1; }
+    grep -q "NAME" <<<"$(MANWIDTH=80 man -l "$page" 2>/dev/null)" || { echo "FAIL: $page has no NAME section"; failed=1; }
 done
 [ "$failed" -eq 0 ] && echo "rendered without warnings: $*"
 exit "$failed"

@@ -63,7 +63,9 @@ library=$(find "$prefix" -name libstowly.so.0 -print -quit)
 [ -n "$library" ] || fail "no libstowly.so.0 installed"
 export LD_LIBRARY_PATH=$(dirname "$library")
 for consumer in "${consumers[@]}"; do
-    ldd "$consumer" | grep -q "=> $library" || fail "$consumer does not load $library"
+    # Read whole before the match: grep -q leaving early would fail the pipe (pipefail).
+    loaded=$(ldd "$consumer")
+    grep -q "=> $library" <<<"$loaded" || { echo "$loaded"; fail "$consumer does not load $library"; }
 done
 
 # A device of its own: the mobile user, developer mode for stowlyctl's installer identity,
