@@ -214,10 +214,12 @@ public:
         uint64_t budget = 4 * bytes.size();
         for (uint64_t index = 0; index < _numObjects; ++index) {
             uint64_t offset = bigEndian(_base + _offsetTable + index * _offsetSize, _offsetSize);
-            if (offset < 8 || offset >= _offsetTable)
+            // libplist takes an object wherever its offset points, also past the object
+            // area (into the offset table and trailer), so that is where strings are looked at.
+            if (offset < 8 || offset >= bytes.size())
                 continue;
             const uint8_t* p = _base + offset;
-            const uint8_t* end = _base + _offsetTable;
+            const uint8_t* end = _base + bytes.size();
             uint8_t type = *p & 0xF0, info = *p & 0x0F;
             ++p;
             uint64_t count;

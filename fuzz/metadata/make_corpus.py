@@ -44,9 +44,10 @@ SEEDS = {
     "info_not_dictionary": (2, {**DATA, "STWMetadataInfo": "text"}),
     "array": (2, [DATA]),
 }
-# corpus/non_utf8_info_key is not written here: the fuzzer found it (an info key with a
-# byte that is not UTF-8, which the reader took and a rewrite of the file changed), and it
-# is kept byte for byte.
+# corpus/non_utf8_info_key and corpus/string_past_offset_table are not written here: the
+# fuzzer found them (an info key with a byte that is not UTF-8, which the reader took and a
+# rewrite of the file changed; a UTF-16 key with a NUL, placed past the offset table, which
+# made libplist abort), and they are kept byte for byte.
 
 
 def main():
