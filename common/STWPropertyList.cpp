@@ -214,9 +214,10 @@ public:
         uint64_t budget = 4 * bytes.size();
         for (uint64_t index = 0; index < _numObjects; ++index) {
             uint64_t offset = bigEndian(_base + _offsetTable + index * _offsetSize, _offsetSize);
-            // libplist takes an object wherever its offset points, also past the object
-            // area (into the offset table and trailer), so that is where strings are looked at.
-            if (offset < 8 || offset >= bytes.size())
+            // libplist takes an object wherever its offset points, also outside the object
+            // area (into the header, the offset table or the trailer), so strings are looked
+            // at wherever they are.
+            if (offset >= bytes.size())
                 continue;
             const uint8_t* p = _base + offset;
             const uint8_t* end = _base + bytes.size();

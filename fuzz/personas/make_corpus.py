@@ -23,9 +23,10 @@ SEEDS = {
     "skipped": [PERSONAL, {"PersonaID": 2**33, "Type": "personal"}, {"PersonaID": 9, "Type": "guest"}, "x"],
     "dictionary": {"Personas": [PERSONAL]},
 }
-# corpus/relative_home is not written here: the fuzzer found it (an enterprise persona
-# whose HomeLayoutPath, read as UTF-16 text, was a relative path that the reader kept), and
-# it is kept byte for byte.
+# corpus/relative_home and corpus/string_in_header are not written here: the fuzzer found
+# them (an enterprise persona whose HomeLayoutPath, read as UTF-16 text, was a relative path
+# that the reader kept; a UTF-16 string with a NUL whose offset points into the header,
+# which made libplist abort), and they are kept byte for byte.
 
 
 def main():
