@@ -66,7 +66,7 @@ std::string STWTortureWorker::historyFor(const std::string& violation) const {
 STWTortureWorker::Outcome STWTortureWorker::_send(const char* kind, STWClient& client, STWValue::Dictionary message,
                                                   STWValue::Dictionary* reply, uint64_t* code) {
     STWErrorRef error;
-    auto answer = client.sendMessage(message, requestTimeout, &error);
+    auto answer = client.sendMessage(message, _faults ? faultReplyTimeout : requestTimeout, &error);
     const std::string* identifier = STWDictionaryString(message, "Identifier");
     if (!identifier)
         identifier = STWDictionaryString(message, "NewIdentifier");
@@ -77,6 +77,15 @@ STWTortureWorker::Outcome STWTortureWorker::_send(const char* kind, STWClient& c
               std::string(kind) + ": " +
                   (answer ? "code " + std::to_string(STWDictionaryUInt64(*answer, "ReplyError").value_or(0))
                           : std::string("no reply")));
+    if (!answer && _faults) {
+        // Nothing waits for an unlock here, and faults must never stop or kill the daemon.
+        _violation(std::string(kind) + (error && error->isPOSIX(ETIMEDOUT)
+                                            ? " got no reply within " + std::to_string(faultReplyTimeout.count()) + " s"
+                                            : " got no reply: the connection ended"));
+        _connectionDead = true;
+        ++uncertain[kind];
+        return Outcome::Uncertain;
+    }
     if (!answer) {
         // A time-out leaves the connection usable (a change waiting for an unlock, say);
         // anything else means the daemon is gone.
@@ -87,6 +96,13 @@ STWTortureWorker::Outcome STWTortureWorker::_send(const char* kind, STWClient& c
     }
     *reply = std::move(*answer);
     *code = STWDictionaryUInt64(*reply, "ReplyError").value_or(0);
+    if (*code != STWErrorSuccess && _faults) {
+        if (!STWErrorCodeName(*code))
+            _violation(std::string(kind) + " answered with code " + std::to_string(*code) +
+                       ", which the daemon does not define");
+        ++failed;
+        return Outcome::Uncertain;
+    }
     if (*code != STWErrorSuccess)
         return Outcome::Refused;
     ++acknowledged[kind];
@@ -471,7 +487,9 @@ void STWTortureWorker::_upcall(STWUpcallClient& upcalls, const std::string& app)
     std::string system = _system(_random() % systemCount);
     request.systemContainerIdentifier = system;
     STWErrorRef error;
-    auto reply = upcalls.send(request, requestTimeout, &error);
+    auto reply = upcalls.send(request, _faults ? faultReplyTimeout : requestTimeout, &error);
+    if (!reply && _faults)
+        _violation("upcall for " + app + " got no reply");
     std::vector<STWTortureIdentity> named{{2, app}, {12, system}};
     for (const auto& group : request.appGroupIdentifiers)
         named.push_back({7, group});
@@ -571,7 +589,7 @@ void STWTortureWorker::run(STWClient& client, STWUpcallClient* upcalls, const st
             _upcall(*upcalls, app);
         else if (roll < 95)
             _emptyDeathRow(client);
-        else if (_index == 0)
+        else if (_index == 0 && !_faults)
             _setKeybag(!_locked);
     }
 }

@@ -13,6 +13,7 @@
 #include "tests/torture/STWTortureModel.h"
 
 #include <atomic>
+#include <chrono>
 #include <map>
 #include <random>
 #include <string>
@@ -21,6 +22,13 @@
 class STWTortureWorker {
 public:
     STWTortureWorker(unsigned index, uint64_t seed, std::string root);
+
+    // Under injected faults any request may fail: a reply with an error counts as not
+    // acknowledged (all or nothing of its change may have been made), but its code must be
+    // one the daemon defines, and a reply must come within faultReplyTimeout (the device
+    // stays unlocked, so nothing waits for an unlock). Off by default.
+    void expectFaults() { _faults = true; }
+    static constexpr std::chrono::seconds faultReplyTimeout{30};
 
     // Sends requests until `stop` is set or the connection dies. `focus` (a crash point's
     // name, or empty) steers it towards the requests that reach that point.
@@ -39,6 +47,7 @@ public:
     STWTortureModel model;
     std::vector<std::string> violations;
     std::map<std::string, uint64_t> acknowledged, uncertain;
+    uint64_t failed = 0; // replies with an error code under injected faults
 
 private:
     enum class Outcome { Acknowledged, Refused, Uncertain };
@@ -84,5 +93,6 @@ private:
     std::map<STWTortureIdentity, std::vector<std::string>> _history;
     bool _connectionDead = false;
     bool _locked = false;
+    bool _faults = false;
     int64_t _nextInfoValue = 1;
 };
