@@ -43,6 +43,13 @@ std::string STWTortureWorker::_group(unsigned k) const {
 
 void STWTortureWorker::_violation(const std::string& text) { violations.push_back(text); }
 
+void STWTortureWorker::_measure(std::chrono::steady_clock::time_point began, bool answered) {
+    ++requests;
+    if (answered && _mode == Mode::Steady)
+        latencies.push_back(uint32_t(std::chrono::duration_cast<std::chrono::microseconds>(
+                                         std::chrono::steady_clock::now() - began).count()));
+}
+
 void STWTortureWorker::_note(const STWTortureIdentity& identity, const std::string& what) {
     auto& lines = _history[identity];
     if (lines.size() >= 8)
@@ -66,7 +73,9 @@ std::string STWTortureWorker::historyFor(const std::string& violation) const {
 STWTortureWorker::Outcome STWTortureWorker::_send(const char* kind, STWClient& client, STWValue::Dictionary message,
                                                   STWValue::Dictionary* reply, uint64_t* code) {
     STWErrorRef error;
-    auto answer = client.sendMessage(message, _faults ? faultReplyTimeout : requestTimeout, &error);
+    auto began = std::chrono::steady_clock::now();
+    auto answer = client.sendMessage(message, _mode != Mode::Kills ? replyTimeout : requestTimeout, &error);
+    _measure(began, answer.has_value());
     const std::string* identifier = STWDictionaryString(message, "Identifier");
     if (!identifier)
         identifier = STWDictionaryString(message, "NewIdentifier");
@@ -77,10 +86,10 @@ STWTortureWorker::Outcome STWTortureWorker::_send(const char* kind, STWClient& c
               std::string(kind) + ": " +
                   (answer ? "code " + std::to_string(STWDictionaryUInt64(*answer, "ReplyError").value_or(0))
                           : std::string("no reply")));
-    if (!answer && _faults) {
+    if (!answer && _mode != Mode::Kills) {
         // Nothing waits for an unlock here, and faults must never stop or kill the daemon.
         _violation(std::string(kind) + (error && error->isPOSIX(ETIMEDOUT)
-                                            ? " got no reply within " + std::to_string(faultReplyTimeout.count()) + " s"
+                                            ? " got no reply within " + std::to_string(replyTimeout.count()) + " s"
                                             : " got no reply: the connection ended"));
         _connectionDead = true;
         ++uncertain[kind];
@@ -96,7 +105,8 @@ STWTortureWorker::Outcome STWTortureWorker::_send(const char* kind, STWClient& c
     }
     *reply = std::move(*answer);
     *code = STWDictionaryUInt64(*reply, "ReplyError").value_or(0);
-    if (*code != STWErrorSuccess && _faults) {
+    // Not found is an answer about the disk, which a fault must not falsify.
+    if (*code != STWErrorSuccess && _mode == Mode::Faults && *code != notFound && *code != infoValueNotFound) {
         if (!STWErrorCodeName(*code))
             _violation(std::string(kind) + " answered with code " + std::to_string(*code) +
                        ", which the daemon does not define");
@@ -469,9 +479,14 @@ void STWTortureWorker::_groups(STWClient& client, const std::string& owner) {
             _observePresent("groups", {7, group}, *path.string(), std::nullopt, std::nullopt);
         _askedFor.insert({7, group});
     }
+    // A group whose container cannot be made is left out, and the others still answered: under
+    // faults that group's container may or may not be there.
     if (!entry.uncertain)
         for (const auto& group : entry.groups)
-            if (!answered.count(group))
+            if (!answered.count(group) && _mode == Mode::Faults)
+                model.containers.emplace(STWTortureIdentity{7, group}, STWTortureExpectation::absent())
+                    .first->second.mayBePresent = true;
+            else if (!answered.count(group))
                 _violation("groups of " + owner + " left out " + group);
 }
 
@@ -487,8 +502,10 @@ void STWTortureWorker::_upcall(STWUpcallClient& upcalls, const std::string& app)
     std::string system = _system(_random() % systemCount);
     request.systemContainerIdentifier = system;
     STWErrorRef error;
-    auto reply = upcalls.send(request, _faults ? faultReplyTimeout : requestTimeout, &error);
-    if (!reply && _faults)
+    auto began = std::chrono::steady_clock::now();
+    auto reply = upcalls.send(request, _mode != Mode::Kills ? replyTimeout : requestTimeout, &error);
+    _measure(began, reply.has_value());
+    if (!reply && _mode != Mode::Kills)
         _violation("upcall for " + app + " got no reply");
     std::vector<STWTortureIdentity> named{{2, app}, {12, system}};
     for (const auto& group : request.appGroupIdentifiers)
@@ -589,7 +606,7 @@ void STWTortureWorker::run(STWClient& client, STWUpcallClient* upcalls, const st
             _upcall(*upcalls, app);
         else if (roll < 95)
             _emptyDeathRow(client);
-        else if (_index == 0 && !_faults)
+        else if (_index == 0 && _mode == Mode::Kills)
             _setKeybag(!_locked);
     }
 }

@@ -11,7 +11,14 @@
 // checker looks at what the faults left. Prints "fault rounds: N, faults fired: F,
 // violations: M".
 //
-//   stowly_torture [--kills N | --faults N] [--seed S] [--threads T] [--state FILE] [--verbose]
+// With --soak SECONDS it neither kills nor faults: 64 client threads (--threads) drive one
+// daemon for that long; it reports the requests, the errors (replies the workload does not
+// expect, and missing replies), the latency and the daemon's resident memory and open
+// descriptors after a warm-up (a tenth of the time) and at the end, which must not have
+// grown beyond 10% (descriptors: 10% and 8).
+//
+//   stowly_torture [--kills N | --faults N | --soak SECONDS] [--seed S] [--threads T]
+//                  [--state FILE] [--verbose]
 //
 // FILE, when given, holds the root, the first-boot semaphore and the daemon's pid, so that
 // a script can clean up after a driver that was itself killed.
@@ -51,6 +58,7 @@ const STWValue::Dictionary installerEntitlements{{"com.vorlane.private.Stowly.al
 struct Options {
     unsigned kills = 1000;
     unsigned faultRounds = 0; // > 0: the fault mode
+    unsigned soakSeconds = 0; // > 0: the soak
     uint64_t seed = 0;
     unsigned threads = 4;
     std::string stateFile;
@@ -59,6 +67,7 @@ struct Options {
 
 bool parse(int argc, char** argv, Options* options) {
     options->seed = std::random_device()();
+    bool threadsGiven = false;
     for (int i = 1; i < argc; ++i) {
         std::string arg = argv[i];
         auto next = [&](unsigned long long* value) {
@@ -69,13 +78,16 @@ bool parse(int argc, char** argv, Options* options) {
             return end && *end == 0;
         };
         unsigned long long value = 0;
+        threadsGiven = threadsGiven || arg == "--threads";
         if (arg == "--kills" && next(&value) && value > 0)
             options->kills = unsigned(value);
         else if (arg == "--faults" && next(&value) && value > 0)
             options->faultRounds = unsigned(value);
         else if (arg == "--seed" && next(&value))
             options->seed = value;
-        else if (arg == "--threads" && next(&value) && value > 0 && value <= 16)
+        else if (arg == "--soak" && next(&value) && value > 0)
+            options->soakSeconds = unsigned(value);
+        else if (arg == "--threads" && next(&value) && value > 0 && value <= 64)
             options->threads = unsigned(value);
         else if (arg == "--state" && i + 1 < argc)
             options->stateFile = argv[++i];
@@ -84,7 +96,9 @@ bool parse(int argc, char** argv, Options* options) {
         else
             return false;
     }
-    return true;
+    if (options->soakSeconds && !threadsGiven)
+        options->threads = 64;
+    return !(options->soakSeconds && options->faultRounds);
 }
 
 class Torture {
@@ -97,7 +111,9 @@ public:
         for (unsigned t = 0; t < options.threads; ++t) {
             _workers.push_back(std::make_unique<STWTortureWorker>(t, options.seed, _daemon.root().string()));
             if (options.faultRounds)
-                _workers.back()->expectFaults();
+                _workers.back()->setMode(STWTortureWorker::Mode::Faults);
+            else if (options.soakSeconds)
+                _workers.back()->setMode(STWTortureWorker::Mode::Steady);
         }
     }
 
@@ -106,6 +122,7 @@ public:
 private:
     void _runKills();
     void _runFaults();
+    void _runSoak();
     // Runs every worker on a thread of its own, with a connection of its own, while
     // `meanwhile` runs; stops and joins them after it.
     void _drive(const std::string& focus, const std::function<void()>& meanwhile);
@@ -126,6 +143,11 @@ private:
     STWTortureChecker _checker;
     std::vector<std::unique_ptr<STWTortureWorker>> _workers;
     unsigned _rounds = 0;
+    struct Usage {
+        long residentKB = -1;
+        long descriptors = -1;
+    } _warm, _end;
+    Usage _usage() const;
     unsigned _kills = 0, _pointKills = 0, _startKills = 0, _reboots = 0, _checks = 0;
     std::vector<std::string> _violations;
 };
@@ -324,17 +346,57 @@ void Torture::_runFaults() {
         _faultRound();
 }
 
+Torture::Usage Torture::_usage() const {
+    Usage usage;
+    std::ifstream status("/proc/" + std::to_string(_daemon.pid()) + "/status");
+    for (std::string line; std::getline(status, line);)
+        if (line.starts_with("VmRSS:"))
+            usage.residentKB = strtol(line.c_str() + 6, nullptr, 10);
+    std::error_code ec;
+    long count = 0;
+    for (std::filesystem::directory_iterator it("/proc/" + std::to_string(_daemon.pid()) + "/fd", ec), end;
+         !ec && it != end; it.increment(ec))
+        ++count;
+    if (!ec)
+        usage.descriptors = count;
+    return usage;
+}
+
+void Torture::_runSoak() {
+    auto began = Clock::now();
+    auto sleepUntil = [](Clock::time_point when) {
+        while (Clock::now() < when && !interrupted.load())
+            std::this_thread::sleep_for(milliseconds(100));
+    };
+    _drive("", [&] {
+        sleepUntil(began + std::chrono::seconds(_options.soakSeconds) / 10);
+        _warm = _usage();
+        sleepUntil(began + std::chrono::seconds(_options.soakSeconds));
+        _end = _usage();
+    });
+    for (auto& worker : _workers) {
+        for (auto& v : worker->violations)
+            _violation(v);
+        worker->violations.clear();
+    }
+    if (!_daemon.isRunning())
+        return _violation("stowlyd died during the soak");
+    _check();
+}
+
 int Torture::run() {
     auto began = Clock::now();
     printf("stowly_torture: root %s, seed %llu, %u threads, %u %s\n", _daemon.root().c_str(),
            static_cast<unsigned long long>(_options.seed), _options.threads,
-           _options.faultRounds ? _options.faultRounds : _options.kills,
-           _options.faultRounds ? "fault rounds" : "kills");
+           _options.faultRounds ? _options.faultRounds : _options.soakSeconds ? _options.soakSeconds : _options.kills,
+           _options.faultRounds ? "fault rounds" : _options.soakSeconds ? "seconds of soak" : "kills");
     fflush(stdout);
     if (!_restart("", true))
         return 1;
     if (_options.faultRounds)
         _runFaults();
+    else if (_options.soakSeconds)
+        _runSoak();
     else
         _runKills();
     double seconds = std::chrono::duration<double>(Clock::now() - began).count();
@@ -365,6 +427,29 @@ int Torture::run() {
                                    std::filesystem::copy_options::overwrite_existing, ec);
         if (!ec)
             printf("the daemon's log: %s\n", kept.c_str());
+    }
+    if (_options.soakSeconds) {
+        uint64_t requests = 0;
+        std::vector<uint32_t> latencies;
+        for (auto& worker : _workers) {
+            requests += worker->requests;
+            latencies.insert(latencies.end(), worker->latencies.begin(), worker->latencies.end());
+        }
+        std::sort(latencies.begin(), latencies.end());
+        auto percentile = [&](double p) {
+            return latencies.empty() ? 0.0 : latencies[size_t(p * double(latencies.size() - 1))] / 1000.0;
+        };
+        // Measured while the load runs; the bound is not about timing, only growth.
+        bool residentOK = _warm.residentKB > 0 && _end.residentKB > 0 && _end.residentKB <= _warm.residentKB * 11 / 10;
+        bool descriptorsOK = _warm.descriptors > 0 && _end.descriptors >= 0 &&
+                             _end.descriptors <= _warm.descriptors * 11 / 10 + 8;
+        printf("latency p50: %.2f ms, p99: %.2f ms (reported, not checked)\n", percentile(0.5), percentile(0.99));
+        printf("resident memory: %ld kB after the warm-up, %ld kB at the end: %s\n", _warm.residentKB,
+               _end.residentKB, residentOK ? "pass" : "FAIL (more than 10% growth)");
+        printf("open descriptors: %ld after the warm-up, %ld at the end: %s\n", _warm.descriptors, _end.descriptors,
+               descriptorsOK ? "pass" : "FAIL (more than 10% + 8 growth)");
+        printf("soak: requests: %llu, errors: %zu\n", static_cast<unsigned long long>(requests), _violations.size());
+        return _violations.empty() && residentOK && descriptorsOK && !interrupted.load() ? 0 : 1;
     }
     if (_options.faultRounds) {
         // Every fault that fires is logged, and the log gathers every start's.
@@ -414,7 +499,10 @@ void Torture::_runKills() {
 int main(int argc, char** argv) {
     Options options;
     if (!parse(argc, argv, &options)) {
-        fprintf(stderr, "usage: %s [--kills N | --faults N] [--seed S] [--threads T] [--state FILE] [--verbose]\n", argv[0]);
+        fprintf(stderr,
+                "usage: %s [--kills N | --faults N | --soak SECONDS] [--seed S] [--threads T] [--state FILE] "
+                "[--verbose]\n",
+                argv[0]);
         return 2;
     }
     // Stopped from outside, the driver still stops its daemon and removes its root.
