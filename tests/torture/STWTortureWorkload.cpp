@@ -481,13 +481,15 @@ void STWTortureWorker::_groups(STWClient& client, const std::string& owner) {
     }
     // A group whose container cannot be made is left out, and the others still answered: under
     // faults that group's container may or may not be there.
-    if (!entry.uncertain)
-        for (const auto& group : entry.groups)
+    if (!entry.uncertain) {
+        for (const auto& group : entry.groups) {
             if (!answered.count(group) && _mode == Mode::Faults)
                 model.containers.emplace(STWTortureIdentity{7, group}, STWTortureExpectation::absent())
                     .first->second.mayBePresent = true;
             else if (!answered.count(group))
                 _violation("groups of " + owner + " left out " + group);
+        }
+    }
 }
 
 void STWTortureWorker::_upcall(STWUpcallClient& upcalls, const std::string& app) {
