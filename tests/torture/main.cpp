@@ -415,7 +415,7 @@ int Torture::run() {
     for (auto& [kind, counts] : kinds)
         printf("  %-16s %8llu acknowledged %6llu not\n", kind.c_str(),
                static_cast<unsigned long long>(counts.first), static_cast<unsigned long long>(counts.second));
-    if (!_options.faultRounds)
+    if (!_options.faultRounds && !_options.soakSeconds)
         printf("crash points reached: %u (during a start or its check: %u), power cycles: %u, checks: %u\n",
                _pointKills, _startKills, _reboots, _checks);
     printf("wall time: %.1f s, seed %llu\n", seconds, static_cast<unsigned long long>(_options.seed));
