@@ -260,6 +260,10 @@ void STWTortureWorker::_wipe(STWClient& client, const std::string& identifier) {
     auto& e = model.containers.at(identity);
     e.info.clear();
     e.protection.clear();
+    // A replace that fails once the old container is parked sends it to death row with its
+    // staging: a wipe answered with an error (under faults) may leave no container at all.
+    if (outcome == Outcome::Uncertain && code > STWErrorSuccess)
+        e.mayBeAbsent = true;
     if (outcome == Outcome::Refused)
         _violation("wipe of " + identityText(identity) + " refused with " + std::to_string(code));
 }
@@ -299,7 +303,10 @@ void STWTortureWorker::_replace(STWClient& client, uint64_t containerClass, cons
         _violation("replace of " + identityText(identity) + " refused with " + std::to_string(code));
         [[fallthrough]];
     case Outcome::Uncertain:
-        // The old container or the new one, never neither nor both.
+        // The old container or the new one, never both; neither only after an error reply
+        // (the failed replace discarded the parked old one), never after a kill.
+        if (code > STWErrorSuccess)
+            e.mayBeAbsent = true;
         e.uuids.insert(newUUID->uuid()->string());
         e.path.clear();
         e.info.clear();
