@@ -397,7 +397,9 @@ void STWTortureWorker::_setProtection(STWClient& client, const std::string& iden
     uint64_t code = 0;
     auto& e = model.containers.at(identity);
     // Refused (locked, superseded): the walk may have begun, and the record is either.
-    if (_send("set-protection", client, message, &reply, &code) == Outcome::Acknowledged)
+    // Under faults the class may fail to be recorded although the change succeeded.
+    Outcome outcome = _send("set-protection", client, message, &reply, &code);
+    if (outcome == Outcome::Acknowledged && _mode != Mode::Faults)
         e.protection = {protectionClass};
     else if (!e.protection.empty())
         e.protection.insert(protectionClass);

@@ -108,6 +108,7 @@ public:
           _daemon({{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}}, {}, false),
           _checker(_daemon.root()) {
         _daemon.setStandardErrorFile(_daemon.root() / "stowlyd.stderr");
+        _checker.recordedProtectionMayLag = options.faultRounds > 0;
         for (unsigned t = 0; t < options.threads; ++t) {
             _workers.push_back(std::make_unique<STWTortureWorker>(t, options.seed, _daemon.root().string()));
             if (options.faultRounds)
