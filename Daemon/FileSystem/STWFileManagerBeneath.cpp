@@ -344,11 +344,18 @@ bool STWFileManager::replaceFileAt(int dirfd, TemporaryFile& file, const std::st
         return false;
     }
     struct stat st;
-    e = fstat(file.fd.get(), &st) != 0 ? errno : syncDescriptor(dirfd, parentPath(path));
-    if (e) {
-        STWSetError(error, STW_POSIX_ERROR(e, "Failed to sync the directory of %@: %s", path, strerror(e)));
+    if (fstat(file.fd.get(), &st) != 0) {
+        e = errno;
+        STWSetError(error, STW_POSIX_ERROR(e, "Failed to stat %@: %s", path, strerror(e)));
         return false;
     }
+    // The rename has replaced the file: a failed sync of the directory only leaves it to the
+    // next power cut to bring back the old one, whole. Failing here would leave the caller
+    // believing the old file is still in place, without its flag and with a stale identity,
+    // while the new one is what every reader sees.
+    e = syncDescriptor(dirfd, parentPath(path));
+    if (e)
+        STW_LOG_ERROR(STWLogCategory::FS, "Failed to sync the directory of %@: %s", path, strerror(e));
     if (immutable) {
         // The flag guards against removal where the file system has it; ownership alone
         // still tells the daemon's files from others' where it does not.

@@ -344,8 +344,11 @@ bool STWClientConnection::_recoverFromReplaceOperationsWithError(STWErrorRef* er
                           STWFormat("old: %@, new: %@, staging: %@, dest: %@", info->oldURL, info->newURL,
                                     info->stagingURL, info->destURL));
             // The old container in place (the first rename never happened, or the new one
-            // took its path), or the new one at its destination: nothing to undo.
-            if (fileManager->itemDoesNotExistAtURL(info->oldURL) && fileManager->itemDoesNotExistAtURL(info->destURL)) {
+            // took its path), or the new one at its destination: nothing to undo. Nothing in
+            // staging either: the replace finished but for removing this journal, and what
+            // it moved has been deleted since; the journal only has to go.
+            if (fileManager->itemDoesNotExistAtURL(info->oldURL) && fileManager->itemDoesNotExistAtURL(info->destURL) &&
+                !fileManager->itemDoesNotExistAtURL(info->stagingURL)) {
                 STW_LOG_DEBUG(STWLogCategory::Lifecycle, "Recovering from failed replace by moving: %@ to %@",
                               info->stagingURL, info->oldURL);
                 STWErrorRef moveError;

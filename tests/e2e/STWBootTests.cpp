@@ -120,6 +120,19 @@ TEST(STWBoot, ARestartSweepsStagingAndAPowerCycleSweepsTransientsAndStrays) {
         fs::create_directories(markers);
         std::ofstream(markers / ".interrupted.plist.Ab12Cd") << "half";
     }
+    // The journal of a replace that failed only to remove it (a full disk), whose container
+    // was deleted since: old path, destination and staging are all gone. Recovery must drop
+    // it instead of failing on it at every start.
+    {
+        auto gone = [&](const fs::path& directory) { return (directory / STWUUID::random().string()).string(); };
+        std::ofstream(layout.journals() / (STWUUID::random().string() + ".plist"))
+            << "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>"
+            << "<key>STWReplaceOperationOldURL</key><string>" << gone(layout.live()) << "</string>"
+            << "<key>STWReplaceOperationNewURL</key><string>" << gone(layout.live()) << "</string>"
+            << "<key>STWReplaceOperationStagingURL</key><string>" << gone(layout.userStaging()) << "</string>"
+            << "<key>STWReplaceOperationDestURL</key><string>" << gone(layout.live()) << "</string>"
+            << "</dict></plist>\n";
+    }
 
     ASSERT_TRUE(daemon.start());
     ASSERT_TRUE(daemon.waitForCleanups());

@@ -59,6 +59,19 @@ TEST_F(FaultInjection, FailedWriteOrReplaceKeepsTheOldFileAndNoTemporary) {
     ASSERT_TRUE(again);
     EXPECT_TRUE(fm()->replaceFileAt(dirfd.get(), *again, "file", false, nullptr, scratch() / "file"));
     EXPECT_EQ(readFile(scratch() / "file"), "new");
+
+    // Once renamed, the new file is the file: a failed sync of the directory after the rename
+    // must not report the old one as still in place (the caller would keep its identity and
+    // take the new file for a stranger's).
+    auto last = fm()->writeTemporaryFileAt(dirfd.get(), "last", 0644, scratch());
+    ASSERT_TRUE(last);
+    ASSERT_TRUE(STWFaultInjection::arm("fsync", 1, EIO));
+    struct stat identity{};
+    EXPECT_TRUE(fm()->replaceFileAt(dirfd.get(), *last, "file", false, &identity, scratch() / "file"));
+    struct stat onDisk{};
+    ASSERT_EQ(stat((scratch() / "file").c_str(), &onDisk), 0);
+    EXPECT_EQ(identity.st_ino, onDisk.st_ino);
+    EXPECT_EQ(readFile(scratch() / "file"), "last");
 }
 
 } // namespace

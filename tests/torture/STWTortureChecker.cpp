@@ -248,7 +248,7 @@ std::vector<std::string> STWTortureChecker::check(const std::vector<STWTortureMo
 
     // A recorded class is the one its data was given: a change records it only after the walk.
     for (const auto& [identity, c] : _found)
-        if (identity.first == 2 && c.protection >= 0 && c.documentsClass != c.protection)
+        if (identity.first == 2 && c.protection >= 0 && c.documentsClass != c.protection && !recordedProtectionMayLag)
             violations.push_back(identityText(identity) + " records protection class " +
                                  std::to_string(c.protection) + ", its Documents has class " +
                                  std::to_string(c.documentsClass));

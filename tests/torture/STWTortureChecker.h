@@ -19,6 +19,11 @@
 
 class STWTortureChecker {
 public:
+    // Under injected faults a protection change may change the data and then fail to record
+    // its class (the failure is logged, the reply still succeeds): the recorded class may
+    // then lag behind the data's.
+    bool recordedProtectionMayLag = false;
+
     // A container as its class directory and metadata file show it.
     struct Container {
         uint64_t containerClass = 0;

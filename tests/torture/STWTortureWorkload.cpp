@@ -43,6 +43,13 @@ std::string STWTortureWorker::_group(unsigned k) const {
 
 void STWTortureWorker::_violation(const std::string& text) { violations.push_back(text); }
 
+void STWTortureWorker::_measure(std::chrono::steady_clock::time_point began, bool answered) {
+    ++requests;
+    if (answered && _mode == Mode::Steady)
+        latencies.push_back(uint32_t(std::chrono::duration_cast<std::chrono::microseconds>(
+                                         std::chrono::steady_clock::now() - began).count()));
+}
+
 void STWTortureWorker::_note(const STWTortureIdentity& identity, const std::string& what) {
     auto& lines = _history[identity];
     if (lines.size() >= 8)
@@ -66,7 +73,9 @@ std::string STWTortureWorker::historyFor(const std::string& violation) const {
 STWTortureWorker::Outcome STWTortureWorker::_send(const char* kind, STWClient& client, STWValue::Dictionary message,
                                                   STWValue::Dictionary* reply, uint64_t* code) {
     STWErrorRef error;
-    auto answer = client.sendMessage(message, requestTimeout, &error);
+    auto began = std::chrono::steady_clock::now();
+    auto answer = client.sendMessage(message, _mode != Mode::Kills ? replyTimeout : requestTimeout, &error);
+    _measure(began, answer.has_value());
     const std::string* identifier = STWDictionaryString(message, "Identifier");
     if (!identifier)
         identifier = STWDictionaryString(message, "NewIdentifier");
@@ -77,6 +86,15 @@ STWTortureWorker::Outcome STWTortureWorker::_send(const char* kind, STWClient& c
               std::string(kind) + ": " +
                   (answer ? "code " + std::to_string(STWDictionaryUInt64(*answer, "ReplyError").value_or(0))
                           : std::string("no reply")));
+    if (!answer && _mode != Mode::Kills) {
+        // Nothing waits for an unlock here, and faults must never stop or kill the daemon.
+        _violation(std::string(kind) + (error && error->isPOSIX(ETIMEDOUT)
+                                            ? " got no reply within " + std::to_string(replyTimeout.count()) + " s"
+                                            : " got no reply: the connection ended"));
+        _connectionDead = true;
+        ++uncertain[kind];
+        return Outcome::Uncertain;
+    }
     if (!answer) {
         // A time-out leaves the connection usable (a change waiting for an unlock, say);
         // anything else means the daemon is gone.
@@ -87,6 +105,14 @@ STWTortureWorker::Outcome STWTortureWorker::_send(const char* kind, STWClient& c
     }
     *reply = std::move(*answer);
     *code = STWDictionaryUInt64(*reply, "ReplyError").value_or(0);
+    // Not found is an answer about the disk, which a fault must not falsify.
+    if (*code != STWErrorSuccess && _mode == Mode::Faults && *code != notFound && *code != infoValueNotFound) {
+        if (!STWErrorCodeName(*code))
+            _violation(std::string(kind) + " answered with code " + std::to_string(*code) +
+                       ", which the daemon does not define");
+        ++failed;
+        return Outcome::Uncertain;
+    }
     if (*code != STWErrorSuccess)
         return Outcome::Refused;
     ++acknowledged[kind];
@@ -234,6 +260,10 @@ void STWTortureWorker::_wipe(STWClient& client, const std::string& identifier) {
     auto& e = model.containers.at(identity);
     e.info.clear();
     e.protection.clear();
+    // A replace that fails once the old container is parked sends it to death row with its
+    // staging: a wipe answered with an error (under faults) may leave no container at all.
+    if (outcome == Outcome::Uncertain && code > STWErrorSuccess)
+        e.mayBeAbsent = true;
     if (outcome == Outcome::Refused)
         _violation("wipe of " + identityText(identity) + " refused with " + std::to_string(code));
 }
@@ -273,7 +303,10 @@ void STWTortureWorker::_replace(STWClient& client, uint64_t containerClass, cons
         _violation("replace of " + identityText(identity) + " refused with " + std::to_string(code));
         [[fallthrough]];
     case Outcome::Uncertain:
-        // The old container or the new one, never neither nor both.
+        // The old container or the new one, never both; neither only after an error reply
+        // (the failed replace discarded the parked old one), never after a kill.
+        if (code > STWErrorSuccess)
+            e.mayBeAbsent = true;
         e.uuids.insert(newUUID->uuid()->string());
         e.path.clear();
         e.info.clear();
@@ -364,7 +397,9 @@ void STWTortureWorker::_setProtection(STWClient& client, const std::string& iden
     uint64_t code = 0;
     auto& e = model.containers.at(identity);
     // Refused (locked, superseded): the walk may have begun, and the record is either.
-    if (_send("set-protection", client, message, &reply, &code) == Outcome::Acknowledged)
+    // Under faults the class may fail to be recorded although the change succeeded.
+    Outcome outcome = _send("set-protection", client, message, &reply, &code);
+    if (outcome == Outcome::Acknowledged && _mode != Mode::Faults)
         e.protection = {protectionClass};
     else if (!e.protection.empty())
         e.protection.insert(protectionClass);
@@ -453,10 +488,17 @@ void STWTortureWorker::_groups(STWClient& client, const std::string& owner) {
             _observePresent("groups", {7, group}, *path.string(), std::nullopt, std::nullopt);
         _askedFor.insert({7, group});
     }
-    if (!entry.uncertain)
-        for (const auto& group : entry.groups)
-            if (!answered.count(group))
+    // A group whose container cannot be made is left out, and the others still answered: under
+    // faults that group's container may or may not be there.
+    if (!entry.uncertain) {
+        for (const auto& group : entry.groups) {
+            if (!answered.count(group) && _mode == Mode::Faults)
+                model.containers.emplace(STWTortureIdentity{7, group}, STWTortureExpectation::absent())
+                    .first->second.mayBePresent = true;
+            else if (!answered.count(group))
                 _violation("groups of " + owner + " left out " + group);
+        }
+    }
 }
 
 void STWTortureWorker::_upcall(STWUpcallClient& upcalls, const std::string& app) {
@@ -471,7 +513,11 @@ void STWTortureWorker::_upcall(STWUpcallClient& upcalls, const std::string& app)
     std::string system = _system(_random() % systemCount);
     request.systemContainerIdentifier = system;
     STWErrorRef error;
-    auto reply = upcalls.send(request, requestTimeout, &error);
+    auto began = std::chrono::steady_clock::now();
+    auto reply = upcalls.send(request, _mode != Mode::Kills ? replyTimeout : requestTimeout, &error);
+    _measure(began, reply.has_value());
+    if (!reply && _mode != Mode::Kills)
+        _violation("upcall for " + app + " got no reply");
     std::vector<STWTortureIdentity> named{{2, app}, {12, system}};
     for (const auto& group : request.appGroupIdentifiers)
         named.push_back({7, group});
@@ -571,7 +617,7 @@ void STWTortureWorker::run(STWClient& client, STWUpcallClient* upcalls, const st
             _upcall(*upcalls, app);
         else if (roll < 95)
             _emptyDeathRow(client);
-        else if (_index == 0)
+        else if (_index == 0 && _mode == Mode::Kills)
             _setKeybag(!_locked);
     }
 }

@@ -13,6 +13,7 @@
 #include "tests/torture/STWTortureModel.h"
 
 #include <atomic>
+#include <chrono>
 #include <map>
 #include <random>
 #include <string>
@@ -21,6 +22,15 @@
 class STWTortureWorker {
 public:
     STWTortureWorker(unsigned index, uint64_t seed, std::string root);
+
+    // Without kills (Faults, Steady) the device stays unlocked, so nothing waits for an
+    // unlock, and every request must be answered within replyTimeout: a missing reply is a
+    // violation. Under injected faults (Faults) any request may fail: a reply with an error
+    // counts as not acknowledged (all or nothing of its change may have been made), but its
+    // code must be one the daemon defines.
+    enum class Mode { Kills, Faults, Steady };
+    void setMode(Mode mode) { _mode = mode; }
+    static constexpr std::chrono::seconds replyTimeout{30};
 
     // Sends requests until `stop` is set or the connection dies. `focus` (a crash point's
     // name, or empty) steers it towards the requests that reach that point.
@@ -39,6 +49,9 @@ public:
     STWTortureModel model;
     std::vector<std::string> violations;
     std::map<std::string, uint64_t> acknowledged, uncertain;
+    uint64_t failed = 0;                // replies with an error code under injected faults
+    uint64_t requests = 0;              // sent over the request socket or the upcall socket
+    std::vector<uint32_t> latencies;    // of every answered request, in microseconds
 
 private:
     enum class Outcome { Acknowledged, Refused, Uncertain };
@@ -70,6 +83,7 @@ private:
     // entry can name any more lose their containers (for certain when `certain`).
     void _released(const std::string& owner, const std::set<std::string>& before, bool certain);
     void _violation(const std::string& text);
+    void _measure(std::chrono::steady_clock::time_point began, bool answered);
     void _note(const STWTortureIdentity& identity, const std::string& what);
 
     std::string _app(unsigned k) const;
@@ -84,5 +98,6 @@ private:
     std::map<STWTortureIdentity, std::vector<std::string>> _history;
     bool _connectionDead = false;
     bool _locked = false;
+    Mode _mode = Mode::Kills;
     int64_t _nextInfoValue = 1;
 };

@@ -4,7 +4,21 @@
 // independent checker compares the disk and the daemon's answers with every acknowledged
 // reply. Prints "kills: N, violations: M" and a summary; exits 1 when M > 0.
 //
-//   stowly_torture [--kills N] [--seed S] [--threads T] [--state FILE] [--verbose]
+// With --faults N it runs N fault rounds instead of kills: the same workload against a
+// daemon started with a random list of I/O faults (STOWLY_FAULT), which must answer every
+// request in time with a code it defines and never die; a reply with an error acknowledges
+// nothing. Each round ends with a clean stop and a start without faults, after which the
+// checker looks at what the faults left. Prints "fault rounds: N, faults fired: F,
+// violations: M".
+//
+// With --soak SECONDS it neither kills nor faults: 64 client threads (--threads) drive one
+// daemon for that long; it reports the requests, the errors (replies the workload does not
+// expect, and missing replies), the latency and the daemon's resident memory and open
+// descriptors after a warm-up (a tenth of the time) and at the end, which must not have
+// grown beyond 10% (descriptors: 10% and 8).
+//
+//   stowly_torture [--kills N | --faults N | --soak SECONDS] [--seed S] [--threads T]
+//                  [--state FILE] [--verbose]
 //
 // FILE, when given, holds the root, the first-boot semaphore and the daemon's pid, so that
 // a script can clean up after a driver that was itself killed.
@@ -17,12 +31,14 @@
 #include "tests/torture/STWTortureWorkload.h"
 
 #include <algorithm>
+#include <cerrno>
 #include <atomic>
 #include <chrono>
 #include <csignal>
 #include <cstdio>
 #include <cstring>
 #include <fstream>
+#include <functional>
 #include <memory>
 #include <random>
 #include <semaphore.h>
@@ -41,6 +57,8 @@ const STWValue::Dictionary installerEntitlements{{"com.vorlane.private.Stowly.al
 
 struct Options {
     unsigned kills = 1000;
+    unsigned faultRounds = 0; // > 0: the fault mode
+    unsigned soakSeconds = 0; // > 0: the soak
     uint64_t seed = 0;
     unsigned threads = 4;
     std::string stateFile;
@@ -49,6 +67,7 @@ struct Options {
 
 bool parse(int argc, char** argv, Options* options) {
     options->seed = std::random_device()();
+    bool threadsGiven = false;
     for (int i = 1; i < argc; ++i) {
         std::string arg = argv[i];
         auto next = [&](unsigned long long* value) {
@@ -59,11 +78,16 @@ bool parse(int argc, char** argv, Options* options) {
             return end && *end == 0;
         };
         unsigned long long value = 0;
+        threadsGiven = threadsGiven || arg == "--threads";
         if (arg == "--kills" && next(&value) && value > 0)
             options->kills = unsigned(value);
+        else if (arg == "--faults" && next(&value) && value > 0)
+            options->faultRounds = unsigned(value);
         else if (arg == "--seed" && next(&value))
             options->seed = value;
-        else if (arg == "--threads" && next(&value) && value > 0 && value <= 16)
+        else if (arg == "--soak" && next(&value) && value > 0)
+            options->soakSeconds = unsigned(value);
+        else if (arg == "--threads" && next(&value) && value > 0 && value <= 64)
             options->threads = unsigned(value);
         else if (arg == "--state" && i + 1 < argc)
             options->stateFile = argv[++i];
@@ -72,7 +96,9 @@ bool parse(int argc, char** argv, Options* options) {
         else
             return false;
     }
-    return true;
+    if (options->soakSeconds && !threadsGiven)
+        options->threads = 64;
+    return !(options->soakSeconds && options->faultRounds);
 }
 
 class Torture {
@@ -82,13 +108,27 @@ public:
           _daemon({{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}}, {}, false),
           _checker(_daemon.root()) {
         _daemon.setStandardErrorFile(_daemon.root() / "stowlyd.stderr");
-        for (unsigned t = 0; t < options.threads; ++t)
+        _checker.recordedProtectionMayLag = options.faultRounds > 0;
+        for (unsigned t = 0; t < options.threads; ++t) {
             _workers.push_back(std::make_unique<STWTortureWorker>(t, options.seed, _daemon.root().string()));
+            if (options.faultRounds)
+                _workers.back()->setMode(STWTortureWorker::Mode::Faults);
+            else if (options.soakSeconds)
+                _workers.back()->setMode(STWTortureWorker::Mode::Steady);
+        }
     }
 
     int run();
 
 private:
+    void _runKills();
+    void _runFaults();
+    void _runSoak();
+    // Runs every worker on a thread of its own, with a connection of its own, while
+    // `meanwhile` runs; stops and joins them after it.
+    void _drive(const std::string& focus, const std::function<void()>& meanwhile);
+    std::string _randomFaults();
+    void _faultRound();
     // Starts the daemon (armed at `point` unless empty) and waits for its cleanups; a daemon
     // that kills itself on the way counts as a kill and is started again unarmed.
     bool _restart(std::string point, bool firstBoot);
@@ -103,6 +143,12 @@ private:
     STWDaemonProcess _daemon;
     STWTortureChecker _checker;
     std::vector<std::unique_ptr<STWTortureWorker>> _workers;
+    unsigned _rounds = 0;
+    struct Usage {
+        long residentKB = -1;
+        long descriptors = -1;
+    } _warm, _end;
+    Usage _usage() const;
     unsigned _kills = 0, _pointKills = 0, _startKills = 0, _reboots = 0, _checks = 0;
     std::vector<std::string> _violations;
 };
@@ -113,7 +159,8 @@ void Torture::_violation(const std::string& text) {
     for (auto& worker : _workers)
         history += worker->historyFor(text);
     if (_violations.size() <= 50)
-        fprintf(stderr, "VIOLATION after kill %u (reproduce with --seed %llu): %s%s\n", _kills,
+        fprintf(stderr, "VIOLATION after %s %u (reproduce with --seed %llu): %s%s\n",
+                _options.faultRounds ? "fault round" : "kill", _options.faultRounds ? _rounds : _kills,
                 static_cast<unsigned long long>(_options.seed), text.c_str(), history.c_str());
 }
 
@@ -153,7 +200,7 @@ bool Torture::_restart(std::string point, bool firstBoot) {
     return false;
 }
 
-void Torture::_window(const std::string& point) {
+void Torture::_drive(const std::string& focus, const std::function<void()>& meanwhile) {
     std::atomic<bool> stop{false};
     std::vector<std::unique_ptr<STWClient>> clients;
     std::vector<std::unique_ptr<STWUpcallClient>> upcalls;
@@ -161,24 +208,36 @@ void Torture::_window(const std::string& point) {
     for (auto& worker : _workers) {
         clients.push_back(_installer());
         upcalls.push_back(STWUpcallClient::connect(STWUpcallClient::socketPathForRoot(_daemon.root()), nullptr));
-        if (!clients.back())
+        if (!clients.back()) {
+            // A killed daemon may refuse; one under faults must not.
+            if (_options.faultRounds)
+                _violation("stowlyd refused a connection");
             continue;
+        }
         threads.emplace_back([&, w = worker.get(), c = clients.back().get(), u = upcalls.back().get()] {
-            w->run(*c, u, stop, point);
+            w->run(*c, u, stop, focus);
         });
     }
-    // Armed, the daemon is given a while to reach its point; otherwise it is killed after
-    // a short random stretch of work, so kills land at every stage of every request.
-    milliseconds window = point.empty() ? milliseconds(20 + _random() % 300) : milliseconds(1500);
-    std::optional<int> status = _daemon.waitForExit(window);
-    bool reached = status.has_value();
-    if (!status) {
-        kill(_daemon.pid(), SIGKILL);
-        status = _daemon.waitForExit(STWDaemonProcess::timeout);
-    }
+    meanwhile();
     stop = true;
     for (auto& thread : threads)
         thread.join();
+}
+
+void Torture::_window(const std::string& point) {
+    std::optional<int> status;
+    bool reached = false;
+    _drive(point, [&] {
+        // Armed, the daemon is given a while to reach its point; otherwise it is killed after
+        // a short random stretch of work, so kills land at every stage of every request.
+        milliseconds window = point.empty() ? milliseconds(20 + _random() % 300) : milliseconds(1500);
+        status = _daemon.waitForExit(window);
+        reached = status.has_value();
+        if (!status) {
+            kill(_daemon.pid(), SIGKILL);
+            status = _daemon.waitForExit(STWDaemonProcess::timeout);
+        }
+    });
     ++_kills;
     if (!point.empty() && reached)
         ++_pointKills;
@@ -235,13 +294,185 @@ void Torture::_check() {
     }
 }
 
+// The points of the daemon's file layer that STOWLY_FAULT can fail, and the errors it
+// fails them with: a full disk, a failing device, a refused permission.
+constexpr const char* faultPoints[] = {"mkdirat", "create",   "write",    "fsync",    "renameat2",
+                                       "fchown",  "fchmod",   "setxattr", "setflags", "unlinkat"};
+constexpr int faultErrors[] = {ENOSPC, EIO, EACCES};
+
+std::string Torture::_randomFaults() {
+    // Two to four points, each failing at one of its first calls (a point holds one fault).
+    std::vector<const char*> points(std::begin(faultPoints), std::end(faultPoints));
+    std::shuffle(points.begin(), points.end(), _random);
+    std::string list;
+    for (size_t i = 0, n = 2 + _random() % 3; i < n; ++i)
+        list += (list.empty() ? "" : ",") + std::string(points[i]) + ":" + std::to_string(1 + _random() % 12) + ":" +
+                std::to_string(faultErrors[_random() % std::size(faultErrors)]);
+    return list;
+}
+
+void Torture::_faultRound() {
+    ++_rounds;
+    std::string faults = _randomFaults();
+    if (_daemon.isRunning() && !_daemon.stop())
+        _violation("stowlyd did not stop cleanly before the faults " + faults);
+    bool armed = _daemon.startWith("STOWLY_FAULT", faults);
+    _writeState();
+    if (!armed || !_daemon.waitForCleanups(false)) {
+        _violation("stowlyd did not start with the faults " + faults);
+    } else {
+        _drive("", [&] { std::this_thread::sleep_for(milliseconds(600 + _random() % 600)); });
+        for (auto& worker : _workers) {
+            for (auto& v : worker->violations)
+                _violation(v + " (faults " + faults + ")");
+            worker->violations.clear();
+        }
+        if (!_daemon.isRunning())
+            _violation("stowlyd died under the faults " + faults);
+        else if (!_daemon.stop())
+            _violation("stowlyd did not stop cleanly after the faults " + faults);
+    }
+    if (_options.verbose)
+        fprintf(stderr, "fault round %u: %s\n", _rounds, faults.c_str());
+    // The faults are spent or dropped with the process: the start without them repairs what
+    // they left, and the check follows its cleanups. It is a first start since power-on: a
+    // removal that failed half-way leaves a directory without metadata in its class
+    // directory, which is no container and only the first-boot sweep removes.
+    bool started = _daemon.isRunning();
+    if (!started) {
+        _daemon.reboot();
+        started = _restart("", true);
+    }
+    if (started)
+        _check();
+    if (!_daemon.isRunning())
+        _violation("stowlyd died after the faults " + faults + ", without them");
+}
+
+void Torture::_runFaults() {
+    while (_rounds < _options.faultRounds && !interrupted.load() && _violations.size() <= 200)
+        _faultRound();
+}
+
+Torture::Usage Torture::_usage() const {
+    Usage usage;
+    std::ifstream status("/proc/" + std::to_string(_daemon.pid()) + "/status");
+    for (std::string line; std::getline(status, line);)
+        if (line.starts_with("VmRSS:"))
+            usage.residentKB = strtol(line.c_str() + 6, nullptr, 10);
+    std::error_code ec;
+    long count = 0;
+    for (std::filesystem::directory_iterator it("/proc/" + std::to_string(_daemon.pid()) + "/fd", ec), end;
+         !ec && it != end; it.increment(ec))
+        ++count;
+    if (!ec)
+        usage.descriptors = count;
+    return usage;
+}
+
+void Torture::_runSoak() {
+    auto began = Clock::now();
+    auto sleepUntil = [](Clock::time_point when) {
+        while (Clock::now() < when && !interrupted.load())
+            std::this_thread::sleep_for(milliseconds(100));
+    };
+    _drive("", [&] {
+        sleepUntil(began + std::chrono::seconds(_options.soakSeconds) / 10);
+        _warm = _usage();
+        sleepUntil(began + std::chrono::seconds(_options.soakSeconds));
+        _end = _usage();
+    });
+    for (auto& worker : _workers) {
+        for (auto& v : worker->violations)
+            _violation(v);
+        worker->violations.clear();
+    }
+    if (!_daemon.isRunning())
+        return _violation("stowlyd died during the soak");
+    _check();
+}
+
 int Torture::run() {
     auto began = Clock::now();
-    printf("stowly_torture: root %s, seed %llu, %u threads, %u kills\n", _daemon.root().c_str(),
-           static_cast<unsigned long long>(_options.seed), _options.threads, _options.kills);
+    printf("stowly_torture: root %s, seed %llu, %u threads, %u %s\n", _daemon.root().c_str(),
+           static_cast<unsigned long long>(_options.seed), _options.threads,
+           _options.faultRounds ? _options.faultRounds : _options.soakSeconds ? _options.soakSeconds : _options.kills,
+           _options.faultRounds ? "fault rounds" : _options.soakSeconds ? "seconds of soak" : "kills");
     fflush(stdout);
     if (!_restart("", true))
         return 1;
+    if (_options.faultRounds)
+        _runFaults();
+    else if (_options.soakSeconds)
+        _runSoak();
+    else
+        _runKills();
+    double seconds = std::chrono::duration<double>(Clock::now() - began).count();
+    uint64_t acknowledged = 0, uncertain = 0, failed = 0;
+    std::map<std::string, std::pair<uint64_t, uint64_t>> kinds;
+    for (auto& worker : _workers) {
+        failed += worker->failed;
+        for (auto& [kind, n] : worker->acknowledged)
+            acknowledged += n, kinds[kind].first += n;
+        for (auto& [kind, n] : worker->uncertain)
+            uncertain += n, kinds[kind].second += n;
+    }
+    printf("requests acknowledged: %llu, not acknowledged: %llu (answered with an error: %llu)\n",
+           static_cast<unsigned long long>(acknowledged), static_cast<unsigned long long>(uncertain),
+           static_cast<unsigned long long>(failed));
+    for (auto& [kind, counts] : kinds)
+        printf("  %-16s %8llu acknowledged %6llu not\n", kind.c_str(),
+               static_cast<unsigned long long>(counts.first), static_cast<unsigned long long>(counts.second));
+    if (!_options.faultRounds && !_options.soakSeconds)
+        printf("crash points reached: %u (during a start or its check: %u), power cycles: %u, checks: %u\n",
+               _pointKills, _startKills, _reboots, _checks);
+    printf("wall time: %.1f s, seed %llu\n", seconds, static_cast<unsigned long long>(_options.seed));
+    if (!_violations.empty()) {
+        // The root goes with the driver; the daemon's log stays for whoever looks into it.
+        std::string kept = "/tmp/stowly-torture-" + std::to_string(_options.seed) + ".log";
+        std::error_code ec;
+        std::filesystem::copy_file(_daemon.root() / "stowlyd.stderr", kept,
+                                   std::filesystem::copy_options::overwrite_existing, ec);
+        if (!ec)
+            printf("the daemon's log: %s\n", kept.c_str());
+    }
+    if (_options.soakSeconds) {
+        uint64_t requests = 0;
+        std::vector<uint32_t> latencies;
+        for (auto& worker : _workers) {
+            requests += worker->requests;
+            latencies.insert(latencies.end(), worker->latencies.begin(), worker->latencies.end());
+        }
+        std::sort(latencies.begin(), latencies.end());
+        auto percentile = [&](double p) {
+            return latencies.empty() ? 0.0 : latencies[size_t(p * double(latencies.size() - 1))] / 1000.0;
+        };
+        // Measured while the load runs; the bound is not about timing, only growth.
+        bool residentOK = _warm.residentKB > 0 && _end.residentKB > 0 && _end.residentKB <= _warm.residentKB * 11 / 10;
+        bool descriptorsOK = _warm.descriptors > 0 && _end.descriptors >= 0 &&
+                             _end.descriptors <= _warm.descriptors * 11 / 10 + 8;
+        printf("latency p50: %.2f ms, p99: %.2f ms (reported, not checked)\n", percentile(0.5), percentile(0.99));
+        printf("resident memory: %ld kB after the warm-up, %ld kB at the end: %s\n", _warm.residentKB,
+               _end.residentKB, residentOK ? "pass" : "FAIL (more than 10% growth)");
+        printf("open descriptors: %ld after the warm-up, %ld at the end: %s\n", _warm.descriptors, _end.descriptors,
+               descriptorsOK ? "pass" : "FAIL (more than 10% + 8 growth)");
+        printf("soak: requests: %llu, errors: %zu\n", static_cast<unsigned long long>(requests), _violations.size());
+        return _violations.empty() && residentOK && descriptorsOK && !interrupted.load() ? 0 : 1;
+    }
+    if (_options.faultRounds) {
+        // Every fault that fires is logged, and the log gathers every start's.
+        unsigned fired = 0;
+        std::ifstream log(_daemon.root() / "stowlyd.stderr");
+        for (std::string line; std::getline(log, line);)
+            fired += line.find("Injected fault: ") != std::string::npos;
+        printf("fault rounds: %u, faults fired: %u, violations: %zu\n", _rounds, fired, _violations.size());
+    } else {
+        printf("kills: %u, violations: %zu\n", _kills, _violations.size());
+    }
+    return _violations.empty() && !interrupted.load() ? 0 : 1;
+}
+
+void Torture::_runKills() {
     size_t nextPoint = 0;
     std::string point;
     while (_kills < _options.kills && !interrupted.load()) {
@@ -269,34 +500,6 @@ int Torture::run() {
         if (_violations.size() > 200)
             break;
     }
-    double seconds = std::chrono::duration<double>(Clock::now() - began).count();
-    uint64_t acknowledged = 0, uncertain = 0;
-    std::map<std::string, std::pair<uint64_t, uint64_t>> kinds;
-    for (auto& worker : _workers) {
-        for (auto& [kind, n] : worker->acknowledged)
-            acknowledged += n, kinds[kind].first += n;
-        for (auto& [kind, n] : worker->uncertain)
-            uncertain += n, kinds[kind].second += n;
-    }
-    printf("requests acknowledged: %llu, without reply: %llu\n", static_cast<unsigned long long>(acknowledged),
-           static_cast<unsigned long long>(uncertain));
-    for (auto& [kind, counts] : kinds)
-        printf("  %-16s %8llu acknowledged %6llu without reply\n", kind.c_str(),
-               static_cast<unsigned long long>(counts.first), static_cast<unsigned long long>(counts.second));
-    printf("crash points reached: %u (during a start or its check: %u), power cycles: %u, checks: %u\n", _pointKills,
-           _startKills, _reboots, _checks);
-    printf("wall time: %.1f s, seed %llu\n", seconds, static_cast<unsigned long long>(_options.seed));
-    if (!_violations.empty()) {
-        // The root goes with the driver; the daemon's log stays for whoever looks into it.
-        std::string kept = "/tmp/stowly-torture-" + std::to_string(_options.seed) + ".log";
-        std::error_code ec;
-        std::filesystem::copy_file(_daemon.root() / "stowlyd.stderr", kept,
-                                   std::filesystem::copy_options::overwrite_existing, ec);
-        if (!ec)
-            printf("the daemon's log: %s\n", kept.c_str());
-    }
-    printf("kills: %u, violations: %zu\n", _kills, _violations.size());
-    return _violations.empty() && !interrupted.load() ? 0 : 1;
 }
 
 } // namespace
@@ -304,7 +507,10 @@ int Torture::run() {
 int main(int argc, char** argv) {
     Options options;
     if (!parse(argc, argv, &options)) {
-        fprintf(stderr, "usage: %s [--kills N] [--seed S] [--threads T] [--state FILE] [--verbose]\n", argv[0]);
+        fprintf(stderr,
+                "usage: %s [--kills N | --faults N | --soak SECONDS] [--seed S] [--threads T] [--state FILE] "
+                "[--verbose]\n",
+                argv[0]);
         return 2;
     }
     // Stopped from outside, the driver still stops its daemon and removes its root.
