@@ -262,8 +262,10 @@ void Torture::_check() {
     auto client = _installer();
     std::vector<STWTortureIdentity> mapped;
     for (auto& worker : _workers) {
+        // What the workload itself saw contradict its record during the window counts too.
+        found.insert(found.end(), worker->violations.begin(), worker->violations.end());
+        worker->violations.clear();
         if (client) {
-            worker->violations.clear();
             worker->compareWithDaemon(*client, disk);
             found.insert(found.end(), worker->violations.begin(), worker->violations.end());
             worker->violations.clear();
@@ -448,12 +450,17 @@ int Torture::run() {
             return latencies.empty() ? 0.0 : latencies[size_t(p * double(latencies.size() - 1))] / 1000.0;
         };
         // Measured while the load runs; the bound is not about timing, only growth.
-        bool residentOK = _warm.residentKB > 0 && _end.residentKB > 0 && _end.residentKB <= _warm.residentKB * 11 / 10;
+        // A short soak sees the allocator still settling: its memory is reported, and held to
+        // the bound from two minutes on.
+        bool residentGated = _options.soakSeconds >= 120;
+        bool residentOK = _warm.residentKB > 0 && _end.residentKB > 0 &&
+                          (_end.residentKB <= _warm.residentKB * 11 / 10 || !residentGated);
         bool descriptorsOK = _warm.descriptors > 0 && _end.descriptors >= 0 &&
                              _end.descriptors <= _warm.descriptors * 11 / 10 + 8;
         printf("latency p50: %.2f ms, p99: %.2f ms (reported, not checked)\n", percentile(0.5), percentile(0.99));
         printf("resident memory: %ld kB after the warm-up, %ld kB at the end: %s\n", _warm.residentKB,
-               _end.residentKB, residentOK ? "pass" : "FAIL (more than 10% growth)");
+               _end.residentKB,
+               !residentGated ? "reported" : residentOK ? "pass" : "FAIL (more than 10% growth)");
         printf("open descriptors: %ld after the warm-up, %ld at the end: %s\n", _warm.descriptors, _end.descriptors,
                descriptorsOK ? "pass" : "FAIL (more than 10% + 8 growth)");
         printf("soak: requests: %llu, errors: %zu\n", static_cast<unsigned long long>(requests), _violations.size());
