@@ -391,6 +391,10 @@ void Torture::_runSoak() {
     }
     if (!_daemon.isRunning())
         return _violation("stowlyd died during the soak");
+    // What requests sent to death row without starting a pass waits for the next one, at the
+    // latest the next start's cleanup: the checker looks after a restart, as after a kill.
+    if (!_daemon.stop() || !_daemon.start() || !_daemon.waitForCleanups(false))
+        return _violation("stowlyd did not stop and start again cleanly after the soak");
     _check();
 }
 
