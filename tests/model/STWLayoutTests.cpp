@@ -62,20 +62,17 @@ TEST_F(STWLayoutTest, PerUserConfigurationRefusesOtherClassesAndIsSharedByEqualI
     EXPECT_EQ(global->getPerUserConfigurationForUserIdentity(unspecific), perUser);
 }
 
-TEST_F(STWLayoutTest, ARemovedBaseDirectoryIsRepairedByTheNextCall) {
-    std::filesystem::path staging = global->stagingDirectory();
-    std::filesystem::remove_all(root->resolve("/private/var/root/Library/Caches"));
-    EXPECT_FALSE(std::filesystem::exists(staging));
-    EXPECT_EQ(global->stagingDirectory(), staging);
-    EXPECT_TRUE(std::filesystem::is_directory(staging));
-}
-
-// A directory is made once and then only checked; what replaced it behind the daemon's back
-// is noticed by that check: a link in its place, a link on the way back to the very directory
+// A directory is made once and then only checked; what happened to it behind the daemon's
+// back is noticed by that check: its removal (with its parent), a link in its place, a link on the way back to the very directory
 // made (nothing is followed below the user's home), another owner, and for death row's held
 // descriptor the directory's removal.
 TEST_F(STWLayoutTest, ADirectoryReplacedAfterItWasMadeIsMadeAgainNotFollowed) {
     namespace fs = std::filesystem;
+    fs::path staging = global->stagingDirectory();
+    fs::remove_all(root->resolve("/private/var/root/Library/Caches"));
+    EXPECT_EQ(global->stagingDirectory(), staging);
+    EXPECT_TRUE(fs::is_directory(staging));
+
     fs::path home = root->resolve("/private/var/relinked-layout"), outside = root->resolve("/private/var/outside");
     auto user = STWUserIdentity::initWithUID(503, 503, home, "RELINKED", STWPersonaTypeEnterprise, 2001);
     fs::path classDirectory = *global->containerDirectoryURLForUserIdentity(user, 2, false);
@@ -151,15 +148,6 @@ TEST_F(STWLayoutTest, OwnersOfGlobalClassesComeFromTheConfiguration) {
     EXPECT_EQ(statOf(*global->containerDirectoryURLForUserIdentity(mobile, 3, false)).st_uid, 33u);
     EXPECT_EQ(statOf(*global->containerDirectoryURLForUserIdentity(mobile, 12, true)).st_uid, 78u);
     EXPECT_EQ(statOf(*global->containerDirectoryURLForUserIdentity(mobile, 13, true)).st_uid, 0u);
-}
-
-TEST_F(STWLayoutTest, AMissingMobileUserLeavesTheIdsAtZero) {
-    root->writeSettings({{"MobileUserName", STWValue("nobody-by-this-name")}});
-    STWGlobalConfiguration missing;
-    root->writeSettings({});
-    EXPECT_EQ(missing.currentMobileUserId(), 0u);
-    EXPECT_EQ(missing.currentMobileGroupId(), 0u);
-    EXPECT_EQ(STWGlobalConfiguration().currentMobileUserId(), 501u);
 }
 
 } // namespace
