@@ -27,8 +27,8 @@
 #include "platform/STWCrashPoint.h"
 #include "platform/STWPlatformConfiguration.h"
 #include "tests/support/STWDaemonProcess.h"
-#include "tests/torture/STWTortureChecker.h"
-#include "tests/torture/STWTortureWorkload.h"
+#include "reliability/torture/STWTortureChecker.h"
+#include "reliability/torture/STWTortureWorkload.h"
 
 #include <algorithm>
 #include <cerrno>

@@ -8,7 +8,7 @@
 // models while it runs.
 #pragma once
 
-#include "tests/torture/STWTortureModel.h"
+#include "reliability/torture/STWTortureModel.h"
 
 #include <chrono>
 #include <filesystem>

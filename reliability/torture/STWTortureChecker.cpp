@@ -1,4 +1,4 @@
-#include "tests/torture/STWTortureChecker.h"
+#include "reliability/torture/STWTortureChecker.h"
 
 #include <cerrno>
 #include <cstring>

@@ -10,7 +10,7 @@
 
 #include "client/STWClient.h"
 #include "client/STWUpcallClient.h"
-#include "tests/torture/STWTortureModel.h"
+#include "reliability/torture/STWTortureModel.h"
 
 #include <atomic>
 #include <chrono>

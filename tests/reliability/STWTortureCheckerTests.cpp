@@ -1,6 +1,6 @@
 // The torture's checker on roots laid out by hand: it must see every kind of damage it
 // exists for, and accept (and learn from) what an unanswered request may have left.
-#include "tests/torture/STWTortureChecker.h"
+#include "reliability/torture/STWTortureChecker.h"
 
 #include <gtest/gtest.h>
 

@@ -1,9 +1,9 @@
-#include "tests/torture/STWTortureWorkload.h"
+#include "reliability/torture/STWTortureWorkload.h"
 
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWError.h"
 #include "common/STWFileIO.h"
-#include "tests/torture/STWTortureChecker.h"
+#include "reliability/torture/STWTortureChecker.h"
 
 #include <cerrno>
 #include <filesystem>
