@@ -279,10 +279,14 @@ bool STWFileManager::moveDirectoryAt(int fromfd, const std::string& name, int to
         e = syncDescriptor(fromfd, parentPath(from));
     if (e) {
         // Not durable, so not done: the directory goes back, and the caller, told that the
-        // move failed, finds it where it was.
-        if (disk::renameat2(tofd, toName.c_str(), fromfd, name.c_str(), RENAME_NOREPLACE) != 0)
-            STW_LOG_ERROR(STWLogCategory::FS, "Failed to move %@ back to %@ after a failed sync: %s", to, from,
-                          strerror(errno));
+        // move failed, finds it where it was. When it cannot go back, the move stands and
+        // is answered as done: a caller told otherwise would leave it where it arrived.
+        if (disk::renameat2(tofd, toName.c_str(), fromfd, name.c_str(), RENAME_NOREPLACE) != 0) {
+            STW_LOG_ERROR(STWLogCategory::FS,
+                          "Moved %@ to %@, but failed to sync the directories (%s) and to move it back: %s", from, to,
+                          strerror(e), strerror(errno));
+            return true;
+        }
         STWSetError(error, STW_POSIX_ERROR(e, "Failed to sync the directories of %@ after moving it from %@: %s", to,
                                            from, strerror(e)));
         return false;

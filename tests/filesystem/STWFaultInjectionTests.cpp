@@ -75,3 +75,23 @@ TEST_F(FaultInjection, FailedWriteOrReplaceKeepsTheOldFileAndNoTemporary) {
 }
 
 } // namespace
+
+// A directory moved whose parents then fail to sync goes back, and the move fails; when it
+// cannot go back either, the move stands and answers success, so no caller takes a
+// published directory for one that is not.
+TEST_F(FaultInjection, AnUnsyncedMoveGoesBackOrStands) {
+    fs::create_directories(scratch() / "from/item");
+    fs::create_directories(scratch() / "to");
+    STWFileDescriptor from = openDirectory(scratch() / "from"), to = openDirectory(scratch() / "to");
+    STWFileDescriptor item = openDirectory(scratch() / "from/item");
+    auto move = [&] {
+        return fm()->moveDirectoryAt(from.get(), "item", to.get(), "item", item.get(),
+                                     STWFileManagerMoveSyncDirectories, scratch() / "from/item", scratch() / "to/item");
+    };
+    ASSERT_TRUE(STWFaultInjection::arm("fsync", 1, EIO));
+    EXPECT_FALSE(move());
+    EXPECT_EQ(names(scratch() / "from"), std::vector<std::string>{"item"});
+    ASSERT_TRUE(STWFaultInjection::armFromList("fsync:1:5,renameat2:2:28"));
+    EXPECT_TRUE(move());
+    EXPECT_EQ(names(scratch() / "to"), std::vector<std::string>{"item"});
+}
