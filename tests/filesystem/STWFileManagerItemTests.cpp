@@ -5,9 +5,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
-#include <cstring>
 #include <map>
-#include <set>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -155,34 +153,6 @@ TEST_F(Items, CreatingAnExistingDirectoryStillSetsOwnerAndClass) {
     }
 }
 
-TEST_F(Items, TraversalStopsOnVisitorAndEntryErrors) {
-    fs::create_directories(scratch() / "tree/sub");
-    writeFile(scratch() / "tree/sub/f", "");
-    fs::create_directory_symlink(scratch(), scratch() / "tree/loop");
-    std::multiset<std::string> seen;
-    auto visit = [](int info, const char* name) { return std::to_string(info) + ":" + name; };
-    ASSERT_TRUE(fm()->_traverseDirectory(scratch() / "tree", nullptr, [&](FTSENT* entry, STWErrorRef*) {
-        seen.insert(visit(entry->fts_info, entry->fts_name));
-        return true;
-    }));
-    // Pre- and post-order visits of the directories, the file, and the link (not followed).
-    EXPECT_EQ(seen,
-              (std::multiset<std::string>{visit(FTS_D, "sub"), visit(FTS_D, "tree"), visit(FTS_DP, "sub"),
-                                          visit(FTS_DP, "tree"), visit(FTS_F, "f"), visit(FTS_SL, "loop")}));
-
-    STWErrorRef error;
-    int visits = 0;
-    EXPECT_FALSE(
-        fm()->_traverseDirectory(scratch() / "tree", &error, [&](FTSENT*, STWErrorRef* visitorError) {
-            ++visits;
-            *visitorError = STW_POSIX_ERROR_NOLOG(EBADF, "visitor gave up");
-            return false;
-        }));
-    EXPECT_EQ(visits, 1);
-    ASSERT_TRUE(error);
-    EXPECT_EQ(error->message(), "visitor gave up");
-}
-
 // What `du -s -x --block-size=1` says, or nullopt where it cannot be run.
 std::optional<uint64_t> duBytes(const fs::path& path) {
     std::string command = "du -s -x --block-size=1 '" + path.native() + "' 2>/dev/null";
@@ -204,7 +174,7 @@ TEST_F(Items, DiskUsageCountsAllocatedBytesLikeDu) {
     // A sparse file: its size is not what it occupies.
     writeFile(tree / "sparse", "s");
     ASSERT_EQ(truncate((tree / "sparse").c_str(), 50 << 20), 0);
-    // Another file system mounted inside is not counted, and not walked into.
+    // Another file system mounted inside is not counted.
     std::optional<ScopedTmpfs> mount;
     mount.emplace(tree / "a/mnt");
     if (mount->mounted())
@@ -216,12 +186,6 @@ TEST_F(Items, DiskUsageCountsAllocatedBytesLikeDu) {
         GTEST_SKIP() << "du is not available";
     EXPECT_EQ(fm()->diskUsageForURL(tree), *expected);
     EXPECT_LT(fm()->diskUsageForURL(tree), 3u << 20);
-    bool crossed = false;
-    ASSERT_TRUE(fm()->_traverseDirectory(tree, nullptr, [&](FTSENT* entry, STWErrorRef*) {
-        crossed |= strcmp(entry->fts_name, "elsewhere") == 0;
-        return true;
-    }));
-    EXPECT_FALSE(crossed);
 
     STWTestRoot::shared().writeSettings(
         {{"Features", STWValue(STWValue::Dictionary{{"fast_container_sizing", STWValue(true)}})}});

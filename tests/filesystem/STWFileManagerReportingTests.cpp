@@ -44,10 +44,6 @@ TEST_F(Reporting, FailuresCarryTheirErrno) {
          ENOENT},
         {[&](STWErrorRef* e) { return bool(fm()->urlsForItemsInDirectoryAtURL(missing, e)); }, ENOENT},
         {[&](STWErrorRef* e) { return bool(fm()->itemsInDirectoryAtURL(missing, e)); }, ENOENT},
-        {[&](STWErrorRef* e) {
-             return fm()->_traverseDirectory(missing, e, [](FTSENT*, STWErrorRef*) { return true; });
-         },
-         ENOENT},
         {[&](STWErrorRef* e) { return fm()->dataProtectionClassOfItemAtURL(missing, &value, e); }, ENOENT},
         {[&](STWErrorRef* e) { return fm()->dataProtectionClassOfItemAtURL(file, &value, e); }, EPERM, true},
         {[&](STWErrorRef* e) { return fm()->setDataProtectionClassOfItemAtURL(file, 3, nullptr, e); }, EPERM,
