@@ -148,9 +148,8 @@ TEST_F(STWFileManagerACLTest, OwnershipWalkSetsOwnerAndModesButLeavesTheMetadata
     EXPECT_EQ(fingerprint(c / "Library" / kMetadata), nested);
 }
 
-// The app owns the tree and rearranges it while we walk: links out of it, a FIFO, a link
-// loop, a hard link to an outside file, and a directory swapped for a link to the outside
-// over and over. Nothing outside may change, and the walks must end.
+// The app owns the tree and rearranges it while we walk (links out, a FIFO, a loop, a hard link
+// out, a directory swapped for a link over and over): nothing outside changes, the walks end.
 TEST_F(STWFileManagerACLTest, HostileTreeNeverLeadsAWalkOutside) {
     fs::path outside = scratch() / "outside";
     fs::create_directories(outside / "dir");

@@ -163,47 +163,30 @@ TEST_F(CopyMove, DurableMoveSyncsContentsBeforeTheRenameAndDirectoriesAfter) {
     writeFile(staging / "container/Library/prefs", "p");
     fs::path destination = live / "container";
 
-    struct Sync {
-        std::string path;
-        bool destinationVisible;
-    };
-    std::vector<Sync> syncs;
-    STWFileManager::setSyncObserverForTesting([&](const std::string& path) {
-        syncs.push_back({path, fs::exists(destination)});
-    });
+    // Whether the destination was visible when each path was first synced.
+    std::map<std::string, bool> synced;
+    STWFileManager::setSyncObserverForTesting(
+        [&](const std::string& path) { synced.emplace(path, fs::exists(destination)); });
     STWErrorRef error;
     bool moved = fm()->moveItemAtURL(staging / "container", destination, STWFileManagerMoveDurable, &error);
-    STWFileManager::setSyncObserverForTesting(nullptr);
     ASSERT_TRUE(moved) << error->description();
-
-    auto find = [&](const fs::path& path) -> const Sync* {
-        for (const Sync& sync : syncs)
-            if (sync.path == path.native())
-                return &sync;
-        return nullptr;
+    auto visibleWhenSynced = [&](const fs::path& path) -> std::optional<bool> {
+        auto sync = synced.find(path.native());
+        return sync == synced.end() ? std::nullopt : std::optional(sync->second);
     };
     // Everything moved reaches the disk while it is still invisible at the destination...
     for (const char* item :
-         {"container/.metadata.plist", "container/Library/prefs", "container/Library", "container"}) {
-        const Sync* sync = find(staging / item);
-        ASSERT_NE(sync, nullptr) << item;
-        EXPECT_FALSE(sync->destinationVisible) << item;
-    }
+         {"container/.metadata.plist", "container/Library/prefs", "container/Library", "container"})
+        EXPECT_EQ(visibleWhenSynced(staging / item), false) << item;
     // ...and both directories whose entries the rename changed are synced after it.
-    for (const fs::path& directory : {live, staging}) {
-        const Sync* sync = find(directory);
-        ASSERT_NE(sync, nullptr) << directory;
-        EXPECT_TRUE(sync->destinationVisible) << directory;
-    }
+    for (const fs::path& directory : {live, staging})
+        EXPECT_EQ(visibleWhenSynced(directory), true) << directory;
 
     // A plain move pays for none of it.
-    syncs.clear();
-    STWFileManager::setSyncObserverForTesting([&](const std::string& path) {
-        syncs.push_back({path, false});
-    });
+    synced.clear();
     EXPECT_TRUE(fm()->moveItemAtURL(destination, staging / "back"));
     STWFileManager::setSyncObserverForTesting(nullptr);
-    EXPECT_TRUE(syncs.empty());
+    EXPECT_TRUE(synced.empty());
 }
 
 } // namespace
