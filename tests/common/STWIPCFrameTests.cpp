@@ -121,9 +121,8 @@ TEST(STWFrameReader, ReadOfAsManyBytesAsWereConsumedIsNotTheEnd) {
     EXPECT_EQ(frame.id, 2u);
 }
 
-// After a good frame, each broken stream is an Error with its errno. The first two are
-// judged with the writer still open: a reader that waited for (or allocated) the payload
-// it was promised would block here.
+// After a good frame, each broken stream is an Error with its errno; the first two with the
+// writer still open, where a reader that waited for (or allocated) its payload would block.
 TEST(STWFrameReader, BrokenStreamsFailWithTheirErrno) {
     std::string good = STWFrameEncode(STWFrameKindRequest, 1, {{"K", STWValue("value")}});
     uint32_t over = STWFrameMaxSize + 1;
