@@ -25,6 +25,7 @@ TEST(STWValue, TypedReadsOfTheWrongTypeReadAsAbsent) {
     for (const STWValue& other : {text, STWValue(true), STWValue(5.0)})
         EXPECT_FALSE(other.uint64Value()) << other.description();
     EXPECT_FALSE(five.boolValue());
+    EXPECT_EQ(five.realValue(), 5.0); // integers serve where seconds are read
     EXPECT_EQ(five.string(), nullptr);
     EXPECT_EQ(text.find("str"), nullptr);
 }

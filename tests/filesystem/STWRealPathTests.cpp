@@ -68,6 +68,7 @@ TEST_F(RealPath, OnlyPathsThatStayBeneathTheBaseAreAccepted) {
         {scratch() / "basement", base, std::nullopt},
         {"", base, std::nullopt},
         {base / "file", "", std::nullopt},
+        {scratch() / "no-base/file", scratch() / "no-base", std::nullopt},
         // Absolute links are refused wherever they point; relative ones may not climb out.
         {base / "absolute-inside", base, std::nullopt},
         {base / "absolute-outside", base, std::nullopt},
