@@ -39,9 +39,6 @@ protected:
         dir = templ;
     }
     void TearDown() override { std::filesystem::remove_all(dir); }
-    void writeRaw(const std::filesystem::path& p, const std::string& bytes) {
-        std::ofstream(p, std::ios::binary) << bytes;
-    }
     std::filesystem::path dir;
 };
 
@@ -117,8 +114,8 @@ TEST_F(STWPropertyListFileTest, AtomicWritesReplaceTheFileOrLeaveItAndNoTemporar
 }
 
 TEST_F(STWPropertyListFileTest, ReadFailuresCarryTheirDomain) {
-    writeRaw(dir / "array.plist", STWPropertyList::serializeXML(STWValue(STWValue::Array{STWValue(1)})));
-    writeRaw(dir / "junk.plist", "bplist00\x01\x02garbage");
+    std::ofstream(dir / "array.plist") << STWPropertyList::serializeXML(STWValue(STWValue::Array{}));
+    std::ofstream(dir / "junk.plist") << "bplist00\x01\x02garbage";
     std::filesystem::create_symlink(dir / "array.plist", dir / "link.plist");
     struct Case {
         const char* name;

@@ -16,21 +16,17 @@ STWValue sample() {
     });
 }
 
+// Integers out of a reader's range, and values of another type, read as absent.
 TEST(STWValue, TypedReadsOfTheWrongTypeReadAsAbsent) {
-    STWValue five(5), minus(-1), big(uint64_t(1) << 63), text("5"), flag(true), real(5.0);
-    EXPECT_EQ(five.uint64Value(), 5u);
-    EXPECT_EQ(five.int64Value(), 5);
+    STWValue five(5), minus(-1), big(uint64_t(1) << 63), text("5");
     EXPECT_FALSE(minus.uint64Value());
-    EXPECT_EQ(minus.int64Value(), -1);
-    EXPECT_EQ(big.uint64Value(), uint64_t(1) << 63);
     EXPECT_FALSE(big.int64Value());
-    for (const STWValue& other : {text, flag, real})
+    EXPECT_EQ(big.uint64Value(), uint64_t(1) << 63);
+    for (const STWValue& other : {text, STWValue(true), STWValue(5.0)})
         EXPECT_FALSE(other.uint64Value()) << other.description();
     EXPECT_FALSE(five.boolValue());
-    EXPECT_EQ(five.realValue(), 5.0);
+    EXPECT_EQ(five.realValue(), 5.0); // integers serve where seconds are read
     EXPECT_EQ(five.string(), nullptr);
-    EXPECT_EQ(text.dictionary(), nullptr);
-    EXPECT_EQ(sample().find("str")->string() ? *sample().find("str")->string() : "", "x");
     EXPECT_EQ(text.find("str"), nullptr);
 }
 
@@ -52,7 +48,8 @@ TEST(STWValue, EqualityAndHashAreDeepAndCopiesAreIndependent) {
 
 TEST(STWValue, IdenticalComparesRealsBitForBit) {
     auto nested = [](double real) {
-        return STWValue(STWValue::Dictionary{{"a", STWValue(STWValue::Array{STWValue("x"), STWValue(real)})}});
+        return STWValue(
+            STWValue::Dictionary{{"a", STWValue(STWValue::Array{STWValue("x"), STWValue(real)})}});
     };
     double nan = std::numeric_limits<double>::quiet_NaN();
     EXPECT_NE(nested(nan), nested(nan));

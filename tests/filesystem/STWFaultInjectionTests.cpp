@@ -1,6 +1,5 @@
-// Faults armed at the file layer's points fail the operation with their errno, fire at the
-// nth call only, and leave nothing half-made. A creation failed at each call of each point
-// is in the end-to-end crash tests.
+// Armed faults fail the nth call of their point with their errno and leave nothing half-made;
+// a creation failed at each call of each point is in the end-to-end crash tests.
 #include "Daemon/FileSystem/STWFaultInjection.h"
 #include "tests/filesystem/STWFileSystemTestSupport.h"
 

@@ -4,6 +4,7 @@
 #include "common/STWLog.h"
 #include "tests/support/STWTestRoot.h"
 
+#include <acl/libacl.h>
 #include <cerrno>
 #include <cstring>
 #include <fcntl.h>
@@ -45,6 +46,32 @@ std::string readFile(const fs::path& path) {
     std::string contents;
     EXPECT_EQ(STWReadFileContents(path, &contents), 0) << path;
     return contents;
+}
+
+struct stat lstatOf(const fs::path& path) {
+    struct stat st = {};
+    EXPECT_EQ(lstat(path.c_str(), &st), 0) << path;
+    return st;
+}
+
+std::string aclText(const fs::path& path, acl_type_t type) {
+    acl_t acl = acl_get_file(path.c_str(), type);
+    if (!acl)
+        return std::string("error: ") + strerror(errno);
+    char* text = acl_to_any_text(acl, nullptr, ',', TEXT_ABBREVIATE | TEXT_NUMERIC_IDS);
+    std::string result = text ? text : "";
+    acl_free(text);
+    acl_free(acl);
+    return result;
+}
+
+void setACLText(const fs::path& path, const char* text, acl_type_t type) {
+    acl_t acl = acl_from_text(text);
+    ASSERT_NE(acl, nullptr) << text;
+    int result = acl_set_file(path.c_str(), type, acl);
+    int error = errno;
+    acl_free(acl);
+    ASSERT_EQ(result, 0) << path << ": " << strerror(error);
 }
 
 int runAs(uid_t uid, gid_t gid, const std::function<int()>& body) {

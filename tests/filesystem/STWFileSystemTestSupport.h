@@ -9,6 +9,8 @@
 #include <filesystem>
 #include <functional>
 #include <string>
+#include <sys/acl.h>
+#include <sys/stat.h>
 #include <sys/types.h>
 
 namespace stwtest {
@@ -31,6 +33,10 @@ private:
 
 void writeFile(const std::filesystem::path& path, const std::string& contents, mode_t mode = 0644);
 std::string readFile(const std::filesystem::path& path);
+struct stat lstatOf(const std::filesystem::path& path);
+// An ACL as short text with numeric ids ("error: ..." where it cannot be read), and its setter.
+std::string aclText(const std::filesystem::path& path, acl_type_t type);
+void setACLText(const std::filesystem::path& path, const char* text, acl_type_t type = ACL_TYPE_ACCESS);
 
 // Runs `body` in a forked child with the given ids and no supplementary groups; answers
 // the body's result, or 100 + n when dropping privileges or the child itself failed.

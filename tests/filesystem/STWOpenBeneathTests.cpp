@@ -89,9 +89,8 @@ INSTANTIATE_TEST_SUITE_P(, OpenBeneath, ::testing::Values(false, true),
                          [](const auto& info) { return info.param ? "ComponentWalk" : "Openat2"; });
 
 
-// A staged directory swapped for a link after it was made: the publishing rename notices
-// that something else arrived, sends it back and fails; nothing stays published. And a
-// second publication under the same name never replaces the first.
+// A staged directory swapped for a link after it was made is sent back by the publishing
+// rename, which fails; a second publication under the same name never replaces the first.
 using PublishStaged = FileSystemTest;
 TEST_F(PublishStaged, AnImpostorIsSentBackAndNothingIsReplaced) {
     fs::path s = scratch();
@@ -123,9 +122,8 @@ TEST_F(PublishStaged, AnImpostorIsSentBackAndNothingIsReplaced) {
     EXPECT_TRUE(error && error->isPOSIX(EEXIST));
 }
 
-// Paths that come with no owner: a link is followed only where no one but root could have
-// placed it. A removal in place takes what the directory held when it was opened and leaves
-// whatever took its name since.
+// Only links no one but root could have placed are followed; a removal in place takes what
+// the directory held when it was opened and leaves whatever took its name since.
 using ForeignLinks = FileSystemTest;
 TEST_F(ForeignLinks, OnlyRootsLinksAreFollowedAndRemovalKeepsToItsDirectory) {
     if (geteuid() != 0)

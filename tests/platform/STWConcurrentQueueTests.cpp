@@ -14,18 +14,17 @@ using namespace std::chrono_literals;
 
 namespace {
 
-TEST(STWConcurrentQueue, OrdinaryItemsRunSideBySide) {
-    auto queue = STWConcurrentQueue::create("test.concurrent");
-    // Both items must be inside the queue at once for either to finish.
+TEST(STWConcurrentQueue, ItemsRunSideBySideAndABarrierRunsAlone) {
+    auto queue = STWConcurrentQueue::create("test.barrier");
+    // Ordinary items run side by side: both must be inside the queue at once for either to finish.
     std::latch both(2);
-    auto first = std::async(std::launch::async, [&] { queue->sync([&] { both.arrive_and_wait(); }); });
-    auto second = std::async(std::launch::async, [&] { queue->sync([&] { both.arrive_and_wait(); }); });
+    auto inside = [&] {
+        return std::async(std::launch::async, [&] { queue->sync([&] { both.arrive_and_wait(); }); });
+    };
+    auto first = inside(), second = inside();
     EXPECT_EQ(first.wait_for(2s), std::future_status::ready);
     EXPECT_EQ(second.wait_for(2s), std::future_status::ready);
-}
 
-TEST(STWConcurrentQueue, BarrierWaitsForEarlierItemsAndHoldsBackLaterOnes) {
-    auto queue = STWConcurrentQueue::create("test.barrier");
     std::binary_semaphore earlierMayFinish(0), barrierMayFinish(0);
     std::atomic<bool> earlierRunning{false}, barrierRan{false}, barrierSawEarlierRunning{false};
 

@@ -45,25 +45,9 @@ TEST(STWQueue, RunsItemsOneAtATimeInSubmissionOrderAlsoWithSyncFromManyThreads) 
     EXPECT_FALSE(overlapped);
 }
 
+// Suspensions nest, and one taken while an item runs holds back only the items after it.
 TEST(STWQueue, SuspendedQueueRunsNothingUntilResumed) {
     auto queue = STWQueue::create("test.suspend");
-    queue->suspend();
-    queue->suspend();
-    std::atomic<int> ran{0};
-    queue->async([&] { ++ran; });
-    auto waiter = std::async(std::launch::async, [&] { queue->sync([&] { ++ran; }); });
-    EXPECT_EQ(waiter.wait_for(100ms), std::future_status::timeout);
-    queue->resume();
-    EXPECT_EQ(waiter.wait_for(100ms), std::future_status::timeout); // still suspended once
-    EXPECT_EQ(ran.load(), 0);
-    queue->resume();
-    waiter.get();
-    EXPECT_EQ(ran.load(), 2);
-    EXPECT_FALSE(queue->isSuspended());
-}
-
-TEST(STWQueue, SuspendTakesEffectAfterTheRunningItem) {
-    auto queue = STWQueue::create("test.suspend-running");
     std::promise<void> started, release;
     auto releaseFuture = release.get_future().share();
     std::atomic<int> ran{0};
@@ -75,12 +59,17 @@ TEST(STWQueue, SuspendTakesEffectAfterTheRunningItem) {
     queue->async([&] { ++ran; });
     started.get_future().wait();
     queue->suspend();
+    queue->suspend();
     release.set_value();
-    std::this_thread::sleep_for(50ms);
+    auto waiter = std::async(std::launch::async, [&] { queue->sync([&] { ++ran; }); });
+    EXPECT_EQ(waiter.wait_for(100ms), std::future_status::timeout);
+    queue->resume();
+    EXPECT_EQ(waiter.wait_for(100ms), std::future_status::timeout); // still suspended once
     EXPECT_EQ(ran.load(), 1);
     queue->resume();
-    queue->sync([] {});
-    EXPECT_EQ(ran.load(), 2);
+    waiter.get();
+    EXPECT_EQ(ran.load(), 3);
+    EXPECT_FALSE(queue->isSuspended());
 }
 
 TEST(STWQueue, KnowsWhichQueueIsCurrentAndPassesExceptionsToSyncCallers) {
