@@ -75,17 +75,13 @@ protected:
     }
     int64_t rows(const char* table) { return queryInt(std::string("SELECT count(*) FROM ") + table + ";"); }
     void replaceData(const std::string& identifier, const std::string& bytes) {
-        sqlite3_stmt* statement = nullptr;
-        ASSERT_EQ(sqlite3_prepare_v2(db->db(),
-                                     "UPDATE code_signing_data SET data = ? WHERE cs_info_id = (SELECT id FROM "
-                                     "code_signing_info WHERE code_signing_id_text = ?);",
-                                     -1, &statement, nullptr),
-                  SQLITE_OK);
-        sqlite3_bind_blob(statement, 1, bytes.data(), static_cast<int>(bytes.size()), SQLITE_TRANSIENT);
-        sqlite3_bind_text(statement, 2, identifier.c_str(), -1, SQLITE_TRANSIENT);
-        EXPECT_EQ(sqlite3_step(statement), SQLITE_DONE);
+        std::string sql = "UPDATE code_signing_data SET data = X'";
+        for (unsigned char byte : bytes)
+            sql += {"0123456789abcdef"[byte >> 4], "0123456789abcdef"[byte & 15]};
+        sql += "' WHERE cs_info_id = (SELECT id FROM code_signing_info WHERE code_signing_id_text = '" +
+               identifier + "');";
+        EXPECT_EQ(sqlite3_exec(db->db(), sql.c_str(), nullptr, nullptr, nullptr), SQLITE_OK) << sql;
         EXPECT_EQ(sqlite3_changes(db->db()), 1);
-        sqlite3_finalize(statement);
     }
     Strings identifiers() {
         STWErrorRef error;
@@ -178,7 +174,6 @@ TEST_F(STWSQLiteDBTest, MissingIdentifiersAndAnEmptyDatabase) {
     EXPECT_FALSE(db->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
         [&](const std::string&, const std::shared_ptr<STWCodeSigningEntry>&) { ++calls; }));
     EXPECT_EQ(calls, 0);
-    EXPECT_TRUE(db->deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(&error));
     EXPECT_TRUE(db->invalidateCodeSigningWithIdentifier("com.example.missing", &error));
     EXPECT_TRUE(db->invalidateCodeSigningForIdentifierAndAllChildren("com.example.missing", &error));
     EXPECT_FALSE(error);
