@@ -101,7 +101,6 @@ TEST_F(STWClientIdentityTest, PeerIdentityCarriesCredentialsAndSurvivesMalformed
     EXPECT_EQ(identity->auditToken().pid(), child.peer->pid());
     ASSERT_TRUE(identity->entitlements().has_value());
     EXPECT_TRUE(identity->entitlements()->empty());
-    EXPECT_NE(identity->description().find("entitlements = YES>"), std::string::npos);
 
     // No signing identifier: no identity.
     child.peer->setDeclaredIdentity(nullptr);
@@ -110,18 +109,15 @@ TEST_F(STWClientIdentityTest, PeerIdentityCarriesCredentialsAndSurvivesMalformed
 
 TEST_F(STWClientIdentityTest, InstallerIdentityIsReusedOnlyForTheSameAuditToken) {
     STWValue entitlements(STWValue::Dictionary{{"com.vorlane.private.Stowly.allowed", STWValue(true)}});
-    ConnectedChild first(socketPath, listenFD);
-    ConnectedChild second(socketPath, listenFD);
-    ASSERT_NE(first.peer, nullptr);
-    ASSERT_NE(second.peer, nullptr);
+    ConnectedChild first(socketPath, listenFD), second(socketPath, listenFD);
+    ASSERT_TRUE(first.peer && second.peer);
     ASSERT_NE(first.peer->auditToken(), second.peer->auditToken());
     declare(*first.peer, STWInstallerBundleIdentifier, entitlements);
     declare(*second.peer, STWInstallerBundleIdentifier, entitlements);
 
     auto a1 = STWClientIdentity::clientIdentityWithTolvanConnection(*first.peer);
-    auto a2 = STWClientIdentity::clientIdentityWithTolvanConnection(*first.peer);
     ASSERT_NE(a1, nullptr);
-    EXPECT_EQ(a1, a2); // the same object: no second entitlement copy
+    EXPECT_EQ(STWClientIdentity::clientIdentityWithTolvanConnection(*first.peer), a1); // no second copy
 
     auto b = STWClientIdentity::clientIdentityWithTolvanConnection(*second.peer);
     ASSERT_NE(b, nullptr);

@@ -90,29 +90,22 @@ TEST_F(STWEntitlementDecisionTest, LookupDictionaryEntitlesLookupsOfWhatItNames)
     EXPECT_FALSE(decide(28, identity)->lookup().has_value());
 }
 
-TEST_F(STWEntitlementDecisionTest, OtherIdLookupAndSpecificEntitlements) {
+// Specific entitlements open their own commands only, entitled but not unrestricted; allowed
+// alone reaches wipe as unrestricted, with no identifiers.
+TEST_F(STWEntitlementDecisionTest, SpecificEntitlementsOpenOnlyTheirCommands) {
     auto identity = caller({{"com.vorlane.private.Stowly.otherIdLookup", STWValue(1)},
-                            {"com.vorlane.private.Stowly.userManagedAssets", STWValue(true)}});
-    auto assets = decide(29, identity);
-    ASSERT_NE(assets, nullptr);
-    EXPECT_TRUE(assets->entitled() && assets->allowOtherIdLookup());
-    EXPECT_FALSE(assets->unrestricted());
+                            {"com.vorlane.private.Stowly.userManagedAssets", STWValue(true)},
+                            {"com.vorlane.private.Stowly.wipeContainer",
+                             STWValue(STWValue::Array{STWValue("com.example.plugin")})}});
+    auto assets = decide(29, identity), wipe = decide(11, identity);
+    ASSERT_TRUE(assets && wipe);
+    EXPECT_TRUE(assets->entitled() && assets->allowOtherIdLookup() && wipe->entitled());
+    EXPECT_FALSE(assets->unrestricted() || wipe->unrestricted());
+    EXPECT_EQ(wipe->entitledWipeIdentifiers().value_or(STWValue::Array()).size(), 1u);
     EXPECT_NE(decide(4, identity), nullptr);
     EXPECT_EQ(decide(2, identity), nullptr);
-}
+    EXPECT_EQ(decide(10, identity), nullptr);
 
-TEST_F(STWEntitlementDecisionTest, WipeContainerArrayEntitlesOnItsOwn) {
-    auto wiper = caller({{"com.vorlane.private.Stowly.wipeContainer",
-                          STWValue(STWValue::Array{STWValue("com.example.plugin")})}});
-    auto connection = decide(11, wiper);
-    ASSERT_NE(connection, nullptr);
-    EXPECT_TRUE(connection->entitled());
-    EXPECT_FALSE(connection->unrestricted());
-    EXPECT_EQ(connection->entitledWipeIdentifiers().value_or(STWValue::Array()).size(), 1u);
-    // The array alone opens nothing else.
-    EXPECT_EQ(decide(10, wiper), nullptr);
-
-    // Allowed without the array: entitled as unrestricted, no identifiers.
     auto allowed = decide(11, caller({{"com.vorlane.private.Stowly.allowed", STWValue(true)}}));
     ASSERT_NE(allowed, nullptr);
     EXPECT_TRUE(allowed->entitled() && !allowed->entitledWipeIdentifiers());
