@@ -35,3 +35,8 @@ private:
     int _listener = -1;
     std::vector<std::thread> _threads;
 };
+
+// Values in failure messages as their description.
+inline void PrintTo(const STWValue& value, std::ostream* os) {
+    *os << value.description();
+}
