@@ -77,25 +77,6 @@ protected:
 
 } // namespace
 
-TEST_F(stowlyctlTest, RawSendsTypedKeysAndPrintsTheReply) {
-    std::filesystem::path plist = daemon.root() / "value.plist";
-    STW_writeToURL({{"Nested", STWValue(true)}}, plist, STWWriteDefault, nullptr);
-    answerOnce(daemon, {{"ReplyError", STWValue(1)}, {"Path", STWValue("/c/A")}, {"Count", STWValue(3)}},
-               &received);
-    // Each type's parsing is in the argument tests; here what reaches the wire.
-    Outcome r = run({"raw", "18446744073709551615", "Name=str:a=b:c", "Counts=u64arr:1,2",
-                     "Info=plist:" + plist.string()});
-    daemon.join();
-    EXPECT_EQ(r.status, 0) << r.err;
-    EXPECT_EQ(r.out, "ReplyError: 1 (Success)\nCount: 3\nPath: \"/c/A\"\n");
-    ASSERT_EQ(received.size(), 1u);
-    EXPECT_EQ(received[0].kind, STWFrameKindRequest);
-    EXPECT_EQ(received[0].body, (Dictionary{{"Command", STWValue(UINT64_MAX)},
-                                            {"Name", STWValue("a=b:c")},
-                                            {"Counts", STWValue(STWValue::Array{STWValue(1), STWValue(2)})},
-                                            {"Info", STWValue(Dictionary{{"Nested", STWValue(true)}})}}));
-}
-
 // --help ends with the table of command numbers and the verbs that send them; every
 // command of the daemon's table must have one, and each must be a subcommand.
 TEST_F(stowlyctlTest, HelpListsAVerbForEveryCommandOfTheDaemon) {
@@ -137,15 +118,22 @@ TEST_F(stowlyctlTest, BashCompletionOffersTheWordsOfTheCommandLine) {
     EXPECT_EQ(complete("--json create --t"), "--transient\n"); // not the global --timeout
 }
 
-TEST_F(stowlyctlTest, AsSendsHelloWithTheIdentityFirst) {
-    std::filesystem::path entitlements = daemon.root() / "entitlements.plist";
+// With --as the hello and its identity go first; then the request with its typed keys (each
+// type's parsing is in the argument tests) and the reply printed.
+TEST_F(stowlyctlTest, AsSendsHelloFirstThenTheTypedKeysAndPrintsTheReply) {
+    std::filesystem::path entitlements = daemon.root() / "entitlements.plist",
+                          plist = daemon.root() / "value.plist";
     Dictionary granted{{"com.example.containers", STWValue(STWValue::Array{STWValue("a")})}};
     STW_writeToURL(granted, entitlements, STWWriteDefault, nullptr);
-    answerOnce(daemon, {{"ReplyError", STWValue(1)}}, &received);
+    STW_writeToURL({{"Nested", STWValue(true)}}, plist, STWWriteDefault, nullptr);
+    answerOnce(daemon, {{"ReplyError", STWValue(1)}, {"Path", STWValue("/c/A")}, {"Count", STWValue(3)}},
+               &received);
     Outcome r = run({"--as", "com.example.tool", "--entitlements", entitlements.string(), "--sandboxed",
-                     "--persona", "PERSONA-1", "raw", "1"});
+                     "--persona", "PERSONA-1", "raw", "18446744073709551615", "Name=str:a=b:c",
+                     "Counts=u64arr:1,2", "Info=plist:" + plist.string()});
     daemon.join();
     EXPECT_EQ(r.status, 0) << r.err;
+    EXPECT_EQ(r.out, "ReplyError: 1 (Success)\nCount: 3\nPath: \"/c/A\"\n");
     ASSERT_EQ(received.size(), 2u);
     EXPECT_EQ(received[0].kind, STWFrameKindHello);
     EXPECT_EQ(received[0].body, (Dictionary{{"CodeSigningIdentifier", STWValue("com.example.tool")},
@@ -153,6 +141,10 @@ TEST_F(stowlyctlTest, AsSendsHelloWithTheIdentityFirst) {
                                             {"Sandboxed", STWValue(true)},
                                             {"PersonaUniqueString", STWValue("PERSONA-1")}}));
     EXPECT_EQ(received[1].kind, STWFrameKindRequest);
+    EXPECT_EQ(received[1].body, (Dictionary{{"Command", STWValue(UINT64_MAX)},
+                                            {"Name", STWValue("a=b:c")},
+                                            {"Counts", STWValue(STWValue::Array{STWValue(1), STWValue(2)})},
+                                            {"Info", STWValue(Dictionary{{"Nested", STWValue(true)}})}}));
 }
 
 // A reply error other than success exits 1 and is named (49 is what a command the daemon

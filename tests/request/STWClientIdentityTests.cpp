@@ -71,7 +71,7 @@ protected:
 
 } // namespace
 
-TEST_F(STWClientIdentityTest, OnlyBooleansAndNumbersAreBooleanEntitlements) {
+TEST_F(STWClientIdentityTest, BooleanEntitlementsAndAPeersIdentity) {
     auto identity = STWClientIdentity::initWithBundleIdentifier(
         "com.example", 501, 501, 1, STWUserIdentityCache::defaultUserIdentity(),
         STWValue::Dictionary{{"bool", STWValue(true)},
@@ -89,18 +89,17 @@ TEST_F(STWClientIdentityTest, OnlyBooleansAndNumbersAreBooleanEntitlements) {
         EXPECT_FALSE(identity->boolValueOfEntitlement(key)) << key;
     // The daemon's own identity has no entitlements to read.
     EXPECT_FALSE(STWClientIdentity::anonymousPrivilegedClientIdentity()->boolValueOfEntitlement("bool"));
-}
 
-TEST_F(STWClientIdentityTest, PeerIdentityCarriesCredentialsAndSurvivesMalformedEntitlements) {
+    // A peer's identity carries its credentials and survives malformed entitlements.
     ConnectedChild child(socketPath, listenFD);
     ASSERT_NE(child.peer, nullptr);
     declare(*child.peer, "com.example.peer", STWValue("not a dictionary"));
-    auto identity = STWClientIdentity::clientIdentityWithTolvanConnection(*child.peer);
-    ASSERT_NE(identity, nullptr);
-    EXPECT_EQ(identity->posixPID(), child.peer->pid());
-    EXPECT_EQ(identity->auditToken().pid(), child.peer->pid());
-    ASSERT_TRUE(identity->entitlements().has_value());
-    EXPECT_TRUE(identity->entitlements()->empty());
+    auto peer = STWClientIdentity::clientIdentityWithTolvanConnection(*child.peer);
+    ASSERT_NE(peer, nullptr);
+    EXPECT_EQ(peer->posixPID(), child.peer->pid());
+    EXPECT_EQ(peer->auditToken().pid(), child.peer->pid());
+    ASSERT_TRUE(peer->entitlements().has_value());
+    EXPECT_TRUE(peer->entitlements()->empty());
 
     // No signing identifier: no identity.
     child.peer->setDeclaredIdentity(nullptr);

@@ -36,7 +36,7 @@ protected:
 // Which commands an unentitled, a lookup-only and an allowed caller reach is checked over
 // the socket in the end-to-end tests. Here the callers a client cannot present there, and
 // what each kind of connection may do.
-TEST_F(STWEntitlementDecisionTest, CallersWithoutUsableEntitlementsReachWhatTheUnentitledReach) {
+TEST_F(STWEntitlementDecisionTest, CallersWithoutUsableEntitlementsAndAllowedCallers) {
     std::vector<uint64_t> open = connectedCommands(caller({}));
     EXPECT_EQ(connectedCommands(nullptr), open) << "no signing identifier";
     // A lookup that is no dictionary, a string for a boolean, a boolean for an array.
@@ -44,13 +44,12 @@ TEST_F(STWEntitlementDecisionTest, CallersWithoutUsableEntitlementsReachWhatTheU
                                         {"com.vorlane.private.Stowly.dataMigration", STWValue("true")},
                                         {"com.vorlane.private.Stowly.wipeContainer", STWValue(true)}})),
               open);
-    auto connection = decide(0, caller({}));
-    EXPECT_FALSE(connection->entitled() || connection->unrestricted() || connection->lookup());
-    EXPECT_EQ(connection->clientBundleIdentifier().value_or(""), "com.example.caller");
+    auto plain = decide(0, caller({}));
+    EXPECT_FALSE(plain->entitled() || plain->unrestricted() || plain->lookup());
+    EXPECT_EQ(plain->clientBundleIdentifier().value_or(""), "com.example.caller");
     EXPECT_FALSE(decide(0, nullptr)->clientBundleIdentifier().has_value());
-}
 
-TEST_F(STWEntitlementDecisionTest, AllowedIsUnrestrictedExceptWhereTestabilityIsRequired) {
+    // Allowed is unrestricted except where testability is required.
     auto allowed = caller({{"com.vorlane.private.Stowly.allowed", STWValue(true)}});
     for (uint64_t c = 0; c < STWCommandCount; c++) {
         if (auto connection = decide(c, allowed)) {
