@@ -1,6 +1,5 @@
-// Each test runs in a process of its own, on a root of its own: the shared mapping and the
-// container cache start empty, and containers made on disk before the first look-up of
-// their class are what the cache finds.
+// Each test needs a process and root of its own: the shared mapping and the container cache
+// start empty and find what was on disk at their first look-up.
 #include "Daemon/CodeSigning/STWCodeSigningMapping.h"
 #include "Daemon/CodeSigning/STWGroupManager.h"
 

@@ -1,7 +1,5 @@
-// The migrations of what older daemons kept outside the database. Each test runs in a
-// process of its own, on a root of its own: the legacy files it writes before the shared
-// mapping exists are what the mapping finds, and containers made on disk before the first
-// listing of their class are what the cache finds.
+// Migrations of what older daemons kept outside the database. Each test needs a process and
+// root of its own: the mapping and the cache find what was on disk when they first looked.
 #include "Daemon/CodeSigning/STWCodeSigningMapping.h"
 
 #include "Daemon/Lifecycle/STWCommandQueue.h"

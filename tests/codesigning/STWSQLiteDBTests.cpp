@@ -308,8 +308,7 @@ TEST_F(STWSQLiteDBTest, AFileThatCannotBeOpenedOrIsHeldStopsTheDaemon) {
     EXPECT_TRUE(STWSQLiteDB::initWithParentDirectoryURL(shared));
 }
 
-// A throw from the block is code 40 and the daemon goes on, on an internal image too (the
-// report such an image logs is checked with the container cache); the block may use the
+// A throw from the block is code 40, on an internal image too; the block may use the
 // database, a nested enumeration of the same query included.
 TEST_F(STWSQLiteDBTest, EnumerationBlockMayThrowOrUseTheDatabase) {
     STWTestRoot::shared();
