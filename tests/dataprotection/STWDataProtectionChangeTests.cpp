@@ -1,6 +1,4 @@
-// Protection-class changes in process: which items a change touches, what an app can plant
-// in its container, the wait for the unlock, a newer change superseding an older one, and
-// the update file read back and restarted.
+// Protection-class changes in process.
 #include "Daemon/DataProtection/STWDataProtectionChangeOperation.h"
 #include "Daemon/DataProtection/STWDataProtectionManager.h"
 #include "Daemon/Lifecycle/STWDaemonQueues.h"
