@@ -33,9 +33,7 @@ protected:
 
 } // namespace
 
-// Which commands an unentitled, a lookup-only and an allowed caller reach is checked over
-// the socket in the end-to-end tests. Here the callers a client cannot present there, and
-// what each kind of connection may do.
+// Callers a client cannot present over the socket, and what each kind of connection may do.
 TEST_F(STWEntitlementDecisionTest, CallersWithoutUsableEntitlementsAndAllowedCallers) {
     std::vector<uint64_t> open = connectedCommands(caller({}));
     EXPECT_EQ(connectedCommands(nullptr), open) << "no signing identifier";
