@@ -1,14 +1,11 @@
 #include "client/stowlyctl/STWCTLArguments.h"
 #include "client/stowlyctl/STWCTLOutput.h"
 #include "common/STWValue.h"
+#include "tests/client/STWFakeDaemon.h"
 
 #include <gtest/gtest.h>
 
 #include <cmath>
-
-inline void PrintTo(const STWValue& value, std::ostream* os) {
-    *os << value.description();
-}
 
 namespace {
 
@@ -56,17 +53,6 @@ TEST(STWCTLArguments, TypedValues) {
         EXPECT_FALSE(parse(bad)) << bad;
 }
 
-TEST(STWCTLArguments, Message) {
-    std::string reason;
-    auto message = STWCTLMessageWithArguments(12, {"A=u64:1", "B=str:x"}, &reason);
-    ASSERT_TRUE(message) << reason;
-    EXPECT_EQ(*message,
-              (STWValue::Dictionary{{"Command", STWValue(12)}, {"A", STWValue(1)}, {"B", STWValue("x")}}));
-    EXPECT_FALSE(STWCTLMessageWithArguments(12, {"A=u64:1", "A=u64:2"}, &reason));
-    EXPECT_NE(reason.find("twice"), std::string::npos) << reason;
-    EXPECT_FALSE(STWCTLMessageWithArguments(12, {"Command=u64:2"}, &reason));
-}
-
 TEST(STWCTLOutput, JSONOfEveryType) {
     STWValue::Dictionary reply{
         {"ReplyError", STWValue(1)},
@@ -88,7 +74,4 @@ TEST(STWCTLOutput, JSONOfEveryType) {
     for (auto [data, text] : std::vector<std::pair<STWData, const char*>>{
              {{}, ""}, {{'f'}, "Zg=="}, {{'f', 'o'}, "Zm8="}, {{'f', 'o', 'o'}, "Zm9v"}})
         EXPECT_EQ(STWCTLBase64(data), text);
-    // The text form, with the names of known codes, is in the stowlyctl tests.
-    EXPECT_EQ(STWCTLReplyText({{"ReplyError", STWValue(123456)}}), "ReplyError: 123456\n");
-    EXPECT_EQ(STWCTLErrorCodeText(123456), "123456 (a code this stowlyctl does not know)");
 }

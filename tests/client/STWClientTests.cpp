@@ -57,14 +57,6 @@ void onThreads(int count, const std::function<void(int)>& body) {
 
 } // namespace
 
-// A missing socket and one nobody listens on are in the stowlyctl tests.
-TEST(STWClient, SocketPathsAndConnectFailures) {
-    EXPECT_EQ(STWClient::defaultSocketPath(), "/run/stowly/stowlyd.sock");
-    STWErrorRef error;
-    EXPECT_FALSE(STWClient::connect("/tmp/" + std::string(200, 'x'), &error));
-    EXPECT_EQ(posixCode(error), ENAMETOOLONG);
-}
-
 TEST(STWClient, RepliesOutOfOrderReachTheirCallers) {
     STWFakeDaemon daemon;
     constexpr int kCallers = 4;
@@ -160,32 +152,22 @@ TEST(STWClient, DaemonClosingFailsEveryWaiterAtOnce) {
     EXPECT_EQ(posixCode(error), ECONNRESET);
 }
 
-// A message over the limit is refused before anything is sent; the connection goes on. (A
-// length over the limit from the daemon is the frame reader's to refuse.)
-TEST(STWClient, AMessageOverTheFrameLimitIsRefused) {
+// Refused before anything is sent, the connection going on: a path too long for a socket, a
+// message over the frame limit. A hello answered without a numeric ReplyError is no answer.
+TEST(STWClient, RefusalsBeforeSendingAndAHelloWithoutANumericAnswer) {
+    STWErrorRef error;
+    EXPECT_FALSE(STWClient::connect("/tmp/" + std::string(200, 'x'), &error));
+    EXPECT_EQ(posixCode(error), ENAMETOOLONG);
     STWFakeDaemon daemon;
     answerEach(daemon, [](int fd, const STWFrame& frame) {
-        STWFakeDaemon::reply(fd, frame.id, {{"ReplyError", STWValue(1)}});
+        bool hello = frame.kind == STWFrameKindHello;
+        STWFakeDaemon::reply(fd, frame.id, {{"ReplyError", hello ? STWValue("1") : STWValue(1)}});
     });
     auto client = connectTo(daemon);
     ASSERT_TRUE(client);
-    STWErrorRef error;
     EXPECT_FALSE(client->sendMessage({{"Blob", STWValue(STWData(STWFrameMaxSize, 0))}}, kLong, &error));
     EXPECT_EQ(posixCode(error), EMSGSIZE);
     EXPECT_TRUE(client->sendMessage(kCommand, kLong, &error));
-}
-
-// A hello accepted and one refused are answered by the daemon in the end-to-end tests and
-// by a scripted daemon in the stowlyctl tests; a reply without a numeric ReplyError is no
-// answer.
-TEST(STWClient, HelloWithoutANumericAnswerFails) {
-    STWFakeDaemon daemon;
-    answerEach(daemon, [](int fd, const STWFrame& frame) {
-        STWFakeDaemon::reply(fd, frame.id, {{"ReplyError", STWValue("1")}});
-    });
-    auto client = connectTo(daemon);
-    ASSERT_TRUE(client);
-    STWErrorRef error;
     EXPECT_FALSE(client->hello({}, kLong, &error));
     EXPECT_EQ(posixCode(error), EBADMSG);
 }

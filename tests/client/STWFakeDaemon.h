@@ -1,6 +1,5 @@
-// A stand-in for stowlyd's listener in client tests: a Unix socket at the daemon's place
-// under a private root, whose connections are handed to a script the test writes. The
-// scripts speak raw frames, so they can answer out of order, late, never or wrongly.
+// stowlyd's socket under a private root, each connection handed to a script of the test that
+// speaks raw frames, so it can answer out of order, late, never or wrongly.
 #pragma once
 
 #include "common/STWIPCFrame.h"
@@ -35,3 +34,8 @@ private:
     int _listener = -1;
     std::vector<std::thread> _threads;
 };
+
+// Values in failure messages as their description.
+inline void PrintTo(const STWValue& value, std::ostream* os) {
+    *os << value.description();
+}

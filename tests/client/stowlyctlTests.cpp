@@ -2,21 +2,17 @@
 // how it exits.
 #include "Daemon/Request/STWCommandTable.h"
 #include "common/STWDictionaryUtilities.h"
+#include "common/STWFileIO.h"
 #include "tests/client/STWFakeDaemon.h"
 
 #include <gtest/gtest.h>
 
 #include <fcntl.h>
-#include <fstream>
 #include <map>
 #include <regex>
 #include <sstream>
 #include <sys/wait.h>
 #include <unistd.h>
-
-inline void PrintTo(const STWValue& value, std::ostream* os) {
-    *os << value.description();
-}
 
 namespace {
 
@@ -29,10 +25,9 @@ struct Outcome {
 };
 
 std::string slurp(const std::filesystem::path& path) {
-    std::ifstream in(path, std::ios::binary);
-    std::stringstream s;
-    s << in.rdbuf();
-    return s.str();
+    std::string contents;
+    STWReadFileContents(path, &contents);
+    return contents;
 }
 
 Outcome stowlyctl(const std::filesystem::path& scratch, std::vector<std::string> arguments) {
@@ -51,13 +46,9 @@ Outcome stowlyctl(const std::filesystem::path& scratch, std::vector<std::string>
         execv(argv[0], argv.data());
         _exit(127);
     }
-    Outcome run;
     int status = 0;
     waitpid(pid, &status, 0);
-    run.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-    run.out = slurp(out);
-    run.err = slurp(err);
-    return run;
+    return {WIFEXITED(status) ? WEXITSTATUS(status) : -1, slurp(out), slurp(err)};
 }
 
 // Answers one request with `reply`, keeping what was asked.
@@ -85,38 +76,6 @@ protected:
 };
 
 } // namespace
-
-TEST_F(stowlyctlTest, RawSendsTypedKeysAndPrintsTheReply) {
-    std::filesystem::path plist = daemon.root() / "value.plist";
-    STW_writeToURL({{"Nested", STWValue(true)}}, plist, STWWriteDefault, nullptr);
-    answerOnce(daemon, {{"ReplyError", STWValue(1)}, {"Path", STWValue("/c/A")}, {"Count", STWValue(3)}},
-               &received);
-    // Each type's parsing is in the argument tests; here what reaches the wire.
-    Outcome r = run({"raw", "18446744073709551615", "Name=str:a=b:c", "Counts=u64arr:1,2",
-                     "Info=plist:" + plist.string()});
-    daemon.join();
-    EXPECT_EQ(r.status, 0) << r.err;
-    EXPECT_EQ(r.out, "ReplyError: 1 (Success)\nCount: 3\nPath: \"/c/A\"\n");
-    ASSERT_EQ(received.size(), 1u);
-    EXPECT_EQ(received[0].kind, STWFrameKindRequest);
-    EXPECT_EQ(received[0].body, (Dictionary{{"Command", STWValue(UINT64_MAX)},
-                                            {"Name", STWValue("a=b:c")},
-                                            {"Counts", STWValue(STWValue::Array{STWValue(1), STWValue(2)})},
-                                            {"Info", STWValue(Dictionary{{"Nested", STWValue(true)}})}}));
-}
-
-// A command the daemon does not carry yet is answered 49, which stowlyctl reports as the
-// error it is, by number, name and meaning.
-TEST_F(stowlyctlTest, ReplyErrorOtherThanSuccessExitsOne) {
-    answerOnce(daemon, {{"ReplyError", STWValue(49)}, {"When", STWValue(STWDate{0, 0})}}, &received);
-    Outcome r = run({"--json", "migrate"});
-    daemon.join();
-    EXPECT_EQ(r.status, 1);
-    EXPECT_EQ(r.out, "{\"ReplyError\":49,\"When\":\"1970-01-01T00:00:00Z\"}\n");
-    EXPECT_EQ(r.err, "error: 49 UnsupportedCommand: invalid or unsupported command\n");
-    ASSERT_EQ(received.size(), 1u);
-    EXPECT_EQ(received[0].body, (Dictionary{{"Command", STWValue(24)}}));
-}
 
 // --help ends with the table of command numbers and the verbs that send them; every
 // command of the daemon's table must have one, and each must be a subcommand.
@@ -159,15 +118,22 @@ TEST_F(stowlyctlTest, BashCompletionOffersTheWordsOfTheCommandLine) {
     EXPECT_EQ(complete("--json create --t"), "--transient\n"); // not the global --timeout
 }
 
-TEST_F(stowlyctlTest, AsSendsHelloWithTheIdentityFirst) {
-    std::filesystem::path entitlements = daemon.root() / "entitlements.plist";
+// With --as the hello and its identity go first; then the request with its typed keys (each
+// type's parsing is in the argument tests) and the reply printed.
+TEST_F(stowlyctlTest, AsSendsHelloFirstThenTheTypedKeysAndPrintsTheReply) {
+    std::filesystem::path entitlements = daemon.root() / "entitlements.plist",
+                          plist = daemon.root() / "value.plist";
     Dictionary granted{{"com.example.containers", STWValue(STWValue::Array{STWValue("a")})}};
     STW_writeToURL(granted, entitlements, STWWriteDefault, nullptr);
-    answerOnce(daemon, {{"ReplyError", STWValue(1)}}, &received);
+    STW_writeToURL({{"Nested", STWValue(true)}}, plist, STWWriteDefault, nullptr);
+    answerOnce(daemon, {{"ReplyError", STWValue(1)}, {"Path", STWValue("/c/A")}, {"Count", STWValue(3)}},
+               &received);
     Outcome r = run({"--as", "com.example.tool", "--entitlements", entitlements.string(), "--sandboxed",
-                     "--persona", "PERSONA-1", "raw", "1"});
+                     "--persona", "PERSONA-1", "raw", "18446744073709551615", "Name=str:a=b:c",
+                     "Counts=u64arr:1,2", "Info=plist:" + plist.string()});
     daemon.join();
     EXPECT_EQ(r.status, 0) << r.err;
+    EXPECT_EQ(r.out, "ReplyError: 1 (Success)\nCount: 3\nPath: \"/c/A\"\n");
     ASSERT_EQ(received.size(), 2u);
     EXPECT_EQ(received[0].kind, STWFrameKindHello);
     EXPECT_EQ(received[0].body, (Dictionary{{"CodeSigningIdentifier", STWValue("com.example.tool")},
@@ -175,43 +141,53 @@ TEST_F(stowlyctlTest, AsSendsHelloWithTheIdentityFirst) {
                                             {"Sandboxed", STWValue(true)},
                                             {"PersonaUniqueString", STWValue("PERSONA-1")}}));
     EXPECT_EQ(received[1].kind, STWFrameKindRequest);
+    EXPECT_EQ(received[1].body, (Dictionary{{"Command", STWValue(UINT64_MAX)},
+                                            {"Name", STWValue("a=b:c")},
+                                            {"Counts", STWValue(STWValue::Array{STWValue(1), STWValue(2)})},
+                                            {"Info", STWValue(Dictionary{{"Nested", STWValue(true)}})}}));
 }
 
-TEST_F(stowlyctlTest, RefusedHelloExitsOne) {
+// A reply error other than success exits 1 and is named (49 is what a command the daemon
+// does not carry yet gets), as is a refused hello; a daemon that is gone or silent exits 2.
+TEST_F(stowlyctlTest, ReplyErrorsExitOneAndConnectionProblemsTwo) {
+    answerOnce(daemon, {{"ReplyError", STWValue(49)}, {"When", STWValue(STWDate{0, 0})}}, &received);
+    Outcome r = run({"--json", "migrate"});
+    daemon.join();
+    EXPECT_EQ(r.status, 1);
+    EXPECT_EQ(r.out, "{\"ReplyError\":49,\"When\":\"1970-01-01T00:00:00Z\"}\n");
+    EXPECT_EQ(r.err, "error: 49 UnsupportedCommand: invalid or unsupported command\n");
+    ASSERT_EQ(received.size(), 1u);
+    EXPECT_EQ(received[0].body, (Dictionary{{"Command", STWValue(24)}}));
+
     daemon.serve([](int fd) {
         STWFrameReader reader(fd);
         if (auto hello = STWFakeDaemon::readFrame(reader))
             STWFakeDaemon::reply(fd, hello->id, {{"ReplyError", STWValue(55)}});
     });
-    Outcome r = run({"--as", "com.example.tool", "raw", "1"});
+    r = run({"--as", "com.example.tool", "raw", "1"});
     daemon.join();
     EXPECT_EQ(r.status, 1);
     EXPECT_EQ(r.err, "error: hello refused: 55 NotEntitled: not entitled\n");
-}
 
-TEST_F(stowlyctlTest, ConnectionProblemsExitTwo) {
-    daemon.stopListening();
-    Outcome r = run({"raw", "1"});
-    EXPECT_EQ(r.status, 2);
-    EXPECT_NE(r.err.find("Connection refused"), std::string::npos) << r.err;
-
-    // --socket wins over --root.
-    r = stowlyctl(daemon.root(), {"--socket", (daemon.root() / "none.sock").string(), "raw", "1"});
-    EXPECT_EQ(r.status, 2);
-    EXPECT_NE(r.err.find("No such file"), std::string::npos) << r.err;
-}
-
-TEST_F(stowlyctlTest, TimeOutExitsTwo) {
     daemon.serve([](int fd) {
         STWFrameReader reader(fd);
         STWFrame frame;
         while (reader.read(frame, nullptr) == STWFrameReadResult::Frame) {
         }
     });
-    Outcome r = run({"--timeout", "0.2", "raw", "1"});
+    r = run({"--timeout", "0.2", "raw", "1"});
     daemon.join();
     EXPECT_EQ(r.status, 2);
     EXPECT_NE(r.err.find("timed out"), std::string::npos) << r.err;
+
+    daemon.stopListening();
+    r = run({"raw", "1"});
+    EXPECT_EQ(r.status, 2);
+    EXPECT_NE(r.err.find("Connection refused"), std::string::npos) << r.err;
+    // --socket wins over --root.
+    r = stowlyctl(daemon.root(), {"--socket", (daemon.root() / "none.sock").string(), "raw", "1"});
+    EXPECT_EQ(r.status, 2);
+    EXPECT_NE(r.err.find("No such file"), std::string::npos) << r.err;
 }
 
 TEST_F(stowlyctlTest, BadArgumentsAreRefusedBeforeConnecting) {
@@ -222,12 +198,12 @@ TEST_F(stowlyctlTest, BadArgumentsAreRefusedBeforeConnecting) {
              {"raw", "18446744073709551616"},
              {"raw", "1", "K=u64:-1"},
              {"raw", "1", "K=u64:1", "K=str:x"},
+             {"raw", "1", "Command=u64:2"},
              {"--as", "x", "--entitlements", "/nonexistent.plist", "raw", "1"},
              {"--timeout", "0", "raw", "1"},
              {"--sandboxed", "raw", "1"},
              {"device"},
-             {},
-         }) {
+             {}}) {
         Outcome r = run(arguments);
         EXPECT_EQ(r.status, 64) << testing::PrintToString(arguments) << ": " << r.err;
     }

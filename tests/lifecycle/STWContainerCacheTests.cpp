@@ -75,9 +75,10 @@ TEST_F(STWContainerCacheTest, RebuildTakesValidContainersAndSkipsEverythingElse)
     }
 }
 
-// That a vanished container answers 44 once and then 21 is checked over the socket in the
-// end-to-end tests; here that its mapping goes with its record.
-TEST_F(STWContainerCacheTest, AContainerDeletedBehindTheCachesBackLosesItsRecordAndMapping) {
+// Changed behind the cache's back: a vanished container loses its record and mapping (its 44
+// then 21 is checked over the socket); look-ups check the metadata file beneath the class
+// directory the cache opened.
+TEST_F(STWContainerCacheTest, ContainersAndClassDirectoriesChangedBehindTheCachesBack) {
     auto doomed = STWMakeTestContainer(mobile, "com.example.doomed", 2);
     STWErrorRef error;
     ASSERT_TRUE(lookup("com.example.doomed", &error));
@@ -99,13 +100,10 @@ TEST_F(STWContainerCacheTest, AContainerDeletedBehindTheCachesBackLosesItsRecord
     EXPECT_EQ((*all)[0]->identifier(), "com.example.kept");
     EXPECT_FALSE(lookup("com.example.gone", &error));
     EXPECT_TRUE(error->is(21));
-}
 
-// A look-up checks the metadata file beneath the class directory the cache opened; one
-// that was replaced is opened again, and the old one no longer counts.
-TEST_F(STWContainerCacheTest, AReplacedClassDirectoryIsOpenedAgain) {
+    // A replaced class directory is opened again, and the old one no longer counts.
     auto moved = STWMakeTestContainer(mobile, "com.example.moved", 2);
-    STWErrorRef error;
+    ASSERT_TRUE(cache->addContainerMetadata(moved.metadata, moved.url, false, true, &error));
     ASSERT_TRUE(lookup("com.example.moved", &error));
     fs::path old = classDirectory().native() + ".old";
     fs::rename(classDirectory(), old);
@@ -117,6 +115,18 @@ TEST_F(STWContainerCacheTest, AReplacedClassDirectoryIsOpenedAgain) {
     fs::rename(moved.url, old / moved.url.filename());
     EXPECT_FALSE(lookup("com.example.moved", &error));
     EXPECT_TRUE(error && error->is(44));
+
+    // A class directory that cannot be listed fails with 43 and caches nothing.
+    fs::path tolvan = classDirectory(9);
+    auto service = STWMakeTestContainer(mobile, "com.example.service", 9);
+    fs::rename(tolvan, tolvan.string() + ".aside");
+    std::ofstream(tolvan) << "not a directory";
+    EXPECT_FALSE(lookup("com.example.service", &error, false, 9));
+    ASSERT_TRUE(error->is(43));
+    EXPECT_TRUE(error->underlyingError() && error->underlyingError()->isPOSIX(ENOTDIR));
+    fs::remove(tolvan);
+    fs::rename(tolvan.string() + ".aside", tolvan);
+    EXPECT_TRUE(lookup("com.example.service", &error, false, 9));
 }
 
 TEST_F(STWContainerCacheTest, DuplicateIdentifiersOnDiskKeepTheLaterEntryInListingOrder) {
@@ -183,20 +193,6 @@ TEST_F(STWContainerCacheTest, UnspecificIdentitySeesPersonalAndEnterpriseContain
     EXPECT_EQ(store->pushCount("com.example.personal"), 1);
     // Enterprise containers are not in the personal cache.
     EXPECT_FALSE(lookup("com.work.mail", &error));
-}
-
-TEST_F(STWContainerCacheTest, AClassDirectoryThatCannotBeListedFailsWith43AndCachesNothing) {
-    STWErrorRef error;
-    fs::path tolvan = classDirectory(9);
-    auto service = STWMakeTestContainer(mobile, "com.example.service", 9);
-    fs::rename(tolvan, tolvan.string() + ".aside");
-    std::ofstream(tolvan) << "not a directory";
-    EXPECT_FALSE(lookup("com.example.service", &error, false, 9));
-    ASSERT_TRUE(error->is(43));
-    EXPECT_TRUE(error->underlyingError() && error->underlyingError()->isPOSIX(ENOTDIR));
-    fs::remove(tolvan);
-    fs::rename(tolvan.string() + ".aside", tolvan);
-    EXPECT_TRUE(lookup("com.example.service", &error, false, 9));
 }
 
 TEST_F(STWContainerCacheTest, ConcurrentLookupsAndAddsDuringTheFirstRebuild) {

@@ -1,6 +1,5 @@
 #include "tests/lifecycle/STWLifecycleTestSupport.h"
 #include "Daemon/FileSystem/STWFileManager.h"
-
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
 #include "tests/support/STWTestRoot.h"

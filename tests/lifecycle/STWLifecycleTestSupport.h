@@ -1,7 +1,5 @@
-// Shared fixtures of the lifecycle tests: a private root with a personal persona, one
-// enterprise persona ("ENT-1", home /private/var/ent1) and a universal persona that shares
-// "com.shared.app" with everyone; containers made on disk with real metadata files; and a
-// sandbox mapping store that records what the cache pushed.
+// Lifecycle fixtures: a root with personas PERSONAL, ENT-1 (home /private/var/ent1) and a
+// universal one sharing "com.shared.app"; containers with real metadata; a recording store.
 #pragma once
 
 #include "Daemon/Model/STWMetadata.h"
@@ -19,14 +17,12 @@ struct STWTestContainer {
     STWMetadataRef metadata;
 };
 
-// Installs the root and its personas and removes every container and mapping a previous
-// test of the same process left behind.
+// Installs the root and its personas; removes what an earlier test of the process left.
 void STWLifecycleTestSetUpRoot();
 STWUserIdentityRef STWTestPersonalIdentity();
 STWUserIdentityRef STWTestEnterpriseIdentity();
 
-// A container directory (named by a new UUID unless `directoryName` is given) in the class
-// directory, with a valid metadata file.
+// A container (named by a new UUID unless `directoryName` is given) with valid metadata.
 STWTestContainer STWMakeTestContainer(const STWUserIdentityRef& userIdentity, const std::string& identifier,
                                       STWContainerClass containerClass, bool transient = false,
                                       const std::optional<std::string>& directoryName = std::nullopt);

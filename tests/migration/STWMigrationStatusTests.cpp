@@ -66,9 +66,8 @@ TEST(STWMigrationStatus, TheRecordedBuildTellsAnUpgrade) {
     EXPECT_TRUE(STWMigrationStatus(file, true).isBuildUpgrade());
 }
 
-// A status file that cannot be read is kept as it is for someone to look at, also when it
-// went bad after a store object read it: nothing counts as recorded, and recording writes
-// nothing over it.
+// A status file that cannot be read, also one gone bad after it was read, is kept as it is:
+// nothing counts as recorded, and recording writes nothing over it.
 TEST(STWMigrationStatus, ACorruptStatusFileIsNeverOverwritten) {
     fs::path file = storeDirectory("corrupt") / STWMigrationStatus::systemFileName;
     STWMigrationStatus earlier(file, true);

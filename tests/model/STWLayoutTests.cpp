@@ -33,7 +33,6 @@ protected:
 };
 
 TEST_F(STWLayoutTest, EveryPathLivesUnderTheRootAndIsCreated) {
-    EXPECT_EQ(global->currentMobileUserId(), 501u);
     for (const std::filesystem::path& path :
          {global->stagingDirectory(), global->deathrowDirectory(), global->replaceDirectory(), global->logDirectory(),
           *global->containerDirectoryURLForUserIdentity(mobile, 12, false),
@@ -54,18 +53,8 @@ TEST_F(STWLayoutTest, EveryPathLivesUnderTheRootAndIsCreated) {
     EXPECT_EQ(statOf(*global->containerDirectoryURLForUserIdentity(mobile, 9, false)).st_uid, 501u);
 }
 
-TEST_F(STWLayoutTest, PerUserConfigurationRefusesOtherClassesAndIsSharedByEqualIdentities) {
-    auto perUser = global->getPerUserConfigurationForUserIdentity(mobile);
-    for (STWContainerClass c : {0ull, 1ull, 12ull, 14ull})
-        EXPECT_FALSE(perUser->containerDirectoryURLForContentClass(c, false)) << c;
-    auto unspecific = STWUserIdentity::initWithUID(501, 501, mobile->homeDirectoryURL(), std::nullopt, STWPersonaTypeUnspecific, 501);
-    EXPECT_EQ(global->getPerUserConfigurationForUserIdentity(unspecific), perUser);
-}
-
-// A directory is made once and then only checked; what happened to it behind the daemon's
-// back is noticed by that check: its removal (with its parent), a link in its place, a link on the way back to the very directory
-// made (nothing is followed below the user's home), another owner, and for death row's held
-// descriptor the directory's removal.
+// A directory made once and changed behind the daemon's back is made again, never followed:
+// removed with its parent, a link in its place or on the way, another owner, death row removed.
 TEST_F(STWLayoutTest, ADirectoryReplacedAfterItWasMadeIsMadeAgainNotFollowed) {
     namespace fs = std::filesystem;
     fs::path staging = global->stagingDirectory();
@@ -129,7 +118,14 @@ TEST_F(STWLayoutTest, StateDirectoriesCarryNoProtectionClassAndBackupsAreNeverCr
     EXPECT_FALSE(std::filesystem::exists(home / "Library/Backup"));
     EXPECT_FALSE(std::filesystem::exists(home / "Library/Logs"));
     EXPECT_EQ(*global->containerDirectoryURLForUserIdentity(enterprise, 7, false), home / "Containers/Shared/AppGroup");
-    EXPECT_NE(global->getPerUserConfigurationForUserIdentity(enterprise), global->getPerUserConfigurationForUserIdentity(mobile));
+
+    // A per-user configuration has no global classes; equal identities share one.
+    auto mobileConfiguration = global->getPerUserConfigurationForUserIdentity(mobile);
+    for (STWContainerClass c : {0ull, 1ull, 12ull, 14ull})
+        EXPECT_FALSE(mobileConfiguration->containerDirectoryURLForContentClass(c, false)) << c;
+    auto unspecific = STWUserIdentity::initWithUID(501, 501, mobile->homeDirectoryURL(), std::nullopt,
+                                                   STWPersonaTypeUnspecific, 501);
+    EXPECT_EQ(global->getPerUserConfigurationForUserIdentity(unspecific), mobileConfiguration);
 }
 
 TEST_F(STWLayoutTest, OwnersOfGlobalClassesComeFromTheConfiguration) {
@@ -141,9 +137,7 @@ TEST_F(STWLayoutTest, OwnersOfGlobalClassesComeFromTheConfiguration) {
     EXPECT_EQ(statOf(global->transientBundleDirectory()).st_uid, 77u);
     EXPECT_EQ(statOf(*global->containerDirectoryURLForUserIdentity(mobile, 12, true)).st_uid, 78u);
 
-    // Back to the defaults: the next call hands the bundle directory back to 33. Owner 0
-    // means "leave the ownership alone" (the daemon is root, so what it creates is root's),
-    // so the system directory keeps the owner it was given.
+    // Back to the defaults: bundles go back to 33; owner 0 leaves ownership alone.
     root->writeSettings({});
     EXPECT_EQ(statOf(*global->containerDirectoryURLForUserIdentity(mobile, 3, false)).st_uid, 33u);
     EXPECT_EQ(statOf(*global->containerDirectoryURLForUserIdentity(mobile, 12, true)).st_uid, 78u);

@@ -1,6 +1,5 @@
-// The persona cache on a device without personas. Persona support is decided once per
-// process, so these cases live in a test program of their own whose root says
-// "PersonasUnsupported" before anything asks.
+// The persona cache on a device without personas: a program of its own, since persona
+// support is decided once per process.
 #include "Daemon/Model/STWUserIdentityCache.h"
 #include "tests/support/STWTestRoot.h"
 
@@ -13,12 +12,8 @@ protected:
     void SetUp() override {
         STWTestRoot::shared().writeSettings({{"PersonasUnsupported", STWValue(true)}});
         // A persona list that would give other answers if it were consulted.
-        STWTestRoot::shared().writePersonas({STWValue(STWValue::Dictionary{
-            {"PersonaID", STWValue(1100)},
-            {"Type", STWValue("enterprise")},
-            {"PersonaUniqueString", STWValue("ENT")},
-            {"BundleIdentifiers", STWValue(STWValue::Array{STWValue("com.work")})},
-        })});
+        STWTestRoot::shared().writePersonas(
+            {STWTestRoot::persona("ENT", 1100, "enterprise", {STWValue("com.work")})});
         cache = STWUserIdentityCache::create();
         home = STWTestRoot::shared().resolve("/private/var/mobile");
     }

@@ -34,29 +34,24 @@ private:
 
 } // namespace
 
-TEST(STWCommandQueue, RunsInOrderIncludingCommandsQueuedByARunningCommand) {
+// In order, commands queued by a running one included; the first failure stops the run and
+// keeps the rest; success leaves the caller's code alone.
+TEST(STWCommandQueue, RunsInOrderAndStopsAtTheFirstFailure) {
     std::vector<int> log;
     auto queue = STWCommandQueue::init();
     queue->insertCommand(std::make_shared<RecordingCommand>(log, 1, 0, std::make_shared<RecordingCommand>(log, 3)));
     queue->insertCommand(std::make_shared<RecordingCommand>(log, 2));
     uint64_t error = 1;
     EXPECT_TRUE(queue->executeAllUntilExhaustedOrError(&error));
-    EXPECT_EQ(error, 1u) << "success leaves the code alone";
+    EXPECT_EQ(error, 1u);
     EXPECT_EQ(log, (std::vector<int>{1, 2, 3}));
     EXPECT_FALSE(queue->executeNextCommandWithError(&error));
     EXPECT_EQ(error, STWErrorCommandQueueExhausted);
-    EXPECT_TRUE(queue->executeAllUntilExhaustedOrError(&error)) << "an empty queue is exhausted";
-}
 
-TEST(STWCommandQueue, StopsAtTheFirstFailureAndKeepsTheRest) {
-    std::vector<int> log;
-    auto queue = STWCommandQueue::init();
-    queue->insertCommand(std::make_shared<RecordingCommand>(log, 1));
-    queue->insertCommand(std::make_shared<RecordingCommand>(log, 2, STWErrorCacheRemoveFailed));
-    queue->insertCommand(std::make_shared<RecordingCommand>(log, 3));
-    uint64_t error = 1;
+    queue->insertCommand(std::make_shared<RecordingCommand>(log, 4, STWErrorCacheRemoveFailed));
+    queue->insertCommand(std::make_shared<RecordingCommand>(log, 5));
     EXPECT_FALSE(queue->executeAllUntilExhaustedOrError(&error));
     EXPECT_EQ(error, STWErrorCacheRemoveFailed);
-    EXPECT_EQ(log, (std::vector<int>{1, 2}));
+    EXPECT_EQ(log, (std::vector<int>{1, 2, 3, 4}));
     EXPECT_EQ(queue->count(), 1u);
 }

@@ -67,9 +67,8 @@ TEST_F(STWCreateOrLookup, AnExceptionInsideALockedCreateReleasesTheLock) {
     EXPECT_FALSE(created->existed());
 }
 
-// A tree with plain files goes; a missing item is no failure. A deletion pass may remove
-// a move's fresh "temp." directory before the item is renamed into it: the move still
-// moves its item (here the pass strikes at exactly that moment).
+// A tree goes, a missing item is no failure, and a move whose fresh "temp." directory a
+// deletion pass removed before the rename still moves its item.
 TEST_F(STWCreateOrLookup, MovesToDeathRowTolerateMissingItemsAndARacingPass) {
     fs::path tree = root.path() / "scratch", raced = root.path() / "raced";
     fs::create_directories(tree / "a/b");

@@ -33,10 +33,8 @@ protected:
 
 } // namespace
 
-// Which commands an unentitled, a lookup-only and an allowed caller reach is checked over
-// the socket in the end-to-end tests. Here the callers a client cannot present there, and
-// what each kind of connection may do.
-TEST_F(STWEntitlementDecisionTest, CallersWithoutUsableEntitlementsReachWhatTheUnentitledReach) {
+// Callers a client cannot present over the socket, and what each kind of connection may do.
+TEST_F(STWEntitlementDecisionTest, CallersWithoutUsableEntitlementsAndAllowedCallers) {
     std::vector<uint64_t> open = connectedCommands(caller({}));
     EXPECT_EQ(connectedCommands(nullptr), open) << "no signing identifier";
     // A lookup that is no dictionary, a string for a boolean, a boolean for an array.
@@ -44,13 +42,12 @@ TEST_F(STWEntitlementDecisionTest, CallersWithoutUsableEntitlementsReachWhatTheU
                                         {"com.vorlane.private.Stowly.dataMigration", STWValue("true")},
                                         {"com.vorlane.private.Stowly.wipeContainer", STWValue(true)}})),
               open);
-    auto connection = decide(0, caller({}));
-    EXPECT_FALSE(connection->entitled() || connection->unrestricted() || connection->lookup());
-    EXPECT_EQ(connection->clientBundleIdentifier().value_or(""), "com.example.caller");
+    auto plain = decide(0, caller({}));
+    EXPECT_FALSE(plain->entitled() || plain->unrestricted() || plain->lookup());
+    EXPECT_EQ(plain->clientBundleIdentifier().value_or(""), "com.example.caller");
     EXPECT_FALSE(decide(0, nullptr)->clientBundleIdentifier().has_value());
-}
 
-TEST_F(STWEntitlementDecisionTest, AllowedIsUnrestrictedExceptWhereTestabilityIsRequired) {
+    // Allowed is unrestricted except where testability is required.
     auto allowed = caller({{"com.vorlane.private.Stowly.allowed", STWValue(true)}});
     for (uint64_t c = 0; c < STWCommandCount; c++) {
         if (auto connection = decide(c, allowed)) {
@@ -90,29 +87,22 @@ TEST_F(STWEntitlementDecisionTest, LookupDictionaryEntitlesLookupsOfWhatItNames)
     EXPECT_FALSE(decide(28, identity)->lookup().has_value());
 }
 
-TEST_F(STWEntitlementDecisionTest, OtherIdLookupAndSpecificEntitlements) {
+// Specific entitlements open their own commands only, entitled but not unrestricted; allowed
+// alone reaches wipe as unrestricted, with no identifiers.
+TEST_F(STWEntitlementDecisionTest, SpecificEntitlementsOpenOnlyTheirCommands) {
     auto identity = caller({{"com.vorlane.private.Stowly.otherIdLookup", STWValue(1)},
-                            {"com.vorlane.private.Stowly.userManagedAssets", STWValue(true)}});
-    auto assets = decide(29, identity);
-    ASSERT_NE(assets, nullptr);
-    EXPECT_TRUE(assets->entitled() && assets->allowOtherIdLookup());
-    EXPECT_FALSE(assets->unrestricted());
+                            {"com.vorlane.private.Stowly.userManagedAssets", STWValue(true)},
+                            {"com.vorlane.private.Stowly.wipeContainer",
+                             STWValue(STWValue::Array{STWValue("com.example.plugin")})}});
+    auto assets = decide(29, identity), wipe = decide(11, identity);
+    ASSERT_TRUE(assets && wipe);
+    EXPECT_TRUE(assets->entitled() && assets->allowOtherIdLookup() && wipe->entitled());
+    EXPECT_FALSE(assets->unrestricted() || wipe->unrestricted());
+    EXPECT_EQ(wipe->entitledWipeIdentifiers().value_or(STWValue::Array()).size(), 1u);
     EXPECT_NE(decide(4, identity), nullptr);
     EXPECT_EQ(decide(2, identity), nullptr);
-}
+    EXPECT_EQ(decide(10, identity), nullptr);
 
-TEST_F(STWEntitlementDecisionTest, WipeContainerArrayEntitlesOnItsOwn) {
-    auto wiper = caller({{"com.vorlane.private.Stowly.wipeContainer",
-                          STWValue(STWValue::Array{STWValue("com.example.plugin")})}});
-    auto connection = decide(11, wiper);
-    ASSERT_NE(connection, nullptr);
-    EXPECT_TRUE(connection->entitled());
-    EXPECT_FALSE(connection->unrestricted());
-    EXPECT_EQ(connection->entitledWipeIdentifiers().value_or(STWValue::Array()).size(), 1u);
-    // The array alone opens nothing else.
-    EXPECT_EQ(decide(10, wiper), nullptr);
-
-    // Allowed without the array: entitled as unrestricted, no identifiers.
     auto allowed = decide(11, caller({{"com.vorlane.private.Stowly.allowed", STWValue(true)}}));
     ASSERT_NE(allowed, nullptr);
     EXPECT_TRUE(allowed->entitled() && !allowed->entitledWipeIdentifiers());

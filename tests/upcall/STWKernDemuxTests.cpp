@@ -7,6 +7,7 @@
 
 #include <cstring>
 #include <functional>
+#include <tuple>
 
 namespace {
 
@@ -26,7 +27,7 @@ const std::string kEndMarkerOnly(8, '\0');
 
 } // namespace
 
-TEST(STWKernDemuxTest, BadLayoutsGetTheMessageLayersCodes) {
+TEST(STWKernDemuxTest, BadLayoutsAndForeignIdsGetTheMessageLayersAnswers) {
     struct Case {
         const char* name;
         std::function<void(STWKernReceivedRequest&)> breakIt;
@@ -50,17 +51,15 @@ TEST(STWKernDemuxTest, BadLayoutsGetTheMessageLayersCodes) {
         c.breakIt(received);
         STWKernReply reply{};
         EXPECT_TRUE(demux_server(&received.request.header, &reply.header)) << c.name;
-        EXPECT_EQ(reply.error.returnCode, c.code) << c.name;
-        EXPECT_EQ(reply.header.size, sizeof(STWKernErrorReply)) << c.name;
-        EXPECT_EQ(reply.header.bits, 19u) << c.name; // the request's remote disposition
-        EXPECT_EQ(reply.header.remotePort, 0x1234u) << c.name;
-        EXPECT_EQ(reply.header.localPort, 0u) << c.name;
-        EXPECT_EQ(reply.header.id, 322515000u) << c.name;
+        // Bits 19: the request's remote disposition; the id is the request's plus 100.
+        EXPECT_EQ(std::tuple(reply.error.returnCode, reply.header.size, reply.header.bits,
+                             reply.header.remotePort, reply.header.localPort, reply.header.id),
+                  std::tuple(c.code, uint32_t(sizeof(STWKernErrorReply)), 19u, 0x1234u, 0u, 322515000u))
+            << c.name;
         EXPECT_EQ(memcmp(&reply.error.ndr, &STWKernNDRRecord, sizeof STWKernNDRRecord), 0) << c.name;
     }
-}
 
-TEST(STWKernDemuxTest, OnlyTheSubsystemsIdsAreTaken) {
+    // Only the subsystem's ids are taken: its unused routine is answered, others left alone.
     STWKernReceivedRequest received = wellFormed(kEndMarkerOnly);
     received.request.header.id = STWKernUnusedRoutineID;
     STWKernReply reply{};
