@@ -43,10 +43,10 @@ std::string STWTortureWorker::_group(unsigned k) const {
 
 void STWTortureWorker::_violation(const std::string& text) { violations.push_back(text); }
 
-void STWTortureWorker::_measure(std::chrono::steady_clock::time_point began, bool answered) {
+void STWTortureWorker::_measure(const char* kind, std::chrono::steady_clock::time_point began, bool answered) {
     ++requests;
     if (answered && _mode == Mode::Steady)
-        latencies.push_back(uint32_t(std::chrono::duration_cast<std::chrono::microseconds>(
+        latencies[kind].push_back(uint32_t(std::chrono::duration_cast<std::chrono::microseconds>(
                                          std::chrono::steady_clock::now() - began).count()));
 }
 
@@ -75,7 +75,7 @@ STWTortureWorker::Outcome STWTortureWorker::_send(const char* kind, STWClient& c
     STWErrorRef error;
     auto began = std::chrono::steady_clock::now();
     auto answer = client.sendMessage(message, _mode != Mode::Kills ? replyTimeout : requestTimeout, &error);
-    _measure(began, answer.has_value());
+    _measure(kind, began, answer.has_value());
     const std::string* identifier = STWDictionaryString(message, "Identifier");
     if (!identifier)
         identifier = STWDictionaryString(message, "NewIdentifier");
@@ -515,7 +515,7 @@ void STWTortureWorker::_upcall(STWUpcallClient& upcalls, const std::string& app)
     STWErrorRef error;
     auto began = std::chrono::steady_clock::now();
     auto reply = upcalls.send(request, _mode != Mode::Kills ? replyTimeout : requestTimeout, &error);
-    _measure(began, reply.has_value());
+    _measure("upcall", began, reply.has_value());
     if (!reply && _mode != Mode::Kills)
         _violation("upcall for " + app + " got no reply");
     std::vector<STWTortureIdentity> named{{2, app}, {12, system}};

@@ -51,7 +51,7 @@ public:
     std::map<std::string, uint64_t> acknowledged, uncertain;
     uint64_t failed = 0;                // replies with an error code under injected faults
     uint64_t requests = 0;              // sent over the request socket or the upcall socket
-    std::vector<uint32_t> latencies;    // of every answered request, in microseconds
+    std::map<std::string, std::vector<uint32_t>> latencies; // kind -> of every answered request, in microseconds
 
 private:
     enum class Outcome { Acknowledged, Refused, Uncertain };
@@ -83,7 +83,7 @@ private:
     // entry can name any more lose their containers (for certain when `certain`).
     void _released(const std::string& owner, const std::set<std::string>& before, bool certain);
     void _violation(const std::string& text);
-    void _measure(std::chrono::steady_clock::time_point began, bool answered);
+    void _measure(const char* kind, std::chrono::steady_clock::time_point began, bool answered);
     void _note(const STWTortureIdentity& identity, const std::string& what);
 
     std::string _app(unsigned k) const;
