@@ -1,43 +1,26 @@
-// The services on one container over the socket: info values, UUID regeneration, disk
-// usage, user-managed assets, staged shared content and the retry self-test; and what an
-// app that owns the container can do to them with links, FIFOs and swaps.
-#include "tests/support/STWDaemonProcess.h"
+// The services on one container (info values, UUID regeneration, disk usage, assets, staged
+// shared content, the retry self-test), and what its app can do to them with links and FIFOs.
+#include "tests/e2e/STWE2ETestSupport.h"
 
 #include "Daemon/FileSystem/STWFileManager.h"
-#include "common/STWError.h"
 
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <chrono>
 #include <fcntl.h>
-#include <fstream>
 #include <map>
 #include <sys/stat.h>
 #include <thread>
 #include <unistd.h>
 
-namespace fs = std::filesystem;
+using namespace STWE2E;
 
 namespace {
-
-const STWValue::Dictionary allowed{{"com.vorlane.private.Stowly.allowed", STWValue(true)}};
-const STWValue::Dictionary tester{{"com.vorlane.private.Stowly.testability", STWValue(true)}};
-const STWValue::Dictionary internal{{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}};
-
-uint64_t code(const STWValue::Dictionary& reply) { return STWDictionaryUInt64(reply, "ReplyError").value_or(0); }
-fs::path path(const STWValue::Dictionary& reply) {
-    const std::string* p = STWDictionaryString(reply, "ReplyPath");
-    return p ? fs::path(*p) : fs::path();
-}
 
 // Creates the container and answers the keys that name it (identifier, class, UUID).
 STWValue::Dictionary create(STWClient& client, const std::string& identifier, uint64_t containerClass,
                             fs::path* where = nullptr) {
-    auto reply = STWDaemonProcess::send(client, 0,
-                                        {{"Identifier", STWValue(identifier)},
-                                         {"ContainerClass", STWValue(containerClass)},
-                                         {"CreateIfNecessary", STWValue(true)}});
+    auto reply = STWDaemonProcess::send(client, 0, keys(identifier, containerClass));
     EXPECT_EQ(code(reply), STWErrorSuccess) << identifier;
     if (where)
         *where = path(reply);
@@ -55,7 +38,7 @@ uint64_t diskUsage(STWClient& client, const STWValue::Dictionary& identity) {
     return STWDictionaryUInt64(reply, "ReplyDiskUsage").value_or(0);
 }
 
-void writeFile(const fs::path& file, size_t bytes) { std::ofstream(file) << std::string(bytes, 'x'); }
+void writeFile(const fs::path& file, size_t bytes) { write(file, std::string(bytes, 'x')); }
 
 // Type, mode, owner and contents (or link target) of every entry below `root`.
 std::map<std::string, std::string> snapshot(const fs::path& root) {
@@ -77,9 +60,8 @@ std::map<std::string, std::string> snapshot(const fs::path& root) {
 fs::path makeCanary() {
     char templ[] = "/tmp/stowly-canary-XXXXXX";
     fs::path canary = mkdtemp(templ);
-    fs::create_directories(canary / "Caches");
-    std::ofstream(canary / "secret") << "root only";
-    std::ofstream(canary / "Caches/secret") << "root only";
+    write(canary / "secret", "root only");
+    write(canary / "Caches/secret", "root only");
     return canary;
 }
 
@@ -94,33 +76,26 @@ STWValue::Dictionary stage(const char* group, const char* source, const char* de
 fs::path makeSharedGroup(STWDaemonProcess& daemon, STWClient& installer, std::unique_ptr<STWClient>* stager) {
     fs::path group;
     create(installer, kGroup, 13, &group);
-    STWValue::Dictionary entitlements{
-        {"com.vorlane.security.system-groups", STWValue(STWValue::Array{STWValue(kGroup)})}};
-    EXPECT_EQ(STWDaemonProcess::replyError(installer, 18,
-                                           {{"Identifier", STWValue("com.example.stager")},
-                                            {"CodeSigningInfo", STWValue(STWValue::Dictionary{
-                                                                    {"com.vorlane.Stowly.Entitlements",
-                                                                     STWValue(entitlements)}})}}),
+    STWValue::Dictionary entitlements{{"com.vorlane.security.system-groups", STWValue(STWValue::Array{STWValue(kGroup)})}};
+    EXPECT_EQ(STWDaemonProcess::replyError(installer, 18, codeSigningKeys("com.example.stager", entitlements)),
               STWErrorSuccess);
     *stager = daemon.connectAs("com.example.stager", stagingEntitlement);
     return group;
 }
 
+using STWContainerServices = SharedDaemonTest;
+
 } // namespace
 
-// Staging checks its input before it looks anything up, then the caller's system groups,
-// and moves content only within the group container.
-TEST(STWContainerServices, StagedSharedContentIsCheckedAndMovedWithinTheGroup) {
-    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}});
-    auto installer = daemon.connectAs("com.example.installer", allowed);
+// Staging checks its input, then the caller's system groups, and moves only within the group.
+TEST_F(STWContainerServices, StagedSharedContentIsCheckedAndMovedWithinTheGroup) {
     std::unique_ptr<STWClient> stager;
-    fs::path group = makeSharedGroup(daemon, *installer, &stager);
-    auto stranger = daemon.connectAs("com.example.stranger", stagingEntitlement);
+    fs::path group = makeSharedGroup(*daemon, *client, &stager);
+    auto stranger = daemon->connectAs("com.example.stranger", stagingEntitlement);
     EXPECT_EQ(STWDaemonProcess::replyError(*stranger, 26, stage("systemgroup.com.example.none", "a/../b", "c")),
               STWErrorInvalidArgument);
     EXPECT_EQ(STWDaemonProcess::replyError(*stranger, 26, stage(kGroup, "a", "b")), STWErrorNotEntitled);
 
-    fs::create_directories(group / "incoming/pkg");
     writeFile(group / "incoming/pkg/file", 10);
     auto staged = STWDaemonProcess::send(*stager, 26, stage(kGroup, "incoming/pkg", "pkg"));
     ASSERT_EQ(code(staged), STWErrorSuccess);
@@ -139,24 +114,19 @@ TEST(STWContainerServices, StagedSharedContentIsCheckedAndMovedWithinTheGroup) {
     EXPECT_EQ(st.st_uid, 65534u); // nobody: the private root's user database has none
 }
 
-// A value set and removed again (nil), and a UUID regenerated: both survive a restart,
-// which rebuilds everything from the metadata files.
-TEST(STWContainerServices, InfoValuesAndRegeneratedUUIDAreKeptOnDisk) {
-    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}});
-    auto client = daemon.connectAs("com.example.installer", allowed);
+// Info values set and removed (nil), and a regenerated UUID, survive a restart.
+TEST_F(STWContainerServices, InfoValuesAndRegeneratedUUIDAreKeptOnDisk) {
     fs::path before;
     auto identity = create(*client, "com.example.info", 2, &before);
-    EXPECT_EQ(STWDaemonProcess::replyError(*client, 5, with(with(identity, "Key", STWValue("kept")), "Value", STWValue(7u))),
-              STWErrorSuccess);
-    EXPECT_EQ(STWDaemonProcess::replyError(*client, 5, with(with(identity, "Key", STWValue("gone")), "Value", STWValue("x"))),
-              STWErrorSuccess);
-    EXPECT_EQ(STWDaemonProcess::replyError(*client, 5, with(identity, "Key", STWValue("gone"))), STWErrorSuccess);
-    EXPECT_EQ(STWDaemonProcess::replyError(*client, 5, with(identity, "Key", STWValue(3u))), STWErrorInvalidArgument);
-    EXPECT_EQ(STWDaemonProcess::replyError(*client, 9, identity), STWErrorSuccess);
+    EXPECT_EQ(code(send(5, with(with(identity, "Key", STWValue("kept")), "Value", STWValue(7u)))), STWErrorSuccess);
+    EXPECT_EQ(code(send(5, with(with(identity, "Key", STWValue("gone")), "Value", STWValue("x")))), STWErrorSuccess);
+    EXPECT_EQ(code(send(5, with(identity, "Key", STWValue("gone")))), STWErrorSuccess);
+    EXPECT_EQ(code(send(5, with(identity, "Key", STWValue(3u)))), STWErrorInvalidArgument);
+    EXPECT_EQ(code(send(9, identity)), STWErrorSuccess);
 
-    ASSERT_TRUE(daemon.stop());
-    ASSERT_TRUE(daemon.start());
-    client = daemon.connectAs("com.example.installer", allowed);
+    ASSERT_TRUE(daemon->stop());
+    ASSERT_TRUE(daemon->start());
+    connect();
     auto kept = STWDaemonProcess::send(*client, 6, with(identity, "Key", STWValue("kept")));
     ASSERT_EQ(code(kept), STWErrorSuccess);
     EXPECT_EQ(kept["ReplyInfoValue"], STWValue(7u));
@@ -170,9 +140,8 @@ TEST(STWContainerServices, InfoValuesAndRegeneratedUUIDAreKeptOnDisk) {
     EXPECT_FALSE(fs::exists(fs::symlink_status(before)));
 }
 
-// A bundle's size is measured once while fast sizing is off and every time while it is
-// on; test lock 2 parks a measurement until it is released.
-TEST(STWContainerServices, DiskUsageIsCachedForBundlesAndParksBehindTestLock2) {
+// A bundle is measured once without fast sizing, always with it; test lock 2 parks a measurement.
+TEST(STWContainerServicesInternal, DiskUsageIsCachedForBundlesAndParksBehindTestLock2) {
     for (bool fast : {false, true}) {
         SCOPED_TRACE(fast ? "fast sizing" : "no fast sizing");
         auto settings = internal;
@@ -196,8 +165,7 @@ TEST(STWContainerServices, DiskUsageIsCachedForBundlesAndParksBehindTestLock2) {
             continue;
 
         auto control = daemon.connectAs("com.example.tester", tester);
-        ASSERT_EQ(STWDaemonProcess::replyError(*control, 31, {{"TestLock", STWValue(2)}, {"Enable", STWValue(true)}}),
-                  STWErrorSuccess);
+        ASSERT_EQ(setTestLock(*control, 2, true), STWErrorSuccess);
         std::atomic<uint64_t> parked{0};
         std::thread measure([&] {
             auto other = daemon.connectAs("com.example.installer", allowed);
@@ -205,21 +173,17 @@ TEST(STWContainerServices, DiskUsageIsCachedForBundlesAndParksBehindTestLock2) {
         });
         std::this_thread::sleep_for(std::chrono::milliseconds(300));
         EXPECT_EQ(parked.load(), 0u);
-        EXPECT_EQ(STWDaemonProcess::replyError(*control, 31, {{"TestLock", STWValue(2)}, {"Enable", STWValue(false)}}),
-                  STWErrorSuccess);
+        EXPECT_EQ(setTestLock(*control, 2, false), STWErrorSuccess);
         measure.join();
         EXPECT_EQ(parked.load(), STWErrorSuccess);
     }
 }
 
-// The assets directory is made once; only what resolves strictly inside it can be deleted,
-// and a link out of it is refused without touching its target.
-TEST(STWContainerServices, UserManagedAssetsStayInsideTheirDirectory) {
-    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}});
-    auto installer = daemon.connectAs("com.example.installer", allowed);
+// The assets directory is made once; only what resolves strictly inside it can be deleted.
+TEST_F(STWContainerServices, UserManagedAssetsStayInsideTheirDirectory) {
     fs::path container;
-    create(*installer, "com.example.app", 2, &container);
-    auto app = daemon.connectAs("com.example.app", {});
+    create(*client, "com.example.app", 2, &container);
+    auto app = daemon->connectAs("com.example.app", {});
     STWValue::Dictionary ask{{"Identifier", STWValue("com.example.app")},
                              {"IsRelative", STWValue(true)},
                              {"CreateIfNecessary", STWValue(true)}};
@@ -245,7 +209,7 @@ TEST(STWContainerServices, UserManagedAssetsStayInsideTheirDirectory) {
     fs::create_symlink("../" + assets.filename().string() + "2/file", assets / "sibling");
     writeFile(assets / "doc", 10);
     auto remove = [&](const char* relative) {
-        return STWDaemonProcess::replyError(*installer, 29,
+        return STWDaemonProcess::replyError(*client, 29,
                                             {{"Identifier", STWValue("com.example.app")}, {"SourcePath", STWValue(relative)}});
     };
     for (const char* refused : {".", "", "out/secret", "out", "sibling", "..", "nothing"})
@@ -258,9 +222,8 @@ TEST(STWContainerServices, UserManagedAssetsStayInsideTheirDirectory) {
     STWFileManager::defaultManager()->removeItemAtURL(canary);
 }
 
-// The daemon exits N times, one per request, and the request after the last exit succeeds
-// and takes the test container away.
-TEST(STWContainerServices, RetryTestExitsTheDaemonNTimesThenSucceeds) {
+// The daemon exits N times, once per request; the next request succeeds and removes its container.
+TEST(STWContainerServicesInternal, RetryTestExitsTheDaemonNTimesThenSucceeds) {
     STWDaemonProcess daemon(internal);
     for (int exits = 0; exits < 2; ++exits) {
         auto client = daemon.connectAs("com.example.tester", tester);
@@ -270,30 +233,24 @@ TEST(STWContainerServices, RetryTestExitsTheDaemonNTimesThenSucceeds) {
     }
     auto client = daemon.connectAs("com.example.tester", tester);
     auto installer = daemon.connectAs("com.example.installer", allowed);
-    STWValue::Dictionary lookup{{"Identifier", STWValue("com.vorlane.retryTest")},
-                                {"ContainerClass", STWValue(2u)},
-                                {"CreateIfNecessary", STWValue(false)}};
+    auto lookup = keys("com.vorlane.retryTest", 2, false);
     EXPECT_EQ(STWDaemonProcess::replyError(*installer, 0, lookup), STWErrorSuccess);
     EXPECT_EQ(STWDaemonProcess::replyError(*client, 25, {{"NumRetryCrashes", STWValue(2u)}}), STWErrorSuccess);
     EXPECT_TRUE(daemon.isRunning());
     EXPECT_EQ(STWDaemonProcess::replyError(*installer, 0, lookup), STWErrorNotFound);
 }
 
-// What an app can plant in its own container (and a system process in a system group
-// container): links to a directory outside in place of subdirectories, assets and staged
-// content, FIFOs, link loops, and a directory swapped with such a link all the while. No
-// command changes anything outside, and each answers promptly.
-TEST(STWContainerServices, HostileContainerContentNeverLeadsOut) {
-    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}});
-    auto installer = daemon.connectAs("com.example.installer", allowed);
+// Links out, FIFOs, loops and directories swapped with links all the while, in a container, its
+// assets and a system group container: no service changes anything outside, and each answers.
+TEST_F(STWContainerServices, HostileContainerContentNeverLeadsOut) {
     fs::path container;
-    auto identity = create(*installer, "com.example.hostile", 2, &container);
+    auto identity = create(*client, "com.example.hostile", 2, &container);
     STWValue::Dictionary assetsKeys{{"Identifier", STWValue("com.example.hostile")},
                                     {"CreateIfNecessary", STWValue(true)}};
-    fs::path assets = path(STWDaemonProcess::send(*installer, 28, assetsKeys));
+    fs::path assets = path(STWDaemonProcess::send(*client, 28, assetsKeys));
     ASSERT_FALSE(assets.empty());
     std::unique_ptr<STWClient> stager;
-    fs::path group = makeSharedGroup(daemon, *installer, &stager);
+    fs::path group = makeSharedGroup(*daemon, *client, &stager);
     fs::path canary = makeCanary();
     auto before = snapshot(canary);
 
@@ -337,15 +294,14 @@ TEST(STWContainerServices, HostileContainerContentNeverLeadsOut) {
     for (int round = 0; round < 20; ++round) {
         for (const auto& [command, keys] : requests) {
             auto start = std::chrono::steady_clock::now();
-            STWClient& client = command == 26 ? *stager : *installer;
-            EXPECT_NE(STWDaemonProcess::replyError(client, command, keys), 0u) << "command " << command;
+            EXPECT_NE(STWDaemonProcess::replyError(command == 26 ? *stager : *client, command, keys), 0u) << command;
             EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(2)) << "command " << command;
         }
     }
     done = true;
     app.join();
     EXPECT_EQ(snapshot(canary), before);
-    EXPECT_TRUE(daemon.isRunning());
-    EXPECT_EQ(STWDaemonProcess::replyError(*installer, 7, identity), STWErrorSuccess);
+    EXPECT_TRUE(daemon->isRunning());
+    EXPECT_EQ(STWDaemonProcess::replyError(*client, 7, identity), STWErrorSuccess);
     STWFileManager::defaultManager()->removeItemAtURL(canary);
 }

@@ -4,11 +4,7 @@
 
 #include <gtest/gtest.h>
 
-namespace {
-
-const bool installed = [] {
+static const bool installed = [] {
     STWDaemonProcess::setFailureHandler([](const std::string& message) { ADD_FAILURE() << message; });
     return true;
 }();
-
-} // namespace

@@ -1,20 +1,11 @@
-#include "tests/support/STWDaemonProcess.h"
-#include "tests/support/STWTestRoot.h"
-
-#include "common/STWError.h"
-#include "common/STWFileIO.h"
-#include "platform/STWAuditToken.h"
-#include "platform/STWSandboxExtension.h"
+// The group, system-container and code-signing commands over the socket, and sandbox tokens.
+#include "tests/e2e/STWE2ETestSupport.h"
 
 #include <gtest/gtest.h>
 
-#include <unistd.h>
+using namespace STWE2E;
 
 namespace {
-
-const STWValue::Dictionary allowed{{"com.vorlane.private.Stowly.allowed", STWValue(true)}};
-
-uint64_t code(const STWValue::Dictionary& reply) { return STWDictionaryUInt64(reply, "ReplyError").value_or(0); }
 
 const STWValue::Dictionary& dictionary(const STWValue::Dictionary& reply, const char* key) {
     static const STWValue::Dictionary none;
@@ -22,57 +13,25 @@ const STWValue::Dictionary& dictionary(const STWValue::Dictionary& reply, const 
     return d ? *d : none;
 }
 
-STWValue groups(std::initializer_list<const char*> names) {
-    STWValue::Array array;
-    for (const char* name : names)
-        array.emplace_back(name);
-    return STWValue(std::move(array));
+// The installer tells the daemon `identifier`'s entitlements, or nothing (the app is gone).
+void install(STWClient& installer, const std::string& identifier, std::optional<STWValue::Dictionary> entitlements) {
+    auto k = entitlements ? codeSigningKeys(identifier, *entitlements)
+                          : STWValue::Dictionary{{"Identifier", STWValue(identifier)}};
+    ASSERT_EQ(STWDaemonProcess::replyError(installer, 18, k), STWErrorSuccess);
+}
+STWValue::Dictionary appGroups(STWValue value) { return {{"com.vorlane.security.application-groups", std::move(value)}}; }
+STWValue::Dictionary appGroups(std::initializer_list<const char*> names) {
+    return appGroups(STWValue(STWValue::Array(names.begin(), names.end())));
 }
 
-class STWGroupCommandsTest : public ::testing::Test {
-protected:
-    static void SetUpTestSuite() {
-        daemon = new STWDaemonProcess({{"DeveloperMode", STWValue(true)}},
-                                      {STWTestRoot::persona("PERSONAL-1", 1000, "personal"),
-                                       STWTestRoot::persona("ENTERPRISE-1", 1001, "enterprise",
-                                                            {STWValue("com.example.work")})},
-                                      false);
-        daemon->setStandardErrorFile(daemon->root() / "stowlyd.stderr");
-        ASSERT_TRUE(daemon->start());
-    }
-    static void TearDownTestSuite() {
-        delete daemon;
-        daemon = nullptr;
-    }
-
-    // What the installer tells the daemon about `identifier`: its entitlements, or nothing
-    // (the app is gone).
-    static void install(const std::string& identifier, std::optional<STWValue::Dictionary> entitlements) {
-        auto installer = daemon->connectAs("com.example.installer", allowed);
-        ASSERT_NE(installer, nullptr);
-        STWValue::Dictionary keys{{"Identifier", STWValue(identifier)}};
-        if (entitlements)
-            keys["CodeSigningInfo"] =
-                STWValue(STWValue::Dictionary{{"com.vorlane.Stowly.Entitlements", STWValue(*entitlements)}});
-        ASSERT_EQ(STWDaemonProcess::replyError(*installer, 18, keys), STWErrorSuccess);
-    }
-    static STWValue::Dictionary appGroups(STWValue value) {
-        return {{"com.vorlane.security.application-groups", std::move(value)}};
-    }
-    static std::string log() {
-        std::string text;
-        STWReadFileContents(daemon->root() / "stowlyd.stderr", &text);
-        return text;
-    }
-
-    static STWDaemonProcess* daemon;
-};
-STWDaemonProcess* STWGroupCommandsTest::daemon = nullptr;
+using STWGroupCommandsTest = SharedDaemonTest;
 
 } // namespace
 
-TEST_F(STWGroupCommandsTest, GroupLookupsFollowTheOwnerAndTheLookupEntitlement) {
-    install("com.example.owner", appGroups(groups({"group.owner"})));
+// Group lookups follow the owner and the lookup entitlement; a group container stays while
+// any installed app names it.
+TEST_F(STWGroupCommandsTest, GroupContainersFollowTheirOwners) {
+    install(*client, "com.example.owner", appGroups({"group.owner"}));
     STWValue::Dictionary ofOwner{{"Identifier", STWValue("com.example.owner")}};
     auto lookupOf = [](STWValue appGroup) {
         return STWValue::Dictionary{
@@ -96,39 +55,52 @@ TEST_F(STWGroupCommandsTest, GroupLookupsFollowTheOwnerAndTheLookupEntitlement) 
     auto anonymous = daemon->connect();
     EXPECT_EQ(STWDaemonProcess::replyError(*anonymous, 13, ofOwner), STWErrorNotEntitled);
     EXPECT_EQ(STWDaemonProcess::replyError(*anonymous, 14, ofOwner), STWErrorNotEntitled);
+
+    fs::path group = *dictionary(own, "ReplyGroupContainerDict").at("group.owner").string();
+    ASSERT_TRUE(fs::is_directory(group));
+    install(*client, "com.example.second", appGroups(STWValue("group.owner")));
+    install(*client, "com.example.owner", std::nullopt);
+    EXPECT_TRUE(fs::is_directory(group));
+    install(*client, "com.example.second", std::nullopt);
+    EXPECT_FALSE(fs::exists(group));
 }
 
-TEST_F(STWGroupCommandsTest, SandboxedEnterpriseCallerGetsATokenPerGroup) {
-    install("com.example.work", appGroups(groups({"group.work.a", "group.work.b"})));
+// A sandboxed caller of an enterprise persona gets a token it can use for its data container
+// and one for each of its groups; a personal caller, sandboxed too, gets none.
+TEST_F(STWGroupCommandsTest, SandboxedEnterpriseCallersGetVerifiableTokens) {
+    install(*client, "com.example.work", appGroups({"group.work.a", "group.work.b"}));
+    install(*client, "com.example.home", appGroups({"group.home"}));
+    STWValue::Dictionary own{{"ContainerClass", STWValue(2)}, {"CreateIfNecessary", STWValue(true)}};
     auto work = daemon->connectAs("com.example.work", {}, true, "ENTERPRISE-1");
+    auto data = STWDaemonProcess::send(*work, 0, own);
+    ASSERT_EQ(code(data), STWErrorSuccess);
+    EXPECT_EQ(data["ReplyPersonaUniqueString"], STWValue("ENTERPRISE-1"));
+    const std::string* token = STWDictionaryString(data, "SandboxToken");
+    EXPECT_TRUE(tokenVerifies(*daemon, token, STWSandboxExtension::containerClass, path(data)));
+    EXPECT_FALSE(tokenVerifies(*daemon, token, STWSandboxExtension::containerClass, path(data).string() + "x"));
     auto reply = STWDaemonProcess::send(*work, 13);
     ASSERT_EQ(code(reply), STWErrorSuccess);
     const auto& paths = dictionary(reply, "ReplyGroupContainerDict");
     const auto& tokens = dictionary(reply, "SandboxTokenDict");
     ASSERT_EQ(paths.size(), 2u);
     ASSERT_EQ(tokens.size(), 2u);
-    std::string key;
-    ASSERT_EQ(STWReadFileContents(daemon->root() / "run/stowly/extension.key", &key), 0);
-    auto auditToken = STWAuditToken::forProcess(getpid(), geteuid(), getegid());
-    ASSERT_TRUE(auditToken.has_value());
-    for (const auto& [group, path] : paths)
-        EXPECT_TRUE(STWSandboxExtension::verify(*tokens.at(group).string(), STWSandboxExtension::applicationGroupClass,
-                                                *path.string(), *auditToken, key))
+    for (const auto& [group, where] : paths)
+        EXPECT_TRUE(tokenVerifies(*daemon, tokens.at(group).string(), STWSandboxExtension::applicationGroupClass,
+                                  *where.string()))
             << group;
 
-    // A personal caller's groups come without tokens.
-    install("com.example.home", appGroups(groups({"group.home"})));
     auto home = daemon->connectAs("com.example.home", {}, true);
-    auto plain = STWDaemonProcess::send(*home, 13);
+    auto plain = STWDaemonProcess::send(*home, 0, own), plainGroups = STWDaemonProcess::send(*home, 13);
     ASSERT_EQ(code(plain), STWErrorSuccess);
-    EXPECT_EQ(dictionary(plain, "ReplyGroupContainerDict").size(), 1u);
-    EXPECT_FALSE(plain.count("SandboxTokenDict"));
+    ASSERT_EQ(code(plainGroups), STWErrorSuccess);
+    EXPECT_FALSE(plain.count("SandboxToken"));
+    EXPECT_EQ(dictionary(plainGroups, "ReplyGroupContainerDict").size(), 1u);
+    EXPECT_FALSE(plainGroups.count("SandboxTokenDict"));
 }
 
 TEST_F(STWGroupCommandsTest, SystemContainersAndSystemGroupsGoToWhomTheyBelong) {
     auto plain = daemon->connectAs("com.example.plain", {});
-    // A system group nobody is entitled to is refused; one services probe for is refused
-    // without a word in the log.
+    // A system group nobody is entitled to is refused, also one that services probe for.
     EXPECT_EQ(STWDaemonProcess::replyError(*plain, 17, {{"GroupIdentifier", STWValue("systemgroup.com.example.x")}}),
               STWErrorNotEntitled);
     EXPECT_EQ(
@@ -137,37 +109,18 @@ TEST_F(STWGroupCommandsTest, SystemContainersAndSystemGroupsGoToWhomTheyBelong) 
     // Any caller finds a well-known system group.
     auto wellKnown = STWDaemonProcess::send(*plain, 17, {{"GroupIdentifier", STWValue("systemgroup.com.vorlane.alder")}});
     ASSERT_EQ(code(wellKnown), STWErrorSuccess);
-    EXPECT_TRUE(std::filesystem::is_directory(*STWDictionaryString(wellKnown, "ReplyPath")));
+    EXPECT_TRUE(fs::is_directory(path(wellKnown)));
 
-    // Any caller finds a well-known system container; an app has its own only when its
-    // entitlements ask for one, and never another's.
+    // Any caller finds a well-known system container; an app its own only when entitled, never another's.
     auto maple = STWDaemonProcess::send(*plain, 15, {{"Identifier", STWValue("com.vorlane.maple")}});
     ASSERT_EQ(code(maple), STWErrorSuccess);
-    EXPECT_EQ(std::filesystem::path(*STWDictionaryString(maple, "ReplyPath")).filename(), "com.vorlane.maple");
+    EXPECT_EQ(path(maple).filename(), "com.vorlane.maple");
     EXPECT_EQ(STWDaemonProcess::replyError(*plain, 15), STWErrorNotEntitled);
-    install("com.example.service", {{{"com.vorlane.security.system-container", STWValue(true)}}});
+    install(*client, "com.example.service", {{{"com.vorlane.security.system-container", STWValue(true)}}});
     auto service = daemon->connectAs("com.example.service", {});
     auto own = STWDaemonProcess::send(*service, 15);
     ASSERT_EQ(code(own), STWErrorSuccess);
-    EXPECT_TRUE(std::filesystem::is_directory(*STWDictionaryString(own, "ReplyPath")));
+    EXPECT_TRUE(fs::is_directory(path(own)));
     EXPECT_EQ(STWDaemonProcess::replyError(*plain, 15, {{"Identifier", STWValue("com.example.service")}}),
               STWErrorNotEntitled);
-
-    std::string text = log();
-    EXPECT_NE(text.find("is not entitled for system group identifier: systemgroup.com.example.x"), std::string::npos);
-    EXPECT_EQ(text.find("systemgroup.com.vorlane.hornbeam"), std::string::npos);
-}
-
-TEST_F(STWGroupCommandsTest, AGroupContainerStaysWhileAnyInstalledAppNamesIt) {
-    install("com.example.first", appGroups(groups({"group.shared"})));
-    install("com.example.second", appGroups(STWValue("group.shared")));
-    auto first = daemon->connectAs("com.example.first", {});
-    auto reply = STWDaemonProcess::send(*first, 13);
-    ASSERT_EQ(code(reply), STWErrorSuccess);
-    std::filesystem::path group = *dictionary(reply, "ReplyGroupContainerDict").at("group.shared").string();
-    ASSERT_TRUE(std::filesystem::is_directory(group));
-    install("com.example.first", std::nullopt);
-    EXPECT_TRUE(std::filesystem::is_directory(group));
-    install("com.example.second", std::nullopt);
-    EXPECT_FALSE(std::filesystem::exists(group));
 }

@@ -46,12 +46,9 @@ int listeningSocket(const std::filesystem::path& path, int type) {
 
 } // namespace
 
-// Started by the service manager, the daemon serves the socket named "stowlyd.sock" among
-// those passed to it (here after the upcall socket). With an idle time (60 s by default
-// then) it leaves when nothing is left to do: no connection and no open transaction for
-// that long. An open connection keeps it. The service manager keeps listening after it
-// left, and the next connection starts it again on the same sockets: that connection,
-// made while no daemon ran, is served by the next one.
+// Started by the service manager, the daemon serves the passed socket named "stowlyd.sock"
+// and leaves after its idle time without connections (an open one keeps it); a connection
+// made while no daemon ran is served by the next one, started on the same sockets.
 TEST(STWIdleExit, LeavesOnlyWhenNoConnectionIsLeft) {
     STWDaemonProcess prepared({}, {}, false); // only its root, cleaned up at the end
     const std::filesystem::path& root = prepared.root();

@@ -1,20 +1,15 @@
 // A device that an older release left behind, brought up to date by the first start of a
 // new build and the two migration commands; the per-user passes; and a power cut at each
 // step of the build upgrade.
-#include "tests/support/STWDaemonProcess.h"
+#include "tests/e2e/STWE2ETestSupport.h"
 
-#include "common/STWDictionaryUtilities.h"
-#include "common/STWError.h"
-#include "common/STWFileIO.h"
 #include "platform/STWCrashPoint.h"
 
 #include <gtest/gtest.h>
 
-#include <fstream>
-#include <set>
 #include <sys/stat.h>
 
-namespace fs = std::filesystem;
+using namespace STWE2E;
 
 namespace {
 
@@ -24,16 +19,6 @@ constexpr const char* kCachedInfoKey = "com.vorlane.Setwright.CachedCodeSigningI
 constexpr const char* kGroupIDsKey = "com.vorlane.Setwright.GroupContainerIDs";
 constexpr const char* kProtectionKey = "com.vorlane.Setwright.ContentProtectionClass";
 
-uint64_t code(const STWValue::Dictionary& reply) { return STWDictionaryUInt64(reply, "ReplyError").value_or(0); }
-fs::path path(const STWValue::Dictionary& reply) {
-    const std::string* p = STWDictionaryString(reply, "ReplyPath");
-    return p ? fs::path(*p) : fs::path();
-}
-STWValue::Dictionary container(const std::string& identifier, uint64_t containerClass, bool create = true) {
-    return {{"Identifier", STWValue(identifier)},
-            {"ContainerClass", STWValue(containerClass)},
-            {"CreateIfNecessary", STWValue(create)}};
-}
 // Keys of an info-value command for the container that `made` (a reply of command 0) names.
 STWValue::Dictionary info(const STWValue::Dictionary& made, uint64_t containerClass, const char* key) {
     return {{"Identifier", made.at("ReplyIdentifier")},
@@ -41,23 +26,15 @@ STWValue::Dictionary info(const STWValue::Dictionary& made, uint64_t containerCl
             {"UUID", made.at("ReplyUUID")},
             {"Key", STWValue(key)}};
 }
-void write(const fs::path& file, const std::string& text) {
-    fs::create_directories(file.parent_path());
-    std::ofstream(file) << text;
-}
 void writePlist(const fs::path& file, const STWValue::Dictionary& dictionary) {
-    STWErrorRef error;
-    EXPECT_TRUE(STW_writeToURL(dictionary, file, STWWriteAtomic, &error)) << file;
+    EXPECT_TRUE(STW_writeToURL(dictionary, file, STWWriteAtomic, nullptr)) << file;
 }
 
-struct Layout {
-    fs::path root;
-    fs::path library() const { return root / "private/var/root/Library/Stowly"; }
+struct Device : Layout {
     fs::path statusFile() const { return library() / "stw_migration_status.plist"; }
     fs::path userStatusFile() const { return root / "private/var/mobile/Library/Stowly/stw_user_migration_status.plist"; }
     fs::path bundles() const { return root / "private/var/containers/Bundle"; }
     fs::path legacyBundles() const { return root / "private/var/mobile/Containers/Bundle"; }
-    fs::path system() const { return root / "private/var/containers/Data/System"; }
     fs::path oldLogs() const { return root / "private/var/mobile/Library/Logs/Stowly"; }
     fs::path logs() const { return root / "private/var/root/Library/Logs/Stowly"; }
 
@@ -81,15 +58,14 @@ struct Layout {
     }
 };
 
-// On a daemon of the current release: an app's bundle container (with `marker` inside) and
-// the well-known system container com.vorlane.maple (likewise). Then, with the daemon
-// stopped, the layout an older release kept: the bundle directory in the mobile user's
-// home, the well-known container under its UUID, no status file (so no record of a build).
-void makeOlderRelease(STWDaemonProcess& daemon, const Layout& layout) {
+// A bundle container and the well-known system container com.vorlane.maple (each with a
+// marker), then laid out as an older release kept them: the bundle directory in the mobile
+// user's home, the well-known container under its UUID, no status file (no build recorded).
+void makeOlderRelease(STWDaemonProcess& daemon, const Device& layout) {
     auto client = daemon.connectAs("com.example.installer", migrator);
     ASSERT_NE(client, nullptr);
-    auto bundle = STWDaemonProcess::send(*client, 0, container("com.example.app", 1));
-    auto maple = STWDaemonProcess::send(*client, 0, container("com.vorlane.maple", 12));
+    auto bundle = STWDaemonProcess::send(*client, 0, keys("com.example.app", 1));
+    auto maple = STWDaemonProcess::send(*client, 0, keys("com.vorlane.maple", 12));
     ASSERT_EQ(code(bundle), STWErrorSuccess);
     ASSERT_EQ(code(maple), STWErrorSuccess);
     ASSERT_EQ(path(maple), layout.system() / "com.vorlane.maple");
@@ -102,10 +78,10 @@ void makeOlderRelease(STWDaemonProcess& daemon, const Layout& layout) {
 }
 
 // The containers of makeOlderRelease() are where the current layout puts them.
-void expectCurrentLayout(STWDaemonProcess& daemon, const Layout& layout) {
+void expectCurrentLayout(STWDaemonProcess& daemon, const Device& layout) {
     auto client = daemon.connectAs("com.example.installer", migrator);
     ASSERT_NE(client, nullptr);
-    fs::path bundle = path(STWDaemonProcess::send(*client, 0, container("com.example.app", 1, false)));
+    fs::path bundle = path(STWDaemonProcess::send(*client, 0, keys("com.example.app", 1, false)));
     EXPECT_EQ(bundle.parent_path(), layout.bundles() / "Application");
     EXPECT_TRUE(fs::exists(bundle / "marker"));
     EXPECT_FALSE(fs::exists(layout.legacyBundles()));
@@ -116,37 +92,29 @@ void expectCurrentLayout(STWDaemonProcess& daemon, const Layout& layout) {
 
 } // namespace
 
-// An older release's device: the layout of makeOlderRelease() beside a well-known
-// container already at its name, a marker file, a legacy
-// mapping file, code-signing info cached in a bundle container, group identifiers in a data
-// container, old log files (and a link an app planted among them), another build. One
-// power cycle and the two commands bring everything where this build keeps it; a second
-// power cycle and the commands again change nothing.
+// An older release's device (makeOlderRelease(), a well-known container already at its name,
+// old status, mapping and log files, cached code-signing info and group identifiers): one power
+// cycle and the two commands bring everything up to date; a second changes nothing.
 TEST(STWMigration, AnOlderReleasesDeviceIsBroughtUpToDateOnce) {
-    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}}, {}, false);
-    Layout layout{daemon.root()};
+    STWDaemonProcess daemon(developer, {}, false);
+    Device layout{{daemon.root()}};
     layout.setBuild("A1");
     ASSERT_TRUE(daemon.start());
     STWValue::Dictionary bundle, data;
-    {
-        auto client = daemon.connectAs("com.example.installer", migrator);
-        ASSERT_NE(client, nullptr);
-        bundle = STWDaemonProcess::send(*client, 0, container("com.example.app", 1));
-        data = STWDaemonProcess::send(*client, 0, container("com.example.app", 2));
-        ASSERT_EQ(code(bundle), STWErrorSuccess);
-        ASSERT_EQ(code(data), STWErrorSuccess);
-        STWValue::Dictionary cached{
-            {"Entitlements", STWValue(STWValue::Dictionary{{"com.example.cached", STWValue(true)}})}};
-        auto setCached = info(bundle, 1, kCachedInfoKey);
-        setCached["Value"] = STWValue(cached);
-        auto setGroups = info(data, 2, kGroupIDsKey);
-        setGroups["Value"] = STWValue(STWValue::Array{STWValue("group.com.example")});
-        ASSERT_EQ(code(STWDaemonProcess::send(*client, 5, setCached)), STWErrorSuccess);
-        ASSERT_EQ(code(STWDaemonProcess::send(*client, 5, setGroups)), STWErrorSuccess);
-    }
     fs::path oak;
     {
         auto client = daemon.connectAs("com.example.installer", migrator);
+        ASSERT_NE(client, nullptr);
+        bundle = STWDaemonProcess::send(*client, 0, keys("com.example.app", 1));
+        data = STWDaemonProcess::send(*client, 0, keys("com.example.app", 2));
+        ASSERT_EQ(code(bundle), STWErrorSuccess);
+        ASSERT_EQ(code(data), STWErrorSuccess);
+        auto setCached = info(bundle, 1, kCachedInfoKey), setGroups = info(data, 2, kGroupIDsKey);
+        STWValue::Dictionary cached{{"com.example.cached", STWValue(true)}};
+        setCached["Value"] = STWValue(STWValue::Dictionary{{"Entitlements", STWValue(cached)}});
+        setGroups["Value"] = STWValue(STWValue::Array{STWValue("group.com.example")});
+        ASSERT_EQ(code(STWDaemonProcess::send(*client, 5, setCached)), STWErrorSuccess);
+        ASSERT_EQ(code(STWDaemonProcess::send(*client, 5, setGroups)), STWErrorSuccess);
         oak = path(STWDaemonProcess::send(*client, 15, {{"Identifier", STWValue("com.vorlane.oak")}}));
         ASSERT_EQ(oak, layout.system() / "com.vorlane.oak");
     }
@@ -155,10 +123,9 @@ TEST(STWMigration, AnOlderReleasesDeviceIsBroughtUpToDateOnce) {
     ASSERT_EQ(stat(oak.c_str(), &before), 0);
     writePlist(layout.library() / "stw_acl2_migration_complete.plist",
                {{"STWMigrationVersionNumber", STWValue("A0")}, {"STWMigrationTime", STWValue("then")}});
-    STWValue::Dictionary legacyEntry{
-        {"CodeSigningInfo", STWValue(STWValue::Dictionary{{"com.vorlane.Stowly.Entitlements",
-                                                           STWValue(STWValue::Dictionary{})}})},
-        {"DataContainerClass", STWValue(uint64_t{2})}};
+    STWValue::Dictionary noEntitlements{{"com.vorlane.Stowly.Entitlements", STWValue(STWValue::Dictionary{})}};
+    STWValue::Dictionary legacyEntry{{"CodeSigningInfo", STWValue(noEntitlements)},
+                                     {"DataContainerClass", STWValue(uint64_t{2})}};
     writePlist(layout.library() / "stw_code_signing_info.plist", {{"com.example.legacy", STWValue(legacyEntry)}});
     write(layout.oldLogs() / "stowlyd.log.0", "zero");
     write(layout.oldLogs() / "stowlyd.log.3", "three");
@@ -175,11 +142,8 @@ TEST(STWMigration, AnOlderReleasesDeviceIsBroughtUpToDateOnce) {
     ASSERT_EQ(stat(oak.c_str(), &after), 0);
     EXPECT_EQ(after.st_ctim.tv_nsec, before.st_ctim.tv_nsec);
     EXPECT_EQ(after.st_ctim.tv_sec, before.st_ctim.tv_sec);
-    // Only what the disk-log level of this (non-internal) build keeps moves; the link is
-    // not followed, and the old directory goes.
-    std::string moved;
-    EXPECT_EQ(STWReadFileContents(layout.logs() / "stowlyd.log.1", &moved), 0);
-    EXPECT_EQ(moved, "zero");
+    // Only the logs this build's level keeps move; the link is not followed; the old directory goes.
+    EXPECT_EQ(read(layout.logs() / "stowlyd.log.1"), "zero");
     EXPECT_FALSE(fs::exists(layout.logs() / "stowlyd.log.4"));
     EXPECT_FALSE(fs::exists(fs::symlink_status(layout.logs() / "planted.1")));
     EXPECT_FALSE(fs::exists(layout.oldLogs()));
@@ -200,7 +164,7 @@ TEST(STWMigration, AnOlderReleasesDeviceIsBroughtUpToDateOnce) {
     EXPECT_EQ(code(STWDaemonProcess::send(*client, 6, info(bundle, 1, kCachedInfoKey))), STWErrorInfoValueNotFound);
     EXPECT_EQ(code(STWDaemonProcess::send(*client, 6, info(data, 2, kGroupIDsKey))), STWErrorInfoValueNotFound);
     struct stat st {};
-    fs::path bundlePath = path(STWDaemonProcess::send(*client, 0, container("com.example.app", 1, false)));
+    fs::path bundlePath = path(STWDaemonProcess::send(*client, 0, keys("com.example.app", 1, false)));
     EXPECT_EQ(stat(bundlePath.c_str(), &st), 0);
     EXPECT_EQ(st.st_uid, 33u); // the installer's, as every bundle's
     std::set<std::string> all{"ACLMigration", "BundleMigration", "GroupIdMigration", "CodeSigningMigration"};
@@ -222,25 +186,21 @@ TEST(STWMigration, AnOlderReleasesDeviceIsBroughtUpToDateOnce) {
 // Standard subdirectories are re-created once per mobile-user store; the protection class
 // of a data container whose app has no bundle container is re-applied on every request.
 TEST(STWMigration, ThePerUserPassesRunOncePerStoreAndOnEveryRequest) {
-    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}});
-    Layout layout{daemon.root()};
+    STWDaemonProcess daemon(developer);
+    Device layout{{daemon.root()}};
     auto client = daemon.connectAs("com.example.installer", migrator);
     ASSERT_NE(client, nullptr);
     STWValue::Dictionary entitlements{{"com.vorlane.developer.default-data-protection", STWValue("complete")}};
-    ASSERT_EQ(code(STWDaemonProcess::send(
-                  *client, 18,
-                  {{"Identifier", STWValue("com.example.orphan")},
-                   {"CodeSigningInfo", STWValue(STWValue::Dictionary{
-                                           {"com.vorlane.Stowly.Entitlements", STWValue(entitlements)}})}})),
+    ASSERT_EQ(STWDaemonProcess::replyError(*client, 18, codeSigningKeys("com.example.orphan", entitlements)),
               STWErrorSuccess);
-    auto made = STWDaemonProcess::send(*client, 0, container("com.example.orphan", 2));
+    auto made = STWDaemonProcess::send(*client, 0, keys("com.example.orphan", 2));
     fs::path orphan = path(made);
     ASSERT_FALSE(orphan.empty());
     auto protectionClass = [&] {
         auto reply = STWDaemonProcess::send(*client, 6, info(made, 2, kProtectionKey));
         return reply.count("ReplyInfoValue") ? reply["ReplyInfoValue"].truncatedInt64Value().value_or(-1) : -1;
     };
-    auto weaken = container("com.example.orphan", 2, false);
+    auto weaken = keys("com.example.orphan", 2, false);
     weaken["DataProtectionClass"] = STWValue(int64_t{3});
 
     ASSERT_EQ(code(STWDaemonProcess::send(*client, 30)), STWErrorSuccess);
@@ -257,18 +217,16 @@ TEST(STWMigration, ThePerUserPassesRunOncePerStoreAndOnEveryRequest) {
     EXPECT_TRUE(fs::is_directory(orphan / "Documents"));
 }
 
-// A power cut right after the bundle directory or a well-known container was renamed:
-// the next start (still the first since power-on, and still an upgrade, since the build was
-// not recorded) finishes the migration, and every container is found where it belongs.
+// A power cut at each rename of the build upgrade (points the crash torture never reaches):
+// the next start, still an upgrade, finishes the migration and every container is found.
 TEST(STWMigrationCrash, APowerCutDuringTheBuildUpgradeLosesNoContainer) {
-    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}});
-    Layout layout{daemon.root()};
+    STWDaemonProcess daemon(internal);
+    Device layout{{daemon.root()}};
     for (std::string_view point : STWCrashPoint::migration) {
         SCOPED_TRACE(std::string(point));
         makeOlderRelease(daemon, layout);
         daemon.reboot();
-        // The points lie in the start-up itself: the daemon may die there before or after
-        // its socket first answers, so only the death counts.
+        // The points lie in the start-up: it may die before or after its socket answers.
         daemon.startWith("STOWLY_CRASH_AT", std::string(point));
         ASSERT_TRUE(daemon.killedItself());
         ASSERT_TRUE(daemon.start());

@@ -1,7 +1,7 @@
-#include "tests/support/STWDaemonProcess.h"
+// The request socket: who gets a connection for which command, many connections at once,
+// malformed input, the client registry, and what a daemon without developer mode refuses.
+#include "tests/e2e/STWE2ETestSupport.h"
 
-#include "common/STWDictionaryUtilities.h"
-#include "common/STWError.h"
 #include "common/STWMessagePack.h"
 #include "common/STWIPCFrame.h"
 #include "platform/STWIPCListener.h"
@@ -9,22 +9,21 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <mutex>
 #include <set>
 #include <sys/socket.h>
 #include <thread>
 #include <unistd.h>
 
+using namespace STWE2E;
+
 namespace {
 
-const STWValue::Dictionary allowed{{"com.vorlane.private.Stowly.allowed", STWValue(true)}};
-
-// Commands whose reply is not "not entitled": the caller got a connection (the command
-// itself may still be unsupported in this build).
+// Commands whose reply is not "not entitled" (they may still be unsupported in this build).
 std::set<uint64_t> connectedCommands(STWClient& client) {
     std::set<uint64_t> commands;
     for (uint64_t c = 0; c < 32; c++) {
-        // A caller's own system container is refused (55) to one without the entitlement;
-        // a well-known one is anyone's.
+        // One's own system container needs an entitlement; a well-known one is anyone's.
         STWValue::Dictionary keys;
         if (c == 15)
             keys["Identifier"] = STWValue("com.vorlane.maple");
@@ -36,33 +35,12 @@ std::set<uint64_t> connectedCommands(STWClient& client) {
     return commands;
 }
 
-std::string lengthPrefixed(std::string_view payload) {
-    uint32_t n = static_cast<uint32_t>(payload.size());
-    std::string frame{static_cast<char>(n), static_cast<char>(n >> 8), static_cast<char>(n >> 16),
-                      static_cast<char>(n >> 24)};
-    return frame + std::string(payload);
-}
 
-class STWRequestServiceTest : public ::testing::Test {
-protected:
-    static void SetUpTestSuite() { daemon = new STWDaemonProcess({{"DeveloperMode", STWValue(true)}}); }
-    static void TearDownTestSuite() {
-        delete daemon;
-        daemon = nullptr;
-    }
-    static STWDaemonProcess* daemon;
-};
-STWDaemonProcess* STWRequestServiceTest::daemon = nullptr;
+std::string lengthPrefixed(const std::string& payload) { return frameHeader(payload.size()) + payload; }
+
+using STWRequestServiceTest = SharedDaemonTest;
 
 } // namespace
-
-TEST_F(STWRequestServiceTest, CommandNumbersOutsideTheTableAreUnsupported) {
-    auto client = daemon->connectAs("com.example.allowed", allowed);
-    ASSERT_NE(client, nullptr);
-    for (uint64_t command : {uint64_t{32}, uint64_t{1} << 63, UINT64_MAX})
-        EXPECT_EQ(STWDaemonProcess::replyError(*client, command), STWErrorUnsupportedCommand) << command;
-    EXPECT_EQ(STWDaemonProcess::replyError(*client, 27), STWErrorUnsupportedCommand);
-}
 
 TEST_F(STWRequestServiceTest, EntitlementsDecideWhichCommandsGetAConnection) {
     auto unentitled = daemon->connectAs("com.example.plain", {});
@@ -83,29 +61,38 @@ TEST_F(STWRequestServiceTest, EntitlementsDecideWhichCommandsGetAConnection) {
         if (c != 25 && c != 31)
             expected.insert(c);
     EXPECT_EQ(connectedCommands(*full), expected);
+    // Command numbers outside the table, and 27, are unsupported.
+    for (uint64_t command : {uint64_t{27}, uint64_t{32}, uint64_t{1} << 63, UINT64_MAX})
+        EXPECT_EQ(STWDaemonProcess::replyError(*full, command), STWErrorUnsupportedCommand) << command;
 }
 
-TEST_F(STWRequestServiceTest, ConcurrentConnectionsEachGetTheirOwnReplies) {
-    constexpr int kConnections = 64;
-    std::atomic<int> wrong{0}, missing{0};
+// 64 connections at once, every other one unentitled, each asking ten times for one new container:
+// every reply reaches its own caller (the unentitled are refused), and one whole container is made.
+TEST_F(STWRequestServiceTest, ConcurrentConnectionsGetTheirOwnRepliesAndMakeOneContainer) {
+    constexpr int kConnections = 64, kRounds = 10;
+    fs::path classDirectory = path(send(0, keys("com.example.probe"))).parent_path();
+    ASSERT_FALSE(classDirectory.empty());
+    size_t before = visible(classDirectory);
+    std::atomic<int> wrong{0}, missing{0}, created{0}, existed{0};
+    std::mutex mutex;
+    std::set<fs::path> paths;
     std::vector<std::thread> threads;
     for (int i = 0; i < kConnections; i++) {
         threads.emplace_back([&, i] {
-            // Even connections may replace containers (and are told that they named none), odd
-            // ones may not.
             bool entitled = i % 2 == 0;
-            auto client = daemon->connectAs("com.example.c" + std::to_string(i),
-                                            entitled ? allowed : STWValue::Dictionary{});
-            if (!client) {
-                missing++;
-                return;
-            }
-            for (int round = 0; round < 20; round++) {
-                uint64_t code = STWDaemonProcess::replyError(*client, 2, {{"Round", STWValue(round)}});
-                if (code == 0)
+            auto caller = daemon->connectAs("com.example.c" + std::to_string(i), entitled ? allowed : STWValue::Dictionary{});
+            missing += !caller;
+            for (int round = 0; caller && round < kRounds; round++) {
+                auto reply = STWDaemonProcess::send(*caller, 0, keys("com.example.racer"));
+                if (reply.empty()) {
                     missing++;
-                else if (code != (entitled ? STWErrorNoIdentifier : STWErrorNotEntitled))
+                } else if (code(reply) != (entitled ? STWErrorSuccess : STWErrorNotEntitled)) {
                     wrong++;
+                } else if (entitled) {
+                    (reply["ReplyExisted"] == STWValue(true) ? existed : created)++;
+                    std::lock_guard lock(mutex);
+                    paths.insert(path(reply));
+                }
             }
         });
     }
@@ -113,6 +100,20 @@ TEST_F(STWRequestServiceTest, ConcurrentConnectionsEachGetTheirOwnReplies) {
         t.join();
     EXPECT_EQ(missing, 0);
     EXPECT_EQ(wrong, 0);
+    EXPECT_EQ(created, 1);
+    EXPECT_EQ(existed, kConnections / 2 * kRounds - 1);
+    ASSERT_EQ(paths.size(), 1u);
+    fs::path container = *paths.begin();
+    EXPECT_TRUE(fs::is_directory(container / "Library/Preferences"));
+    EXPECT_TRUE(fs::exists(container / ".com.vorlane.stowly.metadata.plist"));
+    EXPECT_EQ(container.parent_path(), classDirectory);
+    EXPECT_EQ(visible(classDirectory), before + 1);
+    auto listed = send(1, {{"ContainerClass", STWValue(2)}});
+    ASSERT_EQ(code(listed), STWErrorSuccess);
+    int racers = 0;
+    for (const auto& id : *STWDictionaryFind(listed, "ReplyIdsArray")->array())
+        racers += *id.string() == "com.example.racer";
+    EXPECT_EQ(racers, 1);
 }
 
 TEST_F(STWRequestServiceTest, MalformedInputClosesOnlyThatConnection) {
@@ -122,7 +123,7 @@ TEST_F(STWRequestServiceTest, MalformedInputClosesOnlyThatConnection) {
     std::string request = STWFrameEncode(STWFrameKindRequest, 1, {{"Command", STWValue(27)}});
     std::vector<std::pair<const char*, std::string>> inputs = {
         {"oversized length", std::string("\xff\xff\xff\x7f", 4)},
-        {"broken MessagePack", lengthPrefixed("\x93\x00\x01\xc1")},
+        {"broken MessagePack", lengthPrefixed(std::string("\x93\x00\x01\xc1", 4))},
         {"body not a map", lengthPrefixed(STWMessagePackEncode(
                                STWValue(STWValue::Array{STWValue(0), STWValue(1), STWValue("body")})))},
         {"more values than a request may have",
@@ -136,7 +137,7 @@ TEST_F(STWRequestServiceTest, MalformedInputClosesOnlyThatConnection) {
     for (const auto& [what, bytes] : inputs) {
         int fd = daemon->connectRaw();
         ASSERT_GE(fd, 0);
-        ASSERT_EQ(send(fd, bytes.data(), bytes.size(), MSG_NOSIGNAL), static_cast<ssize_t>(bytes.size())) << what;
+        ASSERT_EQ(::send(fd, bytes.data(), bytes.size(), MSG_NOSIGNAL), static_cast<ssize_t>(bytes.size())) << what;
         EXPECT_TRUE(STWDaemonProcess::closedByDaemon(fd)) << what;
         close(fd);
     }
@@ -144,7 +145,7 @@ TEST_F(STWRequestServiceTest, MalformedInputClosesOnlyThatConnection) {
     for (size_t cut : {size_t{2}, request.size() - 1, request.size()}) {
         int fd = daemon->connectRaw();
         ASSERT_GE(fd, 0);
-        send(fd, request.data(), cut, MSG_NOSIGNAL);
+        ::send(fd, request.data(), cut, MSG_NOSIGNAL);
         close(fd);
     }
     EXPECT_TRUE(daemon->isRunning());
@@ -165,8 +166,7 @@ TEST_F(STWRequestServiceTest, RegistryIdentifiesProgramsByTheirPinnedExecutable)
                                {"Executable", STWValue(self)},
                                {"Entitlements", STWValue(allowed)}};
     auto file = daemon->root() / "etc/stowly/clients.d/e2e.plist";
-    // The registry follows its directory: poll until the daemon sees each change. Who a
-    // caller is is settled when it connects, so every probe is a new connection.
+    // Polled until the daemon sees each change, on new connections: a caller is settled when it connects.
     auto waitFor = [&](uint64_t expected) {
         uint64_t code = 0;
         for (int i = 0; i < 250 && code != expected; i++) {
@@ -186,13 +186,25 @@ TEST_F(STWRequestServiceTest, RegistryIdentifiesProgramsByTheirPinnedExecutable)
     std::filesystem::remove(file);
 }
 
-TEST(STWRequestServiceWithoutDeveloperMode, HelloIsRefusedAndTheConnectionClosed) {
-    STWDaemonProcess daemon({});
+// Without developer mode a hello that declares an identity is refused and the connection
+// closed; a client that goes silent, before its first frame or inside one, is dropped.
+TEST(STWRequestServiceWithoutDeveloperMode, DeclaredIdentitiesAndSilentClientsAreRefused) {
+    STWDaemonProcess daemon({{"FirstFrameTimeout", STWValue(1)}, {"FrameTimeout", STWValue(1)}});
     auto client = daemon.connect();
     ASSERT_NE(client, nullptr);
     STWErrorRef error;
-    auto code = client->hello({{"CodeSigningIdentifier", STWValue("com.example.liar")}}, STWDaemonProcess::timeout,
-                              &error);
-    EXPECT_EQ(code.value_or(0), STWErrorNotEntitled);
+    auto hello = client->hello({{"CodeSigningIdentifier", STWValue("com.example.liar")}}, STWDaemonProcess::timeout,
+                               &error);
+    EXPECT_EQ(hello.value_or(0), STWErrorNotEntitled);
     EXPECT_EQ(STWDaemonProcess::replyError(*client, 2), 0u); // closed: no reply
+
+    int silent = daemon.connectRaw(), stalled = daemon.connectRaw();
+    ASSERT_GE(silent, 0);
+    ASSERT_GE(stalled, 0);
+    std::string request = frameHeader(100) + std::string("\x93\x00\x01", 3);
+    ASSERT_EQ(::send(stalled, request.data(), request.size(), MSG_NOSIGNAL), ssize_t(request.size()));
+    EXPECT_TRUE(STWDaemonProcess::closedByDaemon(silent));
+    EXPECT_TRUE(STWDaemonProcess::closedByDaemon(stalled));
+    close(silent);
+    close(stalled);
 }

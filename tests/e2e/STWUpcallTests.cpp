@@ -1,9 +1,7 @@
 // Upcalls over the daemon's real upcall socket, sent as root, which stands for the kernel.
-#include "tests/support/STWDaemonProcess.h"
+#include "tests/e2e/STWE2ETestSupport.h"
 
 #include "client/STWUpcallClient.h"
-#include "common/STWDictionaryUtilities.h"
-#include "common/STWFileIO.h"
 #include "src/packbuff/packbuff.h"
 
 #include <gtest/gtest.h>
@@ -17,17 +15,17 @@
 #include <thread>
 #include <unistd.h>
 
+using namespace STWE2E;
+
 namespace {
 
 using Request = STWUpcallClient::Request;
 using Reply = STWUpcallClient::Reply;
 using Pairs = std::vector<std::pair<std::string, std::string>>;
 
-const STWValue::Dictionary allowed{{"com.vorlane.private.Stowly.allowed", STWValue(true)}};
 constexpr std::chrono::seconds kTimeout{30};
 
-// The upcall socket appears once the daemon's start-up reaches the upcall server, a
-// little after the request socket that STWDaemonProcess waits for.
+// The upcall socket appears a little after the request socket that STWDaemonProcess waits for.
 std::unique_ptr<STWUpcallClient> connectUpcall(const STWDaemonProcess& daemon) {
     auto deadline = std::chrono::steady_clock::now() + STWDaemonProcess::timeout;
     STWErrorRef error;
@@ -49,8 +47,7 @@ Request appRequest(const std::string& identifier) {
     return request;
 }
 
-// The return code (0 for a success reply) of the reply to one packet on a fresh
-// connection, or nullopt when the daemon closed the connection instead.
+// The return code of the reply to one packet on a fresh connection; nullopt when it closed.
 std::optional<STWKernReturn> returnCode(const STWDaemonProcess& daemon, std::string_view packet) {
     auto client = connectUpcall(daemon);
     if (!client)
@@ -91,60 +88,32 @@ std::string packedBuffer(const std::vector<std::pair<uint16_t, std::string>>& st
     return bytes;
 }
 
-class STWUpcallTest : public ::testing::Test {
+class STWUpcallTest : public SharedDaemonTest {
 protected:
-    static void SetUpTestSuite() {
-        if (geteuid() != 0)
-            return;
-        daemon = new STWDaemonProcess({{"DeveloperMode", STWValue(true)}}, {}, false);
-        daemon->setStandardErrorFile(daemon->root() / "stowlyd.stderr");
-        ASSERT_TRUE(daemon->start());
-    }
-    static void TearDownTestSuite() {
-        delete daemon;
-        daemon = nullptr;
-    }
     void SetUp() override {
         if (geteuid() != 0)
             GTEST_SKIP() << "the upcall socket is root's alone: run the tests as root";
-        installer = daemon->connectAs("com.example.installer", allowed);
-        ASSERT_NE(installer, nullptr);
+        connect();
     }
-
     Reply upcall(const Request& request) {
-        auto client = connectUpcall(*daemon);
+        auto upcalls = connectUpcall(*daemon);
         STWErrorRef error;
-        std::optional<Reply> reply = client ? client->send(request, kTimeout, &error) : std::nullopt;
+        std::optional<Reply> reply = upcalls ? upcalls->send(request, kTimeout, &error) : std::nullopt;
         EXPECT_TRUE(reply) << (error ? error->description() : "");
-        if (reply)
-            return *reply;
         Reply none;
         none.returnCode = -1;
-        return none;
+        return reply.value_or(none);
     }
     // The path command 0 answers for an existing container; "" when there is none.
     std::string lookedUp(const std::string& identifier, uint64_t containerClass) {
-        auto reply = STWDaemonProcess::send(*installer, 0,
-                                            {{"Identifier", STWValue(identifier)},
-                                             {"ContainerClass", STWValue(containerClass)},
-                                             {"CreateIfNecessary", STWValue(false)}});
-        const std::string* path = STWDictionaryString(reply, "ReplyPath");
-        return path ? *path : std::string();
+        return path(send(0, keys(identifier, containerClass, false)));
     }
-
-    static std::string log() {
-        std::string text;
-        STWReadFileContents(daemon->root() / "stowlyd.stderr", &text);
-        return text;
-    }
-
-    static STWDaemonProcess* daemon;
-    std::unique_ptr<STWClient> installer;
 };
-STWDaemonProcess* STWUpcallTest::daemon = nullptr;
 
 } // namespace
 
+// A launch is answered with every container it names, in reply order, as the request socket
+// knows them; root has its own home, and a plug-in gets a plug-in data container.
 TEST_F(STWUpcallTest, AnswersEveryContainerInReplyOrderAsTheRequestSocketKnowsThem) {
     Request request = appRequest("com.example.upcall.app");
     request.containerIdentifier = "com.example.upcall.data";
@@ -181,18 +150,15 @@ TEST_F(STWUpcallTest, AnswersEveryContainerInReplyOrderAsTheRequestSocketKnowsTh
     ASSERT_TRUE(again) << error->description();
     EXPECT_EQ(again->dataContainer, reply->dataContainer);
     EXPECT_EQ(again->appGroups, reply->appGroups);
-}
+    Request root = appRequest("com.example.upcall.root");
+    root.uid = 0;
+    EXPECT_EQ(upcall(root).homeDirectory, (daemon->root() / "private/var/root").native());
 
-// A plug-in's data container is class 4, whether the code-signing mapping recorded nothing
-// for it or recorded an application's class.
-TEST_F(STWUpcallTest, APluginGetsAPluginDataContainer) {
-    STWValue::Dictionary recorded{
-        {"Identifier", STWValue("com.example.upcall.recorded")},
-        {"CodeSigningInfo", STWValue(STWValue::Dictionary{
-                                {"com.vorlane.Stowly.Entitlements", STWValue(STWValue::Dictionary{})}})},
-        {"OptionsDictionary",
-         STWValue(STWValue::Dictionary{{"com.vorlane.Stowly.DataContainerClass", STWValue(uint64_t{2})}})}};
-    ASSERT_EQ(STWDaemonProcess::replyError(*installer, 18, recorded), STWErrorSuccess);
+    // A plug-in's data container is class 4, also when the mapping recorded an app's class.
+    auto recorded = codeSigningKeys("com.example.upcall.recorded", {});
+    recorded["OptionsDictionary"] =
+        STWValue(STWValue::Dictionary{{"com.vorlane.Stowly.DataContainerClass", STWValue(uint64_t{2})}});
+    ASSERT_EQ(code(send(18, recorded)), STWErrorSuccess);
     for (const char* identifier : {"com.example.upcall.plugin", "com.example.upcall.recorded"}) {
         Request request = appRequest(identifier);
         request.containerType = STWKernContainerTypePlugin;
@@ -202,35 +168,17 @@ TEST_F(STWUpcallTest, APluginGetsAPluginDataContainer) {
         EXPECT_EQ(reply.dataContainer, lookedUp(identifier, 4)) << identifier;
         EXPECT_EQ(lookedUp(identifier, 2), "") << identifier;
     }
-    EXPECT_NE(
-        log().find("server_get_process_containers: SB Type: 1, Setwright Type: 2.  Declaring this a plugin"),
-        std::string::npos);
 }
 
-TEST_F(STWUpcallTest, RootsHomeAndUnknownPersonas) {
-    Request root = appRequest("com.example.upcall.root");
-    root.uid = 0;
-    EXPECT_EQ(upcall(root).homeDirectory, (daemon->root() / "private/var/root").native());
-
+// An unknown persona, and a sender that is not root, are refused and nothing is made.
+TEST_F(STWUpcallTest, OnlyTheKernelAndKnownPersonasGetContainers) {
+    std::string app = packedBuffer({{0, "com.example.upcall.refused"}}, {{8, STWKernNoPersona}});
     Request unknown = appRequest("com.example.upcall.persona");
     unknown.personaID = 4242;
     EXPECT_EQ(upcall(unknown).returnCode, STWKernInvalidArgument);
     EXPECT_EQ(lookedUp("com.example.upcall.persona", 2), "") << "nothing is made for an unknown persona";
-}
 
-TEST_F(STWUpcallTest, MessagesTheRoutineCannotTakeGetTheirCodes) {
-    std::string app = packedBuffer({{0, "com.example.upcall.refused"}}, {{8, STWKernNoPersona}});
-    EXPECT_EQ(returnCode(*daemon, STWUpcallClient::packetWithBuffer(packedBuffer({{0, "x"}}, {{9, 1}}))),
-              STWKernInvalidArgument);
-    // A uid sent as a string is an item the routine cannot read.
-    EXPECT_EQ(returnCode(*daemon, STWUpcallClient::packetWithBuffer(packedBuffer({{3, "501"}}))), STWKernFailure);
-    EXPECT_EQ(returnCode(*daemon, STWUpcallClient::packetWithBuffer(app, STWKernUnusedRoutineID)), STWKernMIGBadID);
-    // No routine answers another id: the connection closes rather than leave the sender waiting.
-    EXPECT_EQ(returnCode(*daemon, STWUpcallClient::packetWithBuffer(app, 7)), std::nullopt);
-    EXPECT_EQ(lookedUp("com.example.upcall.refused", 2), "");
-
-    // A sender that is not root is not the kernel, even when it reaches the socket (its
-    // file-system uid stays root's here, its effective uid is what the daemon sees).
+    // A sender that is not root (by its effective uid; its file-system uid stays root's) is no kernel.
     std::string packet = STWUpcallClient::packetWithBuffer(app);
     std::string socketPath = STWUpcallClient::socketPathForRoot(daemon->root());
     pid_t child = fork();
@@ -243,8 +191,8 @@ TEST_F(STWUpcallTest, MessagesTheRoutineCannotTakeGetTheirCodes) {
             _exit(100);
         setfsuid(0);
         int fd = socket(AF_UNIX, SOCK_SEQPACKET, 0);
-        if (connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
-            send(fd, packet.data(), packet.size(), 0) != static_cast<ssize_t>(packet.size()))
+        if (::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
+            ::send(fd, packet.data(), packet.size(), 0) != static_cast<ssize_t>(packet.size()))
             _exit(101);
         STWKernErrorReply reply{};
         if (recv(fd, &reply, sizeof reply, 0) != sizeof reply)
@@ -257,7 +205,9 @@ TEST_F(STWUpcallTest, MessagesTheRoutineCannotTakeGetTheirCodes) {
     EXPECT_EQ(lookedUp("com.example.upcall.refused", 2), "");
 }
 
-TEST_F(STWUpcallTest, HostilePacketsNeverStopTheServer) {
+// Malformed and hostile packets get their codes or a closed connection; the server goes on.
+TEST_F(STWUpcallTest, HostilePacketsGetTheirCodesAndNeverStopTheServer) {
+    std::string refused = packedBuffer({{0, "com.example.upcall.refused"}}, {{8, STWKernNoPersona}});
     std::string good = STWUpcallClient::packetWithBuffer(packedBuffer({{0, "com.example.upcall.hostile"}}, {{8, STWKernNoPersona}}));
     auto withDataCount = [&](uint32_t count) {
         std::string p = good;
@@ -274,6 +224,12 @@ TEST_F(STWUpcallTest, HostilePacketsNeverStopTheServer) {
         std::optional<STWKernReturn> code; // nullopt: the connection closes
     };
     std::vector<Case> cases = {
+        {"an item the routine does not know", STWUpcallClient::packetWithBuffer(packedBuffer({{0, "x"}}, {{9, 1}})),
+         STWKernInvalidArgument},
+        {"a uid sent as a string", STWUpcallClient::packetWithBuffer(packedBuffer({{3, "501"}})), STWKernFailure},
+        {"the unused routine id", STWUpcallClient::packetWithBuffer(refused, STWKernUnusedRoutineID), STWKernMIGBadID},
+        // No routine answers another id: the connection closes rather than leave the sender waiting.
+        {"another routine id", STWUpcallClient::packetWithBuffer(refused, 7), std::nullopt},
         {"shorter than a header", good.substr(0, 10), std::nullopt},
         {"shorter than the layout", good.substr(0, 40), STWKernMIGBadArguments},
         {"a data count that lies", withDataCount(8), STWKernMIGTypeError},
@@ -284,9 +240,9 @@ TEST_F(STWUpcallTest, HostilePacketsNeverStopTheServer) {
     };
     for (const Case& c : cases)
         EXPECT_EQ(returnCode(*daemon, c.packet), c.code) << c.name;
+    EXPECT_EQ(lookedUp("com.example.upcall.refused", 2), "");
 
-    // A 16 MiB packet: the socket may refuse it at the sender; if it goes through, the
-    // daemon closes the connection.
+    // A 16 MiB packet: refused by the sender's socket, or the daemon closes the connection.
     if (auto client = connectUpcall(*daemon)) {
         int size = 32 << 20;
         setsockopt(client->fd(), SOL_SOCKET, SO_SNDBUFFORCE, &size, sizeof size);
@@ -296,7 +252,7 @@ TEST_F(STWUpcallTest, HostilePacketsNeverStopTheServer) {
     }
     // A sender that leaves before its reply.
     if (auto client = connectUpcall(*daemon)) {
-        ASSERT_EQ(send(client->fd(), good.data(), good.size(), 0), static_cast<ssize_t>(good.size()));
+        EXPECT_EQ(::send(client->fd(), good.data(), good.size(), 0), static_cast<ssize_t>(good.size()));
     }
 
     // 10,000 times the same group: one container, named 10,000 times.
@@ -311,10 +267,12 @@ TEST_F(STWUpcallTest, HostilePacketsNeverStopTheServer) {
     EXPECT_TRUE(daemon->isRunning());
 }
 
-TEST(STWUpcallFailureTest, AGroupThatCannotBeMadeLeavesOnlyAStatusOfZero) {
+// A group that cannot be made leaves a reply of status 0 (the other groups made); a stop waits
+// for the upcall being served (parked behind a test lock, which SIGTERM releases).
+TEST(STWUpcallFailureTest, AFailedGroupAndAStopInFlightStillAnswerTheSender) {
     if (geteuid() != 0)
         GTEST_SKIP() << "the upcall socket is root's alone: run the tests as root";
-    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}}, {}, false);
+    STWDaemonProcess daemon(internal, {}, false);
     // The first rename after start-up is the one that would publish the first group.
     ASSERT_TRUE(daemon.startWith("STOWLY_FAULT", "renameat2:1:28"));
     Request request;
@@ -324,45 +282,25 @@ TEST(STWUpcallFailureTest, AGroupThatCannotBeMadeLeavesOnlyAStatusOfZero) {
     auto client = connectUpcall(daemon);
     ASSERT_NE(client, nullptr);
     STWErrorRef error;
-    auto packet = client->exchangePacket(STWUpcallClient::packetWithBuffer(STWUpcallClient::packedBufferForRequest(request)),
-                                         kTimeout, &error);
+    auto packet = client->exchangePacket(
+        STWUpcallClient::packetWithBuffer(STWUpcallClient::packedBufferForRequest(request)), kTimeout, &error);
     ASSERT_TRUE(packet) << error->description();
     EXPECT_EQ(replyTags(*packet), std::vector<uint16_t>{0});
     auto reply = STWUpcallClient::replyFromPacket(*packet, &error);
     ASSERT_TRUE(reply);
     EXPECT_EQ(reply->status, 0u);
-
-    // The second group was still made.
     auto installer = daemon.connectAs("com.example.installer", allowed);
     ASSERT_NE(installer, nullptr);
-    auto lookup = [&](const char* identifier) {
-        return STWDaemonProcess::replyError(*installer, 0,
-                                            {{"Identifier", STWValue(identifier)},
-                                             {"ContainerClass", STWValue(uint64_t{7})},
-                                             {"CreateIfNecessary", STWValue(false)}});
-    };
-    EXPECT_EQ(lookup("group.com.example.upcall.first"), STWErrorNotFound);
-    EXPECT_EQ(lookup("group.com.example.upcall.second"), STWErrorSuccess);
-}
+    EXPECT_EQ(STWDaemonProcess::replyError(*installer, 0, keys("group.com.example.upcall.first", 7, false)),
+              STWErrorNotFound);
+    EXPECT_EQ(STWDaemonProcess::replyError(*installer, 0, keys("group.com.example.upcall.second", 7, false)),
+              STWErrorSuccess);
 
-// Stopping waits for the upcall being served: one parked behind a test lock (which SIGTERM
-// releases) still gets its reply, and the daemon exits cleanly.
-TEST(STWUpcallFailureTest, AnUpcallInFlightIsAnsweredBeforeTheDaemonStops) {
-    if (geteuid() != 0)
-        GTEST_SKIP() << "the upcall socket is root's alone: run the tests as root";
-    STWDaemonProcess daemon({{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}});
-    auto control =
-        daemon.connectAs("com.example.tester", {{"com.vorlane.private.Stowly.testability", STWValue(true)}});
+    auto control = daemon.connectAs("com.example.tester", tester);
     ASSERT_NE(control, nullptr);
-    auto client = connectUpcall(daemon);
-    ASSERT_NE(client, nullptr);
-    ASSERT_EQ(
-        STWDaemonProcess::replyError(*control, 31, {{"TestLock", STWValue(1)}, {"Enable", STWValue(true)}}),
-        STWErrorSuccess);
-    std::optional<Reply> reply;
+    ASSERT_EQ(setTestLock(*control, 1, true), STWErrorSuccess);
     std::atomic<bool> answered{false};
     std::thread launch([&] {
-        STWErrorRef error;
         reply = client->send(appRequest("com.example.upcall.parked"), kTimeout, &error);
         answered = true;
     });
