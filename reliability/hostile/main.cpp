@@ -188,9 +188,9 @@ std::vector<std::string> differences(const std::string& name, const Snapshot& be
 // process) and answers its pid. The child dies with the driver. `asApp` waits for it and
 // answers whether `work` returned true.
 pid_t spawnApp(const std::function<bool()>& work, bool asRoot = false) {
+    pid_t driver = getpid();
     pid_t pid = fork();
     if (pid == 0) {
-        prctl(PR_SET_PDEATHSIG, SIGKILL);
         // The app spins; niced, it leaves the daemon the share of the cores a scheduler
         // would give a system daemon on a device, here on two shared cores.
         errno = 0;
@@ -198,6 +198,9 @@ pid_t spawnApp(const std::function<bool()>& work, bool asRoot = false) {
             _exit(126);
         if (!asRoot && (setgroups(0, nullptr) != 0 || setresgid(kMobile, kMobile, kMobile) != 0 ||
                         setresuid(kMobile, kMobile, kMobile) != 0))
+            _exit(126);
+        // After the change of user, which clears it; a driver already gone is seen here.
+        if (prctl(PR_SET_PDEATHSIG, SIGKILL) != 0 || getppid() != driver)
             _exit(126);
         _exit(work() ? 0 : 1);
     }
