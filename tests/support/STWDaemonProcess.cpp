@@ -85,9 +85,9 @@ STWDaemonProcess::~STWDaemonProcess() {
 
 void STWDaemonProcess::reboot() { sem_unlink(STWPlatformConfiguration(_root).firstBootSemaphoreName().c_str()); }
 
-bool STWDaemonProcess::waitForCleanups(bool firstBoot) {
+bool STWDaemonProcess::waitForCleanups(bool firstBoot, std::chrono::milliseconds limit) {
     std::filesystem::path run = _root / "run/stowly";
-    auto deadline = std::chrono::steady_clock::now() + timeout;
+    auto deadline = std::chrono::steady_clock::now() + limit;
     while (!(std::filesystem::exists(run / "cleanup-complete") &&
              (!firstBoot || std::filesystem::exists(run / "reboot-cleanup-complete")))) {
         if (std::chrono::steady_clock::now() >= deadline || !isRunning()) {

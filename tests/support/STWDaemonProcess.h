@@ -55,7 +55,7 @@ public:
     void reboot();
     // Waits until the cleanups of the running daemon's start have finished, as their
     // completion files say: the every-start cleanup, and with `firstBoot` the first-boot one.
-    bool waitForCleanups(bool firstBoot = false);
+    bool waitForCleanups(bool firstBoot = false, std::chrono::milliseconds limit = timeout);
     // Where the daemon's standard error (its system log off systemd) goes from the next
     // start on; by default it is ours.
     void setStandardErrorFile(std::filesystem::path file) { _standardErrorFile = std::move(file); }
