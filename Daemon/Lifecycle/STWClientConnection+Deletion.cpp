@@ -15,64 +15,125 @@
 #include <algorithm>
 #include <fcntl.h>
 #include <functional>
+#include <mutex>
+#include <set>
 #include <sys/stat.h>
+
+// Where items are moved into death row: a fresh "temp." directory there, open, whose name
+// is in the filling set from its mkdir until the last item is in.
+struct STWClientConnection::DeathRowBatch::Slot {
+    std::shared_ptr<const STWGlobalConfiguration::OpenDirectory> deathRow;
+    STWFileDescriptor fd;
+    std::filesystem::path url;
+    std::string name;
+    ~Slot();
+};
 
 namespace {
 
-// Where an item is moved into death row: a fresh "temp." directory there, open.
-struct DeathRowSlot {
-    STWFileDescriptor fd;
-    std::filesystem::path url;
-};
+using DeathRowSlot = STWClientConnection::DeathRowBatch::Slot;
 
-// Moves an item into a fresh "temp." directory of death row with `move` (given that
-// directory). The directory is made in death row's held descriptor, which the layout
-// reopens once death row was removed. A deletion pass running meanwhile may remove the
-// fresh, still empty directory before the item is renamed into it; the rename's ENOENT then
-// means that, not a missing item (`isGone` tells), and the move is tried again in a new one.
+// The "temp." directories that moves are filling: a deletion pass skips them. A name goes
+// in under the mutex together with its mkdir, so a pass that listed the directory finds
+// it here until the filling is over.
+std::mutex fillingMutex;
+std::set<std::string>& fillingNames() {
+    static std::set<std::string> names;
+    return names;
+}
+
+bool isBeingFilled(const std::string& name) {
+    std::lock_guard lock(fillingMutex);
+    return fillingNames().count(name) != 0;
+}
+
+// A fresh "temp." directory in death row's held descriptor, which the layout reopens once
+// death row was removed, registered as being filled.
+std::unique_ptr<DeathRowSlot> makeSlot(STWErrorRef* error) {
+    auto fileManager = STWFileManager::defaultManager();
+    auto configuration = STWGlobalConfiguration::sharedInstance();
+    auto deathRow = configuration->openDeathrowDirectory(error);
+    if (!deathRow)
+        return nullptr;
+    std::lock_guard lock(fillingMutex);
+    auto unique = fileManager->createTemporaryDirectoryAt(deathRow->fd.get(), "temp.", deathRow->url, error);
+    if (!unique)
+        return nullptr;
+    fillingNames().insert(unique->name);
+    auto slot = std::make_unique<DeathRowSlot>();
+    slot->deathRow = deathRow;
+    slot->fd = std::move(unique->fd);
+    slot->url = deathRow->url / unique->name;
+    slot->name = std::move(unique->name);
+    return slot;
+}
+
+// Moves an item into death row with `move` (given the directory it goes into): the batch's
+// directory when it has one, else a fresh one, which the batch keeps for its next items.
+// A directory that went meanwhile (death row removed) makes the rename answer ENOENT;
+// that means that, not a missing item (`isGone` tells), and the move is tried again in a
+// new one. A name already in the batch's directory goes into a new one as well.
 bool moveIntoDeathRow(const std::filesystem::path& url,
-                      const std::function<bool(const DeathRowSlot& unique, STWErrorRef* error)>& move,
-                      const std::function<bool()>& isGone, bool* moved, STWErrorRef* error) {
+                      const std::function<bool(const DeathRowSlot& slot, STWErrorRef* error)>& move,
+                      const std::function<bool()>& isGone, std::unique_ptr<DeathRowSlot>* kept, bool* moved,
+                      STWErrorRef* error) {
     auto fileManager = STWFileManager::defaultManager();
     auto configuration = STWGlobalConfiguration::sharedInstance();
     *moved = false;
     for (int attempt = 0;; ++attempt) {
         STWErrorRef stepError;
-        auto deathRow = configuration->openDeathrowDirectory(&stepError);
-        auto unique = deathRow ? fileManager->createTemporaryDirectoryAt(deathRow->fd.get(), "temp.", deathRow->url,
-                                                                         &stepError)
-                               : std::nullopt;
-        if (!unique) {
-            // Death row removed between the check of its descriptor and the new directory:
-            // the next attempt reopens it.
-            if (stepError && stepError->isPOSIX(ENOENT) && attempt < 8)
-                continue;
-            STWSetError(error, STW_ERROR(STWErrorItemOperationFailed, stepError, "Failed to create unique directory at: %@",
-                                         deathRow ? deathRow->url : configuration->deathrowDirectory()));
-            return false;
+        std::unique_ptr<DeathRowSlot> fresh;
+        DeathRowSlot* slot = kept ? kept->get() : nullptr;
+        if (!slot) {
+            fresh = makeSlot(&stepError);
+            if (!fresh) {
+                // Death row removed between the check of its descriptor and the new
+                // directory: the next attempt reopens it.
+                if (stepError && stepError->isPOSIX(ENOENT) && attempt < 8)
+                    continue;
+                STWSetError(error, STW_ERROR(STWErrorItemOperationFailed, stepError,
+                                             "Failed to create unique directory at: %@",
+                                             configuration->deathrowDirectory()));
+                return false;
+            }
+            slot = fresh.get();
+            STW_CRASH_POINT(STWCrashPoint::deathRowAfterTemporaryDirectory);
         }
-        DeathRowSlot slot{std::move(unique->fd), deathRow->url / unique->name};
-        STW_CRASH_POINT(STWCrashPoint::deathRowAfterTemporaryDirectory);
-        if (move(slot, &stepError)) {
+        if (move(*slot, &stepError)) {
             *moved = true;
+            if (fresh && kept)
+                *kept = std::move(fresh);
             return true;
         }
         bool missing = stepError && stepError->isPOSIX(ENOENT);
         if (missing && isGone()) {
-            // Nothing to move, and no pass is started for nothing: the empty directory goes
+            // Nothing to move, and no pass is started for nothing: a fresh directory goes
             // now rather than stay in death row until some later pass.
-            fileManager->removeItemAt(deathRow->fd.get(), unique->name, slot.url);
+            if (fresh)
+                fileManager->removeItemAt(fresh->deathRow->fd.get(), fresh->name, fresh->url);
             return true;
+        }
+        if (!fresh && (missing || (stepError && stepError->isPOSIX(EEXIST)))) {
+            kept->reset(); // the batch's directory went, or holds that name: a new one
+            continue;
         }
         if (!missing || attempt == 8) {
             STWSetError(error, STW_ERROR(STWErrorItemOperationFailed, stepError, "Failed to move item at: %@ to: %@",
-                                         url, slot.url / url.filename()));
+                                         url, slot->url / url.filename()));
             return false;
         }
     }
 }
 
 } // namespace
+
+STWClientConnection::DeathRowBatch::Slot::~Slot() {
+    std::lock_guard lock(fillingMutex);
+    fillingNames().erase(name);
+}
+
+STWClientConnection::DeathRowBatch::DeathRowBatch() = default;
+STWClientConnection::DeathRowBatch::~DeathRowBatch() = default;
 
 bool STWClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& url, bool isDir,
                                                    bool startDeletionThread, STWErrorRef* error,
@@ -88,7 +149,7 @@ bool STWClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& 
             return fileManager->moveItemAtURLWithoutForeignLinks(url, unique.fd.get(), name, unique.url / name,
                                                                  options, stepError);
         },
-        [&] { return fileManager->itemDoesNotExistAtURL(url); }, &moved, error);
+        [&] { return fileManager->itemDoesNotExistAtURL(url); }, nullptr, &moved, error);
     if (ok && moved && startDeletionThread)
         deleteContainersOnDeathRowWithCompletion(nullptr);
     return ok;
@@ -96,7 +157,7 @@ bool STWClientConnection::_moveItemAtURLToDeathRow(const std::filesystem::path& 
 
 bool STWClientConnection::_moveItemAtToDeathRow(int parentfd, const std::string& name, int itemfd,
                                                 const std::filesystem::path& url, STWErrorRef* error,
-                                                STWFileManagerMoveOptions options) {
+                                                STWFileManagerMoveOptions options, DeathRowBatch* batch) {
     auto fileManager = STWFileManager::defaultManager();
     bool moved = false;
     return moveIntoDeathRow(
@@ -109,7 +170,7 @@ bool STWClientConnection::_moveItemAtToDeathRow(int parentfd, const std::string&
             struct stat st;
             return fstatat(parentfd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0 && errno == ENOENT;
         },
-        &moved, error);
+        batch ? &batch->_slot : nullptr, &moved, error);
 }
 
 bool STWClientConnection::_removeItemOrMoveToTempAtURL(const std::filesystem::path& url, STWErrorRef* error) {
@@ -156,6 +217,8 @@ void STWClientConnection::deleteContainersOnDeathRowWithCompletion(std::function
         }
         bool first = true;
         for (const auto& item : items ? *items : std::vector<STWFileManager::DirectoryItem>{}) {
+            if (isBeingFilled(item.name))
+                continue; // the pass started after the filling is over takes it
             STWErrorRef itemError;
             std::filesystem::path url = deathRow / item.name;
             if (!_removeItemOrMoveToTempAt(open->fd.get(), item.name, url, &itemError)) {

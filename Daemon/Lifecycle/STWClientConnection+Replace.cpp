@@ -227,13 +227,16 @@ bool STWClientConnection::replaceContainerIdentity(const STWConcreteContainerIde
 
     if (!replaceFile.empty()) {
         STWErrorRef cleanupError;
+        // Staging and journal share one directory in death row: their names differ (the
+        // journal's has its extension). The batch is gone before the pass starts.
+        auto batch = std::make_unique<DeathRowBatch>();
         // The parked container need not leave staging durably: should a power cut bring it
         // back there, it is garbage that no class directory lists. It is moved by the
         // descriptors the park left open; never parked (or put back since), there is nothing
         // to move.
         if (parked.directory &&
             !_moveItemAtToDeathRow(parked.parent.get(), staging.filename(), parked.directory.get(), staging,
-                                   &cleanupError, STWFileManagerMoveDefault)) {
+                                   &cleanupError, STWFileManagerMoveDefault, batch.get())) {
             STW_ERROR(STWErrorRemovePendingFileFailed, cleanupError, "Failed to remove staging dir: %@", staging);
             code = STWErrorRemovePendingFileFailed;
         }
@@ -252,8 +255,10 @@ bool STWClientConnection::replaceContainerIdentity(const STWConcreteContainerIde
                                                strerror(e));
         }
         bool removed = journal ? _moveItemAtToDeathRow(journalDirectory.get(), name, journal.get(), replaceFile,
-                                                       &journalError)
+                                                       &journalError, STWFileManagerMoveSyncSourceDirectory,
+                                                       batch.get())
                                : !journalError;
+        batch.reset();
         if (!removed) {
             STW_ERROR(STWErrorRemovePendingFileFailed, journalError, "Failed to remove replace file: %@", replaceFile);
             code = STWErrorRemovePendingFileFailed;
@@ -283,9 +288,16 @@ bool STWClientConnection::_writeToDiskReplaceAt(const std::filesystem::path& url
     dictionary[kStagingURLKey] = STWValue(info.stagingURL.native());
     dictionary[kDestURLKey] = STWValue(info.destURL.native());
     // Synced with its directory before the first rename it guards; readable before the
-    // first unlock.
+    // first unlock. Written in place under its fresh name: one cut short by a crash was cut
+    // short before anything moved, and the next start, whether it can read it or not, only
+    // removes it.
+    // That spares the rename of a temporary file and the wait for it to reach the disk.
     STWErrorRef writeError;
-    if (!STW_writeToURL(dictionary, url, STWWriteAtomic | STWWriteDurable | STWWriteNoFileProtection, &writeError)) {
+    int e = 0;
+    if (!STW_writeToURL(dictionary, url, STWWriteDurable | STWWriteNoFileProtection, &writeError) ||
+        (e = STWSyncDirectory(url.parent_path())) != 0) {
+        if (e)
+            writeError = STW_POSIX_ERROR(e, "Could not sync the directory of %@: %s", url, strerror(e));
         STWSetError(error, STW_ERROR(STWErrorWriteFileFailed, writeError, "Failed to write replace dictionary to URL %@",
                                      url));
         return false;
@@ -326,8 +338,9 @@ STWClientConnection::_readAndValidateReplaceFileAtUrl(const std::filesystem::pat
 bool STWClientConnection::_recoverFromReplaceOperationsWithError(STWErrorRef* error) {
     auto fileManager = STWFileManager::defaultManager();
     std::filesystem::path directory = STWGlobalConfiguration::sharedInstance()->replaceDirectory();
-    // A journal cut short while it was being written never named anything that moved; its
-    // temporary file is hidden from the listing below and would stay for good.
+    // A journal that an earlier version cut short while writing it through a temporary file
+    // never named anything that moved; that file is hidden from the listing below and would
+    // stay for good.
     if (int removed = STWRemoveAbandonedAtomicWrites(directory); removed > 0)
         STW_LOG_NOTICE(STWLogCategory::Lifecycle, "Removed %d unfinished replace journals in %@", removed, directory);
     STWErrorRef listError;

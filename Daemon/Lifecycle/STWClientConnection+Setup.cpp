@@ -110,6 +110,8 @@ void STWClientConnection::_cleanupOrphanedDataForDirectories(const DirectoryList
     bool internal = STWGlobalConfiguration::sharedInstance()->isInternalImage();
     int classfd = directories.fd->get();
     std::string metadataPath;
+    // The names of one directory are unique: its garbage shares one directory in death row.
+    DeathRowBatch batch;
     for (const auto& entry : directories.items) {
         struct stat st;
         bool containerName = cache->containerURL(fs::path(entry.name), containerClass);
@@ -148,7 +150,7 @@ void STWClientConnection::_cleanupOrphanedDataForDirectories(const DirectoryList
         }
         // Garbage that may as well come back after a power cut: the next start sweeps it again.
         STWErrorRef error;
-        _moveItemAtToDeathRow(classfd, entry.name, item.get(), url, &error, STWFileManagerMoveDefault);
+        _moveItemAtToDeathRow(classfd, entry.name, item.get(), url, &error, STWFileManagerMoveDefault, &batch);
     }
 }
 
@@ -249,13 +251,15 @@ void STWClientConnection::stowlyCleanupWithCompletion(std::function<void(uint64_
     }
     _backgroundQueue->async([this, leftovers = std::move(leftovers), completion = std::move(completion)] {
         for (const auto& listing : leftovers) {
+            // Gone before the pass below starts, which then takes the batch's directory too.
+            DeathRowBatch batch;
             for (const auto& entry : listing->items) {
                 STWFileDescriptor item(
                     openat(listing->fd->get(), entry.name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
                 STWErrorRef error;
                 if (item)
                     _moveItemAtToDeathRow(listing->fd->get(), entry.name, item.get(),
-                                          listing->url / entry.name, &error, STWFileManagerMoveDefault);
+                                          listing->url / entry.name, &error, STWFileManagerMoveDefault, &batch);
             }
         }
         deleteContainersOnDeathRowWithCompletion([completion](uint64_t code) {

@@ -101,15 +101,37 @@ public:
     // as `itemfd` (ESTALE otherwise); the directory it left is synced unless `options` say
     // otherwise, as above. `itemfd` may be an O_PATH descriptor (a link or a FIFO is moved as
     // the entry it is, never opened or followed).
+    // With a `batch`, the item goes into the batch's "temp." directory, made by its first
+    // move: one directory for many items, which is fine as long as their names differ
+    // (the entries of one directory, say).
+    class DeathRowBatch;
     bool _moveItemAtToDeathRow(int parentfd, const std::string& name, int itemfd, const std::filesystem::path& url,
                                STWErrorRef* error,
-                               STWFileManagerMoveOptions options = STWFileManagerMoveSyncSourceDirectory);
+                               STWFileManagerMoveOptions options = STWFileManagerMoveSyncSourceDirectory,
+                               DeathRowBatch* batch = nullptr);
+    // Items moved into death row one after the other that share one fresh "temp." directory
+    // there. A deletion pass leaves the directory alone while the batch lives (and so while
+    // any single move fills its own): nothing arrives in a directory being removed. A pass
+    // started after the batch is gone removes it.
+    class DeathRowBatch {
+    public:
+        DeathRowBatch();
+        ~DeathRowBatch();
+        DeathRowBatch(const DeathRowBatch&) = delete;
+        DeathRowBatch& operator=(const DeathRowBatch&) = delete;
+        struct Slot;
+
+    private:
+        friend class STWClientConnection;
+        std::unique_ptr<Slot> _slot;
+    };
     static bool _removeItemOrMoveToTempAtURL(const std::filesystem::path& url, STWErrorRef* error);
     // The same for the entry `name` of the directory open as `dirfd` (death row's), which
     // `url` names.
     static bool _removeItemOrMoveToTempAt(int dirfd, const std::string& name, const std::filesystem::path& url,
                                           STWErrorRef* error);
-    // Empties death row on the death-row queue; the completion gets 1 or the last error's code.
+    // Empties death row on the death-row queue, but for the "temp." directories that moves
+    // are still filling; the completion gets 1 or the last error's code.
     static void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
 
     // Deletion (Lifecycle/STWClientConnection+Deletion.cpp). A container to delete is looked

@@ -9,10 +9,12 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <fcntl.h>
 #include <fstream>
 #include <future>
 #include <linux/fs.h>
+#include <map>
 #include <sys/ioctl.h>
 #include <unistd.h>
 
@@ -110,4 +112,43 @@ TEST_F(STWDeathRow, WhatIsNotThereOrWillNotGoDoesNotStopDeathRow) {
     EXPECT_TRUE(fs::exists(aside / "file"));
     EXPECT_FALSE(fs::exists(deathRow / "kept"));
     fs::remove_all(aside);
+}
+
+// A batch's items share one fresh directory in death row, and a name that one holds
+// already starts another; no pass takes the directory a batch is filling, so nothing
+// arrives in one being removed. The pass after the batch takes everything.
+TEST_F(STWDeathRow, ABatchSharesOneDirectoryThatPassesLeaveWhileItFills) {
+    fs::path first = root.resolve("/private/var/batch1"), second = root.resolve("/private/var/batch2");
+    std::vector<fs::path> items{first / "a", first / "b", second / "a"};
+    for (const fs::path& item : items)
+        fs::create_directories(item / "Documents");
+    auto batch = std::make_unique<STWClientConnection::DeathRowBatch>();
+    for (const fs::path& item : items) {
+        STWFileDescriptor parent(open(item.parent_path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        STWFileDescriptor fd(open(item.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+        STWErrorRef error;
+        EXPECT_TRUE(connection._moveItemAtToDeathRow(parent.get(), item.filename(), fd.get(), item, &error,
+                                                     STWFileManagerMoveDefault, batch.get()))
+            << item;
+    }
+    auto held = [&] { // each directory of death row: how many items it holds
+        std::map<std::string, size_t> counts;
+        for (const auto& entry : fs::directory_iterator(deathRow))
+            counts[entry.path().filename()] = std::distance(fs::directory_iterator(entry), fs::directory_iterator());
+        return counts;
+    };
+    auto before = held();
+    ASSERT_EQ(before.size(), 2u);
+    auto filling = std::find_if(before.begin(), before.end(), [](const auto& d) { return d.second == 1; });
+    ASSERT_NE(filling, before.end());
+
+    EXPECT_EQ(pass(), STWErrorSuccess);
+    EXPECT_EQ(held(), (std::map<std::string, size_t>{*filling})) << "the filled one goes, the filling one stays";
+    EXPECT_TRUE(fs::is_directory(deathRow / filling->first / "a/Documents"));
+    batch.reset();
+    EXPECT_EQ(pass(), STWErrorSuccess);
+    EXPECT_TRUE(fs::is_empty(deathRow));
+    EXPECT_TRUE(fs::is_empty(first) && fs::is_empty(second));
+    fs::remove(first);
+    fs::remove(second);
 }
