@@ -69,7 +69,6 @@ constexpr const char* kPlugin = "com.hostile.app.plugin";
 constexpr const char* kGroup = "group.com.hostile.app";
 constexpr const char* kSystemGroup = "systemgroup.com.hostile.shared";
 constexpr const char* kVictim = "com.hostile.victim";
-constexpr const char* kMetadataName = ".com.vorlane.stowly.metadata.plist";
 
 std::atomic<bool> interrupted{false};
 
@@ -573,7 +572,7 @@ void Hostile::_plant(unsigned round) {
     const fs::path deepIn = containers[round % containers.size()];
     fs::path classDirectory = containers.front().parent_path();
     fs::path staging = classDirectory.parent_path().parent_path() / "Staging";
-    std::string victimMetadata = (_victimPath / kMetadataName).string();
+    std::string victimMetadata = (_victimPath / STWContainerMetadataFileName).string();
 
     asApp([&] {
         std::error_code ec;
@@ -612,10 +611,10 @@ void Hostile::_plant(unsigned round) {
         fs::path thief = classDirectory / ("6F1B5C2E-0000-4000-8000-" + std::to_string(100000000000 + round));
         fs::create_directory(thief, ec);
         if (round % 3 == 0)
-            fs::copy_file(victimMetadata, thief / kMetadataName, ec);
+            fs::copy_file(victimMetadata, thief / STWContainerMetadataFileName, ec);
         else if (round % 3 == 1)
-            mkfifo((thief / kMetadataName).c_str(), 0644);
-        else if (int fd = open((thief / kMetadataName).c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644); fd >= 0) {
+            mkfifo((thief / STWContainerMetadataFileName).c_str(), 0644);
+        else if (int fd = open((thief / STWContainerMetadataFileName).c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0644); fd >= 0) {
             bool sized = ftruncate(fd, 64 << 20) == 0; // far beyond any metadata
             close(fd);
             if (!sized)
@@ -634,9 +633,9 @@ void Hostile::_plant(unsigned round) {
                    rename(container.c_str(), (container.string() + ".away" + std::to_string(round)).c_str()) == 0;
         };
         if (round % 3 == 0 && away(_pluginData.path) && mkdir(_pluginData.path.c_str(), 0755) == 0)
-            mkfifo((_pluginData.path / kMetadataName).c_str(), 0644);
+            mkfifo((_pluginData.path / STWContainerMetadataFileName).c_str(), 0644);
         if (round % 3 == 1 && away(_group.path) && mkdir(_group.path.c_str(), 0755) == 0)
-            fs::create_symlink(kMetadataName, _group.path / kMetadataName, ec);
+            fs::create_symlink(STWContainerMetadataFileName, _group.path / STWContainerMetadataFileName, ec);
         if (round % 3 == 2 && away(_data.path))
             fs::create_symlink(_victimPath, _data.path, ec);
         return true;
