@@ -26,6 +26,9 @@ struct STWTortureExpectation {
                                     // has a UUID name of its own, which only a regeneration changes)
     std::set<int64_t> info;         // torture info value on disk (-1: none); empty: not checked
     std::set<int64_t> protection;   // recorded protection class (-1: none); empty: not checked
+    bool protectionMayBePartial = false; // a change refused once its walk began (the device
+                                         // locked meanwhile) may have left the data at either
+                                         // class, until a change goes through
 
     static STWTortureExpectation absent() { return {}; }
     static STWTortureExpectation present(std::string uuid, std::string path) {

@@ -146,6 +146,7 @@ void STWTortureWorker::_observePresent(const char* how, const STWTortureIdentity
     if (same) {
         next.info = e.info;
         next.protection = e.protection;
+        next.protectionMayBePartial = e.protectionMayBePartial;
     } else if (!existed || *existed) {
         next.info.clear(); // an older container at a path not known yet: its values are learnt
     }
@@ -399,10 +400,14 @@ void STWTortureWorker::_setProtection(STWClient& client, const std::string& iden
     // Refused (locked, superseded): the walk may have begun, and the record is either.
     // Under faults the class may fail to be recorded although the change succeeded.
     Outcome outcome = _send("set-protection", client, message, &reply, &code);
-    if (outcome == Outcome::Acknowledged && _mode != Mode::Faults)
+    if (outcome == Outcome::Acknowledged && _mode != Mode::Faults) {
         e.protection = {protectionClass};
-    else if (!e.protection.empty())
-        e.protection.insert(protectionClass);
+        e.protectionMayBePartial = false;
+    } else {
+        if (!e.protection.empty())
+            e.protection.insert(protectionClass);
+        e.protectionMayBePartial = true;
+    }
 }
 
 void STWTortureWorker::_released(const std::string& owner, const std::set<std::string>& before, bool certain) {
