@@ -72,6 +72,18 @@ constexpr const char* kVictim = "com.hostile.victim";
 
 std::atomic<bool> interrupted{false};
 
+// What the kernel asks when the app starts: its container and its group's paths.
+STWUpcallClient::Request appUpcall() {
+    STWUpcallClient::Request request;
+    request.codeSignatureIdentifier = kApp;
+    request.containerIdentifier = kApp;
+    request.uid = kMobile;
+    request.appGroupIdentifiers = {kGroup};
+    request.containerType = STWKernContainerTypeApplication;
+    request.personaID = STWKernNoPersona;
+    return request;
+}
+
 STWValue::Dictionary entitled(std::initializer_list<const char*> names) {
     STWValue::Dictionary entitlements;
     for (const char* name : names)
@@ -773,13 +785,7 @@ void Hostile::_drive() {
                                     {"SourcePath", STWValue(source)},
                                     {"DestPath", STWValue(destination)}};
     };
-    STWUpcallClient::Request app;
-    app.codeSignatureIdentifier = kApp;
-    app.containerIdentifier = kApp;
-    app.uid = kMobile;
-    app.appGroupIdentifiers = {kGroup};
-    app.containerType = STWKernContainerTypeApplication;
-    app.personaID = STWKernNoPersona;
+    STWUpcallClient::Request app = appUpcall();
     STWUpcallClient::Request pluginProcess = app;
     pluginProcess.codeSignatureIdentifier = kPlugin;
     pluginProcess.containerIdentifier = kPlugin;
@@ -896,13 +902,7 @@ void Hostile::_cycle(unsigned round) {
     if (!_connect())
         _noAnswer(std::string("the connections after a ") + kind, kBound, "refused");
     // The kernel asks for the app's paths right after the start, with the planted entries.
-    STWUpcallClient::Request request;
-    request.codeSignatureIdentifier = kApp;
-    request.containerIdentifier = kApp;
-    request.uid = kMobile;
-    request.appGroupIdentifiers = {kGroup};
-    request.personaID = STWKernNoPersona;
-    _upcall(request);
+    _upcall(appUpcall());
 }
 
 } // namespace
