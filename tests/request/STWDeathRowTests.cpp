@@ -81,16 +81,15 @@ TEST_F(STWDeathRow, AContainerThatWillNotGoStaysAContainer) {
     auto queue = STWCommandQueue::init();
     queue->insertCommand(STWCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
         {made->containerIdentity()}, true, nullptr));
-    bool armed = STWFaultInjection::arm("renameat2", 1, EIO);
+    ASSERT_TRUE(STWFaultInjection::arm("renameat2", 1, EIO));
     EXPECT_TRUE(queue->executeAllUntilExhaustedOrError(&code));
     STWFaultInjection::disarm();
-    EXPECT_TRUE(setFlags(0)) << "the test root could not be removed";
-    ASSERT_TRUE(armed);
     EXPECT_TRUE(fs::exists(made->url() / STWMetadata::fileName));
     auto found = connection.createOrLookupContainerWithContainerIdentity(identity("com.example.stuck"), false, false,
                                                                          true, &code);
     ASSERT_TRUE(found);
     EXPECT_EQ(found->url(), made->url());
+    EXPECT_TRUE(setFlags(0));
 }
 
 // Nothing to move is moved (and starts no pass); what a pass cannot remove is moved aside
