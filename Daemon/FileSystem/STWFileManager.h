@@ -249,10 +249,9 @@ public:
     // Removes the directory open as `directoryfd`, the entry `name` of `parentfd`: what it
     // holds through its descriptor, then the entry itself while it is still that directory
     // (ESTALE when something else took its place; that is left alone). A directory that is
-    // gone already counts as removed. A `lastEntry` of the directory (a file) is removed
-    // only after everything else in it, and kept when anything else would not go.
+    // gone already counts as removed.
     bool removeDirectoryAt(int parentfd, const std::string& name, int directoryfd, const std::filesystem::path& path,
-                           STWErrorRef* error = nullptr, const std::string& lastEntry = {}) const;
+                           STWErrorRef* error = nullptr) const;
 
     // Makes the directory `relativePath` below `dirfd` one component at a time and answers
     // its descriptor. A symbolic link found where a directory belongs is removed and a

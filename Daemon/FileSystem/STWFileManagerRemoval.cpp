@@ -22,9 +22,6 @@ namespace {
 class RemovalContext : public STWDirectoryWalker::Delegate {
 public:
     int recordedError = 0;
-    // An entry of the directory open as `keptDirectory` that the walk leaves for its caller.
-    int keptDirectory = -1;
-    std::string keptName;
 
     void itemFailed(int dirfd, const std::string& directoryPath, const std::string& name, int e) {
         std::string path = joinPath(directoryPath, name);
@@ -39,8 +36,6 @@ public:
     }
 
     bool visitEntry(int dirfd, const std::string& directoryPath, const STWDirectoryWalker::Entry& entry) override {
-        if (dirfd == keptDirectory && entry.name == keptName)
-            return false;
         if (entry.type == DT_DIR)
             return true;
         // The entry type spares a stat: unlinking a directory answers EISDIR.
@@ -155,17 +150,10 @@ bool STWFileManager::removeItemAt(int dirfd, const std::string& name, const fs::
 }
 
 bool STWFileManager::removeDirectoryAt(int parentfd, const std::string& name, int directoryfd, const fs::path& path,
-                                       STWErrorRef* error, const std::string& lastEntry) const {
+                                       STWErrorRef* error) const {
     std::string pathText = pathString(path);
     RemovalContext context;
-    context.keptDirectory = lastEntry.empty() ? -1 : directoryfd;
-    context.keptName = lastEntry;
     STWDirectoryWalker().walk(directoryfd, pathText, context);
-    // The last entry goes only once everything else went: a removal that fails part-way
-    // leaves it.
-    if (!lastEntry.empty() && (context.recordedError == 0 || context.recordedError == ENOENT) &&
-        disk::unlinkat(directoryfd, lastEntry.c_str(), 0) != 0 && errno != ENOENT)
-        context.itemFailed(directoryfd, pathText, lastEntry, errno);
     struct stat expected, current;
     int e = 0;
     if (fstat(directoryfd, &expected) != 0 || fstatat(parentfd, name.c_str(), &current, AT_SYMLINK_NOFOLLOW) != 0)

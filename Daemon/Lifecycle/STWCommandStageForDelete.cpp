@@ -108,10 +108,7 @@ bool STWCommandStageForDelete::_stageContainer(const STWMetadata& record) {
         return true;
     STW_LOG_DEBUG(STWLogCategory::Lifecycle, "Couldn't stage for deletion from %@ to %@: %@", url, destination,
                   stepError);
-    // In place, its metadata file goes last: a removal that fails part-way leaves a
-    // container (still in the cache, as the failure says) rather than a directory that no
-    // start but the first after power-on would sweep.
-    if (fileManager->removeDirectoryAt(classfd.get(), name, containerfd.get(), url, &stepError, STWMetadata::fileName))
+    if (fileManager->removeDirectoryAt(classfd.get(), name, containerfd.get(), url, &stepError))
         return true;
     STW_ERROR(STWErrorDeleteFailed, stepError, "Failed to delete container at %@: %@", url, stepError);
     return false;

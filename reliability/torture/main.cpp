@@ -336,10 +336,15 @@ void Torture::_faultRound() {
     }
     if (_options.verbose)
         fprintf(stderr, "fault round %u: %s\n", _rounds, faults.c_str());
-    // The faults are spent or dropped with the process: the start without them (not a power
-    // cycle, whose sweep could hide what they left) repairs what they left, and the check
-    // follows its cleanups.
-    bool started = _daemon.isRunning() || _restart("", false);
+    // The faults are spent or dropped with the process: the start without them repairs what
+    // they left, and the check follows its cleanups. It is a first start since power-on: a
+    // removal that failed half-way leaves a directory without metadata in its class
+    // directory, which is no container and only the first-boot sweep removes.
+    bool started = _daemon.isRunning();
+    if (!started) {
+        _daemon.reboot();
+        started = _restart("", true);
+    }
     if (started)
         _check();
     if (!_daemon.isRunning())

@@ -13,10 +13,7 @@
 #include <fcntl.h>
 #include <fstream>
 #include <future>
-#include <linux/fs.h>
 #include <map>
-#include <sys/ioctl.h>
-#include <unistd.h>
 
 namespace fs = std::filesystem;
 
@@ -58,38 +55,6 @@ TEST_F(STWDeathRow, StagingGoesOnPastAContainerItCannotFind) {
     EXPECT_FALSE(fs::exists(made->url()));
     EXPECT_TRUE(fs::is_directory(deathRow / made->url().filename()));
     EXPECT_EQ(pass(), STWErrorSuccess);
-}
-
-// A container that will neither move to death row nor go whole in place (here an
-// append-only file in it) keeps its metadata file: it is still a container, found at its
-// path, not a stray directory for a later sweep.
-TEST_F(STWDeathRow, AContainerThatWillNotGoStaysAContainer) {
-    uint64_t code = STWErrorSuccess;
-    auto made = connection.createOrLookupContainerWithContainerIdentity(identity("com.example.stuck"), true, false,
-                                                                        true, &code);
-    ASSERT_TRUE(made);
-    fs::path stuck = made->url() / "Library/stuck";
-    std::ofstream(stuck) << "x";
-    auto setFlags = [&](int flags) {
-        int fd = open(stuck.c_str(), O_RDONLY | O_CLOEXEC);
-        bool set = fd >= 0 && ioctl(fd, FS_IOC_SETFLAGS, &flags) == 0;
-        close(fd);
-        return set;
-    };
-    if (!setFlags(FS_APPEND_FL))
-        GTEST_SKIP() << "the append-only flag cannot be set here (file system or privileges)";
-    auto queue = STWCommandQueue::init();
-    queue->insertCommand(STWCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
-        {made->containerIdentity()}, true, nullptr));
-    ASSERT_TRUE(STWFaultInjection::arm("renameat2", 1, EIO));
-    EXPECT_TRUE(queue->executeAllUntilExhaustedOrError(&code));
-    STWFaultInjection::disarm();
-    EXPECT_TRUE(fs::exists(made->url() / STWMetadata::fileName));
-    auto found = connection.createOrLookupContainerWithContainerIdentity(identity("com.example.stuck"), false, false,
-                                                                         true, &code);
-    ASSERT_TRUE(found);
-    EXPECT_EQ(found->url(), made->url());
-    EXPECT_TRUE(setFlags(0));
 }
 
 // Nothing to move is moved (and starts no pass); what a pass cannot remove is moved aside
