@@ -414,7 +414,8 @@ STWDataProtectionChangeOperation::dataProtectionChangeOperationAtURL(const fs::p
     auto metadata = STWClientConnection::privilegedClientConnectionWithUserIdentity(user)
                         ->createOrLookupContainerWithContainerIdentity(identity, false, false, true, &code);
     if (!metadata) {
-        STWSetError(error, STW_ERROR(STWErrorNotFound, nullptr,
+        // The lookup's own code goes with it: only "not found" means the file is an orphan.
+        STWSetError(error, STW_ERROR(STWErrorNotFound, STW_ERROR_NOLOG(code, nullptr, "Container lookup failed"),
                                      "Failed to lookup container metadata from file userId: %u, identifier: %@, "
                                      "Class: %llu : %llu",
                                      static_cast<unsigned>(user->posixUID()), info->identifier, info->containerClass,

@@ -157,6 +157,18 @@ bool STWDataProtectionManager::restartPendingDataProtectionOperationsWithError(S
         if (!operation) {
             STW_LOG_ERROR(STWLogCategory::Lifecycle, "Failed to read data protection change operation at %@ : %@", file,
                           readError);
+            // Its container was deleted after the change failed to remove its file: the
+            // change would only find nothing and remove the file, so remove it now. A file
+            // that could not be read, or a lookup that failed otherwise, stays for next time.
+            if (readError && readError->code() == STWErrorNotFound && readError->underlyingError() &&
+                readError->underlyingError()->code() == STWErrorNotFound) {
+                STWErrorRef removeError;
+                if (STWFileManager::defaultManager()->removeItemAtURL(file, &removeError))
+                    STW_LOG_NOTICE(STWLogCategory::Lifecycle, "Removed update file of a missing container at %@", file);
+                else
+                    STW_LOG_ERROR(STWLogCategory::Lifecycle, "Failed to remove data protection file at %@ : %@", file,
+                                  removeError);
+            }
             continue;
         }
         const auto& metadata = operation->dataContainerMetadata();

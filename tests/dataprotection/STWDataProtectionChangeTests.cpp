@@ -214,7 +214,8 @@ TEST_F(STWDataProtectionChange, ANewerChangeSupersedesAnOlderOne) {
 }
 
 // The reader refuses what a damaged file holds, with the code its check names; a good
-// file comes back as the same change, and a restart finishes it.
+// file comes back as the same change, and a restart finishes it (and drops the change of a
+// container that is gone).
 TEST_F(STWDataProtectionChange, UpdateFilesAreCheckedAndRestarted) {
     auto cache = STWUserIdentitySharedCache::sharedInstance();
     fs::path scratch = root.path() / "update.plist";
@@ -265,8 +266,17 @@ TEST_F(STWDataProtectionChange, UpdateFilesAreCheckedAndRestarted) {
     EXPECT_EQ(restored->dataContainerMetadata()->url(), made->url());
     EXPECT_TRUE(restored->retryIfLocked());
 
+    // Beside it: the file of a change whose container has been deleted since, which the
+    // restart removes, and one it cannot read, which it leaves.
+    fs::path pendingUpdates = updateFile(made).parent_path();
+    good["STWDataOperationIdentifier"] = STWValue("com.example.deleted");
+    ASSERT_TRUE(STW_writeToURL(good, pendingUpdates / "deleted.plist", 0, nullptr));
+    write(pendingUpdates / "unreadable.plist", "not a property list");
+
     EXPECT_TRUE(manager->restartPendingDataProtectionOperationsWithError(nullptr));
     EXPECT_EQ(classOf(made->url() / "Documents"), 1);
     EXPECT_EQ(recordedClass("com.example.restart"), 1);
     EXPECT_FALSE(fs::exists(updateFile(made)));
+    EXPECT_FALSE(fs::exists(pendingUpdates / "deleted.plist"));
+    EXPECT_TRUE(fs::remove(pendingUpdates / "unreadable.plist"));
 }
