@@ -100,6 +100,8 @@ std::string STWTortureExpectation::description() const {
         s << ", info value " << setText(info);
     if (!protection.empty())
         s << ", protection class " << setText(protection);
+    if (deletionAnswered)
+        s << ", deleted unless the removal failed";
     return s.str();
 }
 
@@ -270,6 +272,8 @@ std::vector<std::string> STWTortureChecker::check(const std::vector<STWTortureMo
                 problem = "missing";
             else if (c && !expected.mayBePresent)
                 problem = "present at " + c->path;
+            else if (c && expected.deletionAnswered && !undeletable.count(c->path))
+                problem = "present at " + c->path + ", its deletion answered success and nothing failed there";
             else if (c && !expected.uuids.empty() && !expected.uuids.count(c->uuid))
                 problem = "has UUID " + c->uuid;
             else if (c && expected.excluded.count(c->path))

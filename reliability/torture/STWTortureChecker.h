@@ -14,6 +14,7 @@
 #include <filesystem>
 #include <map>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -23,6 +24,10 @@ public:
     // its class (the failure is logged, the reply still succeeds): the recorded class may
     // then lag behind the data's.
     bool recordedProtectionMayLag = false;
+    // Under injected faults a container may be neither moved to death row nor removed in
+    // place; the deletion logs that and still answers success. The paths the daemon's log
+    // names so: only these may stay after a deletion that answered success.
+    std::set<std::string> undeletable;
 
     // A container as its class directory and metadata file show it.
     struct Container {

@@ -29,6 +29,8 @@ struct STWTortureExpectation {
     bool protectionMayBePartial = false; // a change refused once its walk began (the device
                                          // locked meanwhile) may have left the data at either
                                          // class, until a change goes through
+    bool deletionAnswered = false; // under faults: its deletion answered success, yet it may
+                                   // stay if the daemon could neither move nor remove it
 
     static STWTortureExpectation absent() { return {}; }
     static STWTortureExpectation present(std::string uuid, std::string path) {

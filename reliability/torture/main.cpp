@@ -134,6 +134,9 @@ private:
     bool _restart(std::string point, bool firstBoot);
     void _window(const std::string& point);
     void _check();
+    // Tells the checker which containers the daemon's log, since the last call, says could
+    // be neither moved to death row nor removed.
+    void _readUndeletable();
     void _violation(const std::string& text);
     void _writeState();
     std::unique_ptr<STWClient> _installer() { return _daemon.connectAs("com.torture.installer", installerEntitlements); }
@@ -143,6 +146,7 @@ private:
     STWDaemonProcess _daemon;
     STWTortureChecker _checker;
     std::vector<std::unique_ptr<STWTortureWorker>> _workers;
+    std::streamoff _logRead = 0;
     unsigned _rounds = 0;
     struct Usage {
         long residentKB = -1;
@@ -249,8 +253,29 @@ void Torture::_window(const std::string& point) {
                 point.empty() ? "at random" : (point + (reached ? " reached" : " not reached")).c_str());
 }
 
+void Torture::_readUndeletable() {
+    std::ifstream log(_daemon.root() / "stowlyd.stderr");
+    log.seekg(_logRead);
+    const std::string marker = "Failed to delete container at ";
+    for (std::string line; std::getline(log, line);) {
+        size_t at = line.find(marker);
+        if (at == std::string::npos)
+            continue;
+        std::string path = line.substr(at + marker.size());
+        path = path.substr(0, path.find(": "));
+        while (path.size() > 1 && path.back() == '/')
+            path.pop_back();
+        _checker.undeletable.insert(path);
+    }
+    log.clear();
+    if (auto end = log.tellg(); end >= 0)
+        _logRead = end;
+}
+
 void Torture::_check() {
     ++_checks;
+    if (_options.faultRounds)
+        _readUndeletable();
     std::vector<STWTortureModel*> models;
     for (auto& worker : _workers)
         models.push_back(&worker->model);
@@ -485,6 +510,7 @@ int Torture::run() {
         for (std::string line; std::getline(log, line);)
             fired += line.find("Injected fault: ") != std::string::npos;
         printf("fault rounds: %u, faults fired: %u, violations: %zu\n", _rounds, fired, _violations.size());
+        printf("containers a failed deletion left in place: %zu\n", _checker.undeletable.size());
     } else {
         printf("kills: %u, violations: %zu\n", _kills, _violations.size());
     }

@@ -80,8 +80,14 @@ TEST(STWTortureChecker, AcceptsWhatTheRepliesAllowAndLearnsTheRest) {
     model.containers[{2, "com.example.partial"}] =
         STWTortureExpectation::present(D, root.container(2, "com.example.partial", D, -1, {}, 3));
     model.containers[{2, "com.example.partial"}].protectionMayBePartial = true;
+    // A deletion that answered success under faults, of a container the log names as stuck.
+    const std::string E = "aaaaaaaa-aaaa-aaaa-aaaa-aaaaaaaaaaaa";
+    auto& stuck = model.containers[{2, "com.example.stuck"}] =
+        STWTortureExpectation::present(E, root.container(2, "com.example.stuck", E));
+    stuck.mayBeAbsent = stuck.deletionAnswered = true;
 
     STWTortureChecker checker(root.path);
+    checker.undeletable = {stuck.path};
     EXPECT_EQ(checker.check({&model}, std::chrono::milliseconds(0)), std::vector<std::string>());
     EXPECT_TRUE(model.containers.at({12, "com.example.system"}).definitelyPresent());
     EXPECT_EQ(model.containers.at({12, "com.example.system"}).uuid(), B);
@@ -114,6 +120,10 @@ TEST(STWTortureChecker, ReportsEveryKindOfDamage) {
     model.containers[{2, "com.example.info"}] = STWTortureExpectation::present("44444444-4444-4444-4444-444444444444", "");
     model.containers[{2, "com.example.info"}].info = {4};
     model.containers[{1, "com.example.deleted"}] = STWTortureExpectation::absent();
+    // Its deletion answered success under faults, and the log names no failure at its path.
+    std::string stuck = root.container(2, "com.example.stuck", "aaaaaaaa-aaaa-aaaa-aaaa-aaaaaaaaaaaa");
+    auto& answered = model.containers[{2, "com.example.stuck"}] = STWTortureExpectation::unknown();
+    answered.deletionAnswered = true;
 
     STWTortureChecker checker(root.path);
     auto violations = checker.check({&model}, std::chrono::milliseconds(0));
@@ -124,11 +134,12 @@ TEST(STWTortureChecker, ReportsEveryKindOfDamage) {
     EXPECT_TRUE(mentions(violations, "metadata says class 2"));
     EXPECT_TRUE(mentions(violations, "66666666-6666-6666-6666-666666666666: no readable metadata file"));
     EXPECT_TRUE(mentions(violations, "com.example.deleted (class 1) present at " + deleted));
+    EXPECT_TRUE(mentions(violations, "com.example.stuck (class 2) present at " + stuck + ", its deletion answered"));
     EXPECT_TRUE(mentions(violations, "group container"));
     EXPECT_TRUE(mentions(violations, "replace journal left"));
     EXPECT_TRUE(mentions(violations, "death row entry left"));
     EXPECT_TRUE(mentions(violations, "records protection class 3, its Documents has class -1"));
     auto mappings = checker.checkMappings({{2, "com.example.moved"}, {12, "com.example.system"}});
     EXPECT_TRUE(mentions(mappings, "points at /elsewhere"));
-    EXPECT_EQ(violations.size(), 11u);
+    EXPECT_EQ(violations.size(), 12u);
 }
