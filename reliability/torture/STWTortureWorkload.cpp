@@ -37,6 +37,9 @@ std::string STWTortureWorker::_app(unsigned k) const {
 std::string STWTortureWorker::_system(unsigned k) const {
     return "com.torture.t" + std::to_string(_index) + ".system" + std::to_string(k);
 }
+std::string STWTortureWorker::_systemGroup(unsigned k) const {
+    return "systemgroup.torture.t" + std::to_string(_index) + ".sg" + std::to_string(k);
+}
 std::string STWTortureWorker::_group(unsigned k) const {
     return "group.torture.t" + std::to_string(_index) + ".g" + std::to_string(k);
 }
@@ -577,9 +580,11 @@ void STWTortureWorker::run(STWClient& client, STWUpcallClient* upcalls, const st
          codeSigning = focus.starts_with("codesigning.");
     while (!stop.load() && !_connectionDead) {
         std::string app = _app(pick(appCount));
-        uint64_t classes[] = {1, 2, 2, 12};
-        uint64_t containerClass = classes[pick(4)];
-        std::string identifier = containerClass == 12 ? _system(pick(systemCount)) : app;
+        uint64_t classes[] = {1, 2, 2, 12, 13};
+        uint64_t containerClass = classes[pick(5)];
+        std::string identifier = containerClass == 12   ? _system(pick(systemCount))
+                                 : containerClass == 13 ? _systemGroup(pick(systemCount))
+                                                        : app;
         unsigned roll = pick(100);
         // A crash point is reached sooner when its requests come more often.
         if ((protection && roll < 40) || (removal && roll < 20) || (replacing && roll < 25) ||

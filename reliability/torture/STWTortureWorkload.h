@@ -88,6 +88,7 @@ private:
 
     std::string _app(unsigned k) const;
     std::string _system(unsigned k) const;
+    std::string _systemGroup(unsigned k) const;
     std::string _group(unsigned k) const;
 
     unsigned _index;
