@@ -23,6 +23,15 @@ STWValue::Dictionary identityKeys(uint64_t containerClass, const std::string& id
     return {{"Identifier", STWValue(identifier)}, {"ContainerClass", STWValue(containerClass)}};
 }
 
+// A command about one container the record knows, named by its identity and UUID.
+STWValue::Dictionary containerCommand(unsigned command, const STWTortureIdentity& identity,
+                                      const STWTortureExpectation& e) {
+    STWValue::Dictionary message = identityKeys(identity.first, identity.second);
+    message["Command"] = STWValue(command);
+    message["UUID"] = STWValue(*STWUUID::fromString(e.uuid()));
+    return message;
+}
+
 } // namespace
 
 STWTortureWorker::STWTortureWorker(unsigned index, uint64_t seed, std::string root)
@@ -330,9 +339,7 @@ void STWTortureWorker::_regenerate(STWClient& client, const STWTortureIdentity& 
     if (!_learn(client, identity))
         return;
     auto& e = model.containers.at(identity);
-    STWValue::Dictionary message = identityKeys(identity.first, identity.second);
-    message["Command"] = STWValue(9u);
-    message["UUID"] = STWValue(*STWUUID::fromString(e.uuid()));
+    STWValue::Dictionary message = containerCommand(9, identity, e);
     STWValue::Dictionary reply;
     uint64_t code = 0;
     Outcome outcome = _send("regenerate-uuid", client, message, &reply, &code);
@@ -351,9 +358,7 @@ void STWTortureWorker::_setInfo(STWClient& client, const STWTortureIdentity& ide
         return;
     auto& e = model.containers.at(identity);
     int64_t value = _nextInfoValue++;
-    STWValue::Dictionary message = identityKeys(identity.first, identity.second);
-    message["Command"] = STWValue(5u);
-    message["UUID"] = STWValue(*STWUUID::fromString(e.uuid()));
+    STWValue::Dictionary message = containerCommand(5, identity, e);
     message["Key"] = STWValue(STWTortureChecker::infoKey);
     message["Value"] = STWValue(value);
     STWValue::Dictionary reply;
@@ -376,9 +381,7 @@ void STWTortureWorker::_getInfo(STWClient& client, const STWTortureIdentity& ide
     if (!_learn(client, identity))
         return;
     auto& e = model.containers.at(identity);
-    STWValue::Dictionary message = identityKeys(identity.first, identity.second);
-    message["Command"] = STWValue(6u);
-    message["UUID"] = STWValue(*STWUUID::fromString(e.uuid()));
+    STWValue::Dictionary message = containerCommand(6, identity, e);
     message["Key"] = STWValue(STWTortureChecker::infoKey);
     STWValue::Dictionary reply;
     uint64_t code = 0;
