@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <climits>
+#include <cmath>
 #include <cstdlib>
 #include <cstring>
 #include <memory>
@@ -21,6 +22,25 @@ struct PlistDeleter {
     void operator()(plist_t p) const { plist_free(p); }
 };
 using PlistPtr = std::unique_ptr<void, PlistDeleter>;
+
+// The seconds since 2001 a date node holds. libplist hands them out only as whole
+// seconds toward zero and the size of the fraction, which loses the sign of a fraction
+// before 2001 (every rewrite would move such a date); its binary form has the number itself.
+double dateSeconds(plist_t node) {
+    char* bytes = nullptr;
+    uint32_t length = 0;
+    plist_to_bin(node, &bytes, &length);
+    double seconds = std::nan("");
+    // "bplist00", then the lone object: the date marker and a big-endian double.
+    if (bytes && length >= 17 && static_cast<uint8_t>(bytes[8]) == 0x33) {
+        uint64_t bits = 0;
+        for (int i = 9; i < 17; ++i)
+            bits = bits << 8 | static_cast<uint8_t>(bytes[i]);
+        std::memcpy(&seconds, &bits, sizeof seconds);
+    }
+    plist_to_bin_free(bytes);
+    return seconds;
+}
 
 plist_t toPlist(const STWValue& value) {
     switch (value.type()) {
@@ -106,18 +126,18 @@ std::optional<STWValue> fromPlist(plist_t node, int depth) {
         return STWValue(p ? STWData(bytes, bytes + length) : STWData());
     }
     case PLIST_DATE: {
-        int32_t sec = 0, usec = 0;
-        plist_get_date_val(node, &sec, &usec);
-        // libplist keeps int32 seconds since 2001: a date beyond that range reaches us as
-        // the overflowed conversion of its seconds and microseconds. It is read as the
-        // earliest date there is, which the writer gives back as it is.
-        if (usec <= -1000000 || usec >= 1000000 || (sec == INT32_MIN && usec < 0))
+        // The writer keeps int32 seconds since 2001 and microseconds, as libplist does: a
+        // date beyond that range (or no number at all) is read as the earliest date there
+        // is, which a write gives back as it is.
+        double since2001 = dateSeconds(node);
+        if (!(since2001 >= double(INT32_MIN) && since2001 < double(INT32_MAX) + 1))
             return STWValue(STWDate{int64_t(INT32_MIN) + kPlistEpochOffset, 0});
-        int64_t total = static_cast<int64_t>(sec) + kPlistEpochOffset;
-        int64_t micro = usec;
-        if (micro < 0) {
-            total -= 1;
-            micro += 1000000;
+        double whole = std::floor(since2001);
+        int64_t total = static_cast<int64_t>(whole) + kPlistEpochOffset;
+        int64_t micro = std::llround((since2001 - whole) * 1e6);
+        if (micro >= 1000000) {
+            total += 1;
+            micro -= 1000000;
         }
         return STWValue(STWDate{total, static_cast<uint32_t>(micro * 1000)});
     }

@@ -8,6 +8,7 @@ user identity, and a few that the reader refuses (a file in another class's dire
 another user's persona, a bad UUID, no dictionary). Run again after changing a seed; the
 files are committed so that the replay test needs no generator.
 """
+import datetime
 import os
 import plistlib
 
@@ -43,11 +44,15 @@ SEEDS = {
     "bad_uuid": (2, {**DATA, "STWMetadataUUID": "not-a-uuid"}),
     "info_not_dictionary": (2, {**DATA, "STWMetadataInfo": "text"}),
     "array": (2, [DATA]),
+    "data_with_dates": (2, {**DATA, "STWMetadataInfo": {"d": [
+        datetime.datetime(1932, 12, 13, 20, 45, 52, 400000), datetime.datetime(2000, 12, 31, 23, 59, 59, 750000),
+        datetime.datetime(2024, 2, 29, 12, 0, 0, 250000)]}}),
 }
 # corpus/non_utf8_info_key and corpus/string_past_offset_table are not written here: the
 # fuzzer found them (an info key with a byte that is not UTF-8, which the reader took and a
 # rewrite of the file changed; a UTF-16 key with a NUL, placed past the offset table, which
-# made libplist abort), and they are kept byte for byte.
+# made libplist abort), and they are kept byte for byte. So is corpus/far_date_in_info: a
+# date past what the writer holds, whose fraction before 2001 every rewrite used to move.
 
 
 def main():

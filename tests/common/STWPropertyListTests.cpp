@@ -51,18 +51,23 @@ TEST(STWPropertyList, EveryTypeRoundTripsThroughBinaryAndXML) {
         EXPECT_EQ(*back, value) << back->description();
     }
     EXPECT_EQ(STWPropertyList::serializeBinary(value).substr(0, 8), "bplist00");
-    // Binary files keep fractions of a second (to the microsecond); UUIDs are written as their string.
+    // Binary files keep fractions of a second (to the microsecond), also before 2001 and
+    // within a second of it; UUIDs are written as their string.
     STWUUID u = STWUUID::random();
-    STWValue precise(STWValue::Dictionary{{"d", STWValue(STWDate{1700000000, 250000000})}, {"u", STWValue(u)}});
+    STWValue::Array dates{STWValue(STWDate{1700000000, 250000000}), STWValue(STWDate{978307200 - 2144, 400000000}),
+                          STWValue(STWDate{978307199, 750000000})};
+    STWValue precise(STWValue::Dictionary{{"d", STWValue(dates)}, {"u", STWValue(u)}});
     EXPECT_EQ(STWPropertyList::parse(STWPropertyList::serializeBinary(precise)),
-              STWValue(STWValue::Dictionary{{"d", STWValue(STWDate{1700000000, 250000000})}, {"u", STWValue(u.string())}}));
-    // A date beyond what libplist holds (-4.8e216 s) is read as one that a write keeps.
-    std::string far =
-        STWPropertyList::serializeBinary(STWValue(STWValue::Dictionary{{"d", STWValue(STWDate{978307200, 0})}}));
-    far.replace(far.find(std::string("\x33\0\0\0\0\0\0\0\0", 9)) + 1, 8, "\xec\xeb\xa0\xef\xd8\x9c\x90\x6d");
-    auto farRead = STWPropertyList::parse(far);
-    ASSERT_TRUE(farRead);
-    EXPECT_EQ(STWPropertyList::parse(STWPropertyList::serializeBinary(*farRead)), farRead);
+              STWValue(STWValue::Dictionary{{"d", STWValue(dates)}, {"u", STWValue(u.string())}}));
+    // A date beyond what libplist holds (-4.8e216 s, +7.4e10 s) is read as one that a write keeps.
+    for (const char* bits : {"\xec\xeb\xa0\xef\xd8\x9c\x90\x6d", "\x42\x31\x41\x39\x35\x34\x32\xd5"}) {
+        std::string far =
+            STWPropertyList::serializeBinary(STWValue(STWValue::Dictionary{{"d", STWValue(STWDate{978307200, 0})}}));
+        far.replace(far.find(std::string("\x33\0\0\0\0\0\0\0\0", 9)) + 1, 8, bits);
+        auto farRead = STWPropertyList::parse(far);
+        ASSERT_TRUE(farRead);
+        EXPECT_EQ(STWPropertyList::parse(STWPropertyList::serializeBinary(*farRead)), farRead);
+    }
 }
 
 TEST(STWPropertyList, CorruptAndTruncatedBytesAreRefused) {
