@@ -4,7 +4,6 @@
 // pins one) and by its signing identifier.
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWFileDescriptor.h"
-#include "common/STWLog.h"
 #include "fuzz/STWFuzzRoot.h"
 #include "platform/STWClientRegistry.h"
 
@@ -24,11 +23,6 @@ constexpr std::string_view kExecutableContent = "#!/bin/sh\nexit 0\n";
 }
 
 } // namespace
-
-extern "C" int LLVMFuzzerInitialize(int*, char***) {
-    STWLog::setSystemLogLevel(STWLogLevel::Fault);
-    return 0;
-}
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     static const std::filesystem::path directory = STWFuzzRoot() / "etc/stowly/clients.d";

@@ -8,7 +8,10 @@ the replay test needs no generator.
 """
 import hashlib
 import os
-import plistlib
+import sys
+
+sys.path.insert(0, os.path.dirname(os.path.dirname(os.path.abspath(__file__))))
+from seeds import binary, write_corpus, xml  # noqa: E402
 
 # The text of the program the fuzzer matches (kExecutableContent in the fuzzer).
 PROGRAM = b"#!/bin/sh\nexit 0\n"
@@ -31,15 +34,5 @@ SEEDS = {
 }
 
 
-def main():
-    corpus = os.path.join(os.path.dirname(os.path.abspath(__file__)), "corpus")
-    os.makedirs(corpus, exist_ok=True)
-    for name, value in SEEDS.items():
-        with open(os.path.join(corpus, name), "wb") as f:
-            f.write(plistlib.dumps(value, fmt=plistlib.FMT_BINARY))
-    with open(os.path.join(corpus, "entry_xml"), "wb") as f:
-        f.write(plistlib.dumps(ENTRY, fmt=plistlib.FMT_XML))
-
-
 if __name__ == "__main__":
-    main()
+    write_corpus(__file__, {**{name: binary(value) for name, value in SEEDS.items()}, "entry_xml": xml(ENTRY)})

@@ -4,7 +4,6 @@
 // path of the file or holds only values the daemon can use; os-release gives only fields
 // that survive being written out again.
 #include "common/STWDictionaryUtilities.h"
-#include "common/STWLog.h"
 #include "fuzz/STWFuzzRoot.h"
 #include "platform/STWPlatformConfiguration.h"
 
@@ -74,11 +73,6 @@ void checkOSRelease(std::string_view text) {
 }
 
 } // namespace
-
-extern "C" int LLVMFuzzerInitialize(int*, char***) {
-    STWLog::setSystemLogLevel(STWLogLevel::Fault);
-    return 0;
-}
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     if (size == 0)

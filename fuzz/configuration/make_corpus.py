@@ -8,7 +8,10 @@ Run again after changing a seed; the files are committed so that the replay test
 no generator.
 """
 import os
-import plistlib
+import sys
+
+sys.path.insert(0, os.path.dirname(os.path.dirname(os.path.abspath(__file__))))
+from seeds import binary, write_corpus, xml  # noqa: E402
 
 FULL = {
     "InternalImage": True, "MultiUser": False, "PersonasUnsupported": False, "EphemeralStorage": False,
@@ -34,18 +37,8 @@ OS_RELEASES = {
 }
 
 
-def main():
-    corpus = os.path.join(os.path.dirname(os.path.abspath(__file__)), "corpus")
-    os.makedirs(corpus, exist_ok=True)
-    for name, value in PLISTS.items():
-        with open(os.path.join(corpus, name), "wb") as f:
-            f.write(b"\x00" + plistlib.dumps(value, fmt=plistlib.FMT_BINARY))
-    with open(os.path.join(corpus, "full_xml"), "wb") as f:
-        f.write(b"\x00" + plistlib.dumps(FULL, fmt=plistlib.FMT_XML))
-    for name, text in OS_RELEASES.items():
-        with open(os.path.join(corpus, name), "wb") as f:
-            f.write(b"\x01" + text)
-
-
 if __name__ == "__main__":
-    main()
+    seeds = {name: b"\x00" + binary(value) for name, value in PLISTS.items()}
+    seeds["full_xml"] = b"\x00" + xml(FULL)
+    seeds.update({name: b"\x01" + text for name, text in OS_RELEASES.items()})
+    write_corpus(__file__, seeds)

@@ -8,6 +8,10 @@ generator.
 """
 import os
 import struct
+import sys
+
+sys.path.insert(0, os.path.dirname(os.path.dirname(os.path.abspath(__file__))))
+from seeds import write_corpus  # noqa: E402
 
 
 def uint(n):
@@ -114,8 +118,4 @@ SEEDS = {
 }
 
 if __name__ == "__main__":
-    directory = os.path.join(os.path.dirname(os.path.abspath(__file__)), "corpus")
-    os.makedirs(directory, exist_ok=True)
-    for name, data in SEEDS.items():
-        with open(os.path.join(directory, name), "wb") as f:
-            f.write(data)
+    write_corpus(__file__, SEEDS)

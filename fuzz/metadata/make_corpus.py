@@ -10,7 +10,10 @@ files are committed so that the replay test needs no generator.
 """
 import datetime
 import os
-import plistlib
+import sys
+
+sys.path.insert(0, os.path.dirname(os.path.dirname(os.path.abspath(__file__))))
+from seeds import binary, write_corpus, xml  # noqa: E402
 
 IDENTITY = {"posixUID": 501, "posixGID": 501, "type": 0, "version": "2",
             "personaUniqueString": "00000000-0000-0000-0000-000000000501"}
@@ -55,15 +58,7 @@ SEEDS = {
 # date past what the writer holds, whose fraction before 2001 every rewrite used to move.
 
 
-def main():
-    corpus = os.path.join(os.path.dirname(os.path.abspath(__file__)), "corpus")
-    os.makedirs(corpus, exist_ok=True)
-    for name, (container_class, value) in SEEDS.items():
-        with open(os.path.join(corpus, name), "wb") as f:
-            f.write(bytes([container_class - 1]) + plistlib.dumps(value, fmt=plistlib.FMT_BINARY))
-    with open(os.path.join(corpus, "data_xml"), "wb") as f:
-        f.write(bytes([1]) + plistlib.dumps(DATA, fmt=plistlib.FMT_XML))
-
-
 if __name__ == "__main__":
-    main()
+    seeds = {name: bytes([container_class - 1]) + binary(value) for name, (container_class, value) in SEEDS.items()}
+    seeds["data_xml"] = bytes([1]) + xml(DATA)
+    write_corpus(__file__, seeds)

@@ -8,7 +8,6 @@
 #include "Daemon/Model/STWGlobalConfiguration.h"
 #include "Daemon/Model/STWMetadata.h"
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
-#include "common/STWLog.h"
 #include "common/STWPropertyList.h"
 #include "fuzz/STWFuzzRoot.h"
 
@@ -59,11 +58,6 @@ std::shared_ptr<STWMetadata> read(const ClassDirectory& directory, const STWUser
 }
 
 } // namespace
-
-extern "C" int LLVMFuzzerInitialize(int*, char***) {
-    STWLog::setSystemLogLevel(STWLogLevel::Fault);
-    return 0;
-}
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     if (size == 0)

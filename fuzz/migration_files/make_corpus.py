@@ -9,7 +9,10 @@ array of strings, entitlements that are no dictionary). Run again after changing
 the files are committed so that the replay test needs no generator.
 """
 import os
-import plistlib
+import sys
+
+sys.path.insert(0, os.path.dirname(os.path.dirname(os.path.abspath(__file__))))
+from seeds import binary, write_corpus, xml  # noqa: E402
 
 MARKER = {"STWMigrationVersionNumber": "21A100", "STWMigrationTime": "2026-01-01T00:00:00Z"}
 ENTRY = {
@@ -45,11 +48,7 @@ SEEDS = {
     "array_root": (0, ["not", "a", "dictionary"]),
 }
 
-here = os.path.join(os.path.dirname(os.path.abspath(__file__)), "corpus")
-os.makedirs(here, exist_ok=True)
-for name, (marker, value) in SEEDS.items():
-    fmt = plistlib.FMT_XML if name == "entitlements_file" else plistlib.FMT_BINARY
-    with open(os.path.join(here, name), "wb") as f:
-        f.write(bytes([marker]) + plistlib.dumps(value, fmt=fmt))
-with open(os.path.join(here, "not_a_plist"), "wb") as f:
-    f.write(b"\x01bplist00 but not really")
+seeds = {name: bytes([marker]) + (xml(value) if name == "entitlements_file" else binary(value))
+         for name, (marker, value) in SEEDS.items()}
+seeds["not_a_plist"] = b"\x01bplist00 but not really"
+write_corpus(__file__, seeds)

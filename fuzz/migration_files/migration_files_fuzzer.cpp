@@ -14,7 +14,6 @@
 #include "Daemon/Migration/STWMigrationStatus.h"
 #include "common/STWDictionaryUtilities.h"
 #include "common/STWFileIO.h"
-#include "common/STWLog.h"
 #include "common/STWPropertyList.h"
 
 #include <cstdio>
@@ -169,11 +168,6 @@ void entitlementsFile(std::string_view bytes) {
 }
 
 } // namespace
-
-extern "C" int LLVMFuzzerInitialize(int*, char***) {
-    STWLog::setSystemLogLevel(STWLogLevel::Fault);
-    return 0;
-}
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     if (size == 0)

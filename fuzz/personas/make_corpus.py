@@ -7,7 +7,10 @@ that share bundles) and a few that the reader skips entries of or refuses. Run a
 changing a seed; the files are committed so that the replay test needs no generator.
 """
 import os
-import plistlib
+import sys
+
+sys.path.insert(0, os.path.dirname(os.path.dirname(os.path.abspath(__file__))))
+from seeds import binary, write_corpus, xml  # noqa: E402
 
 PERSONAL = {"PersonaUniqueString": "00000000-0000-0000-0000-000000000501", "PersonaID": 501, "Type": "personal"}
 ENTERPRISE = {"PersonaUniqueString": "E1A7C0DE-0000-4000-8000-000000001000", "PersonaID": 1000,
@@ -29,15 +32,7 @@ SEEDS = {
 # which made libplist abort), and they are kept byte for byte.
 
 
-def main():
-    corpus = os.path.join(os.path.dirname(os.path.abspath(__file__)), "corpus")
-    os.makedirs(corpus, exist_ok=True)
-    for name, value in SEEDS.items():
-        with open(os.path.join(corpus, name), "wb") as f:
-            f.write(plistlib.dumps(value, fmt=plistlib.FMT_BINARY))
-    with open(os.path.join(corpus, "enterprise_xml"), "wb") as f:
-        f.write(plistlib.dumps([PERSONAL, ENTERPRISE], fmt=plistlib.FMT_XML))
-
-
 if __name__ == "__main__":
-    main()
+    seeds = {name: binary(value) for name, value in SEEDS.items()}
+    seeds["enterprise_xml"] = xml([PERSONAL, ENTERPRISE])
+    write_corpus(__file__, seeds)

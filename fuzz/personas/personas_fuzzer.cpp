@@ -5,7 +5,6 @@
 // as a user identity with an absolute home.
 #include "Daemon/Model/STWUserIdentityCache.h"
 #include "common/STWDictionaryUtilities.h"
-#include "common/STWLog.h"
 #include "fuzz/STWFuzzRoot.h"
 #include "platform/STWFilePersonaService.h"
 
@@ -41,11 +40,6 @@ bool isBelowRoot(const std::filesystem::path& path) {
 }
 
 } // namespace
-
-extern "C" int LLVMFuzzerInitialize(int*, char***) {
-    STWLog::setSystemLogLevel(STWLogLevel::Fault);
-    return 0;
-}
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     STWFuzzRoot();

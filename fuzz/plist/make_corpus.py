@@ -8,7 +8,10 @@ files are committed so that the replay test needs no generator.
 """
 import datetime
 import os
-import plistlib
+import sys
+
+sys.path.insert(0, os.path.dirname(os.path.dirname(os.path.abspath(__file__))))
+from seeds import binary, write_corpus  # noqa: E402
 
 IDENTITY = {"posixUID": 501, "posixGID": 501, "type": 0, "version": "2"}
 SEEDS = {
@@ -40,13 +43,5 @@ SEEDS = {
 }
 
 
-def main():
-    corpus = os.path.join(os.path.dirname(os.path.abspath(__file__)), "corpus")
-    os.makedirs(corpus, exist_ok=True)
-    for name, value in SEEDS.items():
-        with open(os.path.join(corpus, name), "wb") as f:
-            f.write(plistlib.dumps(value, fmt=plistlib.FMT_BINARY, sort_keys=True))
-
-
 if __name__ == "__main__":
-    main()
+    write_corpus(__file__, {name: binary(value, sort_keys=True) for name, value in SEEDS.items()})

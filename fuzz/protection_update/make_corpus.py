@@ -7,7 +7,10 @@ its checks refuse. Run again after changing a seed; the files are committed so t
 replay test needs no generator.
 """
 import os
-import plistlib
+import sys
+
+sys.path.insert(0, os.path.dirname(os.path.dirname(os.path.abspath(__file__))))
+from seeds import binary, write_corpus  # noqa: E402
 
 CHANGE = {
     "STWDataOperationIdentifier": "com.example.app",
@@ -30,8 +33,4 @@ SEEDS = {
 # corpus/nul_in_key is not written here: the fuzzer found it (a key with a NUL in it that
 # took the reader down inside libplist), and it is kept byte for byte.
 
-here = os.path.join(os.path.dirname(os.path.abspath(__file__)), "corpus")
-os.makedirs(here, exist_ok=True)
-for name, value in SEEDS.items():
-    with open(os.path.join(here, name), "wb") as f:
-        f.write(plistlib.dumps(value, fmt=plistlib.FMT_BINARY))
+write_corpus(__file__, {name: binary(value) for name, value in SEEDS.items()})

@@ -5,16 +5,10 @@
 #include "Daemon/DataProtection/STWDataProtectionChangeOperation.h"
 #include "Daemon/Model/STWUserIdentity.h"
 #include "Daemon/Model/STWUserIdentitySharedCache.h"
-#include "common/STWLog.h"
 #include "fuzz/STWFuzzRoot.h"
 
 #include <cstdio>
 #include <cstdlib>
-
-extern "C" int LLVMFuzzerInitialize(int*, char***) {
-    STWLog::setSystemLogLevel(STWLogLevel::Fault);
-    return 0;
-}
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     std::filesystem::path file = STWFuzzRoot() / "update.plist";

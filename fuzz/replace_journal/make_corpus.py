@@ -7,7 +7,10 @@ component, a missing key, a path that is not text, no dictionary. Run again afte
 a seed; the files are committed so that the replay test needs no generator.
 """
 import os
-import plistlib
+import sys
+
+sys.path.insert(0, os.path.dirname(os.path.dirname(os.path.abspath(__file__))))
+from seeds import binary, write_corpus, xml  # noqa: E402
 
 HOME = "/private/var/mobile/Containers"
 JOURNAL = {
@@ -30,15 +33,5 @@ SEEDS = {
 # for byte.
 
 
-def main():
-    corpus = os.path.join(os.path.dirname(os.path.abspath(__file__)), "corpus")
-    os.makedirs(corpus, exist_ok=True)
-    for name, value in SEEDS.items():
-        with open(os.path.join(corpus, name), "wb") as f:
-            f.write(plistlib.dumps(value, fmt=plistlib.FMT_BINARY))
-    with open(os.path.join(corpus, "replace_xml"), "wb") as f:
-        f.write(plistlib.dumps(JOURNAL, fmt=plistlib.FMT_XML))
-
-
 if __name__ == "__main__":
-    main()
+    write_corpus(__file__, {**{name: binary(value) for name, value in SEEDS.items()}, "replace_xml": xml(JOURNAL)})

@@ -4,7 +4,6 @@
 // writes it into a journal of its own.
 #include "Daemon/Request/STWClientConnection.h"
 #include "common/STWDictionaryUtilities.h"
-#include "common/STWLog.h"
 #include "fuzz/STWFuzzRoot.h"
 
 #include <cstdio>
@@ -19,11 +18,6 @@ bool isTrustedPath(const std::filesystem::path& path) {
 }
 
 } // namespace
-
-extern "C" int LLVMFuzzerInitialize(int*, char***) {
-    STWLog::setSystemLogLevel(STWLogLevel::Fault);
-    return 0;
-}
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     std::filesystem::path file = STWFuzzRoot() / "journal.plist";

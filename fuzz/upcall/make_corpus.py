@@ -7,6 +7,10 @@ changing a seed; the files are committed so that the replay test needs no genera
 """
 import os
 import struct
+import sys
+
+sys.path.insert(0, os.path.dirname(os.path.dirname(os.path.abspath(__file__))))
+from seeds import write_corpus  # noqa: E402
 
 UINT32, STRING = 1, 2
 BASE = 322514900
@@ -61,8 +65,4 @@ SEEDS = {
 }
 
 if __name__ == "__main__":
-    directory = os.path.join(os.path.dirname(os.path.abspath(__file__)), "corpus")
-    os.makedirs(directory, exist_ok=True)
-    for name, data in SEEDS.items():
-        with open(os.path.join(directory, name), "wb") as f:
-            f.write(data)
+    write_corpus(__file__, SEEDS)

@@ -4,7 +4,6 @@
 // identifiers) instead of making containers, so that every reply can be checked against
 // what the request asked for.
 #include "client/STWUpcallClient.h"
-#include "common/STWLog.h"
 #include "upcall/STWKernProcessContainers.h"
 #include "upcall/STWKernServer.h"
 #include "upcall/STWKernTransport.h"
@@ -54,11 +53,6 @@ STWKernReturn server_get_process_containers(const void* request, uint32_t reques
     for (const std::string& group : lastRequest.systemGroupIdentifiers)
         containers.systemGroups.emplace_back(group, pathFor("/systemgroup/", group));
     return containers.copyOut(reply, replySize, deallocate);
-}
-
-extern "C" int LLVMFuzzerInitialize(int*, char***) {
-    STWLog::setSystemLogLevel(STWLogLevel::Fault);
-    return 0;
 }
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
