@@ -92,9 +92,9 @@ int syslogPriority(STWLogLevel level) {
 }
 
 void writeSystemLog(STWLogLevel level, STWLogCategory category, const STWLogSite& site,
-                    std::string_view message, const STWError* error) {
+                    std::string_view message, const STWError* error, std::span<const std::string> more = {}) {
     if (useJournal()) {
-        std::vector<std::string> fields = STWLog::journalFields(level, category, site, message, error);
+        std::vector<std::string> fields = STWLog::journalFields(level, category, site, message, error, more);
         std::vector<iovec> vector;
         vector.reserve(fields.size());
         for (std::string& field : fields)
@@ -223,9 +223,9 @@ bool STWLog::isEnabled(STWLogLevel level) {
 
 std::vector<std::string> STWLog::journalFields(STWLogLevel level, STWLogCategory category,
                                                const STWLogSite& site, std::string_view message,
-                                               const STWError* error) {
+                                               const STWError* error, std::span<const std::string> more) {
     std::vector<std::string> fields;
-    fields.reserve(10);
+    fields.reserve(10 + more.size());
     fields.push_back("MESSAGE=" + std::string(site.function) + ": " + std::string(message));
     fields.push_back("PRIORITY=" + std::to_string(syslogPriority(level)));
     fields.push_back("SYSLOG_IDENTIFIER=stowlyd");
@@ -244,21 +244,22 @@ std::vector<std::string> STWLog::journalFields(STWLogLevel level, STWLogCategory
             fields.push_back("STOWLY_ERROR_DOMAIN=" + std::string(error->domain()));
             fields.push_back("STOWLY_ERROR_CODE=" + std::to_string(error->code()));
         }
-        return fields;
+    } else {
+        fields.push_back("CODE_FUNC=" + std::string(site.function));
+        if (!site.file.empty())
+            fields.push_back("CODE_FILE=" + std::string(sourcePath(site.file)));
+        if (site.line)
+            fields.push_back("CODE_LINE=" + std::to_string(site.line));
     }
-    fields.push_back("CODE_FUNC=" + std::string(site.function));
-    if (!site.file.empty())
-        fields.push_back("CODE_FILE=" + std::string(sourcePath(site.file)));
-    if (site.line)
-        fields.push_back("CODE_LINE=" + std::to_string(site.line));
+    fields.insert(fields.end(), more.begin(), more.end());
     return fields;
 }
 
 void STWLog::write(STWLogLevel level, STWLogCategory category, const STWLogSite& site,
-                   std::string_view message, const STWError* error) {
+                   std::string_view message, const STWError* error, std::span<const std::string> fields) {
     int l = static_cast<int>(level);
     if (l <= systemLevel.load(std::memory_order_relaxed))
-        writeSystemLog(level, category, site, message, error);
+        writeSystemLog(level, category, site, message, error, fields);
     if (l <= fileLevel.load(std::memory_order_relaxed)) {
         if (auto logger = std::atomic_load(&fileLog().logger)) {
             logger->log(level <= STWLogLevel::Error ? spdlog::level::err : spdlog::level::info,

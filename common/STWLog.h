@@ -9,13 +9,17 @@
 // fields, so `journalctl STOWLY_CATEGORY=cache` or `CODE_FUNC=...` finds it. When one of
 // the formatted arguments is an error object, the entry is filed under that error instead:
 // its code (STOWLY_RESULT_CODE for a daemon code, ERRNO for a system call's) and the
-// function and line where the error was made, which is where the failure happened.
+// function and line where the error was made, which is where the failure happened. A call
+// may add fields of its own: the line that ends each request carries STOWLY_COMMAND and
+// the code of its reply as STOWLY_RESULT_CODE, so `journalctl STOWLY_RESULT_CODE=21` finds
+// every request that answered 21.
 #pragma once
 
 #include "common/STWFormat.h"
 
 #include <cstdint>
 #include <filesystem>
+#include <span>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -75,16 +79,18 @@ public:
 
     // True when some destination takes this level; callers skip formatting otherwise.
     static bool isEnabled(STWLogLevel level);
-    // `error`, when given, is the error the line reports (see the top of this file).
+    // `error`, when given, is the error the line reports (see the top of this file);
+    // `fields` are further fields of its journal entry, each "NAME=value".
     static void write(STWLogLevel level, STWLogCategory category, const STWLogSite& site,
-                      std::string_view message, const STWError* error = nullptr);
+                      std::string_view message, const STWError* error = nullptr,
+                      std::span<const std::string> fields = {});
     // Formats the message and writes it under the first error among `args`.
     static void writev(STWLogLevel level, STWLogCategory category, const STWLogSite& site,
                        std::string_view format, std::initializer_list<STWFormatArg> args);
     // The fields of the journal entry write() sends, each "NAME=value".
     static std::vector<std::string> journalFields(STWLogLevel level, STWLogCategory category,
                                                   const STWLogSite& site, std::string_view message,
-                                                  const STWError* error);
+                                                  const STWError* error, std::span<const std::string> fields = {});
     static void flush();
 
     // Logs a fault, flushes, prints the message to standard error and aborts: for broken

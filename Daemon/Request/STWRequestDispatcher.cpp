@@ -120,8 +120,12 @@ bool STWRequestDispatcher::dispatch(const STWValue::Dictionary& request, const S
     std::string clientName = client ? *client : "<unknown>";
     STW_LOG_FN(function, STWLogLevel::Debug, STWLogCategory::Tolvan,
                "end TolvanEventProcessing command=%llu clientIdentifier=%@", command, clientName);
-    STW_LOG_FN(function, STWLogLevel::Default, STWLogCategory::Tolvan, "command=%llu, client=%@, error=%llu", command,
-               clientName, *error);
+    if (STWLog::isEnabled(STWLogLevel::Default)) {
+        const std::string fields[] = {"STOWLY_COMMAND=" + std::to_string(command),
+                                      "STOWLY_RESULT_CODE=" + std::to_string(*error)};
+        STWLog::write(STWLogLevel::Default, STWLogCategory::Tolvan, {function, __FILE__, __LINE__},
+                      STWFormat("command=%llu, client=%@, error=%llu", command, clientName, *error), nullptr, fields);
+    }
     // A command that answers from its completion and did not fail up front leaves the
     // reply to that completion.
     return !(*error == STWErrorSuccess && !sendReply);

@@ -91,6 +91,13 @@ TEST(STWLogJournal, EntriesCarryTheirSiteAndTheCodeOfTheirError) {
     EXPECT_EQ(tail,
               (Fields{"CODE_FUNC=TestBody", "CODE_LINE=" + std::to_string(line), "STOWLY_RESULT_CODE=21"}));
     EXPECT_EQ(fields.size(), 8u); // no CODE_FILE of the caller beside the error's line
+    // A call's own fields follow, with an error or without one.
+    const std::string more[] = {"STOWLY_COMMAND=4"};
+    EXPECT_EQ(STWLog::journalFields(STWLogLevel::Notice, STWLogCategory::Tolvan, {"caller", "y.cpp", 40}, "failed",
+                                    notFound.get(), more),
+              [&] { Fields all = fields; all.push_back(more[0]); return all; }());
+    EXPECT_EQ(STWLog::journalFields(STWLogLevel::Debug, STWLogCategory::Test, {"f", "", 0}, "m", nullptr, more).back(),
+              more[0]);
     EXPECT_EQ(
         STWLog::journalFields(STWLogLevel::Error, STWLogCategory::FS, {"f", "", 0}, "m", posix.get()).back(),
         "ERRNO=2");
