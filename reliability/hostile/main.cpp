@@ -21,9 +21,9 @@
 //     within 10 s: Y ms, command 21 for com.hostile.app (class 2)
 //     within 60 s: Z ms, command 4
 //
-// (the slowest under each bound and what it was)
-// and exits 1 unless E, C and H are 0. SIGINT and SIGTERM end the run after the current
-// request; the root, the canary and the app processes go either way.
+// (the slowest request or cleanup under each bound, and what it was) and exits 1 unless
+// E, C and H are 0. SIGINT and SIGTERM end the run after the current request; the root,
+// the canary and the app processes go either way.
 //
 //   stowly_hostile [--rounds N] [--seed S] [--depth D] [--verbose]
 #include "Daemon/FileSystem/STWFileManager.h"
