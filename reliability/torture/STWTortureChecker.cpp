@@ -105,7 +105,12 @@ std::string STWTortureExpectation::description() const {
     return s.str();
 }
 
-std::string STWTortureChecker::classDirectory(uint64_t containerClass) {
+bool STWTortureChecker::isPerUser(uint64_t containerClass) {
+    return containerClass >= 1 && containerClass <= 11 && containerClass != 1 && containerClass != 3 &&
+           containerClass != 5 && containerClass != 8;
+}
+
+std::string STWTortureChecker::classDirectory(uint64_t containerClass, const std::string& home) {
     static const char* const names[] = {nullptr,             "Bundle/Application", "Data/Application",
                                         "Bundle/QuilletPlugin", "Data/QuilletPlugin", "Bundle/VPNPlugin",
                                         "Data/VPNPlugin",      "Shared/AppGroup",    "Bundle/Framework",
@@ -113,9 +118,7 @@ std::string STWTortureChecker::classDirectory(uint64_t containerClass) {
                                         "Data/System",         "Shared/SystemGroup"};
     if (containerClass < 1 || containerClass > 13)
         return {};
-    bool global = containerClass == 1 || containerClass == 3 || containerClass == 5 || containerClass == 8 ||
-                  containerClass >= 12;
-    return std::string(global ? "private/var/containers/" : "private/var/mobile/Containers/") +
+    return (isPerUser(containerClass) ? home + "/Containers/" : std::string("private/var/containers/")) +
            names[containerClass];
 }
 
@@ -176,6 +179,9 @@ STWTortureChecker::_readContainer(uint64_t containerClass, const std::string& di
     c.containerClass = containerClass;
     c.identifier = *identifier;
     c.uuid = *uuid;
+    plist_t user = plist_dict_get_item(raw, "STWMetadataUserIdentity");
+    if (user && plist_get_node_type(user) == PLIST_DICT)
+        c.persona = stringOf(user, "personaUniqueString").value_or("");
     plist_t info = plist_dict_get_item(raw, "STWMetadataInfo");
     if (info && plist_get_node_type(info) == PLIST_DICT) {
         c.info = integerOf(info, infoKey).value_or(-1);
@@ -188,29 +194,51 @@ STWTortureChecker::_readContainer(uint64_t containerClass, const std::string& di
     return c;
 }
 
+bool STWTortureChecker::_isEnterprise(const std::string& persona) const {
+    for (const auto& [home, unique] : enterpriseHomes)
+        if (unique == persona)
+            return true;
+    return false;
+}
+
+void STWTortureChecker::_scanDirectory(uint64_t containerClass, const std::string& home, const std::string& persona,
+                                       std::vector<std::string>& violations) {
+    std::string directory = _path(classDirectory(containerClass, home));
+    auto names = namesIn(directory);
+    if (!names) {
+        // An enterprise home's class directories are made with its first container.
+        if (errno != ENOENT || home == mobileHome)
+            violations.push_back("cannot list " + directory + ": " + strerror(errno));
+        return;
+    }
+    for (const auto& name : *names) {
+        std::string problem;
+        auto container = _readContainer(containerClass, directory, name, &problem);
+        if (!container) {
+            violations.push_back("incomplete container " + directory + "/" + name + ": " + problem);
+            continue;
+        }
+        STWTortureIdentity identity{containerClass, container->identifier};
+        if (isPerUser(containerClass) && (persona.empty() ? _isEnterprise(container->persona)
+                                                          : container->persona != persona))
+            violations.push_back(identityText(identity) + " at " + container->path + " records persona \"" +
+                                 container->persona + "\", in the home of " +
+                                 (persona.empty() ? std::string("the personal persona") : "persona \"" + persona + "\""));
+        auto [it, inserted] = _found.emplace(identity, *container);
+        if (!inserted)
+            violations.push_back("two containers for " + identityText(identity) + ": " + it->second.path + " and " +
+                                 container->path);
+    }
+}
+
 std::vector<std::string> STWTortureChecker::_scan() {
     std::vector<std::string> violations;
     _found.clear();
     for (uint64_t containerClass = 1; containerClass <= 13; ++containerClass) {
-        std::string directory = _path(classDirectory(containerClass));
-        auto names = namesIn(directory);
-        if (!names) {
-            violations.push_back("cannot list " + directory + ": " + strerror(errno));
-            continue;
-        }
-        for (const auto& name : *names) {
-            std::string problem;
-            auto container = _readContainer(containerClass, directory, name, &problem);
-            if (!container) {
-                violations.push_back("incomplete container " + directory + "/" + name + ": " + problem);
-                continue;
-            }
-            STWTortureIdentity identity{containerClass, container->identifier};
-            auto [it, inserted] = _found.emplace(identity, *container);
-            if (!inserted)
-                violations.push_back("two containers for " + identityText(identity) + ": " + it->second.path +
-                                     " and " + container->path);
-        }
+        _scanDirectory(containerClass, mobileHome, "", violations);
+        if (isPerUser(containerClass))
+            for (const auto& [home, persona] : enterpriseHomes)
+                _scanDirectory(containerClass, home, persona, violations);
     }
     return violations;
 }
@@ -225,9 +253,14 @@ std::vector<std::string> STWTortureChecker::_leftovers(std::chrono::milliseconds
     };
     mustBeEmpty("private/var/root/Library/Stowly/Replace", "replace journal");
     mustBeEmpty("private/var/root/Library/Stowly/PendingUpdates", "protection update file");
-    mustBeEmpty("private/var/mobile/Library/Stowly/Replace", "replace journal");
-    mustBeEmpty("private/var/mobile/Library/Stowly/PendingUpdates", "protection update file");
-    mustBeEmpty("private/var/mobile/Containers/Staging", "staging leftover");
+    std::vector<std::string> homes{mobileHome};
+    for (const auto& [home, persona] : enterpriseHomes)
+        homes.push_back(home);
+    for (const auto& home : homes) {
+        mustBeEmpty(home + "/Library/Stowly/Replace", "replace journal");
+        mustBeEmpty(home + "/Library/Stowly/PendingUpdates", "protection update file");
+        mustBeEmpty(home + "/Containers/Staging", "staging leftover");
+    }
     mustBeEmpty("private/var/root/Library/Caches/com.vorlane.stowlyd/Staging", "staging leftover");
     // The death-row pass runs on its own queue after the cleanups are reported: wait a little.
     std::string deathRow = "private/var/root/Library/Caches/com.vorlane.stowlyd/Dead";
@@ -284,6 +317,9 @@ std::vector<std::string> STWTortureChecker::check(const std::vector<STWTortureMo
                 problem = "has info value " + std::to_string(c->info);
             else if (c && !expected.protection.empty() && !expected.protection.count(c->protection))
                 problem = "has protection class " + std::to_string(c->protection);
+            else if (c && isPerUser(identity.first) &&
+                     (model->persona.empty() ? _isEnterprise(c->persona) : c->persona != model->persona))
+                problem = "belongs to persona \"" + c->persona + "\"";
             if (!problem.empty())
                 violations.push_back(identityText(identity) + " " + problem + "; expected " +
                                      expected.description());

@@ -28,6 +28,9 @@ public:
     // place; the deletion logs that and still answers success. The paths the daemon's log
     // names so: only these may stay after a deletion that answered success.
     std::set<std::string> undeletable;
+    // The homes of enterprise personas (relative to the root) and the unique string of each:
+    // their per-user class directories are scanned beside the mobile user's.
+    std::map<std::string, std::string> enterpriseHomes;
 
     // A container as its class directory and metadata file show it.
     struct Container {
@@ -38,6 +41,7 @@ public:
         int64_t info = -1;       // the torture's info value, -1 when none
         int64_t protection = -1; // the recorded protection class, -1 when none
         int64_t documentsClass = -1; // the protection class of its Documents, -1 when none
+        std::string persona;         // the persona unique string its metadata records, if any
     };
 
     explicit STWTortureChecker(std::filesystem::path root) : _root(std::move(root)) {}
@@ -57,8 +61,11 @@ public:
     // What the last check() found, by identity (the first of duplicates).
     const std::map<STWTortureIdentity, Container>& found() const { return _found; }
 
-    // Where the class directory of `containerClass` lies below the root ("" for none).
-    static std::string classDirectory(uint64_t containerClass);
+    // Where the class directory of `containerClass` lies below the root ("" for none); a
+    // per-user class's lies in `home`.
+    static std::string classDirectory(uint64_t containerClass, const std::string& home = mobileHome);
+    static bool isPerUser(uint64_t containerClass);
+    static constexpr const char* mobileHome = "private/var/mobile";
     // The sandbox item type of a class (0 when it is never mapped).
     static uint64_t sandboxItemType(uint64_t containerClass);
 
@@ -66,6 +73,11 @@ public:
 
 private:
     std::vector<std::string> _scan();
+    // Scans one class directory; the containers of a per-user class must record `persona`
+    // (for the mobile home: no enterprise persona).
+    void _scanDirectory(uint64_t containerClass, const std::string& home, const std::string& persona,
+                        std::vector<std::string>& violations);
+    bool _isEnterprise(const std::string& persona) const;
     std::optional<Container> _readContainer(uint64_t containerClass, const std::string& directory,
                                             const std::string& name, std::string* problem) const;
     std::vector<std::string> _leftovers(std::chrono::milliseconds deathRowWait) const;

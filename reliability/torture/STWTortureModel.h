@@ -13,8 +13,9 @@
 #include <string>
 #include <utility>
 
-// A container identity as the disk shows it: class and identifier (every per-user
-// container here belongs to the mobile user, global ones to nobody).
+// A container identity as the disk shows it: class and identifier. Every per-user container
+// here belongs to the mobile user, in the persona of the thread that owns its identifier
+// (STWTortureModel::persona); global ones belong to nobody.
 using STWTortureIdentity = std::pair<uint64_t, std::string>;
 
 struct STWTortureExpectation {
@@ -58,6 +59,9 @@ struct STWTortureExpectation {
 // its owners' stored code-signing entries names.
 struct STWTortureModel {
     std::map<STWTortureIdentity, STWTortureExpectation> containers;
+    // The enterprise persona (its unique string) the thread's applications are assigned to,
+    // whose home holds their per-user containers; empty: the personal persona's.
+    std::string persona;
     struct Owner {
         std::set<std::string> groups;   // as the last acknowledged update stored them
         std::set<std::string> possible; // with an unacknowledged update: old and new together

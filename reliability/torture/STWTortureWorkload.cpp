@@ -11,7 +11,7 @@
 namespace {
 
 constexpr std::chrono::seconds requestTimeout{3};
-constexpr unsigned appCount = 4, systemCount = 2, groupCount = 3;
+constexpr unsigned appCount = STWTortureWorker::applicationCount, systemCount = 2, groupCount = 3;
 constexpr uint64_t notFound = 21, infoValueNotFound = 24;
 const char* const applicationGroupsKey = "com.vorlane.security.application-groups";
 
@@ -23,16 +23,17 @@ STWValue::Dictionary identityKeys(uint64_t containerClass, const std::string& id
     return {{"Identifier", STWValue(identifier)}, {"ContainerClass", STWValue(containerClass)}};
 }
 
-// A command about one container the record knows, named by its identity and UUID.
-STWValue::Dictionary containerCommand(unsigned command, const STWTortureIdentity& identity,
-                                      const STWTortureExpectation& e) {
+} // namespace
+
+STWValue::Dictionary STWTortureWorker::_containerCommand(unsigned command, const STWTortureIdentity& identity,
+                                                         const STWTortureExpectation& e) const {
     STWValue::Dictionary message = identityKeys(identity.first, identity.second);
     message["Command"] = STWValue(command);
     message["UUID"] = STWValue(*STWUUID::fromString(e.uuid()));
+    if (!model.persona.empty() && STWTortureChecker::isPerUser(identity.first))
+        message["PersonaUniqueString"] = STWValue(model.persona);
     return message;
 }
-
-} // namespace
 
 STWTortureWorker::STWTortureWorker(unsigned index, uint64_t seed, std::string root)
     : _index(index), _root(std::move(root)), _random(seed * 7919 + index) {
@@ -40,9 +41,10 @@ STWTortureWorker::STWTortureWorker(unsigned index, uint64_t seed, std::string ro
         model.owners[_app(k)];
 }
 
-std::string STWTortureWorker::_app(unsigned k) const {
-    return "com.torture.t" + std::to_string(_index) + ".app" + std::to_string(k);
+std::string STWTortureWorker::application(unsigned index, unsigned k) {
+    return "com.torture.t" + std::to_string(index) + ".app" + std::to_string(k);
 }
+std::string STWTortureWorker::_app(unsigned k) const { return application(_index, k); }
 std::string STWTortureWorker::_system(unsigned k) const {
     return "com.torture.t" + std::to_string(_index) + ".system" + std::to_string(k);
 }
@@ -194,6 +196,11 @@ void STWTortureWorker::_create(STWClient& client, uint64_t containerClass, const
             _violation(std::string(kind) + " of " + identityText(identity) + " answered without path or UUID");
             break;
         }
+        const std::string* persona = STWDictionaryString(reply, "ReplyPersonaUniqueString");
+        if (!model.persona.empty() && STWTortureChecker::isPerUser(containerClass) &&
+            (!persona || *persona != model.persona))
+            _violation(std::string(kind) + " of " + identityText(identity) + " answered persona " +
+                       (persona ? *persona : std::string("none")) + ", not " + model.persona);
         _observePresent(kind, identity, *path, uuid->uuid()->string(),
                         create ? STWDictionaryBool(reply, "ReplyExisted") : std::optional<bool>(true));
         break;
@@ -312,6 +319,10 @@ void STWTortureWorker::_replace(STWClient& client, uint64_t containerClass, cons
                                  {"NewIdentifier", STWValue(identifier)},
                                  {"NewContainerClass", STWValue(containerClass)},
                                  {"NewContainerUUID", *newUUID}};
+    if (!model.persona.empty() && STWTortureChecker::isPerUser(containerClass)) {
+        replace["OldPersonaUniqueString"] = STWValue(model.persona);
+        replace["NewPersonaUniqueString"] = STWValue(model.persona);
+    }
     STWValue::Dictionary reply;
     auto& e = model.containers.at(identity);
     switch (_send("replace", client, replace, &reply, &code)) {
@@ -339,7 +350,7 @@ void STWTortureWorker::_regenerate(STWClient& client, const STWTortureIdentity& 
     if (!_learn(client, identity))
         return;
     auto& e = model.containers.at(identity);
-    STWValue::Dictionary message = containerCommand(9, identity, e);
+    STWValue::Dictionary message = _containerCommand(9, identity, e);
     STWValue::Dictionary reply;
     uint64_t code = 0;
     Outcome outcome = _send("regenerate-uuid", client, message, &reply, &code);
@@ -358,7 +369,7 @@ void STWTortureWorker::_setInfo(STWClient& client, const STWTortureIdentity& ide
         return;
     auto& e = model.containers.at(identity);
     int64_t value = _nextInfoValue++;
-    STWValue::Dictionary message = containerCommand(5, identity, e);
+    STWValue::Dictionary message = _containerCommand(5, identity, e);
     message["Key"] = STWValue(STWTortureChecker::infoKey);
     message["Value"] = STWValue(value);
     STWValue::Dictionary reply;
@@ -381,7 +392,7 @@ void STWTortureWorker::_getInfo(STWClient& client, const STWTortureIdentity& ide
     if (!_learn(client, identity))
         return;
     auto& e = model.containers.at(identity);
-    STWValue::Dictionary message = containerCommand(6, identity, e);
+    STWValue::Dictionary message = _containerCommand(6, identity, e);
     message["Key"] = STWValue(STWTortureChecker::infoKey);
     STWValue::Dictionary reply;
     uint64_t code = 0;
@@ -525,7 +536,7 @@ void STWTortureWorker::_upcall(STWUpcallClient& upcalls, const std::string& app)
     request.codeSignatureIdentifier = app;
     request.uid = 501;
     request.containerType = 0;
-    request.personaID = 0xFFFFFFFFu;
+    request.personaID = _personaID;
     if (!entry.uncertain)
         request.appGroupIdentifiers.assign(entry.groups.begin(), entry.groups.end());
     std::string system = _system(_random() % systemCount);

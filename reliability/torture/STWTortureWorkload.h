@@ -23,6 +23,10 @@ class STWTortureWorker {
 public:
     STWTortureWorker(unsigned index, uint64_t seed, std::string root);
 
+    // The applications thread `index` installs, creates containers of and deletes.
+    static constexpr unsigned applicationCount = 4;
+    static std::string application(unsigned index, unsigned k);
+
     // Without kills (Faults, Steady) the device stays unlocked, so nothing waits for an
     // unlock, and every request must be answered within replyTimeout: a missing reply is a
     // violation. Under injected faults (Faults) any request may fail: a reply with an error
@@ -30,6 +34,13 @@ public:
     // code must be one the daemon defines.
     enum class Mode { Kills, Faults, Steady };
     void setMode(Mode mode) { _mode = mode; }
+    // Assigns the thread's applications to an enterprise persona (its unique string and
+    // kernel persona id): their per-user containers live in its home, commands that name a
+    // container by UUID name the persona, and the upcall asks for that persona.
+    void setPersona(std::string persona, uint32_t personaID) {
+        model.persona = std::move(persona);
+        _personaID = personaID;
+    }
     static constexpr std::chrono::seconds replyTimeout{30};
 
     // Sends requests until `stop` is set or the connection dies. `focus` (a crash point's
@@ -86,6 +97,9 @@ private:
     void _measure(const char* kind, std::chrono::steady_clock::time_point began, bool answered);
     void _note(const STWTortureIdentity& identity, const std::string& what);
 
+    // A command about one container the record knows, named by its identity, UUID and persona.
+    STWValue::Dictionary _containerCommand(unsigned command, const STWTortureIdentity& identity,
+                                           const STWTortureExpectation& e) const;
     std::string _app(unsigned k) const;
     std::string _system(unsigned k) const;
     std::string _systemGroup(unsigned k) const;
@@ -101,4 +115,5 @@ private:
     bool _locked = false;
     Mode _mode = Mode::Kills;
     int64_t _nextInfoValue = 1;
+    uint32_t _personaID = 0xFFFFFFFFu; // none: the kernel names no persona
 };

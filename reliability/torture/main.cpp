@@ -11,6 +11,10 @@
 // checker looks at what the faults left. Prints "fault rounds: N, faults fired: F,
 // violations: M".
 //
+// Every fourth thread (1, 5, ...) has its applications assigned to an enterprise persona
+// with a home of its own: their data and group containers live there, and the checker
+// scans that home too and checks which persona each per-user container records.
+//
 // With --soak SECONDS it neither kills nor faults: 64 client threads (--threads) drive one
 // daemon for that long; it reports the requests, the errors (replies the workload does not
 // expect, and missing replies), the latency and the daemon's resident memory and open
@@ -25,8 +29,10 @@
 #include "common/STWFileIO.h"
 #include "common/STWLog.h"
 #include "platform/STWCrashPoint.h"
+#include "platform/STWFilePersonaService.h"
 #include "platform/STWPlatformConfiguration.h"
 #include "tests/support/STWDaemonProcess.h"
+#include "tests/support/STWTestRoot.h"
 #include "reliability/torture/STWTortureChecker.h"
 #include "reliability/torture/STWTortureWorkload.h"
 
@@ -54,6 +60,30 @@ using std::chrono::milliseconds;
 std::atomic<bool> interrupted{false};
 
 const STWValue::Dictionary installerEntitlements{{"com.vorlane.private.Stowly.allowed", STWValue(true)}};
+
+// The enterprise persona of every fourth thread, and where its home lies below the root.
+constexpr const char* enterprisePersona = "TORTURE-ENTERPRISE";
+constexpr uint32_t enterprisePersonaID = 1001;
+constexpr const char* enterpriseHome = "private/var/enterprise/torture";
+bool isEnterpriseThread(unsigned index) { return index % 4 == 1; }
+
+// The personal persona of the mobile user (as the daemon assumes without a list) and the
+// enterprise persona, to which the enterprise threads' applications are assigned.
+STWValue::Array personas(unsigned threads) {
+    STWValue::Array applications;
+    for (unsigned t = 0; t < threads; ++t)
+        for (unsigned k = 0; isEnterpriseThread(t) && k < STWTortureWorker::applicationCount; ++k)
+            applications.emplace_back(STWTortureWorker::application(t, k));
+    STWValue::Dictionary enterprise =
+        *STWTestRoot::persona(enterprisePersona, enterprisePersonaID, "enterprise", std::move(applications),
+                              (std::string("/") + enterpriseHome).c_str())
+             .dictionary();
+    // The kernel's type number of such a persona, by which the upcall serves its processes
+    // from the persona's home.
+    enterprise["KernelType"] = STWValue(2u);
+    return {STWTestRoot::persona(STWFilePersonaService::defaultPersonalUniqueString, 501, "personal"),
+            STWValue(enterprise)};
+}
 
 struct Options {
     unsigned kills = 1000;
@@ -105,12 +135,16 @@ class Torture {
 public:
     explicit Torture(const Options& options)
         : _options(options), _random(options.seed),
-          _daemon({{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}}, {}, false),
+          _daemon({{"DeveloperMode", STWValue(true)}, {"InternalImage", STWValue(true)}}, personas(options.threads),
+                  false),
           _checker(_daemon.root()) {
         _daemon.setStandardErrorFile(_daemon.root() / "stowlyd.stderr");
         _checker.recordedProtectionMayLag = options.faultRounds > 0;
+        _checker.enterpriseHomes[enterpriseHome] = enterprisePersona;
         for (unsigned t = 0; t < options.threads; ++t) {
             _workers.push_back(std::make_unique<STWTortureWorker>(t, options.seed, _daemon.root().string()));
+            if (isEnterpriseThread(t))
+                _workers.back()->setPersona(enterprisePersona, enterprisePersonaID);
             if (options.faultRounds)
                 _workers.back()->setMode(STWTortureWorker::Mode::Faults);
             else if (options.soakSeconds)
@@ -154,6 +188,7 @@ private:
     } _warm, _end;
     Usage _usage() const;
     unsigned _kills = 0, _pointKills = 0, _startKills = 0, _reboots = 0, _checks = 0;
+    uint64_t _containersChecked = 0, _enterpriseChecked = 0; // summed over the checks
     std::vector<std::string> _violations;
 };
 
@@ -282,16 +317,23 @@ void Torture::_check() {
     std::vector<std::string> found = _checker.check(models);
 
     std::map<STWTortureIdentity, std::pair<std::string, std::string>> disk;
-    for (const auto& [identity, container] : _checker.found())
+    for (const auto& [identity, container] : _checker.found()) {
         disk[identity] = {container.uuid, container.path};
+        _enterpriseChecked += container.persona == enterprisePersona;
+    }
+    _containersChecked += _checker.found().size();
     auto client = _installer();
+    // A group container is no application of a persona: the daemon looks it up in the
+    // caller's, so an enterprise thread's containers are asked for as that persona.
+    auto enterpriseClient = _daemon.connectAs("com.torture.installer", installerEntitlements, false, enterprisePersona);
     std::vector<STWTortureIdentity> mapped;
     for (auto& worker : _workers) {
         // What the workload itself saw contradict its record during the window counts too.
         found.insert(found.end(), worker->violations.begin(), worker->violations.end());
         worker->violations.clear();
-        if (client) {
-            worker->compareWithDaemon(*client, disk);
+        STWClient* asker = worker->model.persona.empty() ? client.get() : enterpriseClient.get();
+        if (asker) {
+            worker->compareWithDaemon(*asker, disk);
             found.insert(found.end(), worker->violations.begin(), worker->violations.end());
             worker->violations.clear();
         }
@@ -457,6 +499,9 @@ int Torture::run() {
     if (!_options.faultRounds && !_options.soakSeconds)
         printf("crash points reached: %u (during a start or its check: %u), power cycles: %u, checks: %u\n",
                _pointKills, _startKills, _reboots, _checks);
+    if (_checks)
+        printf("containers at a check: %.1f on average, %.1f of them the enterprise persona's\n",
+               double(_containersChecked) / _checks, double(_enterpriseChecked) / _checks);
     printf("wall time: %.1f s, seed %llu\n", seconds, static_cast<unsigned long long>(_options.seed));
     if (!_violations.empty()) {
         // The root goes with the driver; the daemon's log stays for whoever looks into it.

@@ -20,16 +20,23 @@ struct Root {
     ~Root() { fs::remove_all(path); }
 
     // A container directory with a metadata file as the daemon writes it; its directory is
-    // named by the container's UUID unless told otherwise.
+    // named by the container's UUID unless told otherwise. A per-user one lies in `home` and
+    // records `persona`.
     std::string container(uint64_t containerClass, const std::string& identifier, const std::string& uuid,
-                          int64_t info = -1, std::string directoryName = {}, int64_t protection = -1) {
-        fs::path directory = path / STWTortureChecker::classDirectory(containerClass) /
+                          int64_t info = -1, std::string directoryName = {}, int64_t protection = -1,
+                          const std::string& persona = {}, const std::string& home = STWTortureChecker::mobileHome) {
+        fs::path directory = path / STWTortureChecker::classDirectory(containerClass, home) /
                              (directoryName.empty() ? uuid : directoryName);
         fs::create_directories(directory);
         plist_t dict = plist_new_dict();
         plist_dict_set_item(dict, "STWMetadataIdentifier", plist_new_string(identifier.c_str()));
         plist_dict_set_item(dict, "STWMetadataUUID", plist_new_string(uuid.c_str()));
         plist_dict_set_item(dict, "STWMetadataContentClass", plist_new_uint(containerClass));
+        if (!persona.empty()) {
+            plist_t user = plist_new_dict();
+            plist_dict_set_item(user, "personaUniqueString", plist_new_string(persona.c_str()));
+            plist_dict_set_item(dict, "STWMetadataUserIdentity", user);
+        }
         if (info >= 0 || protection >= 0) {
             plist_t infoDict = plist_new_dict();
             if (info >= 0)
@@ -50,6 +57,7 @@ struct Root {
     fs::path path;
 };
 
+const std::string enterpriseHome = "private/var/enterprise/e", enterprise = "ENTERPRISE";
 const std::string A = "11111111-1111-1111-1111-111111111111", B = "22222222-2222-2222-2222-222222222222",
                   C = "33333333-3333-3333-3333-333333333333";
 
@@ -86,9 +94,19 @@ TEST(STWTortureChecker, AcceptsWhatTheRepliesAllowAndLearnsTheRest) {
         STWTortureExpectation::present(E, root.container(2, "com.example.stuck", E));
     stuck.mayBeAbsent = stuck.deletionAnswered = true;
 
+    // An enterprise thread's data in its persona's home, a personal one's in the mobile home.
+    const std::string F = "bbbbbbbb-bbbb-bbbb-bbbb-bbbbbbbbbbbb";
+    STWTortureModel work;
+    work.persona = enterprise;
+    work.containers[{2, "com.example.work"}] = STWTortureExpectation::present(
+        F, root.container(2, "com.example.work", F, -1, {}, -1, enterprise, enterpriseHome));
+    model.containers[{2, "com.example.home"}] = STWTortureExpectation::unknown();
+    root.container(2, "com.example.home", "cccccccc-cccc-cccc-cccc-cccccccccccc", -1, {}, -1, "PERSONAL");
+
     STWTortureChecker checker(root.path);
     checker.undeletable = {stuck.path};
-    EXPECT_EQ(checker.check({&model}, std::chrono::milliseconds(0)), std::vector<std::string>());
+    checker.enterpriseHomes[enterpriseHome] = enterprise;
+    EXPECT_EQ(checker.check({&model, &work}, std::chrono::milliseconds(0)), std::vector<std::string>());
     EXPECT_TRUE(model.containers.at({12, "com.example.system"}).definitelyPresent());
     EXPECT_EQ(model.containers.at({12, "com.example.system"}).uuid(), B);
     EXPECT_TRUE(model.containers.at({1, "com.example.gone"}).definitelyAbsent());
@@ -124,9 +142,17 @@ TEST(STWTortureChecker, ReportsEveryKindOfDamage) {
     std::string stuck = root.container(2, "com.example.stuck", "aaaaaaaa-aaaa-aaaa-aaaa-aaaaaaaaaaaa");
     auto& answered = model.containers[{2, "com.example.stuck"}] = STWTortureExpectation::unknown();
     answered.deletionAnswered = true;
+    // A personal container in the enterprise home, an enterprise thread's in the mobile home.
+    root.container(2, "com.example.lost", "dddddddd-dddd-dddd-dddd-dddddddddddd", -1, {}, -1, "PERSONAL",
+                   enterpriseHome);
+    STWTortureModel work;
+    work.persona = enterprise;
+    work.containers[{2, "com.example.work"}] = STWTortureExpectation::unknown();
+    root.container(2, "com.example.work", "eeeeeeee-eeee-eeee-eeee-eeeeeeeeeeee", -1, {}, -1, "PERSONAL");
 
     STWTortureChecker checker(root.path);
-    auto violations = checker.check({&model}, std::chrono::milliseconds(0));
+    checker.enterpriseHomes[enterpriseHome] = enterprise;
+    auto violations = checker.check({&model, &work}, std::chrono::milliseconds(0));
     EXPECT_TRUE(mentions(violations, "com.example.moved (class 2) has UUID " + B)) << violations.size();
     EXPECT_TRUE(mentions(violations, "com.example.missing (class 2) missing"));
     EXPECT_TRUE(mentions(violations, "two containers for com.example.twice"));
@@ -139,7 +165,9 @@ TEST(STWTortureChecker, ReportsEveryKindOfDamage) {
     EXPECT_TRUE(mentions(violations, "replace journal left"));
     EXPECT_TRUE(mentions(violations, "death row entry left"));
     EXPECT_TRUE(mentions(violations, "records protection class 3, its Documents has class -1"));
+    EXPECT_TRUE(mentions(violations, "com.example.lost (class 2) at " + (root.path / enterpriseHome).string()));
+    EXPECT_TRUE(mentions(violations, "com.example.work (class 2) belongs to persona \"PERSONAL\""));
     auto mappings = checker.checkMappings({{2, "com.example.moved"}, {12, "com.example.system"}});
     EXPECT_TRUE(mentions(mappings, "points at /elsewhere"));
-    EXPECT_EQ(violations.size(), 12u);
+    EXPECT_EQ(violations.size(), 14u);
 }
