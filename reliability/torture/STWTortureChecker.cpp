@@ -106,8 +106,8 @@ std::string STWTortureExpectation::description() const {
 }
 
 bool STWTortureChecker::isPerUser(uint64_t containerClass) {
-    return containerClass >= 1 && containerClass <= 11 && containerClass != 1 && containerClass != 3 &&
-           containerClass != 5 && containerClass != 8;
+    return containerClass >= 2 && containerClass <= 11 && containerClass != 3 && containerClass != 5 &&
+           containerClass != 8;
 }
 
 std::string STWTortureChecker::classDirectory(uint64_t containerClass, const std::string& home) {
@@ -194,11 +194,13 @@ STWTortureChecker::_readContainer(uint64_t containerClass, const std::string& di
     return c;
 }
 
-bool STWTortureChecker::_isEnterprise(const std::string& persona) const {
+bool STWTortureChecker::_records(const Container& c, const std::string& persona) const {
+    if (!persona.empty())
+        return c.persona == persona;
     for (const auto& [home, unique] : enterpriseHomes)
-        if (unique == persona)
-            return true;
-    return false;
+        if (unique == c.persona)
+            return false;
+    return true;
 }
 
 void STWTortureChecker::_scanDirectory(uint64_t containerClass, const std::string& home, const std::string& persona,
@@ -219,8 +221,7 @@ void STWTortureChecker::_scanDirectory(uint64_t containerClass, const std::strin
             continue;
         }
         STWTortureIdentity identity{containerClass, container->identifier};
-        if (isPerUser(containerClass) && (persona.empty() ? _isEnterprise(container->persona)
-                                                          : container->persona != persona))
+        if (isPerUser(containerClass) && !_records(*container, persona))
             violations.push_back(identityText(identity) + " at " + container->path + " records persona \"" +
                                  container->persona + "\", in the home of " +
                                  (persona.empty() ? std::string("the personal persona") : "persona \"" + persona + "\""));
@@ -317,8 +318,7 @@ std::vector<std::string> STWTortureChecker::check(const std::vector<STWTortureMo
                 problem = "has info value " + std::to_string(c->info);
             else if (c && !expected.protection.empty() && !expected.protection.count(c->protection))
                 problem = "has protection class " + std::to_string(c->protection);
-            else if (c && isPerUser(identity.first) &&
-                     (model->persona.empty() ? _isEnterprise(c->persona) : c->persona != model->persona))
+            else if (c && isPerUser(identity.first) && !_records(*c, model->persona))
                 problem = "belongs to persona \"" + c->persona + "\"";
             if (!problem.empty())
                 violations.push_back(identityText(identity) + " " + problem + "; expected " +

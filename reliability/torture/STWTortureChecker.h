@@ -77,7 +77,8 @@ private:
     // (for the mobile home: no enterprise persona).
     void _scanDirectory(uint64_t containerClass, const std::string& home, const std::string& persona,
                         std::vector<std::string>& violations);
-    bool _isEnterprise(const std::string& persona) const;
+    // Whether `c` records `persona` (empty: the personal one, i.e. no enterprise persona).
+    bool _records(const Container& c, const std::string& persona) const;
     std::optional<Container> _readContainer(uint64_t containerClass, const std::string& directory,
                                             const std::string& name, std::string* problem) const;
     std::vector<std::string> _leftovers(std::chrono::milliseconds deathRowWait) const;
