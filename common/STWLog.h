@@ -11,8 +11,8 @@
 // its code (STOWLY_RESULT_CODE for a daemon code, ERRNO for a system call's) and the
 // function and line where the error was made, which is where the failure happened. A call
 // may add fields of its own: the line that ends each request carries STOWLY_COMMAND and
-// the code of its reply as STOWLY_RESULT_CODE, so `journalctl STOWLY_RESULT_CODE=21` finds
-// every request that answered 21.
+// the code of its reply as STOWLY_RESULT_CODE, so `journalctl STOWLY_COMMAND=4
+// STOWLY_RESULT_CODE=21` finds the death-row requests that answered 21.
 #pragma once
 
 #include "common/STWFormat.h"

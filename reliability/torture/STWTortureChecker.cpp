@@ -224,7 +224,8 @@ void STWTortureChecker::_scanDirectory(uint64_t containerClass, const std::strin
         if (isPerUser(containerClass) && !_records(*container, persona))
             violations.push_back(identityText(identity) + " at " + container->path + " records persona \"" +
                                  container->persona + "\", in the home of " +
-                                 (persona.empty() ? std::string("the personal persona") : "persona \"" + persona + "\""));
+                                 (persona.empty() ? std::string("the personal persona")
+                                                  : "persona \"" + persona + "\""));
         auto [it, inserted] = _found.emplace(identity, *container);
         if (!inserted)
             violations.push_back("two containers for " + identityText(identity) + ": " + it->second.path + " and " +

@@ -25,13 +25,17 @@ STWValue::Dictionary identityKeys(uint64_t containerClass, const std::string& id
 
 } // namespace
 
+const std::string* STWTortureWorker::_enterprisePersona(uint64_t containerClass) const {
+    return !model.persona.empty() && STWTortureChecker::isPerUser(containerClass) ? &model.persona : nullptr;
+}
+
 STWValue::Dictionary STWTortureWorker::_containerCommand(unsigned command, const STWTortureIdentity& identity,
                                                          const STWTortureExpectation& e) const {
     STWValue::Dictionary message = identityKeys(identity.first, identity.second);
     message["Command"] = STWValue(command);
     message["UUID"] = STWValue(*STWUUID::fromString(e.uuid()));
-    if (!model.persona.empty() && STWTortureChecker::isPerUser(identity.first))
-        message["PersonaUniqueString"] = STWValue(model.persona);
+    if (const std::string* persona = _enterprisePersona(identity.first))
+        message["PersonaUniqueString"] = STWValue(*persona);
     return message;
 }
 
@@ -197,10 +201,10 @@ void STWTortureWorker::_create(STWClient& client, uint64_t containerClass, const
             break;
         }
         const std::string* persona = STWDictionaryString(reply, "ReplyPersonaUniqueString");
-        if (!model.persona.empty() && STWTortureChecker::isPerUser(containerClass) &&
-            (!persona || *persona != model.persona))
+        const std::string* expected = _enterprisePersona(containerClass);
+        if (expected && (!persona || *persona != *expected))
             _violation(std::string(kind) + " of " + identityText(identity) + " answered persona " +
-                       (persona ? *persona : std::string("none")) + ", not " + model.persona);
+                       (persona ? *persona : std::string("none")) + ", not " + *expected);
         _observePresent(kind, identity, *path, uuid->uuid()->string(),
                         create ? STWDictionaryBool(reply, "ReplyExisted") : std::optional<bool>(true));
         break;
@@ -319,9 +323,9 @@ void STWTortureWorker::_replace(STWClient& client, uint64_t containerClass, cons
                                  {"NewIdentifier", STWValue(identifier)},
                                  {"NewContainerClass", STWValue(containerClass)},
                                  {"NewContainerUUID", *newUUID}};
-    if (!model.persona.empty() && STWTortureChecker::isPerUser(containerClass)) {
-        replace["OldPersonaUniqueString"] = STWValue(model.persona);
-        replace["NewPersonaUniqueString"] = STWValue(model.persona);
+    if (const std::string* persona = _enterprisePersona(containerClass)) {
+        replace["OldPersonaUniqueString"] = STWValue(*persona);
+        replace["NewPersonaUniqueString"] = STWValue(*persona);
     }
     STWValue::Dictionary reply;
     auto& e = model.containers.at(identity);

@@ -97,6 +97,9 @@ private:
     void _measure(const char* kind, std::chrono::steady_clock::time_point began, bool answered);
     void _note(const STWTortureIdentity& identity, const std::string& what);
 
+    // The enterprise persona a container of `containerClass` belongs to, which commands that
+    // name it by UUID must name too; nullptr for the personal persona and for global classes.
+    const std::string* _enterprisePersona(uint64_t containerClass) const;
     // A command about one container the record knows, named by its identity, UUID and persona.
     STWValue::Dictionary _containerCommand(unsigned command, const STWTortureIdentity& identity,
                                            const STWTortureExpectation& e) const;
